@@ -1,0 +1,2 @@
+// The footprint polygon.
+#pragma once

@@ -1,0 +1,1 @@
+#include <silvan/toimgsetparser.h>

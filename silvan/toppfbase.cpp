@@ -1,0 +1,1 @@
+#include <silvan/toppfbase.h>

@@ -1,0 +1,2 @@
+// Filled in by a later change.
+#pragma once

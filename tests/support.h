@@ -1,0 +1,61 @@
+// Helpers shared by the tests: scratch directories and file contents.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <kestrel/exception.h>
+
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <random>
+#include <string>
+
+namespace testsupport {
+
+// A directory of its own for each test, removed with everything in it at the end.
+class TempDir {
+public:
+    TempDir() {
+        std::random_device rd;
+        const auto base = std::filesystem::temp_directory_path();
+        for (;;) {
+            path_ = base / ("silvan-test-" + std::to_string(rd()));
+            if (std::filesystem::create_directory(path_)) break;
+        }
+    }
+    ~TempDir() {
+        std::error_code ec;
+        std::filesystem::remove_all(path_, ec);
+    }
+    TempDir(const TempDir&) = delete;
+    TempDir& operator=(const TempDir&) = delete;
+
+    const std::filesystem::path& Path() const { return path_; }
+    // The path of a file in the directory, as the narrow string the library takes.
+    std::string File(const std::string& name) const { return (path_ / name).string(); }
+
+private:
+    std::filesystem::path path_;
+};
+
+inline std::string WriteFile(const std::string& path, const std::string& bytes) {
+    std::ofstream out(path, std::ios::binary);
+    out << bytes;
+    return path;
+}
+
+inline std::string ReadFile(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+}
+
+// Checks that an exception names the operation that failed and where it was thrown.
+inline void ExpectThrownFrom(const kestrel::Exception& e, const std::string& function,
+                             const std::string& sourceFile) {
+    EXPECT_EQ(e.GetFunction(), function);
+    EXPECT_EQ(e.GetSourceFile(), sourceFile);
+    EXPECT_GT(e.GetSourceLine(), 0u);
+}
+
+}  // namespace testsupport

@@ -1,0 +1,146 @@
+// The parameter-table reader: grammar, defaults, typed reading and its errors.
+#include <kestrel/mfileparser.h>
+
+#include "support.h"
+
+#include <memory>
+
+using kestrel::DataException;
+using kestrel::MFileParser;
+using kestrel::ParametersTableIF;
+using testsupport::TempDir;
+using testsupport::WriteFile;
+
+namespace {
+
+std::unique_ptr<ParametersTableIF> Read(const std::string& path) {
+    MFileParser reader(0);
+    return std::unique_ptr<ParametersTableIF>(reader.Create(path));
+}
+
+}  // namespace
+
+TEST(MFileTable, SkipsHeaderCommentAndBlankLines) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"),
+                                "!MFILE header\r\n a;1\r\n\r\n   \t\n!comment;9\nb;2\n"));
+    ASSERT_TRUE(table);
+    ASSERT_EQ(table->GetLineCount(), 2u);
+    EXPECT_EQ(table->GetString(0, 0), "a");
+    EXPECT_EQ(table->GetInt(0, 1), 1);
+    EXPECT_EQ(table->GetString(1, 0), "b");
+    EXPECT_EQ(table->GetInt(1, 1), 2);
+}
+
+TEST(MFileTable, LastLineWithoutLineEndAndCarriageReturnsAreRead) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), "x;y\r\nlast;7"));
+    ASSERT_EQ(table->GetLineCount(), 2u);
+    EXPECT_EQ(table->GetString(0, 1), "y");
+    EXPECT_EQ(table->GetInt(1, 1), 7);
+}
+
+TEST(MFileTable, FieldsAreTrimmedButKeepInnerBlanks) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), " \tmy scene.tif\t ; -12 \n"));
+    EXPECT_EQ(table->GetString(0, 0), "my scene.tif");
+    EXPECT_EQ(table->GetInt(0, 1), -12);
+}
+
+TEST(MFileTable, MissingOrEmptyFieldsReadAsTypedDefaults) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), "only\na;;\n"));
+    table->AddDefaultString("name");
+    table->AddDefaultInt(-5);
+    table->AddDefaultIntList({3, -1, 7});
+    for (int line = 0; line < 2; ++line) {
+        EXPECT_EQ(table->GetInt(line, 1), -5);
+        EXPECT_EQ(table->GetIntList(line, 2), (std::vector<int>{3, -1, 7}));
+        EXPECT_EQ(table->GetString(line, 2), "3,-1,7");
+    }
+    EXPECT_EQ(table->GetString(0, 0), "only");
+}
+
+TEST(MFileTable, EmptyDefaultListReadsAsEmptyList) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), "a\n"));
+    table->AddDefaultString("");
+    table->AddDefaultIntList({});
+    EXPECT_TRUE(table->GetIntList(0, 1).empty());
+}
+
+TEST(MFileTable, IntegerListsAllowBlanksAroundItems) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), "1,2,3; 4 , -5 ,+6 ;2147483647,-2147483648\n"));
+    EXPECT_EQ(table->GetIntList(0, 0), (std::vector<int>{1, 2, 3}));
+    EXPECT_EQ(table->GetIntList(0, 1), (std::vector<int>{4, -5, 6}));
+    EXPECT_EQ(table->GetIntList(0, 2), (std::vector<int>{2147483647, -2147483648}));
+}
+
+TEST(MFileTable, ExtraSeparatorsDoNotShiftEarlierColumns) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), "a;b;c;d;e\n"));
+    EXPECT_EQ(table->GetString(0, 1), "b");
+    EXPECT_EQ(table->GetString(0, 4), "e");
+}
+
+// A value that is not of the asked type is refused with the file, line in the file and column.
+TEST(MFileTable, BadValuesNameFileLineAndColumn) {
+    TempDir dir;
+    const std::string path =
+        WriteFile(dir.File("bad.txt"), "!header\nok;1;1,2\n\nabc;x1;1,,2;99999999999;7,z\n");
+    auto table = Read(path);
+    table->AddDefaultString("");
+    table->AddDefaultString("");
+    const struct {
+        int column;
+        bool list;
+        const char* value;
+    } cases[] = {{0, false, "\"abc\" is not an integer"},
+                 {1, false, "\"x1\" is not an integer"},
+                 {2, true, "\"\" is not an integer"},
+                 {3, false, "\"99999999999\" is out of the 32-bit integer range"},
+                 {4, true, "\"z\" is not an integer"}};
+    for (const auto& c : cases) {
+        try {
+            if (c.list) table->GetIntList(1, c.column);
+            else table->GetInt(1, c.column);
+            ADD_FAILURE() << "column " << c.column << " was read";
+        } catch (const DataException& e) {
+            const std::string expected =
+                path + ", line 4, column " + std::to_string(c.column) + ": " + c.value;
+            EXPECT_EQ(e.GetErrorMessage(), expected);
+            EXPECT_NE(e.GetFunction().find("GetInt"), std::string::npos);
+        }
+    }
+}
+
+TEST(MFileTable, EmptyValueWithStringDefaultIsNoSilentZero) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), "a;\n"));
+    table->AddDefaultString("");
+    table->AddDefaultString("");
+    EXPECT_THROW(table->GetInt(0, 1), DataException);
+}
+
+TEST(MFileTable, MissingValueWithoutDefaultIsRefused) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), "a\n"));
+    EXPECT_THROW(table->GetString(0, 1), DataException);
+    EXPECT_THROW(table->GetString(1, 0), DataException);
+    EXPECT_THROW(table->GetString(0, -1), DataException);
+}
+
+TEST(MFileTable, UnreadableFilesGiveNoTable) {
+    TempDir dir;
+    EXPECT_FALSE(Read(dir.File("missing.txt")));
+    EXPECT_FALSE(Read(dir.Path().string()));
+}
+
+TEST(MFileTable, FileOfCommentsHasNoLines) {
+    TempDir dir;
+    auto table = Read(WriteFile(dir.File("m.txt"), "!MFILE\n\n  \n"));
+    ASSERT_TRUE(table);
+    EXPECT_EQ(table->GetLineCount(), 0u);
+    EXPECT_EQ(Read(WriteFile(dir.File("e.txt"), ""))->GetLineCount(), 0u);
+}
