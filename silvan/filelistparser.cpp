@@ -7,8 +7,7 @@ namespace silvan {
 namespace core {
 
 std::shared_ptr<ParametersTableIF> ReadTable(MFileParser& parser, const std::string& filename,
-                                             unsigned int& lineCount,
-                                             const SourceLocation& where) {
+                                             unsigned int& lineCount, const SourceLocation& where) {
     std::shared_ptr<ParametersTableIF> table(parser.Create(filename));
     if (!table) {
         KESTREL_THROW_AT(where, ParameterException, "MFILE", ParameterException::InvalidFile,
@@ -41,7 +40,9 @@ FileListParser::~FileListParser() = default;
 FileListParser::FileListParser(const FileListParser&) = default;
 FileListParser& FileListParser::operator=(const FileListParser&) = default;
 
-void FileListParser::AddDefaultLine() { table->AddDefaultString(""); }
+void FileListParser::AddDefaultLine() {
+    table->AddDefaultString("");
+}
 
 void FileListParser::ParseLine(int index) {
     core::CheckLineIndex(index, mfileLines, KESTREL_HERE);

@@ -17,10 +17,8 @@ namespace core {
 // Has the parser read filename into a table. Throws ParameterException "Invalid MFILE" when no
 // table is obtained and "Empty text file" when it has no line (releasing it); both are reported
 // at `where`, the constructor that reads. On success lineCount holds the table's line count.
-std::shared_ptr<ParametersTableIF> ReadTable(MFileParser& parser,
-                                                        const std::string& filename,
-                                                        unsigned int& lineCount,
-                                                        const SourceLocation& where);
+std::shared_ptr<ParametersTableIF> ReadTable(MFileParser& parser, const std::string& filename,
+                                             unsigned int& lineCount, const SourceLocation& where);
 
 // Throws DataException "Index %d is outside of valid range: %d" at `where` unless
 // 0 <= index < lineCount, both compared as signed 32-bit integers.
@@ -30,7 +28,7 @@ void CheckLineIndex(int index, unsigned int lineCount, const SourceLocation& whe
 
 // A list of file names, one per line.
 class SILVAN_API FileListParser : public MFileParser {
-public:
+  public:
     explicit FileListParser(const std::string& filename);
     ~FileListParser() override;
     // Copies share the table; it is released with the last of them.
@@ -43,7 +41,7 @@ public:
     std::string GetFili() const { return fili; }
     unsigned int GetMfileLines() const { return mfileLines; }
 
-private:
+  private:
     void AddDefaultLine();
 
     std::string fili;

@@ -15,13 +15,14 @@ namespace testsupport {
 
 // A directory of its own for each test, removed with everything in it at the end.
 class TempDir {
-public:
+  public:
     TempDir() {
         std::random_device rd;
         const auto base = std::filesystem::temp_directory_path();
         for (;;) {
             path_ = base / ("silvan-test-" + std::to_string(rd()));
-            if (std::filesystem::create_directory(path_)) break;
+            if (std::filesystem::create_directory(path_))
+                break;
         }
     }
     ~TempDir() {
@@ -35,7 +36,7 @@ public:
     // The path of a file in the directory, as the narrow string the library takes.
     std::string File(const std::string& name) const { return (path_ / name).string(); }
 
-private:
+  private:
     std::filesystem::path path_;
 };
 

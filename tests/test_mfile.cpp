@@ -22,8 +22,8 @@ std::unique_ptr<ParametersTableIF> Read(const std::string& path) {
 
 TEST(MFileTable, SkipsHeaderCommentAndBlankLines) {
     TempDir dir;
-    auto table = Read(WriteFile(dir.File("m.txt"),
-                                "!MFILE header\r\n a;1\r\n\r\n   \t\n!comment;9\nb;2\n"));
+    auto table =
+        Read(WriteFile(dir.File("m.txt"), "!MFILE header\r\n a;1\r\n\r\n   \t\n!comment;9\nb;2\n"));
     ASSERT_TRUE(table);
     ASSERT_EQ(table->GetLineCount(), 2u);
     EXPECT_EQ(table->GetString(0, 0), "a");
@@ -103,8 +103,10 @@ TEST(MFileTable, BadValuesNameFileLineAndColumn) {
                  {4, true, "\"z\" is not an integer"}};
     for (const auto& c : cases) {
         try {
-            if (c.list) table->GetIntList(1, c.column);
-            else table->GetInt(1, c.column);
+            if (c.list)
+                table->GetIntList(1, c.column);
+            else
+                table->GetInt(1, c.column);
             ADD_FAILURE() << "column " << c.column << " was read";
         } catch (const DataException& e) {
             const std::string expected =

@@ -13,7 +13,9 @@ Exception::~Exception() = default;
 Exception::Exception(const Exception&) = default;
 Exception& Exception::operator=(const Exception&) = default;
 
-const char* Exception::what() const noexcept { return message_.c_str(); }
+const char* Exception::what() const noexcept {
+    return message_.c_str();
+}
 
 std::string Exception::Describe() const {
     return message_ + " (in " + function_ + ", " + file_ + ":" + std::to_string(line_) + ")";
@@ -92,6 +94,8 @@ std::string FormatString(const char* format, ...) {
     return std::string(large.data(), static_cast<std::size_t>(needed));
 }
 
-const char* _(const char* text) { return text; }
+const char* _(const char* text) {
+    return text;
+}
 
 }  // namespace kestrel

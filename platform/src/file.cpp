@@ -18,7 +18,8 @@ std::string File::GetBasename() const {
 }
 
 std::string File::GetNormalizedName() const {
-    if (name_.empty()) return name_;
+    if (name_.empty())
+        return name_;
     fs::path normal = fs::path(name_).lexically_normal();
     normal.make_preferred();
     return normal.string();
@@ -27,7 +28,8 @@ std::string File::GetNormalizedName() const {
 std::string File::GetAbsolutePath() const {
     std::error_code ec;
     fs::path absolute = fs::absolute(fs::path(name_), ec);
-    if (ec) absolute = fs::path(name_);
+    if (ec)
+        absolute = fs::path(name_);
     fs::path directory = absolute.lexically_normal().parent_path();
     directory.make_preferred();
     std::string text = directory.string();

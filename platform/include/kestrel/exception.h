@@ -26,7 +26,8 @@ namespace detail {
 constexpr const char* SourceBaseName(const char* path) {
     const char* base = path;
     for (const char* p = path; *p != '\0'; ++p) {
-        if (*p == '/' || *p == '\\') base = p + 1;
+        if (*p == '/' || *p == '\\')
+            base = p + 1;
     }
     return base;
 }
@@ -41,11 +42,12 @@ struct SourceLocation {
 };
 
 // The location of the statement in which it stands.
-#define KESTREL_HERE \
-    (::kestrel::SourceLocation{::kestrel::detail::SourceBaseName(__FILE__), KESTREL_FUNCSIG, __LINE__})
+#define KESTREL_HERE                                                                         \
+    (::kestrel::SourceLocation{::kestrel::detail::SourceBaseName(__FILE__), KESTREL_FUNCSIG, \
+                               __LINE__})
 
 // Throws an exception of the family, filling in source file, function signature and line.
-#define KESTREL_THROW(ExceptionType, ...)                                                      \
+#define KESTREL_THROW(ExceptionType, ...)                                                          \
     throw ExceptionType(__VA_ARGS__, ::kestrel::detail::SourceBaseName(__FILE__), KESTREL_FUNCSIG, \
                         __LINE__)
 
@@ -54,7 +56,7 @@ struct SourceLocation {
     throw ExceptionType(__VA_ARGS__, (where).file, (where).function, (where).line)
 
 class KESTREL_API Exception : public std::exception {
-public:
+  public:
     Exception(const std::string& message, const std::string& file, const std::string& function,
               unsigned int line);
     ~Exception() override;
@@ -72,7 +74,7 @@ public:
     // Message followed by where it was raised: "message (in function, file:line)".
     std::string Describe() const;
 
-private:
+  private:
     std::string message_;
     std::string file_;
     std::string function_;
@@ -80,21 +82,21 @@ private:
 };
 
 class KESTREL_API DataException : public Exception {
-public:
-    DataException(const std::string& message, const std::string& file,
-                  const std::string& function, unsigned int line);
+  public:
+    DataException(const std::string& message, const std::string& file, const std::string& function,
+                  unsigned int line);
     ~DataException() override;
     DataException(const DataException&);
     DataException& operator=(const DataException&);
 };
 
 class KESTREL_API ParameterException : public DataException {
-public:
+  public:
     enum Type {
-        InvalidFile = 0,   // a parameter file that cannot be used
-        Unsupported = 1,   // a value that is not supported
-        OutOfRange = 2,    // a value outside its range
-        EmptyValue = 3     // an empty value
+        InvalidFile = 0,  // a parameter file that cannot be used
+        Unsupported = 1,  // a value that is not supported
+        OutOfRange = 2,   // a value outside its range
+        EmptyValue = 3    // an empty value
     };
 
     ParameterException(const std::string& parameterName, Type type, const std::string& value,
@@ -109,7 +111,7 @@ public:
     const std::string& GetValue() const { return value_; }
     const std::string& GetExpected() const { return expected_; }
 
-private:
+  private:
     std::string parameterName_;
     Type type_;
     std::string value_;
@@ -117,7 +119,7 @@ private:
 };
 
 class KESTREL_API IOException : public Exception {
-public:
+  public:
     IOException(const std::string& message, const std::string& file, const std::string& function,
                 unsigned int line);
     ~IOException() override;
@@ -126,28 +128,28 @@ public:
 };
 
 class KESTREL_API FileException : public IOException {
-public:
-    FileException(const std::string& fileName, const std::string& message,
-                  const std::string& file, const std::string& function, unsigned int line);
+  public:
+    FileException(const std::string& fileName, const std::string& message, const std::string& file,
+                  const std::string& function, unsigned int line);
     ~FileException() override;
     FileException(const FileException&);
     FileException& operator=(const FileException&);
 
     const std::string& GetFileName() const { return fileName_; }
 
-private:
+  private:
     std::string fileName_;
 };
 
 class KESTREL_API FileAccessException : public FileException {
-public:
+  public:
     enum Type {
         AccessFailed = 0,  // any other access failure
         ReadFailed = 1,    // the file's content cannot be read as expected
         WriteFailed = 2,
         OpenFailed = 3,
         DeleteFailed = 4,
-        CreateFailed = 5   // the file cannot be created
+        CreateFailed = 5  // the file cannot be created
     };
 
     FileAccessException(const std::string& fileName, const Type& type, const std::string& message,
@@ -158,12 +160,12 @@ public:
 
     Type GetType() const { return type_; }
 
-private:
+  private:
     Type type_;
 };
 
 class KESTREL_API FileNotFoundException : public FileException {
-public:
+  public:
     FileNotFoundException(const std::string& fileName, const std::string& message,
                           const std::string& file, const std::string& function, unsigned int line);
     ~FileNotFoundException() override;

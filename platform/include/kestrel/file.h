@@ -13,7 +13,7 @@ namespace fileio {
 // them; both "/" and "\" separate directories in base names, since parameter files are also
 // written on Windows.
 class KESTREL_API File {
-public:
+  public:
     explicit File(const std::string& name);
     explicit File(const char* name);
 
@@ -34,7 +34,7 @@ public:
     // Whether something exists under this name.
     bool Exists() const;
 
-private:
+  private:
     std::string name_;
 };
 

@@ -14,7 +14,7 @@ namespace kestrel {
 
 // A parsed parameter file. Lines and columns count from 0.
 class KESTREL_API ParametersTableIF {
-public:
+  public:
     virtual ~ParametersTableIF();
 
     // The field as a signed 32-bit integer. Throws DataException when it is not one.
@@ -32,24 +32,24 @@ public:
     virtual void AddDefaultInt(int value) = 0;
     virtual void AddDefaultString(const std::string& value) = 0;
 
-protected:
+  protected:
     ParametersTableIF() = default;
     ParametersTableIF(const ParametersTableIF&) = default;
     ParametersTableIF& operator=(const ParametersTableIF&) = default;
 };
 
 class KESTREL_API ParserBuilderIF {
-public:
+  public:
     virtual ~ParserBuilderIF();
 
-protected:
+  protected:
     ParserBuilderIF() = default;
     ParserBuilderIF(const ParserBuilderIF&) = default;
     ParserBuilderIF& operator=(const ParserBuilderIF&) = default;
 };
 
 class KESTREL_API MFileParser : public ParserBuilderIF {
-public:
+  public:
     // The flags are reserved; the parsers of this suite pass 0.
     explicit MFileParser(int flags);
     ~MFileParser() override;
@@ -62,7 +62,7 @@ public:
 
     int GetFlags() const { return flags_; }
 
-private:
+  private:
     std::int32_t flags_;
 };
 

@@ -1,0 +1,116 @@
+// The file-list parser and the parser core it shares with the other parameter-file parsers.
+#include <silvan/filelistparser.h>
+
+#include "support.h"
+
+using kestrel::DataException;
+using kestrel::ParameterException;
+using kestrel::processes::silvan::FileListParser;
+using testsupport::ExpectThrownFrom;
+using testsupport::TempDir;
+using testsupport::WriteFile;
+
+namespace {
+
+const char* const kParseLine = "void kestrel::processes::silvan::FileListParser::ParseLine(int)";
+
+std::string ThreeFiles(const TempDir& dir) {
+    return WriteFile(dir.File("list.txt"), "!MFILE\na.tif\nsub/b.tif\nc d.tif\n");
+}
+
+void ExpectRangeError(FileListParser& files, int index, const std::string& message) {
+    try {
+        files.ParseLine(index);
+        FAIL() << "index " << index << " was accepted";
+    } catch (const DataException& e) {
+        EXPECT_EQ(e.GetErrorMessage(), message);
+        ExpectThrownFrom(e, kParseLine, "filelistparser.cpp");
+    }
+}
+
+}  // namespace
+
+TEST(FileListParser, ReadsLinesByIndexInAnyOrder) {
+    TempDir dir;
+    FileListParser files(ThreeFiles(dir));
+    EXPECT_EQ(files.GetMfileLines(), 3u);
+    EXPECT_EQ(files.GetFili(), "");
+    files.ParseLine(2);
+    EXPECT_EQ(files.GetFili(), "c d.tif");
+    files.ParseLine(0);
+    EXPECT_EQ(files.GetFili(), "a.tif");
+    files.ParseLine(0);
+    EXPECT_EQ(files.GetFili(), "a.tif");
+    files.ParseLine(1);
+    EXPECT_EQ(files.GetFili(), "sub/b.tif");
+    EXPECT_EQ(files.GetMfileLines(), 3u);
+}
+
+TEST(FileListParser, IndexOutsideTheLinesIsRefusedAndKeepsTheCurrentLine) {
+    TempDir dir;
+    FileListParser files(ThreeFiles(dir));
+    files.ParseLine(1);
+    ExpectRangeError(files, 3, "Index 3 is outside of valid range: 3");
+    ExpectRangeError(files, -1, "Index -1 is outside of valid range: 3");
+    ExpectRangeError(files, -2147483647 - 1, "Index -2147483648 is outside of valid range: 3");
+    EXPECT_EQ(files.GetFili(), "sub/b.tif");
+}
+
+TEST(FileListParser, EmptyFieldReadsAsEmptyName) {
+    TempDir dir;
+    FileListParser files(WriteFile(dir.File("list.txt"), "a.tif\n ;x\n"));
+    files.ParseLine(1);
+    EXPECT_EQ(files.GetFili(), "");
+}
+
+TEST(FileListParser, UnreadableFileIsInvalidMfile) {
+    TempDir dir;
+    const std::string name = dir.File("no such list.txt");
+    try {
+        FileListParser files(name);
+        FAIL();
+    } catch (const ParameterException& e) {
+        EXPECT_EQ(e.GetErrorMessage(), "Invalid MFILE");
+        EXPECT_EQ(e.GetParameterName(), "MFILE");
+        EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
+        EXPECT_EQ(static_cast<int>(e.GetType()), 0);
+        EXPECT_EQ(e.GetValue(), name);
+        EXPECT_EQ(e.GetExpected(), "");
+        ExpectThrownFrom(e,
+                         "kestrel::processes::silvan::FileListParser::FileListParser(const "
+                         "std::string&)",
+                         "filelistparser.cpp");
+    }
+}
+
+TEST(FileListParser, FileWithoutDataLinesIsEmptyTextFile) {
+    TempDir dir;
+    for (const char* bytes : {"", "!MFILE created for nobody\n", "\n  \n\t\r\n"}) {
+        const std::string name = WriteFile(dir.File("empty.txt"), bytes);
+        try {
+            FileListParser files(name);
+            FAIL() << "accepted \"" << bytes << "\"";
+        } catch (const ParameterException& e) {
+            EXPECT_EQ(e.GetErrorMessage(), "Empty text file");
+            EXPECT_EQ(e.GetParameterName(), "MFILE");
+            EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
+            EXPECT_EQ(e.GetValue(), name);
+        }
+    }
+}
+
+TEST(FileListParser, CopiesShareTheTableAndOutliveTheOriginal) {
+    TempDir dir;
+    auto original = std::make_unique<FileListParser>(ThreeFiles(dir));
+    original->ParseLine(2);
+    FileListParser copy(*original);
+    FileListParser assigned(WriteFile(dir.File("other.txt"), "x\n"));
+    assigned = *original;
+    original.reset();
+    EXPECT_EQ(copy.GetFili(), "c d.tif");
+    copy.ParseLine(0);
+    assigned.ParseLine(1);
+    EXPECT_EQ(copy.GetFili(), "a.tif");
+    EXPECT_EQ(assigned.GetFili(), "sub/b.tif");
+    EXPECT_EQ(assigned.GetMfileLines(), 3u);
+}
