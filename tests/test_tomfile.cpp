@@ -1,0 +1,220 @@
+// The master parameter file parser and the preparation and image-set files it writes.
+#include <silvan/tomfileparser.h>
+
+#include "support.h"
+
+#include <filesystem>
+
+using kestrel::FileAccessException;
+using kestrel::MFileParser;
+using kestrel::ParameterException;
+using kestrel::ParametersTableIF;
+using kestrel::processes::silvan::TOMFileParser;
+using testsupport::ExpectThrownFrom;
+using testsupport::ReadFile;
+using testsupport::TempDir;
+using testsupport::WriteFile;
+
+namespace {
+
+// One line of every role kind, with fields left out and empty.
+const char* const kMaster =
+    "!MFILE master\n"
+    "/img/a.tif;1,2,3;7;0,16;0;5;low;2;fill\n"
+    "C:\\img\\b.pix;4;3;;0;5;high;1;FILL\n"
+    "/img/c.tif;1;2;1,1;255;0;moderate;3;prep\n"
+    "d.tif;1;2;1,1;255;0;any;4;Prep\n"
+    "rel/e.tif;1;2;1,1;255;0;;;PREPARE\n"
+    "f.tif;2;2;3;9;1;Low;0;XPREP\n"
+    "g g.tif;3;2;3;9;1;HIGH;9;\n"
+    "h.tif\n";
+
+const char* const kExpectedPrep =
+    "!MFILE created for VARNOK\n"
+    "/img/a.tif;1,2,3;7;0,16;0;5\n"
+    "C:\\img\\b.pix;4;3;;0;5\n"
+    "/img/c.tif;1;2;1,1;255;0\n"
+    "d.tif;1;2;1,1;255;0\n"
+    "rel/e.tif;1;2;1,1;255;0\n"
+    "f.tif;2;2;3;9;1\n"
+    "g g.tif;3;2;3;9;1\n"
+    "h.tif;;;;;\n";
+
+const char* const kExpectedImgSet =
+    "!IMGSET created for MELDRA\n"
+    "a.tif;low;2\n"
+    "b.pix;high;1\n"
+    "f.tif;Low;0\n"
+    "g g.tif;HIGH;9\n"
+    "h.tif;;\n";
+
+struct Master {
+    TempDir dir;
+    std::string path = WriteFile(dir.File("master.txt"), kMaster);
+    TOMFileParser parser{path};
+};
+
+std::vector<std::string> PrepGetters(const TOMFileParser& p) {
+    return {p.GetFili(), p.GetDbic(), p.GetMmseg(), p.GetDbiw(), p.GetSrcBgd(), p.GetEdgeClip()};
+}
+std::vector<std::string> FillGetters(const TOMFileParser& p) {
+    return {p.GetRadioDif(), p.GetDbmPxErr(), p.GetRole()};
+}
+
+}  // namespace
+
+TEST(TOMFileParser, WritesBothDerivedFilesByteForByte) {
+    Master m;
+    EXPECT_EQ(m.parser.GetMfileLines(), 8u);
+    m.parser.WriteMFilePrep(m.dir.File("prep.txt"));
+    m.parser.WriteImgSet(m.dir.File("imgset.txt"));
+    EXPECT_EQ(ReadFile(m.dir.File("prep.txt")), kExpectedPrep);
+    EXPECT_EQ(ReadFile(m.dir.File("imgset.txt")), kExpectedImgSet);
+    EXPECT_EQ(m.parser.GetMfileLines(), 8u);
+}
+
+TEST(TOMFileParser, PrepLineKeepsEmptyFieldsInPlace) {
+    TempDir dir;
+    TOMFileParser parser(WriteFile(dir.File("m.txt"), "a;7;3;;0;5;low;1;fill\n"));
+    parser.WriteMFilePrep(dir.File("prep.txt"));
+    EXPECT_EQ(ReadFile(dir.File("prep.txt")), "!MFILE created for VARNOK\na;7;3;;0;5\n");
+}
+
+TEST(TOMFileParser, GettersHoldTheLastLineOfEachWritersMode) {
+    Master m;
+    for (const auto& value : PrepGetters(m.parser))
+        EXPECT_EQ(value, "");
+    for (const auto& value : FillGetters(m.parser))
+        EXPECT_EQ(value, "");
+
+    m.parser.WriteMFilePrep(m.dir.File("prep.txt"));
+    EXPECT_EQ(PrepGetters(m.parser), (std::vector<std::string>{"h.tif", "", "", "", "", ""}));
+    for (const auto& value : FillGetters(m.parser))
+        EXPECT_EQ(value, "");
+
+    TOMFileParser fill(m.path);
+    fill.WriteImgSet(m.dir.File("imgset.txt"));
+    EXPECT_EQ(fill.GetFili(), "h.tif");
+    EXPECT_EQ(fill.GetDbic(), "");
+    EXPECT_EQ(FillGetters(fill), (std::vector<std::string>{"", "", ""}));
+}
+
+TEST(TOMFileParser, ImgSetUpperCasesTheRoleAndPrepLeavesFillFieldsAlone) {
+    TempDir dir;
+    TOMFileParser parser(
+        WriteFile(dir.File("m.txt"), "x.tif;1;2;3;4;5;low;2;fill\ny.tif;9;8;7;6;5;high;3;Prep\n"));
+    parser.WriteImgSet(dir.File("imgset.txt"));
+    EXPECT_EQ(FillGetters(parser), (std::vector<std::string>{"high", "3", "PREP"}));
+    EXPECT_EQ(parser.GetDbic(), "");
+    parser.WriteMFilePrep(dir.File("prep.txt"));
+    EXPECT_EQ(PrepGetters(parser), (std::vector<std::string>{"y.tif", "9", "8", "7", "6", "5"}));
+    EXPECT_EQ(FillGetters(parser), (std::vector<std::string>{"high", "3", "PREP"}));
+    EXPECT_EQ(ReadFile(dir.File("imgset.txt")), "!IMGSET created for MELDRA\nx.tif;low;2\n");
+}
+
+TEST(TOMFileParser, OnlyPrepRolesGiveAnImgSetWithTheHeaderAlone) {
+    TempDir dir;
+    TOMFileParser parser(WriteFile(dir.File("m.txt"), "x.tif;1;2;3;4;5;low;2;PREP\n"));
+    parser.WriteImgSet(dir.File("imgset.txt"));
+    parser.WriteMFilePrep(dir.File("prep.txt"));
+    EXPECT_EQ(ReadFile(dir.File("imgset.txt")), "!IMGSET created for MELDRA\n");
+    EXPECT_EQ(ReadFile(dir.File("prep.txt")), "!MFILE created for VARNOK\nx.tif;1;2;3;4;5\n");
+}
+
+TEST(TOMFileParser, RewritingReplacesTheFile) {
+    Master m;
+    const std::string out = WriteFile(m.dir.File("prep.txt"), std::string(10000, 'x'));
+    m.parser.WriteMFilePrep(out);
+    m.parser.WriteMFilePrep(out);
+    EXPECT_EQ(ReadFile(out), kExpectedPrep);
+}
+
+// The derived files read back through the table reader with the values written.
+TEST(TOMFileParser, DerivedFilesReadBackThroughTheTableReader) {
+    Master m;
+    m.parser.WriteMFilePrep(m.dir.File("prep.txt"));
+    MFileParser reader(0);
+    std::unique_ptr<ParametersTableIF> prep(reader.Create(m.dir.File("prep.txt")));
+    for (int c = 0; c < 6; ++c)
+        prep->AddDefaultString("");
+    ASSERT_EQ(prep->GetLineCount(), 8u);
+    EXPECT_EQ(prep->GetString(1, 0), "C:\\img\\b.pix");
+    EXPECT_EQ(prep->GetIntList(0, 1), (std::vector<int>{1, 2, 3}));
+    EXPECT_EQ(prep->GetInt(0, 2), 7);
+    EXPECT_EQ(prep->GetIntList(0, 3), (std::vector<int>{0, 16}));
+    EXPECT_EQ(prep->GetString(1, 3), "");
+    EXPECT_EQ(prep->GetInt(2, 4), 255);
+    EXPECT_EQ(prep->GetInt(0, 5), 5);
+}
+
+TEST(TOMFileParser, RefusesUnreadableAndEmptyFiles) {
+    TempDir dir;
+    const struct {
+        std::string path;
+        const char* message;
+    } cases[] = {{dir.File("missing.txt"), "Invalid MFILE"},
+                 {WriteFile(dir.File("empty.txt"), "!MFILE\n\n"), "Empty text file"}};
+    for (const auto& c : cases) {
+        try {
+            TOMFileParser parser(c.path);
+            FAIL() << c.path;
+        } catch (const ParameterException& e) {
+            EXPECT_EQ(e.GetErrorMessage(), c.message);
+            EXPECT_EQ(e.GetParameterName(), "MFILE");
+            EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
+            EXPECT_EQ(e.GetValue(), c.path);
+            ExpectThrownFrom(e,
+                             "kestrel::processes::silvan::TOMFileParser::TOMFileParser(const "
+                             "std::string&)",
+                             "tomfileparser.cpp");
+        }
+    }
+}
+
+TEST(TOMFileParser, CopiesShareTheTable) {
+    Master m;
+    auto original = std::make_unique<TOMFileParser>(m.path);
+    TOMFileParser copy(*original);
+    TOMFileParser assigned(WriteFile(m.dir.File("one.txt"), "x\n"));
+    assigned = *original;
+    original.reset();
+    copy.WriteMFilePrep(m.dir.File("prep.txt"));
+    assigned.WriteImgSet(m.dir.File("imgset.txt"));
+    EXPECT_EQ(ReadFile(m.dir.File("prep.txt")), kExpectedPrep);
+    EXPECT_EQ(ReadFile(m.dir.File("imgset.txt")), kExpectedImgSet);
+}
+
+// A file that cannot be created is an error, not a silent success.
+TEST(TOMFileParser, UncreatableOutputThrowsAndLeavesNoFile) {
+    Master m;
+    const std::string out = m.dir.File("no-such-dir/prep.txt");
+    for (auto write : {&TOMFileParser::WriteMFilePrep, &TOMFileParser::WriteImgSet}) {
+        try {
+            (m.parser.*write)(out);
+            FAIL() << "writing " << out << " succeeded";
+        } catch (const FileAccessException& e) {
+            EXPECT_EQ(e.GetFileName(), out);
+            EXPECT_EQ(e.GetType(), FileAccessException::CreateFailed);
+            EXPECT_EQ(static_cast<int>(e.GetType()), 5);
+            EXPECT_NE(e.GetErrorMessage().find(out), std::string::npos);
+            EXPECT_EQ(e.GetSourceFile(), "tomfileparser.cpp");
+            EXPECT_NE(e.GetFunction().find("TOMFileParser::Write"), std::string::npos);
+        }
+        EXPECT_FALSE(std::filesystem::exists(m.dir.File("no-such-dir")));
+    }
+}
+
+TEST(TOMFileParser, OutputThatIsADirectoryThrows) {
+    Master m;
+    EXPECT_THROW(m.parser.WriteImgSet(m.dir.Path().string()), FileAccessException);
+}
+
+#if defined(__linux__)
+// A device that refuses every write: the failure surfaces when the lines are written out.
+TEST(TOMFileParser, FailedWriteThrows) {
+    Master m;
+    if (!std::filesystem::exists("/dev/full"))
+        GTEST_SKIP() << "no /dev/full";
+    EXPECT_THROW(m.parser.WriteMFilePrep("/dev/full"), FileAccessException);
+}
+#endif
