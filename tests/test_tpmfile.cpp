@@ -1,0 +1,132 @@
+// The preparation parameter file parser: typed columns, the process's defaults and errors.
+#include <silvan/tpmfileparser.h>
+
+#include "support.h"
+
+#include <memory>
+
+using kestrel::DataException;
+using kestrel::ParameterException;
+using kestrel::processes::silvan::TPMFileParser;
+using testsupport::TempDir;
+using testsupport::WriteFile;
+
+namespace {
+
+using Channels = std::vector<unsigned int>;
+using Ints = std::vector<int>;
+
+// A parser with the process defaults channels 4,5, segment 2, dbiw 10,20, background "0" and
+// edge clipping 3.
+std::unique_ptr<TPMFileParser> Open(const std::string& path, Channels dbic = {4, 5}) {
+    Ints dbiw{10, 20};
+    return std::make_unique<TPMFileParser>(path, dbic, 2, dbiw, "0", 3);
+}
+
+std::string WritePrep(const TempDir& dir, const std::string& lines) {
+    return WriteFile(dir.File("prep.txt"), "!MFILE created for VARNOK\n" + lines);
+}
+
+void ExpectLine(const TPMFileParser& p, const std::string& fili, const Channels& dbic, int mmseg,
+                const Ints& dbiw, const std::string& srcBgd, int edgeClip) {
+    EXPECT_EQ(p.GetFili(), fili);
+    EXPECT_EQ(p.GetDbic(), dbic);
+    EXPECT_EQ(p.GetMmseg(), mmseg);
+    EXPECT_EQ(p.GetDbiw(), dbiw);
+    EXPECT_EQ(p.GetSrcBgd(), srcBgd);
+    EXPECT_EQ(p.GetEdgeClip(), edgeClip);
+}
+
+}  // namespace
+
+// Lines are read in any order and nothing of one line stays in the next; columns left out or
+// empty read as the process's values, the channel list expanded like a read one.
+TEST(TPMFileParser, ReadsTypedLinesAndProcessDefaults) {
+    TempDir dir;
+    auto p = Open(WritePrep(dir,
+                            "a.tif;3;1;;-9999;0\n"
+                            "d:\\img\\b.pix;1,2,3,4;7;0,1,-2;none;12\n"
+                            "c.tif\n"
+                            ";;;;;\n"));
+    ExpectLine(*p, "", {}, 0, {}, "", 0);
+    ASSERT_EQ(p->GetMfileLines(), 4u);
+    p->ParseLine(1);
+    ExpectLine(*p, "d:\\img\\b.pix", {1, 2, 3, 4}, 7, {0, 1, -2}, "none", 12);
+    p->ParseLine(0);
+    ExpectLine(*p, "a.tif", {3}, 1, {10, 20}, "-9999", 0);
+    p->ParseLine(2);
+    ExpectLine(*p, "c.tif", {4, 5}, 2, {10, 20}, "0", 3);
+    p->ParseLine(3);
+    ExpectLine(*p, "", {4, 5}, 2, {10, 20}, "0", 3);
+}
+
+TEST(TPMFileParser, IndexOutOfRangeLeavesEveryField) {
+    TempDir dir;
+    auto p = Open(WritePrep(dir, "a.tif;1,2;1;5;bg;6\nb.tif\n"));
+    p->ParseLine(0);
+    for (const int index : {-1, 2}) {
+        try {
+            p->ParseLine(index);
+            ADD_FAILURE() << index << " was read";
+        } catch (const DataException& e) {
+            EXPECT_EQ(e.GetErrorMessage(),
+                      "Index " + std::to_string(index) + " is outside of valid range: 2");
+            EXPECT_NE(e.GetFunction().find("TPMFileParser::ParseLine"), std::string::npos);
+            EXPECT_EQ(e.GetSourceFile(), "tpmfileparser.cpp");
+        }
+        ExpectLine(*p, "a.tif", {1, 2}, 1, {5}, "bg", 6);
+    }
+}
+
+// A channel list naming no channel is refused, whether it comes from the line or from the
+// process default; a default channel number above INT_MAX does not come back as a channel.
+TEST(TPMFileParser, ChannelListsNamingNoChannelAreRefused) {
+    TempDir dir;
+    const std::string path = WritePrep(dir, "a.tif;1;1\nb.tif;2,0;2\nc.tif\n");
+    auto p = Open(path, {1, 4294967295u});
+    p->ParseLine(0);
+    try {
+        p->ParseLine(1);
+        ADD_FAILURE() << "channel 0 was accepted";
+    } catch (const DataException& e) {
+        EXPECT_NE(e.GetErrorMessage().find("\"2,0\""), std::string::npos) << e.GetErrorMessage();
+    }
+    // The columns before the channel list hold the new line, the later ones the old.
+    EXPECT_EQ(p->GetFili(), "b.tif");
+    EXPECT_EQ(p->GetMmseg(), 1);
+    EXPECT_THROW(p->ParseLine(2), DataException);
+    EXPECT_EQ(p->GetDbic(), (Channels{1}));
+}
+
+TEST(TPMFileParser, UnreadableFileIsRefused) {
+    TempDir dir;
+    const std::string path = dir.File("missing.txt");
+    try {
+        Open(path);
+        ADD_FAILURE() << "a missing file was read";
+    } catch (const ParameterException& e) {
+        EXPECT_EQ(e.GetErrorMessage(), "Invalid MFILE");
+        EXPECT_EQ(e.GetParameterName(), "MFILE");
+        EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
+        EXPECT_EQ(e.GetValue(), path);
+        EXPECT_NE(e.GetFunction().find("TPMFileParser::TPMFileParser"), std::string::npos);
+        EXPECT_EQ(e.GetSourceFile(), "tpmfileparser.cpp");
+    }
+}
+
+// Copies share the table, which lives as long as the last of them.
+TEST(TPMFileParser, CopiesShareTheTable) {
+    TempDir dir;
+    auto other = Open(WriteFile(dir.File("other.txt"), "x.tif\n"));
+    {
+        auto original = Open(WritePrep(dir, "a.tif;1;1\nb.tif;2;2\n"));
+        original->ParseLine(1);
+        TPMFileParser copy(*original);
+        original.reset();
+        EXPECT_EQ(copy.GetFili(), "b.tif");
+        *other = copy;
+    }
+    other->ParseLine(0);
+    ExpectLine(*other, "a.tif", {1}, 1, {10, 20}, "0", 3);
+    EXPECT_EQ(other->GetMfileLines(), 2u);
+}
