@@ -4,7 +4,7 @@ namespace kestrel {
 namespace processes {
 namespace silvan {
 
-namespace core {
+namespace parsercore {
 
 std::shared_ptr<ParametersTableIF> ReadTable(MFileParser& parser, const std::string& filename,
                                              unsigned int& lineCount, const SourceLocation& where) {
@@ -29,10 +29,10 @@ void CheckLineIndex(int index, unsigned int lineCount, const SourceLocation& whe
     }
 }
 
-}  // namespace core
+}  // namespace parsercore
 
 FileListParser::FileListParser(const std::string& filename) : MFileParser(0) {
-    table = core::ReadTable(*this, filename, mfileLines, KESTREL_HERE);
+    table = parsercore::ReadTable(*this, filename, mfileLines, KESTREL_HERE);
     AddDefaultLine();
 }
 
@@ -45,7 +45,7 @@ void FileListParser::AddDefaultLine() {
 }
 
 void FileListParser::ParseLine(int index) {
-    core::CheckLineIndex(index, mfileLines, KESTREL_HERE);
+    parsercore::CheckLineIndex(index, mfileLines, KESTREL_HERE);
     fili = table->GetString(index, 0);
 }
 

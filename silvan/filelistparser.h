@@ -12,7 +12,7 @@ namespace kestrel {
 namespace processes {
 namespace silvan {
 
-namespace core {
+namespace parsercore {
 
 // Has the parser read filename into a table. Throws ParameterException "Invalid MFILE" when no
 // table is obtained and "Empty text file" when it has no line (releasing it); both are reported
@@ -24,7 +24,7 @@ std::shared_ptr<ParametersTableIF> ReadTable(MFileParser& parser, const std::str
 // 0 <= index < lineCount, both compared as signed 32-bit integers.
 void CheckLineIndex(int index, unsigned int lineCount, const SourceLocation& where);
 
-}  // namespace core
+}  // namespace parsercore
 
 // A list of file names, one per line.
 class SILVAN_API FileListParser : public MFileParser {

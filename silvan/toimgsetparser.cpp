@@ -19,7 +19,7 @@ bool StartsWith(const std::string& text, const char* prefix) {
 TOImgSetParser::TOImgSetParser(const std::string& filename, RadiometricDiff radioDifDefault,
                                int dbmPxErrDefault)
     : MFileParser(0) {
-    table = core::ReadTable(*this, filename, mfileLines, KESTREL_HERE);
+    table = parsercore::ReadTable(*this, filename, mfileLines, KESTREL_HERE);
     AddDefaultLine(radioDifDefault, dbmPxErrDefault);
 }
 
@@ -34,7 +34,7 @@ void TOImgSetParser::AddDefaultLine(RadiometricDiff radioDifDefault, int dbmPxEr
 }
 
 void TOImgSetParser::ParseLine(int index) {
-    core::CheckLineIndex(index, mfileLines, KESTREL_HERE);
+    parsercore::CheckLineIndex(index, mfileLines, KESTREL_HERE);
     sceneId = table->GetString(index, 0);
     radioDif = EncodeRadioDif(table->GetString(index, 1));
     dbmPxErr = table->GetInt(index, 2);

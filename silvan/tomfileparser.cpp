@@ -116,7 +116,7 @@ class LineWriter {
 TOMFileParser::TOMFileParser() : MFileParser(0) {}
 
 TOMFileParser::TOMFileParser(const std::string& filename) : MFileParser(0) {
-    table = core::ReadTable(*this, filename, mfileLines, KESTREL_HERE);
+    table = parsercore::ReadTable(*this, filename, mfileLines, KESTREL_HERE);
     AddDefaultLine();
 }
 
@@ -130,7 +130,7 @@ void TOMFileParser::AddDefaultLine() {
 }
 
 void TOMFileParser::ParseLineForPrep(const int line) {
-    core::CheckLineIndex(line, mfileLines, KESTREL_HERE);
+    parsercore::CheckLineIndex(line, mfileLines, KESTREL_HERE);
     fili = table->GetString(line, kFili);
     dbic = table->GetString(line, kDbic);
     mmseg = table->GetString(line, kMmseg);
@@ -140,7 +140,7 @@ void TOMFileParser::ParseLineForPrep(const int line) {
 }
 
 void TOMFileParser::ParseLineForFill(const int line) {
-    core::CheckLineIndex(line, mfileLines, KESTREL_HERE);
+    parsercore::CheckLineIndex(line, mfileLines, KESTREL_HERE);
     fili = table->GetString(line, kFili);
     radioDif = table->GetString(line, kRadioDif);
     dbmPxErr = table->GetString(line, kDbmPxErr);
@@ -170,7 +170,7 @@ void TOMFileParser::WriteImgSet(const std::string& filename) {
             c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
         if (role.compare(0, 4, "PREP") == 0)
             continue;
-        const ::kestrel::core::fileio::File image(fili);
+        const core::fileio::File image(fili);
         out << image.GetBasename() << ';' << radioDif << ';' << dbmPxErr;
         out.EndLine();
     }

@@ -11,7 +11,7 @@ TPMFileParser::TPMFileParser(const std::string& filename, std::vector<unsigned i
                              int defaultMmseg, std::vector<int>& defaultDbiw,
                              const std::string& defaultSrcBgd, int defaultEdgeClip)
     : MFileParser(0) {
-    table = core::ReadTable(*this, filename, mfileLines, KESTREL_HERE);
+    table = parsercore::ReadTable(*this, filename, mfileLines, KESTREL_HERE);
     AddDefaultLine(defaultDbic, defaultMmseg, defaultDbiw, defaultSrcBgd, defaultEdgeClip);
 }
 
@@ -38,7 +38,7 @@ void TPMFileParser::AddDefaultLine(std::vector<unsigned int>& dbicDefault, int m
 }
 
 void TPMFileParser::ParseLine(const int line) {
-    core::CheckLineIndex(line, mfileLines, KESTREL_HERE);
+    parsercore::CheckLineIndex(line, mfileLines, KESTREL_HERE);
     fili = table->GetString(line, 0);
     // The table's list is overwritten by its next read: copy it before anything else reads.
     const std::vector<int> channels = table->GetIntList(line, 1);
