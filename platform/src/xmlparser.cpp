@@ -343,6 +343,52 @@ xc::DOMImplementation* Implementation() {
     return xc::DOMImplementationRegistry::getDOMImplementation(kFeatures);
 }
 
+// Puts every child element of an element that holds elements on a line of its own, indented by
+// two blanks a level. Xerces' own pretty printing also puts blank lines around the root's
+// children; these whitespace nodes give the same layout without them.
+void IndentElements(xc::DOMDocument* document, xc::DOMElement* element, std::size_t depth) {
+    if (element->getFirstElementChild() == nullptr)
+        return;
+    const XString inner = ToXML("\n" + std::string(2 * (depth + 1), ' '));
+    for (xc::DOMElement* child = element->getFirstElementChild(); child != nullptr;
+         child = child->getNextElementSibling()) {
+        element->insertBefore(document->createTextNode(inner.c_str()), child);
+        IndentElements(document, child, depth + 1);
+    }
+    element->appendChild(
+        document->createTextNode(ToXML("\n" + std::string(2 * depth, ' ')).c_str()));
+}
+
+// The serialized document with the XML declaration and the document type declaration each on
+// a line of its own, and a line end at the end.
+std::string WithPrologLines(const char* bytes, std::size_t length) {
+    std::string out(bytes, length);
+    std::size_t pos = out.find("?>");
+    if (pos != std::string::npos) {
+        pos += 2;
+        out.insert(pos, "\n");
+        ++pos;
+        if (out.compare(pos, 9, "<!DOCTYPE") == 0) {
+            char quote = 0;
+            for (std::size_t i = pos; i < out.size(); ++i) {
+                const char c = out[i];
+                if (quote != 0) {
+                    if (c == quote)
+                        quote = 0;
+                } else if (c == '"' || c == '\'') {
+                    quote = c;
+                } else if (c == '>') {
+                    out.insert(i + 1, "\n");
+                    break;
+                }
+            }
+        }
+    }
+    if (out.empty() || out.back() != '\n')
+        out += '\n';
+    return out;
+}
+
 }  // namespace
 
 // ---------------------------------------------------------------------------------------------
@@ -596,6 +642,7 @@ void XMLParser::WriteXMLFile() {
     type.reset();
 
     AddElementsToDocument();
+    IndentElements(document_.get(), document_->getDocumentElement(), 0);
 
     RecordingDOMErrorHandler errors;
     xc::MemBufFormatTarget target;
@@ -603,7 +650,7 @@ void XMLParser::WriteXMLFile() {
         XercesPtr<xc::DOMLSSerializer> serializer(implementation->createLSSerializer());
         xc::DOMConfiguration* config = serializer->getDomConfig();
         config->setParameter(xc::XMLUni::fgDOMErrorHandler, &errors);
-        config->setParameter(xc::XMLUni::fgDOMWRTFormatPrettyPrint, true);
+        config->setParameter(xc::XMLUni::fgDOMWRTFormatPrettyPrint, false);
         config->setParameter(xc::XMLUni::fgDOMXMLDeclaration, true);
         static const XMLCh kLineFeed[] = {'\n', 0};
         serializer->setNewLine(kLineFeed);
@@ -637,9 +684,10 @@ void XMLParser::WriteXMLFile() {
             FormatString("XML file %s cannot be created: %s", name.c_str(),
                          std::error_code(error, std::generic_category()).message().c_str()));
     }
-    const std::size_t length = static_cast<std::size_t>(target.getLen());
+    const std::string text = WithPrologLines(reinterpret_cast<const char*>(target.getRawBuffer()),
+                                             static_cast<std::size_t>(target.getLen()));
     errno = 0;
-    const bool written = std::fwrite(target.getRawBuffer(), 1, length, file) == length;
+    const bool written = std::fwrite(text.data(), 1, text.size(), file) == text.size();
     const bool closed = std::fclose(file) == 0;
     const int error = errno;
     if (!written || !closed) {
