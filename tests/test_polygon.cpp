@@ -3,140 +3,92 @@
 
 #include "support.h"
 
-#include <algorithm>
+#include <array>
 #include <limits>
 #include <memory>
+#include <utility>
 #include <vector>
 
 using kestrel::tin::Polygon;
 using P = point2_t<double>;
+using Pts = std::vector<std::pair<double, double>>;
 
 namespace {
 
 // A polygon made the way the readers make one: from a new[] array that it takes over.
-Polygon<double> Make(const std::vector<P>& points) {
+Polygon<double> Make(const Pts& points) {
     P* array = new P[points.size()];
-    std::copy(points.begin(), points.end(), array);
+    for (std::size_t i = 0; i < points.size(); ++i)
+        array[i] = {points[i].first, points[i].second};
     return Polygon<double>(array, static_cast<unsigned int>(points.size()));
 }
 
-std::vector<P> PointsOf(const Polygon<double>& polygon) {
-    return std::vector<P>(polygon.points, polygon.points + polygon.numPoints);
+Pts PointsOf(const Polygon<double>& polygon) {
+    Pts out;
+    for (unsigned int i = 0; i < polygon.numPoints; ++i)
+        out.emplace_back(polygon.points[i].x, polygon.points[i].y);
+    return out;
 }
 
-void ExpectPoints(const Polygon<double>& polygon, const std::vector<P>& expected) {
-    const std::vector<P> actual = PointsOf(polygon);
-    ASSERT_EQ(actual.size(), expected.size());
-    for (std::size_t i = 0; i < expected.size(); ++i) {
-        EXPECT_EQ(actual[i].x, expected[i].x) << "point " << i;
-        EXPECT_EQ(actual[i].y, expected[i].y) << "point " << i;
-    }
+std::array<double, 4> Box(const Polygon<double>& p) {
+    return {p.bbox.min.x, p.bbox.min.y, p.bbox.max.x, p.bbox.max.y};
 }
 
 }  // namespace
 
-TEST(Polygon, PointsAreTakenOverBoundedAndCleaned) {
-    const Polygon<double> polygon = Make({{1, 1}, {1, 1}, {2, 2}});
-    EXPECT_TRUE(polygon.ownsPoints);
-    ExpectPoints(polygon, {{1, 1}, {2, 2}});
-    EXPECT_EQ(polygon.bbox.min.x, 1.0);
-    EXPECT_EQ(polygon.bbox.min.y, 1.0);
-    EXPECT_EQ(polygon.bbox.max.x, 2.0);
-    EXPECT_EQ(polygon.bbox.max.y, 2.0);
+TEST(Polygon, BoxSpansEachAxisAndIsComputedBeforeDuplicatesGo) {
+    EXPECT_EQ(Box(Make({{3, -1}, {-2, 5}, {0.5, 7}})), (std::array<double, 4>{-2, -1, 3, 7}));
+    const Polygon<double> cleaned = Make({{0, 0}, {5e-10, 5e-10}});
+    EXPECT_EQ(PointsOf(cleaned), (Pts{{0, 0}}));
+    EXPECT_EQ(Box(cleaned), (std::array<double, 4>{0, 0, 5e-10, 5e-10}));
 }
 
-TEST(Polygon, BoxSpansEveryAxisSeparately) {
-    const Polygon<double> polygon = Make({{3, -1}, {-2, 5}, {0.5, 7}});
-    EXPECT_EQ(polygon.bbox.min.x, -2.0);
-    EXPECT_EQ(polygon.bbox.min.y, -1.0);
-    EXPECT_EQ(polygon.bbox.max.x, 3.0);
-    EXPECT_EQ(polygon.bbox.max.y, 7.0);
+TEST(Polygon, PointWithinOneNanometreOfItsOriginalPredecessorIsDropped) {
+    const std::pair<Pts, Pts> cases[] = {
+        {{{1, 1}, {1, 1}, {2, 2}}, {{1, 1}, {2, 2}}},
+        {{{0, 0}, {1e-9, 0}}, {{0, 0}, {1e-9, 0}}},  // the tolerance is strict
+        {{{0, 0}, {5e-10, 0}, {1, 1}}, {{0, 0}, {1, 1}}},
+        {{{0, 0}, {0, 1}}, {{0, 0}, {0, 1}}},  // close in x only
+        {{{1, 1}, {1 - 5e-10, 1 - 5e-10}}, {{1, 1}}},
+        // Each point is compared with its predecessor as given, not with the last one kept.
+        {{{0, 0}, {4e-10, 0}, {8e-10, 0}, {1.2e-9, 0}}, {{0, 0}}},
+        {{{0, 0}, {4e-10, 0}, {8e-10, 0}, {1.2e-9, 0}, {5, 5}, {5, 5}, {6, 6}},
+         {{0, 0}, {5, 5}, {6, 6}}},
+        {{{0, 0}, {1, 0}, {1, 1}, {0, 0}}, {{0, 0}, {1, 0}, {1, 1}, {0, 0}}},  // closing point
+    };
+    for (const auto& c : cases)
+        EXPECT_EQ(PointsOf(Make(c.first)), c.second) << "case " << (&c - cases);
 }
 
-TEST(Polygon, ToleranceIsStrictlyInsideOneNanometre) {
-    // 1e-9 apart in x: both stay. 5e-10 apart in x, same y: the second goes.
-    ExpectPoints(Make({{0, 0}, {1e-9, 0}}), {{0, 0}, {1e-9, 0}});
-    ExpectPoints(Make({{0, 0}, {5e-10, 0}, {1, 1}}), {{0, 0}, {1, 1}});
-    // Close in x but not in y: not a duplicate.
-    ExpectPoints(Make({{0, 0}, {0, 1}}), {{0, 0}, {0, 1}});
-    // Close in both, negative direction.
-    ExpectPoints(Make({{1, 1}, {1 - 5e-10, 1 - 5e-10}}), {{1, 1}});
-}
-
-TEST(Polygon, CreepingRunCollapsesToItsFirstPoint) {
-    // Each point is compared with its predecessor as given, not with the last one kept.
-    ExpectPoints(Make({{0, 0}, {4e-10, 0}, {8e-10, 0}, {1.2e-9, 0}}), {{0, 0}});
-    ExpectPoints(Make({{0, 0}, {4e-10, 0}, {8e-10, 0}, {1.2e-9, 0}, {5, 5}, {5, 5}, {6, 6}}),
-                 {{0, 0}, {5, 5}, {6, 6}});
-}
-
-TEST(Polygon, ClosingPointIsKeptAndRingIsNotClosed) {
-    ExpectPoints(Make({{0, 0}, {1, 0}, {1, 1}, {0, 0}}), {{0, 0}, {1, 0}, {1, 1}, {0, 0}});
-    ExpectPoints(Make({{0, 0}, {1, 0}, {1, 1}}), {{0, 0}, {1, 0}, {1, 1}});
-}
-
-TEST(Polygon, BoxIsNotRecomputedAfterRemoval) {
-    // The box is computed before the duplicates go and is not recomputed: it still covers the
-    // dropped point.
-    const Polygon<double> polygon = Make({{0, 0}, {5e-10, 5e-10}});
-    ExpectPoints(polygon, {{0, 0}});
-    EXPECT_EQ(polygon.bbox.max.x, 5e-10);
-}
-
-TEST(Polygon, EmptyPolygonHasInvertedBox) {
+TEST(Polygon, EmptyPolygonHasInvertedBoxAndNullArrayWithPointsIsRefused) {
     const double big = std::numeric_limits<double>::max();
     for (P* array : {static_cast<P*>(nullptr), new P[0]}) {
         const Polygon<double> polygon(array, 0);
         EXPECT_EQ(polygon.numPoints, 0u);
-        EXPECT_EQ(polygon.bbox.min.x, big);
-        EXPECT_EQ(polygon.bbox.min.y, big);
-        EXPECT_EQ(polygon.bbox.max.x, -big);
-        EXPECT_EQ(polygon.bbox.max.y, -big);
+        EXPECT_EQ(Box(polygon), (std::array<double, 4>{big, big, -big, -big}));
     }
-}
-
-TEST(Polygon, NullArrayWithPointsIsRefused) {
     EXPECT_THROW(Polygon<double>(nullptr, 3), kestrel::DataException);
 }
 
-TEST(Polygon, NewBoxIsZero) {
-    const kestrel::tin::BBox<double, P> box;
-    EXPECT_EQ(box.min.x, 0.0);
-    EXPECT_EQ(box.min.y, 0.0);
-    EXPECT_EQ(box.max.x, 0.0);
-    EXPECT_EQ(box.max.y, 0.0);
-}
-
-TEST(Polygon, CopyHasItsOwnPointsAndTheSourceBox) {
+TEST(Polygon, CopiesAndAssignmentsOwnIndependentPoints) {
     auto source = std::make_unique<Polygon<double>>(Make({{1, 2}, {3, 4}}));
     source->reserved = 42;
     source->bbox.max.x = 99;  // no longer matches the points: the copy takes it as it is
     const Polygon<double> copy(*source);
-    EXPECT_NE(copy.points, source->points);
     EXPECT_TRUE(copy.ownsPoints);
     EXPECT_EQ(copy.reserved, 42);
-    EXPECT_EQ(copy.bbox.max.x, 99.0);
-    EXPECT_EQ(copy.bbox.min.y, 2.0);
-
+    EXPECT_EQ(Box(copy), (std::array<double, 4>{1, 2, 99, 4}));
     source->points[0].x = -7;
-    ExpectPoints(copy, {{1, 2}, {3, 4}});
     source.reset();
-    ExpectPoints(copy, {{1, 2}, {3, 4}});
-}
+    EXPECT_EQ(PointsOf(copy), (Pts{{1, 2}, {3, 4}}));
 
-TEST(Polygon, CopyOfCleanedPolygonCopiesOnlyKeptPoints) {
-    const Polygon<double> source = Make({{1, 1}, {1, 1}, {1, 1}, {2, 2}});
-    const Polygon<double> copy(source);
-    ExpectPoints(copy, {{1, 1}, {2, 2}});
-}
+    // Only the kept points of a cleaned polygon are copied.
+    EXPECT_EQ(PointsOf(Polygon<double>(Make({{1, 1}, {1, 1}, {2, 2}}))), (Pts{{1, 1}, {2, 2}}));
 
-TEST(Polygon, AssignmentReplacesPointsAndSurvivesSelfAssignment) {
     Polygon<double> target = Make({{9, 9}});
-    const Polygon<double> source = Make({{1, 2}, {3, 4}});
-    target = source;
-    ExpectPoints(target, {{1, 2}, {3, 4}});
-    EXPECT_NE(target.points, source.points);
+    target = copy;
+    EXPECT_NE(target.points, copy.points);
     Polygon<double>& alias = target;
     target = alias;
-    ExpectPoints(target, {{1, 2}, {3, 4}});
+    EXPECT_EQ(PointsOf(target), (Pts{{1, 2}, {3, 4}}));
 }
