@@ -200,6 +200,21 @@ TEST_F(SceneRead, EscapesEntitiesLongTextsAndCharacterSetsGiveBytes) {
     EXPECT_TRUE(Contains(message, "U+65E5") && Contains(message, "ElevMapRaster")) << message;
 }
 
+// Text nested far deeper than any scene file nests is read without exhausting the stack.
+TEST_F(SceneRead, DeeplyNestedTextIsRead) {
+    Elements e;
+    const int depth = 200000;
+    std::string nested;
+    for (int i = 0; i < depth; ++i)
+        nested += "<a>";
+    nested += "deep.pix";
+    for (int i = 0; i < depth; ++i)
+        nested += "</a>";
+    e.source = "<SourceRaster>" + nested + "</SourceRaster>";
+    TOSceneParser scene(Put("deep.xml", e.Document()).c_str());
+    EXPECT_EQ(scene.GetSceneFilename(), "deep.pix");
+}
+
 TEST_F(SceneRead, MissingFileOrDirectoryIsReportedWithItsName) {
     const std::string path = dir.File("none.xml");
     EXPECT_TRUE(Contains(ReadError<kestrel::FileNotFoundException>(path), path));

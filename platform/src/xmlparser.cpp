@@ -247,23 +247,32 @@ std::vector<char> ReadBytes(const std::string& name, const SourceLocation& where
 }
 
 // Appends the text of node and its descendants (text and CDATA sections, as DOM text content
-// has it) as bytes. Returns the first character that has no single-byte form, or 0.
+// has it) as bytes. Returns the first character that has no single-byte form, or 0. Walks the
+// tree without recursion, so that deeply nested input cannot exhaust the stack.
 XMLCh AppendText(const xc::DOMNode* node, std::string* out) {
-    for (const xc::DOMNode* child = node->getFirstChild(); child != nullptr;
-         child = child->getNextSibling()) {
-        const xc::DOMNode::NodeType type = child->getNodeType();
+    const xc::DOMNode* current = node->getFirstChild();
+    while (current != nullptr) {
+        const xc::DOMNode::NodeType type = current->getNodeType();
         if (type == xc::DOMNode::TEXT_NODE || type == xc::DOMNode::CDATA_SECTION_NODE) {
-            for (const XMLCh* c = child->getNodeValue(); c != nullptr && *c != 0; ++c) {
+            for (const XMLCh* c = current->getNodeValue(); c != nullptr && *c != 0; ++c) {
                 if (*c > 0xFF)
                     return *c;
                 out->push_back(static_cast<char>(*c));
             }
-        } else if (type == xc::DOMNode::ELEMENT_NODE ||
-                   type == xc::DOMNode::ENTITY_REFERENCE_NODE) {
-            const XMLCh bad = AppendText(child, out);
-            if (bad != 0)
-                return bad;
+        } else if ((type == xc::DOMNode::ELEMENT_NODE ||
+                    type == xc::DOMNode::ENTITY_REFERENCE_NODE) &&
+                   current->getFirstChild() != nullptr) {
+            current = current->getFirstChild();
+            continue;
         }
+        // Next in document order below node.
+        while (current != nullptr && current->getNextSibling() == nullptr) {
+            current = current->getParentNode();
+            if (current == node)
+                return 0;
+        }
+        if (current != nullptr)
+            current = current->getNextSibling();
     }
     return 0;
 }
