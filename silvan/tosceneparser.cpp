@@ -27,8 +27,8 @@ const char kDtdName[] = "TOSceneDesc_Document.dtd";
 const char* const kDtdText[] = {
     "<?xml version=\"1.0\" encoding=\"ISO-8859-1\"?>\n\n",
     "<!-- True Ortho Scene Description File -->\n",
-    "<!ELEMENT TOSceneDesc_Document (SourceRaster | OrthoRaster | VisIdxmapRaster | "
-    "ElevMapRaster | Mmseg | OrthoNoDataValue | ElevNoDataValue | SceneFootprint)*>\n",
+    ("<!ELEMENT TOSceneDesc_Document (SourceRaster | OrthoRaster | VisIdxmapRaster | "
+     "ElevMapRaster | Mmseg | OrthoNoDataValue | ElevNoDataValue | SceneFootprint)*>\n"),
     "<!ELEMENT SourceRaster (#PCDATA)>\n",
     "<!ELEMENT OrthoRaster (#PCDATA)>\n",
     "<!ELEMENT VisIdxmapRaster (#PCDATA)>\n",
