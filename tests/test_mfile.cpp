@@ -146,3 +146,28 @@ TEST(MFileTable, FileOfCommentsHasNoLines) {
     EXPECT_EQ(table->GetLineCount(), 0u);
     EXPECT_EQ(Read(WriteFile(dir.File("e.txt"), ""))->GetLineCount(), 0u);
 }
+
+// A file of many read chunks: lines, comments, blank lines and CR LF ends that straddle chunk
+// boundaries are indexed like any others.
+TEST(MFileTable, LargeFileIsIndexedAcrossReadChunks) {
+    TempDir dir;
+    std::string bytes = "\xEF\xBB\xBF!header\r\n";
+    std::vector<std::string> names;
+    for (int i = 0; i < 30000; ++i) {
+        names.push_back("scene_" + std::to_string(i) + std::string(i % 61, 'x'));
+        bytes += names.back() + ";" + std::to_string(i) + (i % 3 ? "\r\n" : "\n");
+        if (i % 97 == 0)
+            bytes += "! comment " + std::to_string(i) + "\n";
+        if (i % 89 == 0)
+            bytes += " \t \r\n";
+    }
+    bytes += "last;-1";
+    auto table = Read(WriteFile(dir.File("large.txt"), bytes));
+    ASSERT_EQ(table->GetLineCount(), names.size() + 1);
+    for (int i = 0; i < static_cast<int>(names.size()); ++i) {
+        ASSERT_EQ(table->GetString(i, 0), names[static_cast<std::size_t>(i)]);
+        ASSERT_EQ(table->GetInt(i, 1), i);
+    }
+    EXPECT_EQ(table->GetString(30000, 0), "last");
+    EXPECT_EQ(table->GetInt(30000, 1), -1);
+}

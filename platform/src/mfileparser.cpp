@@ -35,15 +35,72 @@ Span Trim(Span s) {
     return s;
 }
 
-// The bytes of a file, read whole. Not zero-initialised: every byte is written by the read.
-struct FileBytes {
-    std::unique_ptr<char[]> data;
+// A parameter file as read: its bytes, and the offset of each data line in them.
+struct LoadedFile {
+    std::unique_ptr<char[]> bytes;  // not zero-initialised: every byte is written by the read
     std::size_t size = 0;
+    std::vector<std::size_t> lineStarts;
 };
 
-// Reads the whole file. False when it cannot be opened or read. The table keeps its own copy
-// rather than a mapping of the file, so that it stays valid when the file is rewritten.
-bool ReadWholeFile(const std::string& filename, FileBytes& bytes) {
+// Collects the starts of the data lines while the file's bytes arrive, so that each chunk is
+// indexed while it is still in the processor's cache.
+class LineIndexer {
+  public:
+    LineIndexer(const std::string& filename, std::vector<std::size_t>& starts)
+        : filename_(filename), starts_(starts) {}
+
+    // Indexes the lines that end in bytes [scanned, size) of the file read so far.
+    void Scan(const char* bytes, std::size_t size) {
+        // A byte order mark written by some Windows editors is not part of the first line.
+        if (scanned_ == 0 && size >= 3 && std::memcmp(bytes, "\xEF\xBB\xBF", 3) == 0)
+            scanned_ = lineStart_ = 3;
+        const char* const end = bytes + size;
+        const char* p = bytes + scanned_;
+        while (p < end) {
+            const char* eol = static_cast<const char*>(std::memchr(p, '\n', end - p));
+            if (eol == nullptr)
+                break;
+            AddLine(bytes, static_cast<std::size_t>(eol - bytes));
+            p = eol + 1;
+        }
+        scanned_ = size;
+    }
+
+    // Indexes a last line that has no line end.
+    void Finish(const char* bytes, std::size_t size) {
+        if (lineStart_ < size)
+            AddLine(bytes, size);
+    }
+
+  private:
+    // Records the line [lineStart_, eol) when it is a data line: not a "!" line, not blank.
+    void AddLine(const char* bytes, std::size_t eol) {
+        const std::size_t start = lineStart_;
+        lineStart_ = eol + 1;
+        if (start == eol || bytes[start] == '!')
+            return;
+        const char* q = bytes + start;
+        while (q < bytes + eol && (IsBlank(*q) || *q == '\r'))
+            ++q;
+        if (q == bytes + eol)
+            return;
+        if (starts_.size() >= static_cast<std::size_t>(INT_MAX)) {
+            KESTREL_THROW(DataException, FormatString("%s has more data lines than can be indexed",
+                                                      filename_.c_str()));
+        }
+        starts_.push_back(start);
+    }
+
+    const std::string& filename_;
+    std::vector<std::size_t>& starts_;
+    std::size_t lineStart_ = 0;
+    std::size_t scanned_ = 0;
+};
+
+// Reads the whole file and indexes its data lines. False when it cannot be opened or read. The
+// table keeps its own copy rather than a mapping of the file, so that it stays valid when the
+// file is rewritten while it is in use.
+bool LoadFile(const std::string& filename, LoadedFile& loaded) {
     std::error_code ec;
     const std::filesystem::path path(filename);
     if (!std::filesystem::is_regular_file(path, ec))
@@ -51,34 +108,47 @@ bool ReadWholeFile(const std::string& filename, FileBytes& bytes) {
     std::size_t capacity = static_cast<std::size_t>(std::filesystem::file_size(path, ec));
     if (ec)
         return false;
-
     std::unique_ptr<std::FILE, int (*)(std::FILE*)> file(std::fopen(filename.c_str(), "rb"),
                                                          &std::fclose);
     if (!file)
         return false;
-    bytes.data.reset(new char[capacity + 1]);
-    bytes.size = 0;
+
+    constexpr std::size_t kChunk = 1 << 18;
+    loaded.bytes.reset(new char[capacity + 1]);
+    loaded.size = 0;
+    loaded.lineStarts.reserve(capacity / 48 + 16);  // a typical line is longer than 48 bytes
+    LineIndexer indexer(filename, loaded.lineStarts);
     for (;;) {
-        bytes.size +=
-            std::fread(bytes.data.get() + bytes.size, 1, capacity + 1 - bytes.size, file.get());
+        if (loaded.size == capacity + 1) {
+            // The file has grown since its size was taken: make room and go on reading.
+            const std::size_t larger = 2 * capacity + kChunk;
+            std::unique_ptr<char[]> bytes(new char[larger + 1]);
+            std::memcpy(bytes.get(), loaded.bytes.get(), loaded.size);
+            loaded.bytes = std::move(bytes);
+            capacity = larger;
+        }
+        const std::size_t want = std::min(kChunk, capacity + 1 - loaded.size);
+        const std::size_t got = std::fread(loaded.bytes.get() + loaded.size, 1, want, file.get());
         if (std::ferror(file.get()))
             return false;
-        if (bytes.size <= capacity)
-            return true;
-        // The file has grown since its size was taken: make room and go on reading.
-        std::unique_ptr<char[]> larger(new char[2 * capacity + 65536]);
-        std::memcpy(larger.get(), bytes.data.get(), bytes.size);
-        bytes.data = std::move(larger);
-        capacity = 2 * capacity + 65535;
+        if (got == 0)
+            break;
+        loaded.size += got;
+        indexer.Scan(loaded.bytes.get(), loaded.size);
     }
+    indexer.Finish(loaded.bytes.get(), loaded.size);
+    if (loaded.lineStarts.capacity() > loaded.lineStarts.size() + loaded.lineStarts.size() / 4)
+        loaded.lineStarts.shrink_to_fit();
+    return true;
 }
 
 class MFileTable final : public ParametersTableIF {
   public:
-    MFileTable(std::string filename, FileBytes bytes)
-        : filename_(std::move(filename)), bytes_(std::move(bytes)) {
-        IndexLines();
-    }
+    MFileTable(std::string filename, LoadedFile file)
+        : filename_(std::move(filename)),
+          bytes_(std::move(file.bytes)),
+          size_(file.size),
+          lineStarts_(std::move(file.lineStarts)) {}
 
     int GetInt(int line, int column) const override {
         const Field f = Lookup(line, column, KESTREL_HERE);
@@ -133,46 +203,6 @@ class MFileTable final : public ParametersTableIF {
         bool fromDefault;
     };
 
-    void IndexLines() {
-        const char* const begin = bytes_.data.get();
-        const char* const end = begin + bytes_.size;
-        const char* p = begin;
-        // A byte order mark written by some Windows editors is not part of the first line.
-        if (bytes_.size >= 3 && std::memcmp(p, "\xEF\xBB\xBF", 3) == 0)
-            p += 3;
-        ReserveLineStarts();
-        while (p < end) {
-            const char* eol = static_cast<const char*>(std::memchr(p, '\n', end - p));
-            if (eol == nullptr)
-                eol = end;
-            if (*p != '!') {
-                const char* q = p;
-                while (q < eol && (IsBlank(*q) || *q == '\r'))
-                    ++q;
-                if (q < eol) {
-                    if (lineStarts_.size() >= static_cast<std::size_t>(INT_MAX)) {
-                        KESTREL_THROW(DataException,
-                                      FormatString("%s has more data lines than can be indexed",
-                                                   filename_.c_str()));
-                    }
-                    lineStarts_.push_back(static_cast<std::size_t>(p - begin));
-                }
-            }
-            p = eol + 1;
-        }
-        lineStarts_.shrink_to_fit();
-    }
-
-    // Reserves room for the line starts from the line length of the file's first bytes, so
-    // that a large file is indexed without repeated reallocation.
-    void ReserveLineStarts() {
-        const std::size_t sample = std::min<std::size_t>(bytes_.size, 1 << 16);
-        const char* const begin = bytes_.data.get();
-        const auto newlines = static_cast<std::size_t>(std::count(begin, begin + sample, '\n'));
-        if (newlines > 0)
-            lineStarts_.reserve(bytes_.size / (sample / newlines) + 16);
-    }
-
     Field Lookup(int line, int column, const SourceLocation& where) const {
         if (line < 0 || static_cast<std::size_t>(line) >= lineStarts_.size()) {
             KESTREL_THROW_AT(where, DataException,
@@ -184,8 +214,8 @@ class MFileTable final : public ParametersTableIF {
                 where, DataException,
                 FormatString("%s: column %d is not a valid column", filename_.c_str(), column));
         }
-        const char* const end = bytes_.data.get() + bytes_.size;
-        const char* p = bytes_.data.get() + lineStarts_[static_cast<std::size_t>(line)];
+        const char* const end = bytes_.get() + size_;
+        const char* p = bytes_.get() + lineStarts_[static_cast<std::size_t>(line)];
         const char* eol = static_cast<const char*>(std::memchr(p, '\n', end - p));
         if (eol == nullptr)
             eol = end;
@@ -237,13 +267,14 @@ class MFileTable final : public ParametersTableIF {
 
     // The line number in the file (from 1) of a data line; only asked for in messages.
     unsigned int FileLineOf(int line) const {
-        const char* const begin = bytes_.data.get();
+        const char* const begin = bytes_.get();
         const char* const start = begin + lineStarts_[static_cast<std::size_t>(line)];
         return static_cast<unsigned int>(std::count(begin, start, '\n')) + 1;
     }
 
     std::string filename_;
-    FileBytes bytes_;
+    std::unique_ptr<char[]> bytes_;
+    std::size_t size_;
     std::vector<std::size_t> lineStarts_;
     std::vector<std::string> defaults_;
     mutable std::vector<int> listScratch_;
@@ -258,10 +289,10 @@ MFileParser::MFileParser(int flags) : flags_(flags) {}
 MFileParser::~MFileParser() = default;
 
 ParametersTableIF* MFileParser::Create(const std::string& filename) {
-    FileBytes bytes;
-    if (!ReadWholeFile(filename, bytes))
+    LoadedFile file;
+    if (!LoadFile(filename, file))
         return nullptr;
-    return new MFileTable(filename, std::move(bytes));
+    return new MFileTable(filename, std::move(file));
 }
 
 }  // namespace kestrel
