@@ -75,16 +75,17 @@ class Polygon {
     }
 
     // Recomputes the box from the points. Without points the box is inverted: min holds the
-    // largest finite value and max its negative.
+    // largest finite value and max its negative. (min and max are parenthesised so that the
+    // macros of <windows.h> cannot expand in a caller that includes it first.)
     void ComputeBounds() {
-        const T big = std::numeric_limits<T>::max();
+        const T big = (std::numeric_limits<T>::max)();
         point2_t<T> lo{big, big};
         point2_t<T> hi{-big, -big};
         for (unsigned int i = 0; i < numPoints; ++i) {
-            lo.x = std::min(lo.x, points[i].x);
-            lo.y = std::min(lo.y, points[i].y);
-            hi.x = std::max(hi.x, points[i].x);
-            hi.y = std::max(hi.y, points[i].y);
+            lo.x = (std::min)(lo.x, points[i].x);
+            lo.y = (std::min)(lo.y, points[i].y);
+            hi.x = (std::max)(hi.x, points[i].x);
+            hi.y = (std::max)(hi.y, points[i].y);
         }
         bbox.min = lo;
         bbox.max = hi;
