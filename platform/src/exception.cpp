@@ -73,20 +73,20 @@ FileNotFoundException::FileNotFoundException(const FileNotFoundException&) = def
 FileNotFoundException& FileNotFoundException::operator=(const FileNotFoundException&) = default;
 
 std::string FormatString(const char* format, ...) {
-    char small[256];
+    char onStack[256];
     std::va_list args;
     va_start(args, format);
     std::va_list retry;
     va_copy(retry, args);
-    const int needed = std::vsnprintf(small, sizeof small, format, args);
+    const int needed = std::vsnprintf(onStack, sizeof onStack, format, args);
     va_end(args);
     if (needed < 0) {
         va_end(retry);
         return std::string(format);  // an encoding error: show the format rather than nothing
     }
-    if (static_cast<std::size_t>(needed) < sizeof small) {
+    if (static_cast<std::size_t>(needed) < sizeof onStack) {
         va_end(retry);
-        return std::string(small, static_cast<std::size_t>(needed));
+        return std::string(onStack, static_cast<std::size_t>(needed));
     }
     std::vector<char> large(static_cast<std::size_t>(needed) + 1);
     std::vsnprintf(large.data(), large.size(), format, retry);
