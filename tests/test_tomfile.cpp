@@ -192,3 +192,12 @@ TEST(TOMFileParser, FailedWriteThrows) {
     EXPECT_THROW(m.parser.WriteMFilePrep("/dev/full"), FileAccessException);
 }
 #endif
+
+// The parser keeps its own copy of the master file, so a derived file may replace it.
+TEST(TOMFileParser, WritingOverItsOwnMasterFile) {
+    Master m;
+    m.parser.WriteMFilePrep(m.path);
+    m.parser.WriteImgSet(m.dir.File("imgset.txt"));
+    EXPECT_EQ(ReadFile(m.path), kExpectedPrep);
+    EXPECT_EQ(ReadFile(m.dir.File("imgset.txt")), kExpectedImgSet);
+}
