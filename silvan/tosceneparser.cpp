@@ -1,6 +1,5 @@
 #include <silvan/tosceneparser.h>
 
-#include <cerrno>
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
@@ -43,7 +42,6 @@ const char* const kDtdText[] = {
 // atoi's reading (leading number, 0 when none), with values beyond int clamped instead of
 // undefined.
 int TextToInt(const std::string& text) {
-    errno = 0;
     const long value = std::strtol(text.c_str(), nullptr, 10);
     if (value > INT_MAX)
         return INT_MAX;
@@ -84,9 +82,8 @@ void TOSceneParser::SetSceneFootprint(const Footprint* footprint) {
     if (footprint == nullptr) {
         KESTREL_THROW(DataException, "No footprint polygon was given to the scene");
     }
-    // Copy before releasing: the argument may be the polygon held.
-    std::unique_ptr<Footprint> copy(new Footprint(*footprint));
-    sceneFootprint = std::move(copy);
+    // The copy is made before the held polygon is released: the argument may be that polygon.
+    sceneFootprint = std::make_unique<Footprint>(*footprint);
 }
 
 // ---------------------------------------------------------------------------------------------

@@ -75,6 +75,21 @@ bool IsXmlByte(unsigned char byte) {
     return byte >= 0x20 || byte == 0x09 || byte == 0x0A || byte == 0x0D;
 }
 
+// The system's text for an errno value.
+std::string SystemReason(int error) {
+    return error != 0 ? std::error_code(error, std::generic_category()).message()
+                      : "reason unknown";
+}
+
+// Reports that an XML file cannot be read, written or created, with the reason given by Xerces
+// or the system.
+[[noreturn]] void ThrowFileError(const SourceLocation& where, const std::string& name,
+                                 FileAccessException::Type type, const char* failure,
+                                 const std::string& reason) {
+    KESTREL_THROW_AT(where, FileAccessException, name, type,
+                     FormatString("XML file %s %s: %s", name.c_str(), failure, reason.c_str()));
+}
+
 // ---------------------------------------------------------------------------------------------
 // Xerces start-up and shut-down, counted over all objects of the process. Starting and stopping
 // Xerces costs about ten times as much as reading a scene file, so the process itself holds one
@@ -217,10 +232,8 @@ std::vector<char> ReadBytes(const std::string& name, const SourceLocation& where
             KESTREL_THROW_AT(where, FileNotFoundException, name,
                              FormatString("XML file %s does not exist", name.c_str()));
         }
-        KESTREL_THROW_AT(
-            where, FileAccessException, name, FileAccessException::OpenFailed,
-            FormatString("XML file %s cannot be opened: %s", name.c_str(),
-                         std::error_code(error, std::generic_category()).message().c_str()));
+        ThrowFileError(where, name, FileAccessException::OpenFailed, "cannot be opened",
+                       SystemReason(error));
     }
     std::vector<char> bytes;
     char chunk[65536];
@@ -238,10 +251,8 @@ std::vector<char> ReadBytes(const std::string& name, const SourceLocation& where
     const int error = errno;
     std::fclose(file);
     if (failed) {
-        KESTREL_THROW_AT(
-            where, FileAccessException, name, FileAccessException::ReadFailed,
-            FormatString("XML file %s cannot be read: %s", name.c_str(),
-                         std::error_code(error, std::generic_category()).message().c_str()));
+        ThrowFileError(where, name, FileAccessException::ReadFailed, "cannot be read",
+                       SystemReason(error));
     }
     return bytes;
 }
@@ -490,20 +501,17 @@ void XMLParser::LoadDocument() {
     try {
         parser.parse(source);
     } catch (const ParseFailure& failure) {
-        KESTREL_THROW(
-            FileAccessException, name, FileAccessException::ReadFailed,
-            FormatString("XML file %s cannot be read: line %llu, column %llu: %s", name.c_str(),
-                         failure.line, failure.column, failure.what.c_str()));
+        ThrowFileError(KESTREL_HERE, name, FileAccessException::ReadFailed, "cannot be read",
+                       FormatString("line %llu, column %llu: %s", failure.line, failure.column,
+                                    failure.what.c_str()));
     } catch (const xc::OutOfMemoryException&) {
         throw std::bad_alloc();
     } catch (const xc::XMLException& e) {
-        KESTREL_THROW(FileAccessException, name, FileAccessException::ReadFailed,
-                      FormatString("XML file %s cannot be read: %s", name.c_str(),
-                                   MessageText(e.getMessage()).c_str()));
+        ThrowFileError(KESTREL_HERE, name, FileAccessException::ReadFailed, "cannot be read",
+                       MessageText(e.getMessage()));
     } catch (const xc::DOMException& e) {
-        KESTREL_THROW(FileAccessException, name, FileAccessException::ReadFailed,
-                      FormatString("XML file %s cannot be read: %s", name.c_str(),
-                                   MessageText(e.getMessage()).c_str()));
+        ThrowFileError(KESTREL_HERE, name, FileAccessException::ReadFailed, "cannot be read",
+                       MessageText(e.getMessage()));
     }
     document_.reset(parser.adoptDocument());
     if (!document_ || document_->getDocumentElement() == nullptr) {
@@ -668,30 +676,25 @@ void XMLParser::WriteXMLFile() {
         output->setEncoding(encoding.c_str());
         output->setByteStream(&target);
         if (!serializer->write(document_.get(), output.get())) {
-            KESTREL_THROW(FileAccessException, name, FileAccessException::WriteFailed,
-                          FormatString("XML file %s cannot be written: %s", name.c_str(),
-                                       errors.message.c_str()));
+            ThrowFileError(KESTREL_HERE, name, FileAccessException::WriteFailed,
+                           "cannot be written", errors.message);
         }
     } catch (const xc::OutOfMemoryException&) {
         throw std::bad_alloc();
     } catch (const xc::XMLException& e) {
-        KESTREL_THROW(FileAccessException, name, FileAccessException::WriteFailed,
-                      FormatString("XML file %s cannot be written: %s", name.c_str(),
-                                   MessageText(e.getMessage()).c_str()));
+        ThrowFileError(KESTREL_HERE, name, FileAccessException::WriteFailed, "cannot be written",
+                       MessageText(e.getMessage()));
     } catch (const xc::DOMException& e) {
-        KESTREL_THROW(FileAccessException, name, FileAccessException::WriteFailed,
-                      FormatString("XML file %s cannot be written: %s", name.c_str(),
-                                   MessageText(e.getMessage()).c_str()));
+        ThrowFileError(KESTREL_HERE, name, FileAccessException::WriteFailed, "cannot be written",
+                       MessageText(e.getMessage()));
     }
 
     errno = 0;
     std::FILE* file = std::fopen(name.c_str(), "wb");
     if (file == nullptr) {
         const int error = errno;
-        KESTREL_THROW(
-            FileAccessException, name, FileAccessException::CreateFailed,
-            FormatString("XML file %s cannot be created: %s", name.c_str(),
-                         std::error_code(error, std::generic_category()).message().c_str()));
+        ThrowFileError(KESTREL_HERE, name, FileAccessException::CreateFailed, "cannot be created",
+                       SystemReason(error));
     }
     const std::string text = WithPrologLines(reinterpret_cast<const char*>(target.getRawBuffer()),
                                              static_cast<std::size_t>(target.getLen()));
@@ -701,12 +704,8 @@ void XMLParser::WriteXMLFile() {
     const int error = errno;
     if (!written || !closed) {
         std::remove(name.c_str());  // a cut file must not pass for a scene
-        KESTREL_THROW(
-            FileAccessException, name, FileAccessException::WriteFailed,
-            FormatString("XML file %s cannot be written: %s", name.c_str(),
-                         error != 0
-                             ? std::error_code(error, std::generic_category()).message().c_str()
-                             : "short write"));
+        ThrowFileError(KESTREL_HERE, name, FileAccessException::WriteFailed, "cannot be written",
+                       error != 0 ? SystemReason(error) : "short write");
     }
 }
 
