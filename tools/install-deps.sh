@@ -2,7 +2,8 @@
 # Installs the Debian 12 packages needed to build, test and benchmark the library.
 set -euo pipefail
 packages=(cmake g++ make pkg-config googletest libgtest-dev libgmock-dev libbenchmark-dev
-          libxerces-c-dev libgdal-dev libxml2-utils)
+          libxerces-c-dev libgdal-dev libproj-dev proj-data proj-bin gdal-bin
+          libxml2-utils)
 missing=()
 for p in "${packages[@]}"; do
     dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")

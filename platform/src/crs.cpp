@@ -1,0 +1,214 @@
+#include <kestrel/crs.h>
+
+#include <cmath>
+
+#include <gdal_alg.h>
+#include <ogr_spatialref.h>
+
+#include <kestrel/exception.h>
+
+#include "gdalsupport.h"
+
+namespace kestrel {
+namespace ogc {
+namespace cs {
+
+namespace {
+
+std::unique_ptr<OGRSpatialReference> NewSpatialReference() {
+    auto srs = std::make_unique<OGRSpatialReference>();
+    srs->SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
+    return srs;
+}
+
+}  // namespace
+
+ICRS::ICRS(const std::string& definition) : srs_(NewSpatialReference()) {
+    gdalsupport::EnsureRegistered();
+    gdalsupport::ErrorCapture errors;
+    if (definition.empty() || definition.find('\0') != std::string::npos ||
+        srs_->SetFromUserInput(definition.c_str()) != OGRERR_NONE) {
+        KESTREL_THROW(DataException, FormatString("\"%s\" names no coordinate system: %s",
+                                                  definition.c_str(), errors.Reason().c_str()));
+    }
+    srs_->SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
+}
+
+ICRS::ICRS(const OGRSpatialReference& srs) : srs_(srs.Clone()) {
+    srs_->SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
+}
+
+ICRS::ICRS(const ICRS& other) : ICRS(*other.srs_) {}
+
+ICRS& ICRS::operator=(const ICRS& other) {
+    if (this != &other) {
+        srs_.reset(other.srs_->Clone());
+        srs_->SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
+    }
+    return *this;
+}
+
+ICRS::~ICRS() = default;
+
+ICRS* ICRS::Clone() const {
+    return new ICRS(*this);
+}
+
+std::string ICRS::GetName() const {
+    const char* name = srs_->GetName();
+    return name != nullptr ? name : "";
+}
+
+std::string ICRS::GetWKT() const {
+    const char* options[] = {"FORMAT=WKT2_2019", "MULTILINE=NO", nullptr};
+    char* text = nullptr;
+    srs_->exportToWkt(&text, options);
+    std::string wkt = text != nullptr ? text : "";
+    CPLFree(text);
+    return wkt;
+}
+
+bool ICRS::IsGeographic() const {
+    return srs_->IsGeographic() != 0;
+}
+bool ICRS::IsProjected() const {
+    return srs_->IsProjected() != 0;
+}
+bool ICRS::IsCompound() const {
+    return srs_->IsCompound() != 0;
+}
+unsigned int ICRS::GetAxesCount() const {
+    return static_cast<unsigned int>(srs_->GetAxesCount());
+}
+
+bool ICRS::IsSame(const ICRS& other) const {
+    const char* options[] = {"IGNORE_DATA_AXIS_TO_SRS_AXIS_MAPPING=YES", nullptr};
+    return srs_->IsSame(other.srs_.get(), options) != 0;
+}
+
+// ---------------------------------------------------------------------------------------------
+
+GeocodingInfo::GeocodingInfo() : forward_{0, 1, 0, 0, 0, 1}, inverse_{0, 1, 0, 0, 0, 1} {}
+
+GeocodingInfo::GeocodingInfo(const std::array<double, 6>& geoTransform) : forward_(geoTransform) {
+    for (double g : forward_) {
+        if (!std::isfinite(g))
+            KESTREL_THROW(DataException, "A geotransform holds a value that is not finite");
+    }
+    if (!GDALInvGeoTransform(forward_.data(), inverse_.data())) {
+        KESTREL_THROW(DataException,
+                      FormatString("The geotransform (%.17g, %.17g, %.17g, %.17g, %.17g, %.17g) "
+                                   "cannot be inverted",
+                                   forward_[0], forward_[1], forward_[2], forward_[3], forward_[4],
+                                   forward_[5]));
+    }
+}
+
+GeocodingInfo GeocodingInfo::NorthUp(double left, double top, double pixelWidth,
+                                     double pixelHeight) {
+    return GeocodingInfo({left, pixelWidth, 0.0, top, 0.0, -pixelHeight});
+}
+
+double GeocodingInfo::GetPixelWidth() const {
+    return std::hypot(forward_[1], forward_[4]);
+}
+double GeocodingInfo::GetPixelHeight() const {
+    return std::hypot(forward_[2], forward_[5]);
+}
+
+void GeocodingInfo::PixelToGround(double pixel, double line, double& x, double& y) const {
+    x = forward_[0] + pixel * forward_[1] + line * forward_[2];
+    y = forward_[3] + pixel * forward_[4] + line * forward_[5];
+}
+
+void GeocodingInfo::GroundToPixel(double x, double y, double& pixel, double& line) const {
+    pixel = inverse_[0] + x * inverse_[1] + y * inverse_[2];
+    line = inverse_[3] + x * inverse_[4] + y * inverse_[5];
+}
+
+// ---------------------------------------------------------------------------------------------
+
+struct CoordinateTransformation::Impl {
+    std::unique_ptr<OGRCoordinateTransformation> transform;
+};
+
+namespace {
+
+std::unique_ptr<OGRCoordinateTransformation> CreateTransformation(const OGRSpatialReference& source,
+                                                                  const OGRSpatialReference& target) {
+    gdalsupport::EnsureRegistered();
+    gdalsupport::ErrorCapture errors;
+    OGRCoordinateTransformationOptions options;
+    // A ballpark transformation silently drops a datum shift or a missing geoid grid: tens of
+    // metres of error. Refuse it.
+    options.SetBallparkAllowed(false);
+    std::unique_ptr<OGRCoordinateTransformation> transform(
+        OGRCreateCoordinateTransformation(&source, &target, options));
+    if (!transform) {
+        const ICRS from(source), to(target);
+        KESTREL_THROW(DataException,
+                      FormatString("No transformation from \"%s\" to \"%s\" without a ballpark "
+                                   "step (is a datum or geoid grid missing?): %s",
+                                   from.GetName().c_str(), to.GetName().c_str(),
+                                   errors.Reason().c_str()));
+    }
+    return transform;
+}
+
+}  // namespace
+
+CoordinateTransformation::CoordinateTransformation(const ICRS& source, const ICRS& target)
+    : impl_(std::make_unique<Impl>()) {
+    impl_->transform =
+        CreateTransformation(source.GetSpatialReference(), target.GetSpatialReference());
+}
+
+CoordinateTransformation::CoordinateTransformation(const CoordinateTransformation& other)
+    : impl_(std::make_unique<Impl>()) {
+    impl_->transform.reset(other.impl_->transform->Clone());
+}
+
+CoordinateTransformation::~CoordinateTransformation() = default;
+
+bool CoordinateTransformation::Transform(std::size_t n, double* x, double* y, double* z) const {
+    if (n == 0)
+        return true;
+    gdalsupport::ErrorCapture errors;
+    std::unique_ptr<int[]> success(new int[n]);
+    const bool all = impl_->transform->Transform(n, x, y, z, nullptr, success.get()) != 0;
+    bool every = all;
+    for (std::size_t i = 0; i < n; ++i) {
+        const bool good = success[i] != 0 && std::isfinite(x[i]) && std::isfinite(y[i]) &&
+                          (z == nullptr || std::isfinite(z[i]));
+        if (!good) {
+            x[i] = y[i] = NAN;
+            if (z != nullptr)
+                z[i] = NAN;
+            every = false;
+        }
+    }
+    return every;
+}
+
+}  // namespace cs
+}  // namespace ogc
+
+namespace ogc {
+namespace utils {
+
+cs::DatumType GetVerticalDatumType(const cs::ICRS* crs) {
+    if (crs == nullptr)
+        return cs::DatumEllipsoid;
+    const OGRSpatialReference& srs = crs->GetSpatialReference();
+    if (srs.IsVertical() || srs.IsCompound())
+        return cs::DatumMSL;
+    return cs::DatumEllipsoid;
+}
+
+cs::ICRS* MapunitsToCRS(const std::string& text) {
+    return new cs::ICRS(text);
+}
+
+}  // namespace utils
+}  // namespace ogc
+}  // namespace kestrel
