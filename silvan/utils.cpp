@@ -5,6 +5,26 @@
 #include <kestrel/stringlist.h>
 
 // ---------------------------------------------------------------------------------------------
+// Elevation sources and vertical datums
+
+// (end of elevation sources and vertical datums)
+
+// ---------------------------------------------------------------------------------------------
+// Raster access and resampling
+
+// (end of raster access and resampling)
+
+// ---------------------------------------------------------------------------------------------
+// Ortho output layout and metadata
+
+// (end of ortho output layout and metadata)
+
+// ---------------------------------------------------------------------------------------------
+// Footprint vector output
+
+// (end of footprint vector output)
+
+// ---------------------------------------------------------------------------------------------
 // String helpers
 
 std::vector<std::string> TokenizeStr(const std::string& text, const char* delimiters) {

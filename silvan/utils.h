@@ -7,6 +7,26 @@
 #include <silvan/export.h>
 
 // ---------------------------------------------------------------------------------------------
+// Elevation sources and vertical datums
+
+// (end of elevation sources and vertical datums)
+
+// ---------------------------------------------------------------------------------------------
+// Raster access and resampling
+
+// (end of raster access and resampling)
+
+// ---------------------------------------------------------------------------------------------
+// Ortho output layout and metadata
+
+// (end of ortho output layout and metadata)
+
+// ---------------------------------------------------------------------------------------------
+// Footprint vector output
+
+// (end of footprint vector output)
+
+// ---------------------------------------------------------------------------------------------
 // String helpers
 
 // The tokens of text split at each character of delimiters, each trimmed of white space around
