@@ -1,8 +1,12 @@
 #include <silvan/utils.h>
 
+#include <cctype>
 #include <memory>
 
+#include <kestrel/exception.h>
+#include <kestrel/file.h>
 #include <kestrel/stringlist.h>
+#include <kestrel/vectorfile.h>
 
 // ---------------------------------------------------------------------------------------------
 // Elevation sources and vertical datums
@@ -17,10 +21,127 @@
 // ---------------------------------------------------------------------------------------------
 // Ortho output layout and metadata
 
+namespace {
+
+// Whether a map-units text asks for no coordinate system: empty, or its first four characters
+// are "None" in any case.
+bool IsNoMapUnits(const std::string& text) {
+    if (text.empty())
+        return true;
+    if (text.size() < 4)
+        return false;
+    static const char none[] = "NONE";
+    for (std::size_t i = 0; i < 4; ++i) {
+        if (std::toupper(static_cast<unsigned char>(text[i])) != none[i])
+            return false;
+    }
+    return true;
+}
+
+// Whole blocks of 16.
+unsigned int RoundToBlock(unsigned int value) {
+    return (value / 16u + (value % 16u != 0 ? 1u : 0u)) * 16u;
+}
+
+// The footprint polygon of the scene: the closed ring GetSceneFootprint gives, without its
+// closing vertex.
+kestrel::tin::Polygon<double>* MakeSceneFootprint(const kestrel::ogc::cs::GeocodingInfo* geocoding,
+                                                  unsigned int pixels, unsigned int lines,
+                                                  const std::vector<double>& borderX,
+                                                  const std::vector<double>& borderY) {
+    GDBVertex* vertices = nullptr;
+    int count = 0;
+    GetSceneFootprint(geocoding, pixels, lines, borderX, borderY, vertices, count);
+    const std::unique_ptr<GDBVertex[]> ring(vertices);
+    if (count < 2 || vertices == nullptr) {
+        KESTREL_THROW(kestrel::DataException,
+                      kestrel::FormatString("The scene footprint has %d vertices: a closed ring "
+                                            "needs at least 2",
+                                            count));
+    }
+    const unsigned int open = static_cast<unsigned int>(count - 1);
+    std::unique_ptr<point2_t<double>[]> points(new point2_t<double>[open]);
+    for (unsigned int i = 0; i < open; ++i)
+        points[i] = point2_t<double>{vertices[i].x, vertices[i].y};
+    auto* polygon = new kestrel::tin::Polygon<double>(points.get(), open);
+    points.release();
+    return polygon;
+}
+
+}  // namespace
+
+void GetOrthoParams(int borderSamples, const std::string& alignment, const std::string& mapUnits,
+                    double pixelWidth, double pixelHeight, kestrel::datasources::IDataset* dataset,
+                    kestrel::mathmodel::IMathModel* model, const std::vector<int>& channels,
+                    kestrel::dem::IRasterDEM* dem, float flatHeight,
+                    kestrel::ogc::cs::ICRS*& outCrs, kestrel::ogc::cs::GeocodingInfo*& outGeocoding,
+                    unsigned int& pixels, unsigned int& lines,
+                    kestrel::tin::Polygon<double>*& outFootprint) {
+    std::unique_ptr<kestrel::ogc::cs::ICRS> mapCRS;
+    if (!IsNoMapUnits(mapUnits))
+        mapCRS.reset(kestrel::ogc::utils::MapunitsToCRS(mapUnits));
+    auto* raster = dynamic_cast<kestrel::datasources::IRasterDataset*>(dataset);
+    std::vector<double> borderX, borderY;
+    double lowest = 0.0, highest = 0.0;
+    GetLayoutOptions("", "", "", "", borderSamples, alignment, mapCRS.get(), pixelWidth,
+                     pixelHeight, dem, flatHeight, raster, model, channels, outCrs, outGeocoding,
+                     lines, pixels, borderX, borderY, lowest, highest);
+    pixels = RoundToBlock(pixels);
+    lines = RoundToBlock(lines);
+    outFootprint = MakeSceneFootprint(outGeocoding, pixels, lines, borderX, borderY);
+}
+
+kestrel::mathmodel::IMathModel* GetMathModel(const std::string& path, int segment) {
+    return GetSrcModel(path, "", segment);
+}
+
+kestrel::processes::ortho::OrthoMetadataTransfer* GetMetaTrans(const double& value) {
+    auto* transfer = new kestrel::processes::ortho::OrthoMetadataTransfer(value);
+    if (transfer == nullptr)
+        KESTREL_THROW(kestrel::Exception, "Unsupported funtion.");
+    return transfer;
+}
+
 // (end of ortho output layout and metadata)
 
 // ---------------------------------------------------------------------------------------------
 // Footprint vector output
+
+void WriteSceneFootprint(const std::string& path, const kestrel::tin::Polygon<double>* footprint) {
+    if (footprint == nullptr) {
+        KESTREL_THROW(kestrel::DataException,
+                      kestrel::FormatString("No footprint was given for \"%s\"", path.c_str()));
+    }
+    const unsigned int count = footprint->numPoints;
+    if (count < 4)
+        return;
+    std::unique_ptr<GDBVertex[]> vertices(new GDBVertex[count + 1]);
+    for (unsigned int i = 0; i < count; ++i)
+        vertices[i] = GDBVertex{footprint->points[i].x, footprint->points[i].y, 0.0};
+    vertices[count] = GDBVertex{footprint->points[0].x, footprint->points[0].y, 0.0};
+    const kestrel::core::fileio::File file(path);
+    const std::string baseName = file.GetBasename();
+
+    GDBFile* handle = GDBOpen(path.c_str(), "r+");
+    try {
+        GDBLayer_t* layer = GDBCreateLayer(handle, "Ortho", "Footprint", "");
+        const int field = GDBAddField(layer, "Name", 3, nullptr);
+        const int shape = GDBCreateShape(layer, -1);
+        GDBSetVertices(layer, shape, static_cast<int>(count + 1), vertices.get(), nullptr);
+        GDBSetValueString(layer, shape, field, baseName.c_str());
+    } catch (...) {
+        if (handle != nullptr) {
+            try {
+                GDBClose(handle);
+            } catch (...) {
+                // The first failure is the one to report.
+            }
+        }
+        throw;
+    }
+    if (handle != nullptr)
+        GDBClose(handle);
+}
 
 // (end of footprint vector output)
 

@@ -19,10 +19,45 @@
 // ---------------------------------------------------------------------------------------------
 // Ortho output layout and metadata
 
+#include <kestrel/crs.h>
+#include <kestrel/datasources.h>
+#include <kestrel/mathmodel.h>
+#include <kestrel/orthoutils.h>
+#include <silvan/polygon.h>
+
+// The layout of a process's ortho: its coordinate system, geocoding, size in whole blocks of 16
+// pixels and lines, and the scene's footprint (a new open ring, owned by the caller with the
+// coordinate system and geocoding). mapUnits names the output coordinate system (empty, or a
+// text beginning with "None" in any case: chosen from the scene). borderSamples, alignment,
+// pixelWidth, pixelHeight, the DEM and flatHeight go to GetLayoutOptions (see there). A failure
+// leaves the footprint output unchanged.
+SILVAN_API void GetOrthoParams(int borderSamples, const std::string& alignment,
+                               const std::string& mapUnits, double pixelWidth, double pixelHeight,
+                               kestrel::datasources::IDataset* dataset,
+                               kestrel::mathmodel::IMathModel* model,
+                               const std::vector<int>& channels, kestrel::dem::IRasterDEM* dem,
+                               float flatHeight, kestrel::ogc::cs::ICRS*& outCrs,
+                               kestrel::ogc::cs::GeocodingInfo*& outGeocoding,
+                               unsigned int& pixels, unsigned int& lines,
+                               kestrel::tin::Polygon<double>*& outFootprint);
+
+// The math model of a source raster, owned by the caller; segment as GetSrcModel takes it.
+SILVAN_API kestrel::mathmodel::IMathModel* GetMathModel(const std::string& path, int segment);
+
+// A new metadata-transfer object whose no-data value is value, owned by the caller.
+SILVAN_API kestrel::processes::ortho::OrthoMetadataTransfer* GetMetaTrans(const double& value);
+
 // (end of ortho output layout and metadata)
 
 // ---------------------------------------------------------------------------------------------
 // Footprint vector output
+
+// Adds the footprint to the file at path (which must exist and hold vector layers: a
+// GeoPackage, a Shapefile directory) as one closed polygon in a new layer "Footprint", its "Name"
+// the base name of path. A footprint of fewer than 4 points is not written. Throws
+// DataException for a null footprint, FileAccessException when the file cannot take the layer.
+SILVAN_API void WriteSceneFootprint(const std::string& path,
+                                    const kestrel::tin::Polygon<double>* footprint);
 
 // (end of footprint vector output)
 

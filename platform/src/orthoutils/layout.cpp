@@ -1,0 +1,497 @@
+// The ortho layout: the source image's border traced through its model onto the terrain.
+#include <algorithm>
+#include <cmath>
+#include <limits>
+#include <memory>
+#include <vector>
+
+#include <ogr_spatialref.h>
+
+#include <kestrel/elevation.h>
+#include <kestrel/exception.h>
+#include <kestrel/orthoutils.h>
+
+#include "layoutinternal.h"
+
+namespace kestrel {
+namespace orthoutils {
+
+namespace {
+
+using ogc::cs::CoordinateTransformation;
+using ogc::cs::ICRS;
+
+// The largest grid side accepted: a wrong pixel size must not give an absurd raster.
+constexpr double kMaxGridSide = 1048576.0;
+
+// The horizontal part of a coordinate system (compound: its horizontal CRS; geographic 3-D: the
+// 2-D one), so that transformations between ground positions never touch heights.
+std::unique_ptr<ICRS> Horizontal(const ICRS* crs) {
+    if (crs == nullptr)
+        return nullptr;
+    std::unique_ptr<OGRSpatialReference> srs(crs->GetSpatialReference().Clone());
+    if (srs->IsCompound())
+        srs->StripVertical();
+    if (srs->GetAxesCount() == 3)
+        srs->DemoteTo2D(nullptr);
+    return std::make_unique<ICRS>(*srs);
+}
+
+// Ground positions from one coordinate system to another; identity when either is unknown or
+// both are the same.
+class PlaneMapping {
+  public:
+    PlaneMapping(const ICRS* from, const ICRS* to) {
+        auto a = Horizontal(from), b = Horizontal(to);
+        if (a && b && !a->IsSame(*b))
+            transform_ = std::make_unique<CoordinateTransformation>(*a, *b);
+    }
+    // Maps in place; points that fail become NaN.
+    void Map(std::size_t n, double* x, double* y) const {
+        if (transform_)
+            transform_->Transform(n, x, y);
+    }
+
+  private:
+    std::unique_ptr<CoordinateTransformation> transform_;
+};
+
+double PolygonArea(const std::vector<double>& x, const std::vector<double>& y) {
+    double twice = 0.0;
+    for (std::size_t i = 0, n = x.size(); i < n; ++i) {
+        const std::size_t j = (i + 1) % n;
+        twice += x[i] * y[j] - x[j] * y[i];
+    }
+    return std::fabs(twice) / 2.0;
+}
+
+// Positions on the image border, top edge left to right, right edge downwards, bottom edge right
+// to left, left edge upwards: an open ring starting at the top-left corner.
+void BorderPositions(unsigned int width, unsigned int height, int perEdge,
+                     std::vector<double>& pixel, std::vector<double>& line) {
+    const double w = width, h = height;
+    for (int edge = 0; edge < 4; ++edge) {
+        for (int k = 0; k < perEdge; ++k) {
+            const double t = static_cast<double>(k) / perEdge;
+            switch (edge) {
+                case 0:
+                    pixel.push_back(t * w), line.push_back(0.0);
+                    break;
+                case 1:
+                    pixel.push_back(w), line.push_back(t * h);
+                    break;
+                case 2:
+                    pixel.push_back((1.0 - t) * w), line.push_back(h);
+                    break;
+                default:
+                    pixel.push_back(0.0), line.push_back((1.0 - t) * h);
+                    break;
+            }
+        }
+    }
+}
+
+// Rays through image positions, intersected with the terrain.
+class RayCaster {
+  public:
+    RayCaster(const mathmodel::IMathModel& model, const dem::IElevationSource& terrain)
+        : model_(model), terrain_(terrain), toTerrain_(model.GetCRS(), terrain.GetCRS()) {}
+
+    // Model ground positions of image positions at heights h.
+    void Ground(std::size_t n, const double* pixel, const double* line, const double* h, double* x,
+                double* y) const {
+        std::unique_ptr<bool[]> ok(new bool[n]);
+        model_.ImageToGround(n, pixel, line, h, x, y, ok.get());
+        for (std::size_t i = 0; i < n; ++i) {
+            if (!ok[i])
+                x[i] = y[i] = NAN;
+        }
+    }
+
+    // Terrain heights below model ground positions; positions in terrain coordinates are
+    // written to tx, ty.
+    void Terrain(std::size_t n, const double* x, const double* y, double* tx, double* ty,
+                 double* heights) const {
+        std::copy(x, x + n, tx);
+        std::copy(y, y + n, ty);
+        toTerrain_.Map(n, tx, ty);
+        terrain_.GetHeights(n, tx, ty, heights);
+    }
+
+    const PlaneMapping& ToTerrain() const { return toTerrain_; }
+
+    // Intersects each ray from height hi down to lo with the terrain. Ground positions and
+    // heights of the hits go to x, y, h; a ray without a hit gets NaN.
+    void Intersect(const std::vector<double>& pixel, const std::vector<double>& line, double hi,
+                   double lo, double stepLength, std::vector<double>& x, std::vector<double>& y,
+                   std::vector<double>& h) const {
+        const std::size_t n = pixel.size();
+        x.assign(n, NAN), y.assign(n, NAN), h.assign(n, NAN);
+        // Steps per ray: the ray's horizontal run between hi and lo in terrain units, over the
+        // step length.
+        std::vector<double> top(n, hi), bottom(n, lo), gx(n), gy(n), tx(n), ty(n), th(n);
+        std::vector<int> steps(n, 1);
+        {
+            std::vector<double> x2(n), y2(n), tx2(n), ty2(n);
+            Ground(n, pixel.data(), line.data(), top.data(), gx.data(), gy.data());
+            Ground(n, pixel.data(), line.data(), bottom.data(), x2.data(), y2.data());
+            std::copy(gx.begin(), gx.end(), tx.begin());
+            std::copy(gy.begin(), gy.end(), ty.begin());
+            std::copy(x2.begin(), x2.end(), tx2.begin());
+            std::copy(y2.begin(), y2.end(), ty2.begin());
+            toTerrain_.Map(n, tx.data(), ty.data());
+            toTerrain_.Map(n, tx2.data(), ty2.data());
+            for (std::size_t i = 0; i < n; ++i) {
+                const double run = std::hypot(tx2[i] - tx[i], ty2[i] - ty[i]);
+                if (std::isfinite(run))
+                    steps[i] = static_cast<int>(std::min(4096.0, std::ceil(run / stepLength))) + 1;
+            }
+        }
+        // March down each ray in lockstep, keeping the last height above the terrain ("upper")
+        // and the first one at or below it ("lower").
+        std::vector<double> upper(n, NAN), lower(n, NAN);
+        std::vector<std::size_t> active(n);
+        for (std::size_t i = 0; i < n; ++i)
+            active[i] = i;
+        std::vector<double> ap, al, ah, ax, ay, atx, aty, ath;
+        for (int step = 0; !active.empty(); ++step) {
+            const std::size_t m = active.size();
+            ap.resize(m), al.resize(m), ah.resize(m), ax.resize(m), ay.resize(m);
+            atx.resize(m), aty.resize(m), ath.resize(m);
+            for (std::size_t k = 0; k < m; ++k) {
+                const std::size_t i = active[k];
+                ap[k] = pixel[i], al[k] = line[i];
+                ah[k] = top[i] - (top[i] - bottom[i]) * step / steps[i];
+            }
+            Ground(m, ap.data(), al.data(), ah.data(), ax.data(), ay.data());
+            Terrain(m, ax.data(), ay.data(), atx.data(), aty.data(), ath.data());
+            std::size_t kept = 0;
+            for (std::size_t k = 0; k < m; ++k) {
+                const std::size_t i = active[k];
+                if (std::isnan(ath[k])) {
+                    // No terrain here (outside the DEM, or no-data): march on.
+                } else if (ah[k] > ath[k]) {
+                    upper[i] = ah[k];
+                } else if (std::isnan(upper[i])) {
+                    // The ray starts below the terrain (a peak the height survey missed):
+                    // start again above it.
+                    if (step == 0 && top[i] < ath[k] + 1.0 && restarts_ < 64 * n) {
+                        ++restarts_;
+                        top[i] = ath[k] + (hi - lo) + 1.0;
+                        steps[i] += 4;
+                        active[kept++] = i;
+                        continue;
+                    }
+                    lower[i] = ah[k];
+                    upper[i] = ah[k];
+                    continue;
+                } else {
+                    lower[i] = ah[k];
+                    continue;
+                }
+                if (step < steps[i])
+                    active[kept++] = i;
+            }
+            active.resize(kept);
+        }
+        // Bisect each bracket down to a millimetre.
+        std::vector<std::size_t> bracketed;
+        for (std::size_t i = 0; i < n; ++i) {
+            if (!std::isnan(lower[i]))
+                bracketed.push_back(i);
+        }
+        const std::size_t m = bracketed.size();
+        ap.resize(m), al.resize(m), ah.resize(m), ax.resize(m), ay.resize(m);
+        atx.resize(m), aty.resize(m), ath.resize(m);
+        for (std::size_t k = 0; k < m; ++k)
+            ap[k] = pixel[bracketed[k]], al[k] = line[bracketed[k]];
+        double width = 0.0;
+        for (std::size_t i : bracketed)
+            width = std::max(width, upper[i] - lower[i]);
+        for (; width > 1e-3; width /= 2) {
+            for (std::size_t k = 0; k < m; ++k)
+                ah[k] = (upper[bracketed[k]] + lower[bracketed[k]]) / 2;
+            Ground(m, ap.data(), al.data(), ah.data(), ax.data(), ay.data());
+            Terrain(m, ax.data(), ay.data(), atx.data(), aty.data(), ath.data());
+            for (std::size_t k = 0; k < m; ++k) {
+                const std::size_t i = bracketed[k];
+                if (ah[k] <= ath[k])
+                    lower[i] = ah[k];
+                else
+                    upper[i] = ah[k];
+            }
+        }
+        for (std::size_t k = 0; k < m; ++k)
+            ah[k] = lower[bracketed[k]];
+        Ground(m, ap.data(), al.data(), ah.data(), ax.data(), ay.data());
+        for (std::size_t k = 0; k < m; ++k) {
+            const std::size_t i = bracketed[k];
+            x[i] = ax[k], y[i] = ay[k], h[i] = ah[k];
+        }
+    }
+
+  private:
+    const mathmodel::IMathModel& model_;
+    const dem::IElevationSource& terrain_;
+    PlaneMapping toTerrain_;
+    mutable std::size_t restarts_ = 0;
+};
+
+// The lowest and highest terrain heights on a grid of samples over a box in terrain
+// coordinates; false when no sample has a height.
+bool SurveyHeights(const dem::IElevationSource& terrain, double minX, double minY, double maxX,
+                   double maxY, int side, double& low, double& high, double& median) {
+    std::vector<double> x, y;
+    for (int j = 0; j < side; ++j) {
+        for (int i = 0; i < side; ++i) {
+            x.push_back(minX + (maxX - minX) * (i + 0.5) / side);
+            y.push_back(minY + (maxY - minY) * (j + 0.5) / side);
+        }
+    }
+    std::vector<double> heights(x.size());
+    terrain.GetHeights(x.size(), x.data(), y.data(), heights.data());
+    heights.erase(
+        std::remove_if(heights.begin(), heights.end(), [](double v) { return !std::isfinite(v); }),
+        heights.end());
+    if (heights.empty())
+        return false;
+    const auto range = std::minmax_element(heights.begin(), heights.end());
+    low = *range.first;
+    high = *range.second;
+    std::nth_element(heights.begin(), heights.begin() + heights.size() / 2, heights.end());
+    median = heights[heights.size() / 2];
+    return true;
+}
+
+// Bounding box of model ground positions in terrain coordinates, enlarged by a margin.
+bool TerrainBox(const PlaneMapping& toTerrain, std::vector<double> x, std::vector<double> y,
+                double margin, double box[4]) {
+    toTerrain.Map(x.size(), x.data(), y.data());
+    box[0] = box[1] = std::numeric_limits<double>::infinity();
+    box[2] = box[3] = -std::numeric_limits<double>::infinity();
+    for (std::size_t i = 0; i < x.size(); ++i) {
+        if (!std::isfinite(x[i]) || !std::isfinite(y[i]))
+            continue;
+        box[0] = std::min(box[0], x[i]), box[1] = std::min(box[1], y[i]);
+        box[2] = std::max(box[2], x[i]), box[3] = std::max(box[3], y[i]);
+    }
+    if (!(box[0] <= box[2] && box[1] <= box[3]))
+        return false;
+    const double dx = (box[2] - box[0]) * margin, dy = (box[3] - box[1]) * margin;
+    box[0] -= dx, box[1] -= dy, box[2] += dx, box[3] += dy;
+    return true;
+}
+
+std::unique_ptr<ICRS> UtmZoneOf(double longitude, double latitude) {
+    int zone = static_cast<int>(std::floor((longitude + 180.0) / 6.0)) % 60 + 1;
+    if (zone < 1)
+        zone += 60;
+    const int code = (latitude >= 0 ? 32600 : 32700) + zone;
+    return std::make_unique<ICRS>("EPSG:" + std::to_string(code));
+}
+
+void CheckFinite(const std::vector<double>& values, const char* what, const SourceLocation& at) {
+    for (double v : values) {
+        if (!std::isfinite(v))
+            KESTREL_THROW_AT(at, DataException, FormatString("%s holds a non-finite value", what));
+    }
+}
+
+}  // namespace
+
+Layout ComputeLayout(const mathmodel::IMathModel& model, const dem::IElevationSource* terrain,
+                     const LayoutRequest& request) {
+    const unsigned int width = model.GetImageWidth(), height = model.GetImageHeight();
+    if (width == 0 || height == 0) {
+        KESTREL_THROW(
+            DataException,
+            FormatString("The math model's image is empty (%u x %u pixels)", width, height));
+    }
+    if (!std::isfinite(request.pixelWidth) || !std::isfinite(request.pixelHeight) ||
+        request.pixelWidth < 0 || request.pixelHeight < 0) {
+        KESTREL_THROW(DataException,
+                      FormatString("The pixel size (%g, %g) is not a finite value of 0 or more",
+                                   request.pixelWidth, request.pixelHeight));
+    }
+    if (!std::isfinite(request.flatHeight)) {
+        KESTREL_THROW(DataException,
+                      FormatString("The flat terrain height %g is not finite", request.flatHeight));
+    }
+    const int perEdge =
+        request.borderSamples > 0
+            ? request.borderSamples
+            : static_cast<int>(std::clamp(std::max(width, height) / 16u, 64u, 1024u));
+    std::vector<double> pixel, line;
+    BorderPositions(width, height, perEdge, pixel, line);
+    const std::size_t n = pixel.size();
+
+    Layout layout;
+    std::vector<double> gx(n), gy(n), gh(n, request.flatHeight);
+    // Does the ground position depend on the height at all (not for a geotransform or GCPs)?
+    bool heightMatters = false;
+    {
+        const double cp[2] = {width / 2.0, width / 2.0}, cl[2] = {height / 2.0, height / 2.0};
+        const double ch[2] = {request.flatHeight, request.flatHeight + 100.0};
+        double cx[2], cy[2];
+        bool ok[2];
+        model.ImageToGround(2, cp, cl, ch, cx, cy, ok);
+        if (!ok[0] || !ok[1]) {
+            KESTREL_THROW(DataException,
+                          "The math model cannot place the image centre on the ground");
+        }
+        heightMatters = std::hypot(cx[1] - cx[0], cy[1] - cy[0]) > 0.0;
+    }
+    if (terrain == nullptr || !heightMatters) {
+        std::unique_ptr<bool[]> ok(new bool[n]);
+        model.ImageToGround(n, pixel.data(), line.data(), gh.data(), gx.data(), gy.data(),
+                            ok.get());
+        for (std::size_t i = 0; i < n; ++i) {
+            if (!ok[i]) {
+                KESTREL_THROW(DataException,
+                              FormatString("The math model cannot place image position (%g, %g) "
+                                           "on the ground",
+                                           pixel[i], line[i]));
+            }
+        }
+        layout.minHeight = layout.maxHeight = request.flatHeight;
+        if (terrain != nullptr) {
+            std::vector<double> tx = gx, ty = gy, th(n);
+            RayCaster(model, *terrain)
+                .Terrain(n, gx.data(), gy.data(), tx.data(), ty.data(), th.data());
+            th.erase(std::remove_if(th.begin(), th.end(), [](double v) { return std::isnan(v); }),
+                     th.end());
+            if (!th.empty()) {
+                const auto range = std::minmax_element(th.begin(), th.end());
+                layout.minHeight = *range.first, layout.maxHeight = *range.second;
+            }
+        }
+    } else {
+        const ogc::cs::DatumType modelDatum = ogc::utils::GetVerticalDatumType(model.GetCRS());
+        const ogc::cs::DatumType terrainDatum = terrain->GetOutputVerticalDatum();
+        if (terrainDatum != ogc::cs::DatumMathModel && terrainDatum != modelDatum) {
+            KESTREL_THROW(
+                DataException,
+                FormatString("The DEM delivers heights in datum %d, the math model "
+                             "takes them in datum %d: set the DEM's output datum to "
+                             "the model's",
+                             static_cast<int>(terrainDatum), static_cast<int>(modelDatum)));
+        }
+        const RayCaster caster(model, *terrain);
+        // Survey the terrain's heights where the scene lies: first over the whole DEM, then
+        // over the border projected at the heights found, twice.
+        double box[4], low, high, median;
+        terrain->GetExtent(box[0], box[1], box[2], box[3]);
+        if (!SurveyHeights(*terrain, box[0], box[1], box[2], box[3], 64, low, high, median))
+            KESTREL_THROW(DataException, "The DEM has no height anywhere");
+        for (int pass = 0; pass < 2; ++pass) {
+            std::vector<double> bx, by;
+            for (double level :
+                 pass == 0 ? std::vector<double>{median} : std::vector<double>{low, high}) {
+                std::vector<double> hx(n), hy(n), hh(n, level);
+                caster.Ground(n, pixel.data(), line.data(), hh.data(), hx.data(), hy.data());
+                bx.insert(bx.end(), hx.begin(), hx.end());
+                by.insert(by.end(), hy.begin(), hy.end());
+            }
+            double l2, h2, m2;
+            if (!TerrainBox(caster.ToTerrain(), bx, by, 0.1, box) ||
+                !SurveyHeights(*terrain, box[0], box[1], box[2], box[3], 256, l2, h2, m2)) {
+                KESTREL_THROW(DataException,
+                              "The border rays of the image miss the DEM entirely: it has no "
+                              "height where the scene lies");
+            }
+            low = l2, high = h2;
+        }
+        const double span = high - low;
+        const double hi = high + 0.1 * span + 1.0, lo = low - 0.1 * span - 1.0;
+        // One step of the march: the source's ground resolution, in terrain units.
+        std::vector<double> fx(n), fy(n), fh(n, (low + high) / 2), ftx, fty;
+        caster.Ground(n, pixel.data(), line.data(), fh.data(), fx.data(), fy.data());
+        ftx = fx, fty = fy;
+        caster.ToTerrain().Map(n, ftx.data(), fty.data());
+        const double area = PolygonArea(ftx, fty);
+        const double stepLength = std::sqrt(area / (static_cast<double>(width) * height));
+        if (!(stepLength > 0) || !std::isfinite(stepLength))
+            KESTREL_THROW(DataException, "The math model gives the image no area on the ground");
+        caster.Intersect(pixel, line, hi, lo, stepLength, gx, gy, gh);
+        std::size_t missed = 0, first = n;
+        for (std::size_t i = 0; i < n; ++i) {
+            if (std::isnan(gh[i])) {
+                ++missed;
+                first = std::min(first, i);
+            }
+        }
+        if (missed == n) {
+            KESTREL_THROW(DataException,
+                          "The border rays of the image miss the DEM entirely: no ray through "
+                          "the image's border meets the terrain");
+        }
+        if (missed > 0) {
+            KESTREL_THROW(DataException,
+                          FormatString("The DEM does not cover the scene: %zu of %zu rays "
+                                       "through the image's border miss it, the first at pixel "
+                                       "%g, line %g",
+                                       missed, n, pixel[first], line[first]));
+        }
+        const auto range = std::minmax_element(gh.begin(), gh.end());
+        layout.minHeight = *range.first, layout.maxHeight = *range.second;
+    }
+
+    // The output coordinate system.
+    if (request.outputCRS != nullptr) {
+        layout.crs = Horizontal(request.outputCRS);
+    } else if (model.GetCRS() != nullptr && model.GetCRS()->IsProjected()) {
+        layout.crs = Horizontal(model.GetCRS());
+    } else if (model.GetCRS() != nullptr) {
+        const ICRS wgs84("EPSG:4326");
+        double lon = 0, lat = 0;
+        for (std::size_t i = 0; i < n; ++i)
+            lon += gx[i] / n, lat += gy[i] / n;
+        PlaneMapping(model.GetCRS(), &wgs84).Map(1, &lon, &lat);
+        if (!std::isfinite(lon) || !std::isfinite(lat))
+            KESTREL_THROW(DataException, "The scene's centre has no longitude and latitude");
+        layout.crs = UtmZoneOf(lon, lat);
+    }
+    PlaneMapping(model.GetCRS(), layout.crs.get()).Map(n, gx.data(), gy.data());
+    CheckFinite(gx, "The border traced in the output coordinate system", KESTREL_HERE);
+    CheckFinite(gy, "The border traced in the output coordinate system", KESTREL_HERE);
+
+    // Pixel size and grid.
+    double pw = request.pixelWidth, ph = request.pixelHeight;
+    if (pw == 0 && ph == 0) {
+        pw = ph = std::sqrt(PolygonArea(gx, gy) / (static_cast<double>(width) * height));
+        if (!(pw > 0) || !std::isfinite(pw)) {
+            KESTREL_THROW(DataException,
+                          "The pixel size is 0 and the math model gives no ground resolution");
+        }
+    } else if (pw == 0) {
+        pw = ph;
+    } else if (ph == 0) {
+        ph = pw;
+    }
+    const auto xs = std::minmax_element(gx.begin(), gx.end());
+    const auto ys = std::minmax_element(gy.begin(), gy.end());
+    double left = *xs.first, top = *ys.second;
+    if (request.alignToPixelSize) {
+        left = std::floor(left / pw) * pw;
+        top = std::ceil(top / ph) * ph;
+    }
+    const double columns = std::ceil((*xs.second - left) / pw - 1e-6);
+    const double rows = std::ceil((top - *ys.first) / ph - 1e-6);
+    if (!(columns >= 1 && rows >= 1 && columns <= kMaxGridSide && rows <= kMaxGridSide)) {
+        KESTREL_THROW(DataException,
+                      FormatString("The output grid of %.0f x %.0f pixels of %g x %g is empty "
+                                   "or larger than %.0f pixels a side",
+                                   columns, rows, pw, ph, kMaxGridSide));
+    }
+    layout.geocoding = ogc::cs::GeocodingInfo::NorthUp(left, top, pw, ph);
+    layout.pixels = static_cast<unsigned int>(columns);
+    layout.lines = static_cast<unsigned int>(rows);
+    layout.pixelWidth = pw;
+    layout.pixelHeight = ph;
+    layout.borderX = std::move(gx);
+    layout.borderY = std::move(gy);
+    return layout;
+}
+
+}  // namespace orthoutils
+}  // namespace kestrel
