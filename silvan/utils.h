@@ -37,9 +37,8 @@ SILVAN_API void GetOrthoParams(int borderSamples, const std::string& alignment,
                                kestrel::mathmodel::IMathModel* model,
                                const std::vector<int>& channels, kestrel::dem::IRasterDEM* dem,
                                float flatHeight, kestrel::ogc::cs::ICRS*& outCrs,
-                               kestrel::ogc::cs::GeocodingInfo*& outGeocoding,
-                               unsigned int& pixels, unsigned int& lines,
-                               kestrel::tin::Polygon<double>*& outFootprint);
+                               kestrel::ogc::cs::GeocodingInfo*& outGeocoding, unsigned int& pixels,
+                               unsigned int& lines, kestrel::tin::Polygon<double>*& outFootprint);
 
 // The math model of a source raster, owned by the caller; segment as GetSrcModel takes it.
 SILVAN_API kestrel::mathmodel::IMathModel* GetMathModel(const std::string& path, int segment);

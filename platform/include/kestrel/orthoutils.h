@@ -63,18 +63,20 @@ KESTREL_API kestrel::mathmodel::IMathModel* GetSrcModel(const std::string& path,
 //       image order (top edge left to right, right edge, bottom edge, left edge).
 //  21, 22 out: the lowest and highest terrain heights met on the border.
 // Throws a kestrel exception naming what is wrong: no model, a DEM that the border rays miss or
-// that does not cover the scene, bad pixel sizes, non-finite values, a grid larger than 2^31
+// that does not cover the scene, bad pixel sizes, non-finite values, a grid of more than 2^20
 // pixels or lines.
-KESTREL_API void GetLayoutOptions(
-    const std::string& reserved1, const std::string& reserved2, const std::string& reserved3,
-    const std::string& reserved4, int borderSamples, const std::string& alignment,
-    const kestrel::ogc::cs::ICRS* mapCRS, double& pixelWidth, double& pixelHeight,
-    const kestrel::dem::IRasterDEM* dem, float flatHeight,
-    kestrel::datasources::IRasterDataset* dataset, const kestrel::mathmodel::IMathModel* model,
-    const std::vector<int>& channels, kestrel::ogc::cs::ICRS*& outCRS,
-    kestrel::ogc::cs::GeocodingInfo*& outGeocoding, unsigned int& lines, unsigned int& pixels,
-    std::vector<double>& borderX, std::vector<double>& borderY, double& minHeight,
-    double& maxHeight);
+KESTREL_API void GetLayoutOptions(const std::string& reserved1, const std::string& reserved2,
+                                  const std::string& reserved3, const std::string& reserved4,
+                                  int borderSamples, const std::string& alignment,
+                                  const kestrel::ogc::cs::ICRS* mapCRS, double& pixelWidth,
+                                  double& pixelHeight, const kestrel::dem::IRasterDEM* dem,
+                                  float flatHeight, kestrel::datasources::IRasterDataset* dataset,
+                                  const kestrel::mathmodel::IMathModel* model,
+                                  const std::vector<int>& channels, kestrel::ogc::cs::ICRS*& outCRS,
+                                  kestrel::ogc::cs::GeocodingInfo*& outGeocoding,
+                                  unsigned int& lines, unsigned int& pixels,
+                                  std::vector<double>& borderX, std::vector<double>& borderY,
+                                  double& minHeight, double& maxHeight);
 
 // The ground outline of the scene inside the pixels x lines grid of geocoding: the border ring
 // (borderX, borderY, as GetLayoutOptions gives it) clipped to the grid and rid of vertices that
@@ -197,6 +199,5 @@ class KESTREL_API ScopedLayoutImpl {
 
 }  // namespace orthoutils
 }  // namespace kestrel
-
 
 // (end of sensor models, output layout, footprint and metadata transfer)
