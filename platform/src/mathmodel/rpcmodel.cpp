@@ -125,21 +125,23 @@ class RpcModel final : public IMathModel {
         jacobian[3] = (Dot(rpc_.adfLINE_NUM_COEFF, dP) - l * Dot(rpc_.adfLINE_DEN_COEFF, dP)) / ld;
     }
 
-    // Newton's method on the normalised ground position whose image is (s, l) at height H.
+    // Newton's method on the normalised ground position whose image is (s, l) at height H:
+    // converged at a millionth of a pixel, accepted within a thousandth.
     bool Solve(double s, double l, double H, double& L, double& P) const {
         if (!std::isfinite(s) || !std::isfinite(l) || !std::isfinite(H))
             return false;
-        // A thousandth of a pixel, in normalised image units.
-        const double tolerance =
-            1e-3 / std::max(std::fabs(rpc_.dfSAMP_SCALE), std::fabs(rpc_.dfLINE_SCALE));
+        const double pixel =
+            1.0 / std::max(std::fabs(rpc_.dfSAMP_SCALE), std::fabs(rpc_.dfLINE_SCALE));
         L = P = 0.0;
+        double residual = HUGE_VAL;
         for (int iteration = 0; iteration < 30; ++iteration) {
             double sNow, lNow, j[4];
             Evaluate(L, P, H, sNow, lNow, j);
             const double ds = s - sNow, dl = l - lNow;
             if (!std::isfinite(ds) || !std::isfinite(dl))
                 return false;
-            if (std::fabs(ds) < tolerance && std::fabs(dl) < tolerance)
+            residual = std::max(std::fabs(ds), std::fabs(dl));
+            if (residual < 1e-6 * pixel)
                 return true;
             const double det = j[0] * j[3] - j[1] * j[2];
             if (det == 0.0 || !std::isfinite(det))
@@ -155,7 +157,7 @@ class RpcModel final : public IMathModel {
             L += stepL;
             P += stepP;
         }
-        return false;
+        return residual < 1e-3 * pixel;
     }
 
     GDALRPCInfoV2 rpc_;
