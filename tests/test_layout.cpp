@@ -3,6 +3,7 @@
 // checked against gdalwarp.
 #include <gtest/gtest.h>
 
+#include <array>
 #include <cmath>
 #include <cstdio>
 #include <memory>
@@ -17,6 +18,7 @@
 #include <silvan/utils.h>
 
 #include "rpcscene.h"
+#include "samplecity.h"
 #include "support.h"
 
 #if defined(_WIN32)
@@ -445,4 +447,41 @@ TEST(Layout, ZeroPixelSizeTakesTheSourceResolution) {
     const auto& g = layout.geocoding.GetGeoTransform();
     EXPECT_NEAR(std::remainder(g[0], layout.pixelWidth), 0.0, 1e-6);
     EXPECT_NEAR(std::remainder(g[3], layout.pixelHeight), 0.0, 1e-6);
+}
+
+// Over a DSM with a 30 m box building across the image's border, every border ray meets the
+// surface where the camera's own ray does, on the roof, on the walls and on the ground alike
+// (GDAL's RPC image-to-ground iteration does not converge on walls).
+TEST(Layout, BorderRaysMeetRoofsAndWallsWhereTheCameraSeesThem) {
+    TempDir dir;
+    samplecity::CityOptions city = samplecity::BoxScene(30.0, {}, 30.0, 128);
+    city.cameras.push_back({"edge", 45.0, 30.0, 300.0, 128, 128, 0.5});
+    const samplecity::Sample sample = samplecity::MakeSample(dir.Path().string(), city, 1);
+    const samplecity::Dsm dsm(city);
+    const samplecity::FrameCamera& camera = *sample.images[0].camera;
+
+    std::unique_ptr<kestrel::mathmodel::IMathModel> model(
+        GetSrcModel(sample.images[0].path, "", 0));
+    const samplecity::GridSurface surface(sample.dsmPath);
+    kestrel::orthoutils::LayoutRequest request;
+    const int perEdge = 64;
+    request.borderSamples = perEdge;
+    const auto layout = kestrel::orthoutils::ComputeLayout(*model, &surface, request);
+    ASSERT_EQ(layout.borderX.size(), 4u * perEdge);
+    EXPECT_GT(layout.maxHeight, layout.minHeight + 20.0);
+
+    int raised = 0;
+    for (int i = 0; i < 4 * perEdge; ++i) {
+        const int edge = i / perEdge;
+        const double t = static_cast<double>(i % perEdge) / perEdge;
+        const double positions[4][2] = {
+            {t * 128, 0}, {128, t * 128}, {(1 - t) * 128, 128}, {0, (1 - t) * 128}};
+        std::array<double, 3> origin, direction, hit;
+        camera.Ray(positions[edge][0], positions[edge][1], origin, direction);
+        ASSERT_TRUE(dsm.Intersect(origin, direction, hit));
+        raised += hit[2] > dsm.Ground(hit[0], hit[1]) + 1.0;
+        EXPECT_NEAR(layout.borderX[i], hit[0], 0.3) << i;
+        EXPECT_NEAR(layout.borderY[i], hit[1], 0.3) << i;
+    }
+    EXPECT_GT(raised, 10);  // the border crosses the building
 }
