@@ -12,6 +12,7 @@
 
 #include <gdal_priv.h>
 
+#include <kestrel/dem.h>
 #include <kestrel/elevation.h>
 #include <kestrel/exception.h>
 #include <kestrel/orthoutils.h>
@@ -345,7 +346,8 @@ std::string RunCommand(const std::string& command) {
 }  // namespace
 
 // The traced extent matches the one gdalwarp chooses with the DEM for the same pixel size,
-// within 2 pixels on each side; the footprint lies inside the grid.
+// within 2 pixels on each side; GetOrthoParams makes of it a grid in whole blocks of 16 with
+// the footprint inside.
 TEST(Layout, ExtentAgreesWithGdalwarpOverTerrain) {
     TempDir dir;
     const std::string image = dir.File("src.tif"), demPath = dir.File("dem.tif");
@@ -364,37 +366,51 @@ TEST(Layout, ExtentAgreesWithGdalwarpOverTerrain) {
     const double reference[4] = {gt[0], gt[3] + gt[5] * warped->GetRasterYSize(),
                                  gt[0] + gt[1] * warped->GetRasterXSize(), gt[3]};
 
-    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetSrcModel(image, "", 0));
-    const FunctionTerrain terrain = SceneHills();
-    kestrel::orthoutils::LayoutRequest request;
-    request.pixelWidth = request.pixelHeight = 1.5;
-    request.alignToPixelSize = false;
-    const auto layout = kestrel::orthoutils::ComputeLayout(*model, &terrain, request);
-    ASSERT_NE(layout.crs, nullptr);
-    EXPECT_EQ(layout.crs->GetName(), "WGS 84 / UTM zone 32N");
-    const auto& g = layout.geocoding.GetGeoTransform();
-    const double ours[4] = {g[0], g[3] - 1.5 * layout.lines, g[0] + 1.5 * layout.pixels, g[3]};
+    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetMathModel(image, 0));
+    std::unique_ptr<kestrel::dem::IRasterDEM> dem(kestrel::dem::DEMFactory::CreateFileRasterDEM(
+        demPath, 1, 0.0, 1.0, NAN, kestrel::ogc::cs::DatumEllipsoid, false, 64));
+    double pixelWidth = 1.5, pixelHeight = 1.5, low = 0, high = 0;
+    ICRS* crsOut = nullptr;
+    GeocodingInfo* geocodingOut = nullptr;
+    unsigned int lines = 0, pixels = 0;
+    std::vector<double> borderX, borderY;
+    GetLayoutOptions("", "", "", "", 0, "EXTENT", nullptr, pixelWidth, pixelHeight, dem.get(), 0.0f,
+                     nullptr, model.get(), {}, crsOut, geocodingOut, lines, pixels, borderX,
+                     borderY, low, high);
+    const std::unique_ptr<ICRS> crs(crsOut);
+    const std::unique_ptr<GeocodingInfo> geocoding(geocodingOut);
+    ASSERT_NE(crs, nullptr);
+    EXPECT_EQ(crs->GetName(), "WGS 84 / UTM zone 32N");
+    const auto& g = geocoding->GetGeoTransform();
+    const double ours[4] = {g[0], g[3] - 1.5 * lines, g[0] + 1.5 * pixels, g[3]};
     for (int side = 0; side < 4; ++side)
         EXPECT_NEAR(ours[side], reference[side], 2 * 1.5) << "side " << side;
-    EXPECT_GE(layout.minHeight, 150.0);
-    EXPECT_LE(layout.maxHeight, 400.0);
+    EXPECT_GE(low, 150.0);
+    EXPECT_LE(high, 400.0);
 
     GDBVertex* vertices = nullptr;
     int count = 0;
-    GetSceneFootprint(&layout.geocoding, layout.pixels, layout.lines, layout.borderX,
-                      layout.borderY, vertices, count);
+    GetSceneFootprint(geocoding.get(), pixels, lines, borderX, borderY, vertices, count);
     std::unique_ptr<GDBVertex[]> ring(vertices);
     ASSERT_GE(count, 4);
-    EXPECT_LT(count, static_cast<int>(layout.borderX.size()));
+    EXPECT_LT(count, static_cast<int>(borderX.size()));
     EXPECT_EQ(ring[0].x, ring[count - 1].x);
     EXPECT_EQ(ring[0].y, ring[count - 1].y);
-    for (int i = 0; i < count; ++i) {
+
+    // The library's call: the same grid corner, whole blocks, the footprint inside.
+    Outputs layout;
+    GetOrthoParams(0, "EXTENT", "", 1.5, 1.5, nullptr, model.get(), {}, dem.get(), 0.0f, layout.crs,
+                   layout.geocoding, layout.pixels, layout.lines, layout.footprint);
+    EXPECT_EQ(layout.geocoding->GetGeoTransform(), g);
+    EXPECT_EQ(layout.pixels, (pixels + 15) / 16 * 16);
+    EXPECT_EQ(layout.lines, (lines + 15) / 16 * 16);
+    ASSERT_GE(layout.footprint->numPoints, 3u);
+    for (unsigned int i = 0; i < layout.footprint->numPoints; ++i) {
         double p, l;
-        layout.geocoding.GroundToPixel(ring[i].x, ring[i].y, p, l);
-        EXPECT_TRUE(p >= -1e-6 && p <= layout.pixels + 1e-6 && l >= -1e-6 &&
-                    l <= layout.lines + 1e-6)
+        layout.geocoding->GroundToPixel(layout.footprint->points[i].x,
+                                        layout.footprint->points[i].y, p, l);
+        EXPECT_TRUE(p >= -1e-6 && p <= pixels + 1e-6 && l >= -1e-6 && l <= lines + 1e-6)
             << p << " " << l;
-        EXPECT_EQ(ring[i].z, 0.0);
     }
 }
 
@@ -462,11 +478,12 @@ TEST(Layout, BorderRaysMeetRoofsAndWallsWhereTheCameraSeesThem) {
 
     std::unique_ptr<kestrel::mathmodel::IMathModel> model(
         GetSrcModel(sample.images[0].path, "", 0));
-    const samplecity::GridSurface surface(sample.dsmPath);
+    std::unique_ptr<kestrel::dem::IRasterDEM> surface(kestrel::dem::DEMFactory::CreateFileRasterDEM(
+        sample.dsmPath, 1, 0.0, 1.0, NAN, kestrel::ogc::cs::DatumEllipsoid, false, 16));
     kestrel::orthoutils::LayoutRequest request;
     const int perEdge = 64;
     request.borderSamples = perEdge;
-    const auto layout = kestrel::orthoutils::ComputeLayout(*model, &surface, request);
+    const auto layout = kestrel::orthoutils::ComputeLayout(*model, surface.get(), request);
     ASSERT_EQ(layout.borderX.size(), 4u * perEdge);
     EXPECT_GT(layout.maxHeight, layout.minHeight + 20.0);
 

@@ -5,10 +5,7 @@
 #include <mutex>
 #include <utility>
 
-#if __has_include(<kestrel/dem.h>)
 #include <kestrel/dem.h>
-#define KESTREL_HAVE_RASTER_DEM 1
-#endif
 #include <kestrel/elevation.h>
 #include <kestrel/exception.h>
 #include <kestrel/orthoutils.h>
@@ -22,16 +19,6 @@ namespace orthoutils {
 LayoutImpl::~LayoutImpl() = default;
 
 namespace {
-
-const dem::IElevationSource* Terrain(const dem::IRasterDEM* dem) {
-#if defined(KESTREL_HAVE_RASTER_DEM)
-    return dem;
-#else
-    if (dem != nullptr)
-        KESTREL_THROW(DataException, "Raster DEMs are not available in this build");
-    return nullptr;
-#endif
-}
 
 class BuiltInLayout final : public LayoutImpl {
   public:
@@ -97,7 +84,7 @@ class BuiltInLayout final : public LayoutImpl {
                 }
             }
         }
-        Layout layout = ComputeLayout(*model, Terrain(dem), request);
+        Layout layout = ComputeLayout(*model, dem, request);
         auto geocoding = std::make_unique<ogc::cs::GeocodingInfo>(layout.geocoding);
         pixelWidth = layout.pixelWidth;
         pixelHeight = layout.pixelHeight;
