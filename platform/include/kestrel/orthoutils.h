@@ -78,7 +78,7 @@ KESTREL_API kestrel::mathmodel::IMathModel* GetSrcModel(const std::string& path,
 // The layout of an ortho: where the source image falls on the ground when each ray through its
 // border is intersected with the terrain. Arguments, in order:
 //  1-4  not used (reserved).
-//  5    border samples per image edge; 0 or less chooses (one ray every 16 pixels, 64 to 1024).
+//  5    border samples per image edge; 0 or less chooses (one ray every 16 pixels, 64 to 512).
 //  6    alignment of the grid: "" or "PIXEL" puts its corners on whole multiples of the pixel
 //       size; "EXTENT" puts its top-left corner on the traced extent's.
 //  7    the output coordinate system; null chooses: the model's when it is projected, otherwise

@@ -132,7 +132,19 @@ class RpcModel final : public IMathModel {
             return false;
         const double pixel =
             1.0 / std::max(std::fabs(rpc_.dfSAMP_SCALE), std::fabs(rpc_.dfLINE_SCALE));
-        L = P = 0.0;
+        // Start from the polynomials' linear terms, which hold nearly all of a sensor's geometry.
+        {
+            const double* sn = rpc_.adfSAMP_NUM_COEFF;
+            const double* ln = rpc_.adfLINE_NUM_COEFF;
+            const double a = sn[1], b = sn[2], c = ln[1], d = ln[2];
+            const double rs = s - sn[0] - sn[3] * H, rl = l - ln[0] - ln[3] * H;
+            const double det = a * d - b * c;
+            L = P = 0.0;
+            if (det != 0.0 && std::isfinite(det)) {
+                L = std::clamp((d * rs - b * rl) / det, -2.0, 2.0);
+                P = std::clamp((a * rl - c * rs) / det, -2.0, 2.0);
+            }
+        }
         double residual = HUGE_VAL;
         for (int iteration = 0; iteration < 30; ++iteration) {
             double sNow, lNow, j[4];

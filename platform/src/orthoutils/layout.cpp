@@ -7,6 +7,7 @@
 
 #include <ogr_spatialref.h>
 
+#include <kestrel/dem.h>
 #include <kestrel/elevation.h>
 #include <kestrel/exception.h>
 #include <kestrel/orthoutils.h>
@@ -120,73 +121,78 @@ class RayCaster {
 
     const PlaneMapping& ToTerrain() const { return toTerrain_; }
 
-    // Intersects each ray from height hi down to lo with the terrain. Ground positions and
-    // heights of the hits go to x, y, h; a ray without a hit gets NaN.
+    // Intersects each ray from height hi down to lo with the terrain: the first point where the
+    // ray reaches the surface. Ground positions (model coordinates) and heights of the hits go
+    // to x, y, h; a ray without a hit gets NaN.
     void Intersect(const std::vector<double>& pixel, const std::vector<double>& line, double hi,
                    double lo, double stepLength, std::vector<double>& x, std::vector<double>& y,
-                   std::vector<double>& h) const {
+                   std::vector<double>& h, int depth = 0) const {
         const std::size_t n = pixel.size();
         x.assign(n, NAN), y.assign(n, NAN), h.assign(n, NAN);
-        // Steps per ray: the ray's horizontal run between hi and lo in terrain units, over the
-        // step length.
-        std::vector<double> top(n, hi), bottom(n, lo), gx(n), gy(n), tx(n), ty(n), th(n);
-        std::vector<int> steps(n, 1);
+        if (n == 0)
+            return;
+        // The march follows each ray through a few exact nodes, linearly in between: a ray
+        // bends little over the height range, and the bracket it finds is refined exactly.
+        constexpr int kNodes = 9;
+        std::vector<double> nodeX(kNodes * n), nodeY(kNodes * n);
         {
-            std::vector<double> x2(n), y2(n), tx2(n), ty2(n);
-            Ground(n, pixel.data(), line.data(), top.data(), gx.data(), gy.data());
-            Ground(n, pixel.data(), line.data(), bottom.data(), x2.data(), y2.data());
-            std::copy(gx.begin(), gx.end(), tx.begin());
-            std::copy(gy.begin(), gy.end(), ty.begin());
-            std::copy(x2.begin(), x2.end(), tx2.begin());
-            std::copy(y2.begin(), y2.end(), ty2.begin());
-            toTerrain_.Map(n, tx.data(), ty.data());
-            toTerrain_.Map(n, tx2.data(), ty2.data());
-            for (std::size_t i = 0; i < n; ++i) {
-                const double run = std::hypot(tx2[i] - tx[i], ty2[i] - ty[i]);
-                if (std::isfinite(run))
-                    steps[i] = static_cast<int>(std::min(4096.0, std::ceil(run / stepLength))) + 1;
+            std::vector<double> level(n), gx(n), gy(n);
+            for (int k = 0; k < kNodes; ++k) {
+                std::fill(level.begin(), level.end(), hi - (hi - lo) * k / (kNodes - 1));
+                Ground(n, pixel.data(), line.data(), level.data(), gx.data(), gy.data());
+                toTerrain_.Map(n, gx.data(), gy.data());
+                std::copy(gx.begin(), gx.end(), nodeX.begin() + k * n);
+                std::copy(gy.begin(), gy.end(), nodeY.begin() + k * n);
             }
         }
-        // March down each ray in lockstep, keeping the last height above the terrain ("upper")
+        // Steps per ray: its horizontal run over the step length.
+        std::vector<int> steps(n, 1);
+        for (std::size_t i = 0; i < n; ++i) {
+            double run = 0.0;
+            for (int k = 1; k < kNodes; ++k) {
+                run += std::hypot(nodeX[k * n + i] - nodeX[(k - 1) * n + i],
+                                  nodeY[k * n + i] - nodeY[(k - 1) * n + i]);
+            }
+            if (std::isfinite(run))
+                steps[i] = static_cast<int>(std::min(8192.0, std::ceil(run / stepLength))) + 1;
+        }
+        // March down the rays in lockstep, keeping the last height above the terrain ("upper")
         // and the first one at or below it ("lower").
         std::vector<double> upper(n, NAN), lower(n, NAN);
-        std::vector<std::size_t> active(n);
+        std::vector<std::size_t> active(n), startsBelow;
         for (std::size_t i = 0; i < n; ++i)
             active[i] = i;
-        std::vector<double> ap, al, ah, ax, ay, atx, aty, ath;
+        std::vector<double> ax, ay, ah, at;
         for (int step = 0; !active.empty(); ++step) {
             const std::size_t m = active.size();
-            ap.resize(m), al.resize(m), ah.resize(m), ax.resize(m), ay.resize(m);
-            atx.resize(m), aty.resize(m), ath.resize(m);
+            ax.resize(m), ay.resize(m), ah.resize(m), at.resize(m);
             for (std::size_t k = 0; k < m; ++k) {
                 const std::size_t i = active[k];
-                ap[k] = pixel[i], al[k] = line[i];
-                ah[k] = top[i] - (top[i] - bottom[i]) * step / steps[i];
+                const double t = static_cast<double>(step) / steps[i];
+                const double node = std::min(t * (kNodes - 1), kNodes - 1.0 - 1e-12);
+                const int segment = static_cast<int>(node);
+                const double f = node - segment;
+                const std::size_t a = segment * n + i, b = (segment + 1) * n + i;
+                ax[k] = nodeX[a] + f * (nodeX[b] - nodeX[a]);
+                ay[k] = nodeY[a] + f * (nodeY[b] - nodeY[a]);
+                ah[k] = hi - (hi - lo) * t;
             }
-            Ground(m, ap.data(), al.data(), ah.data(), ax.data(), ay.data());
-            Terrain(m, ax.data(), ay.data(), atx.data(), aty.data(), ath.data());
+            terrain_.GetHeights(m, ax.data(), ay.data(), at.data());
             std::size_t kept = 0;
             for (std::size_t k = 0; k < m; ++k) {
                 const std::size_t i = active[k];
-                if (std::isnan(ath[k])) {
+                if (std::isnan(at[k])) {
                     // No terrain here (outside the DEM, or no-data): march on.
-                } else if (ah[k] > ath[k]) {
+                } else if (ah[k] > at[k]) {
                     upper[i] = ah[k];
-                } else if (std::isnan(upper[i])) {
-                    // The ray starts below the terrain (a peak the height survey missed):
-                    // start again above it.
-                    if (step == 0 && top[i] < ath[k] + 1.0 && restarts_ < 64 * n) {
-                        ++restarts_;
-                        top[i] = ath[k] + (hi - lo) + 1.0;
-                        steps[i] += 4;
-                        active[kept++] = i;
-                        continue;
-                    }
-                    lower[i] = ah[k];
-                    upper[i] = ah[k];
+                } else if (std::isnan(upper[i]) && step == 0) {
+                    // The ray starts below the surface: a peak the height survey missed.
+                    startsBelow.push_back(i);
                     continue;
                 } else {
                     lower[i] = ah[k];
+                    if (std::isnan(upper[i]))
+                        upper[i] = ah[k];
                     continue;
                 }
                 if (step < steps[i])
@@ -194,48 +200,92 @@ class RayCaster {
             }
             active.resize(kept);
         }
-        // Bisect each bracket down to a millimetre.
-        std::vector<std::size_t> bracketed;
-        for (std::size_t i = 0; i < n; ++i) {
-            if (!std::isnan(lower[i]))
-                bracketed.push_back(i);
-        }
-        const std::size_t m = bracketed.size();
-        ap.resize(m), al.resize(m), ah.resize(m), ax.resize(m), ay.resize(m);
-        atx.resize(m), aty.resize(m), ath.resize(m);
-        for (std::size_t k = 0; k < m; ++k)
-            ap[k] = pixel[bracketed[k]], al[k] = line[bracketed[k]];
-        double width = 0.0;
-        for (std::size_t i : bracketed)
-            width = std::max(width, upper[i] - lower[i]);
-        for (; width > 1e-3; width /= 2) {
-            for (std::size_t k = 0; k < m; ++k)
-                ah[k] = (upper[bracketed[k]] + lower[bracketed[k]]) / 2;
-            Ground(m, ap.data(), al.data(), ah.data(), ax.data(), ay.data());
-            Terrain(m, ax.data(), ay.data(), atx.data(), aty.data(), ath.data());
-            for (std::size_t k = 0; k < m; ++k) {
-                const std::size_t i = bracketed[k];
-                if (ah[k] <= ath[k])
-                    lower[i] = ah[k];
-                else
-                    upper[i] = ah[k];
+        Bisect(pixel, line, upper, lower, x, y, h);
+        // Rays that start below the surface are cast again from higher up.
+        if (!startsBelow.empty() && depth < 4) {
+            std::vector<double> sp, sl, sx, sy, sh;
+            for (std::size_t i : startsBelow)
+                sp.push_back(pixel[i]), sl.push_back(line[i]);
+            const double span = hi - lo;
+            Intersect(sp, sl, hi + 2 * span, hi, stepLength, sx, sy, sh, depth + 1);
+            for (std::size_t k = 0; k < startsBelow.size(); ++k) {
+                const std::size_t i = startsBelow[k];
+                x[i] = sx[k], y[i] = sy[k], h[i] = sh[k];
             }
-        }
-        for (std::size_t k = 0; k < m; ++k)
-            ah[k] = lower[bracketed[k]];
-        Ground(m, ap.data(), al.data(), ah.data(), ax.data(), ay.data());
-        for (std::size_t k = 0; k < m; ++k) {
-            const std::size_t i = bracketed[k];
-            x[i] = ax[k], y[i] = ay[k], h[i] = ah[k];
         }
     }
 
   private:
+    // Narrows each bracket [lower, upper] of a ray's height to a millimetre on the exact ray,
+    // then places the ray's hit at its lower end.
+    void Bisect(const std::vector<double>& pixel, const std::vector<double>& line,
+                std::vector<double>& upper, std::vector<double>& lower, std::vector<double>& x,
+                std::vector<double>& y, std::vector<double>& h) const {
+        std::vector<std::size_t> rays;
+        for (std::size_t i = 0; i < pixel.size(); ++i) {
+            if (!std::isnan(lower[i]))
+                rays.push_back(i);
+        }
+        const std::size_t m = rays.size();
+        std::vector<double> bp(m), bl(m), bh(m), bx(m), by(m), tx(m), ty(m), th(m);
+        for (std::size_t k = 0; k < m; ++k)
+            bp[k] = pixel[rays[k]], bl[k] = line[rays[k]];
+        double width = 0.0;
+        for (std::size_t i : rays)
+            width = std::max(width, upper[i] - lower[i]);
+        for (; width > 1e-3; width /= 2) {
+            for (std::size_t k = 0; k < m; ++k)
+                bh[k] = (upper[rays[k]] + lower[rays[k]]) / 2;
+            Ground(m, bp.data(), bl.data(), bh.data(), bx.data(), by.data());
+            Terrain(m, bx.data(), by.data(), tx.data(), ty.data(), th.data());
+            for (std::size_t k = 0; k < m; ++k) {
+                const std::size_t i = rays[k];
+                if (bh[k] <= th[k])
+                    lower[i] = bh[k];
+                else
+                    upper[i] = bh[k];
+            }
+        }
+        for (std::size_t k = 0; k < m; ++k)
+            bh[k] = lower[rays[k]];
+        Ground(m, bp.data(), bl.data(), bh.data(), bx.data(), by.data());
+        for (std::size_t k = 0; k < m; ++k) {
+            const std::size_t i = rays[k];
+            x[i] = bx[k], y[i] = by[k], h[i] = bh[k];
+        }
+    }
+
     const mathmodel::IMathModel& model_;
     const dem::IElevationSource& terrain_;
     PlaneMapping toTerrain_;
-    mutable std::size_t restarts_ = 0;
 };
+
+// The terrain heights below a 3 x 3 grid of image positions, found by projecting each at the
+// height found below it until that settles; false when none has a height.
+bool ReferenceHeights(const RayCaster& caster, unsigned int width, unsigned int height,
+                      double start, double& low, double& high) {
+    std::vector<double> pixel, line;
+    for (int j = 0; j < 3; ++j) {
+        for (int i = 0; i < 3; ++i)
+            pixel.push_back(width * (0.05 + 0.45 * i)), line.push_back(height * (0.05 + 0.45 * j));
+    }
+    const std::size_t n = pixel.size();
+    std::vector<double> level(n, start), x(n), y(n), tx(n), ty(n), found(n);
+    for (int iteration = 0; iteration < 8; ++iteration) {
+        caster.Ground(n, pixel.data(), line.data(), level.data(), x.data(), y.data());
+        caster.Terrain(n, x.data(), y.data(), tx.data(), ty.data(), found.data());
+        for (std::size_t i = 0; i < n; ++i) {
+            if (std::isfinite(found[i]))
+                level[i] = found[i];
+        }
+    }
+    low = HUGE_VAL, high = -HUGE_VAL;
+    for (std::size_t i = 0; i < n; ++i) {
+        if (std::isfinite(found[i]))
+            low = std::min(low, found[i]), high = std::max(high, found[i]);
+    }
+    return low <= high;
+}
 
 // The lowest and highest terrain heights on a grid of samples over a box in terrain
 // coordinates; false when no sample has a height.
@@ -320,7 +370,7 @@ Layout ComputeLayout(const mathmodel::IMathModel& model, const dem::IElevationSo
     const int perEdge =
         request.borderSamples > 0
             ? request.borderSamples
-            : static_cast<int>(std::clamp(std::max(width, height) / 16u, 64u, 1024u));
+            : static_cast<int>(std::clamp(std::max(width, height) / 16u, 64u, 512u));
     std::vector<double> pixel, line;
     BorderPositions(width, height, perEdge, pixel, line);
     const std::size_t n = pixel.size();
@@ -377,16 +427,19 @@ Layout ComputeLayout(const mathmodel::IMathModel& model, const dem::IElevationSo
                              static_cast<int>(terrainDatum), static_cast<int>(modelDatum)));
         }
         const RayCaster caster(model, *terrain);
-        // Survey the terrain's heights where the scene lies: first over the whole DEM, then
-        // over the border projected at the heights found, twice.
-        double box[4], low, high, median;
-        terrain->GetExtent(box[0], box[1], box[2], box[3]);
-        if (!SurveyHeights(*terrain, box[0], box[1], box[2], box[3], 64, low, high, median))
-            KESTREL_THROW(DataException, "The DEM has no height anywhere");
+        // Survey the terrain's heights where the scene lies: from the heights below a few
+        // image positions, then over the border projected at the heights found, twice.
+        double box[4], low, high;
+        if (!ReferenceHeights(caster, width, height, request.flatHeight, low, high)) {
+            double median;
+            terrain->GetExtent(box[0], box[1], box[2], box[3]);
+            if (!SurveyHeights(*terrain, box[0], box[1], box[2], box[3], 64, low, high, median))
+                KESTREL_THROW(DataException, "The DEM has no height anywhere");
+            low = high = median;
+        }
         for (int pass = 0; pass < 2; ++pass) {
             std::vector<double> bx, by;
-            for (double level :
-                 pass == 0 ? std::vector<double>{median} : std::vector<double>{low, high}) {
+            for (double level : {low, high}) {
                 std::vector<double> hx(n), hy(n), hh(n, level);
                 caster.Ground(n, pixel.data(), line.data(), hh.data(), hx.data(), hy.data());
                 bx.insert(bx.end(), hx.begin(), hx.end());
@@ -409,9 +462,17 @@ Layout ComputeLayout(const mathmodel::IMathModel& model, const dem::IElevationSo
         ftx = fx, fty = fy;
         caster.ToTerrain().Map(n, ftx.data(), fty.data());
         const double area = PolygonArea(ftx, fty);
-        const double stepLength = std::sqrt(area / (static_cast<double>(width) * height));
+        double stepLength = std::sqrt(area / (static_cast<double>(width) * height));
         if (!(stepLength > 0) || !std::isfinite(stepLength))
             KESTREL_THROW(DataException, "The math model gives the image no area on the ground");
+        // Between the posts of a raster DEM the surface is bilinear: half a post is fine enough.
+        if (const auto* raster = dynamic_cast<const dem::IRasterDEM*>(terrain)) {
+            const ogc::cs::GeocodingInfo* posts = raster->GetGeocoding();
+            if (posts != nullptr) {
+                stepLength = std::max(
+                    stepLength, std::min(posts->GetPixelWidth(), posts->GetPixelHeight()) / 2);
+            }
+        }
         caster.Intersect(pixel, line, hi, lo, stepLength, gx, gy, gh);
         std::size_t missed = 0, first = n;
         for (std::size_t i = 0; i < n; ++i) {
