@@ -167,15 +167,20 @@ int Workflow::Run() {
         auto step = Clock::now();
         Prepare();
         summary_.timings.emplace_back("prepare", SecondsSince(step));
+        const bool anyScene =
+            std::any_of(scenes_.begin(), scenes_.end(), [](const Scene& s) { return s.inSlice; });
+        if (!anyScene)
+            stopped_ = stopped_ || !options_.hasLines;
         step = Clock::now();
-        MakeGrid();
+        if (anyScene)
+            MakeGrid();
         summary_.timings.emplace_back("grid", SecondsSince(step));
         step = Clock::now();
-        if (!stopped_)
+        if (!stopped_ && anyScene)
             RunScenes();
         summary_.timings.emplace_back("scenes", SecondsSince(step));
         step = Clock::now();
-        if (!stopped_ && !options_.hasLines)
+        if (!stopped_ && anyScene && !options_.hasLines)
             Recover();
         summary_.timings.emplace_back("recovery", SecondsSince(step));
         succeeded = !stopped_ && summary_.errors.empty();
