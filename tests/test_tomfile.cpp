@@ -21,7 +21,7 @@ namespace {
 const char* const kMaster =
     "!MFILE master\n"
     "/img/a.tif;1,2,3;7;0,16;0;5;low;2;fill\n"
-    "C:\\img\\b.pix;4;3;;0;5;high;1;FILL\n"
+    "C:\\img\\b.tif;4;3;;0;5;high;1;FILL\n"
     "/img/c.tif;1;2;1,1;255;0;moderate;3;prep\n"
     "d.tif;1;2;1,1;255;0;any;4;Prep\n"
     "rel/e.tif;1;2;1,1;255;0;;;PREPARE\n"
@@ -32,7 +32,7 @@ const char* const kMaster =
 const char* const kExpectedPrep =
     "!MFILE created for VARNOK\n"
     "/img/a.tif;1,2,3;7;0,16;0;5\n"
-    "C:\\img\\b.pix;4;3;;0;5\n"
+    "C:\\img\\b.tif;4;3;;0;5\n"
     "/img/c.tif;1;2;1,1;255;0\n"
     "d.tif;1;2;1,1;255;0\n"
     "rel/e.tif;1;2;1,1;255;0\n"
@@ -43,7 +43,7 @@ const char* const kExpectedPrep =
 const char* const kExpectedImgSet =
     "!IMGSET created for MELDRA\n"
     "a.tif;low;2\n"
-    "b.pix;high;1\n"
+    "b.tif;high;1\n"
     "f.tif;Low;0\n"
     "g g.tif;HIGH;9\n"
     "h.tif;;\n";
@@ -122,7 +122,7 @@ TEST(TOMFileParser, DerivedFilesReadBackThroughTheTableReader) {
     for (int c = 0; c < 6; ++c)
         prep->AddDefaultString("");
     ASSERT_EQ(prep->GetLineCount(), 8u);
-    EXPECT_EQ(prep->GetString(1, 0), "C:\\img\\b.pix");
+    EXPECT_EQ(prep->GetString(1, 0), "C:\\img\\b.tif");
     EXPECT_EQ(prep->GetIntList(0, 1), (std::vector<int>{1, 2, 3}));
     EXPECT_EQ(prep->GetInt(0, 2), 7);
     EXPECT_EQ(prep->GetIntList(0, 3), (std::vector<int>{0, 16}));
