@@ -152,6 +152,17 @@ std::string Workflow::Where(const Scene& scene) const {
     return options_.master + ", line " + std::to_string(scene.masterLine);
 }
 
+void Workflow::AddStep(const std::string& step, double seconds) {
+    std::lock_guard<std::mutex> lock(stepMutex_);
+    for (auto& entry : stepSeconds_) {
+        if (entry.first == step) {
+            entry.second += seconds;
+            return;
+        }
+    }
+    stepSeconds_.emplace_back(step, seconds);
+}
+
 void Workflow::Fail(Scene& scene, const std::string& message) {
     scene.status = "failed";
     scene.error = message;
@@ -196,6 +207,8 @@ int Workflow::Run() {
         progress_.Error(Explain(e));
     }
     summary_.timings.emplace_back("total", SecondsSince(start));
+    for (const auto& entry : stepSeconds_)
+        summary_.timings.push_back(entry);
     Finish(succeeded);
     return succeeded ? 0 : 1;
 }
@@ -279,9 +292,13 @@ void Workflow::Prepare() {
         if (scene.error.empty() && scene.given.empty())
             scene.error = Where(scene) + ": the source image is missing";
         if (scene.error.empty()) {
-            const fs::path source(scene.given);
-            scene.input.source =
-                (source.is_absolute() ? source : masterDir / source).lexically_normal().string();
+            // A relative source is taken from the master file's directory, or else from the
+            // current one.
+            fs::path source(scene.given);
+            if (source.is_relative() &&
+                (fs::exists(masterDir / source, ec) || !fs::exists(source, ec)))
+                source = masterDir / source;
+            scene.input.source = fs::absolute(source, ec).lexically_normal().string();
             scene.id = kestrel::core::fileio::File(scene.given).GetBasename();
             scene.name = fs::path(scene.id).stem().string();
             const auto known = imageSet.find(scene.id);
@@ -373,6 +390,11 @@ void Workflow::MakeGrid() {
 
 bool Workflow::IsComplete(const Scene& scene) const {
     if (!FileExists(scene.xml) || !FileExists(scene.footprint) || !FileExists(scene.quicklook))
+        return false;
+    // Made before its inputs last changed: make it again.
+    const double made = ModifiedTime(scene.xml);
+    if (made < ModifiedTime(scene.input.source) ||
+        made < ModifiedTime(options_.dem.empty() ? options_.tin : options_.dem))
         return false;
     try {
         std::unique_ptr<TOSceneParser> description;
@@ -466,20 +488,29 @@ void Workflow::RunScene(Scene& scene) {
         for (const std::string& part : parts)
             RemoveFile(part);
 
+        auto step = Clock::now();
+        const auto timed = [&](const char* name) {
+            AddStep(name, SecondsSince(step));
+            step = Clock::now();
+        };
         report(0.0, 0.05, "layout")(0.0);
         Footprint footprint;
         SceneLayout(options_, scene.input, grid_.crs, grid_.PixelSize(), &footprint);
+        timed("scene layout");
 
         const OrthoResult result =
             MakeOrtho(options_, scene.input, grid_, parts[0], parts[1], report(0.05, 0.9, "ortho"));
         Publish(parts[0], scene.ortho);
         Publish(parts[1], scene.visibility);
+        timed("scene ortho");
 
         report(0.9, 0.95, "footprint")(0.0);
         WriteFootprint(parts[2], *footprint);
         Publish(parts[2], scene.footprint);
+        timed("scene footprint");
         WriteQuicklook(scene.visibility, parts[3], Quicklook::Visibility);
         Publish(parts[3], scene.quicklook);
+        timed("scene quicklook");
 
         // The scene description comes last: its presence says the scene is complete.
         report(0.95, 1.0, "scene")(0.0);
@@ -497,6 +528,7 @@ void Workflow::RunScene(Scene& scene) {
             description->Serialize(false);
         }
         Publish(parts[4], scene.xml);
+        timed("scene description");
         scene.status = "done";
     } catch (const std::exception& e) {
         for (const std::string& part : parts)
@@ -552,8 +584,10 @@ void Workflow::Recover() {
     } else {
         RemoveFile(stamp);
         progress_.Info("merging the footprints of " + std::to_string(layers.size()) + " scene(s)");
+        auto step = Clock::now();
         MergeFootprints(layers, grid_, PartName(footprints));
         Publish(PartName(footprints), footprints);
+        AddStep("footprint merge", SecondsSince(step));
         if (!inputs.empty()) {
             progress_.Info("occlusion recovery over " + std::to_string(inputs.size()) +
                            " scene(s) of the image set");
@@ -568,10 +602,13 @@ void Workflow::Recover() {
                               });
                 Publish(PartName(mosaic), mosaic);
                 Publish(PartName(source), source);
+                AddStep("occlusion recovery", SecondsSince(start));
+                step = Clock::now();
                 WriteQuicklook(mosaic, PartName(quicklooks[0]), Quicklook::Image);
                 Publish(PartName(quicklooks[0]), quicklooks[0]);
                 WriteQuicklook(source, PartName(quicklooks[1]), Quicklook::SourceIndex);
                 Publish(PartName(quicklooks[1]), quicklooks[1]);
+                AddStep("mosaic quicklooks", SecondsSince(step));
             } catch (const std::exception& e) {
                 for (const std::string& path : {mosaic, source, quicklooks[0], quicklooks[1]})
                     RemoveFile(PartName(path));

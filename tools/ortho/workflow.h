@@ -8,7 +8,9 @@
 #include "steps.h"
 #include "summary.h"
 
+#include <mutex>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace ortho {
@@ -70,6 +72,10 @@ class Workflow {
     bool stopped_ = false;  // a failure stops the run (no --keep-going)
     RunSummary summary_;
     std::string summaryPath_;
+    // Seconds spent in each step, summed over the scenes (threads add to it).
+    std::mutex stepMutex_;
+    std::vector<std::pair<std::string, double>> stepSeconds_;
+    void AddStep(const std::string& step, double seconds);
 };
 
 }  // namespace ortho
