@@ -98,19 +98,3 @@ TEST(FileListParser, FileWithoutDataLinesIsEmptyTextFile) {
         }
     }
 }
-
-TEST(FileListParser, CopiesShareTheTableAndOutliveTheOriginal) {
-    TempDir dir;
-    auto original = std::make_unique<FileListParser>(ThreeFiles(dir));
-    original->ParseLine(2);
-    FileListParser copy(*original);
-    FileListParser assigned(WriteFile(dir.File("other.txt"), "x\n"));
-    assigned = *original;
-    original.reset();
-    EXPECT_EQ(copy.GetFili(), "c d.tif");
-    copy.ParseLine(0);
-    assigned.ParseLine(1);
-    EXPECT_EQ(copy.GetFili(), "a.tif");
-    EXPECT_EQ(assigned.GetFili(), "sub/b.tif");
-    EXPECT_EQ(assigned.GetMfileLines(), 3u);
-}

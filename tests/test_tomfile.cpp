@@ -5,6 +5,7 @@
 
 #include <filesystem>
 
+using kestrel::DataException;
 using kestrel::FileAccessException;
 using kestrel::MFileParser;
 using kestrel::ParameterException;
@@ -149,19 +150,6 @@ TEST(TOMFileParser, RefusesUnreadableAndEmptyFiles) {
     }
 }
 
-TEST(TOMFileParser, CopiesShareTheTable) {
-    Master m;
-    auto original = std::make_unique<TOMFileParser>(m.path);
-    TOMFileParser copy(*original);
-    TOMFileParser assigned(WriteFile(m.dir.File("one.txt"), "x\n"));
-    assigned = *original;
-    original.reset();
-    copy.WriteMFilePrep(m.dir.File("prep.txt"));
-    assigned.WriteImgSet(m.dir.File("imgset.txt"));
-    EXPECT_EQ(ReadFile(m.dir.File("prep.txt")), kExpectedPrep);
-    EXPECT_EQ(ReadFile(m.dir.File("imgset.txt")), kExpectedImgSet);
-}
-
 // A file that cannot be created is an error, not a silent success.
 TEST(TOMFileParser, UncreatableOutputThrowsAndLeavesNoFile) {
     Master m;
@@ -200,4 +188,45 @@ TEST(TOMFileParser, WritingOverItsOwnMasterFile) {
     m.parser.WriteImgSet(m.dir.File("imgset.txt"));
     EXPECT_EQ(ReadFile(m.path), kExpectedPrep);
     EXPECT_EQ(ReadFile(m.dir.File("imgset.txt")), kExpectedImgSet);
+}
+
+// A record whose line in a derived file would begin with "!" would read back as a comment, so
+// the file would lose it: refused naming the master file, line and value, and the previous
+// output stays as it was.
+TEST(TOMFileParser, RecordsThatWouldReadBackAsCommentsAreRefused) {
+    TempDir dir;
+    const std::string prep = WriteFile(dir.File("prep.txt"), "previous prep\n");
+    const std::string imgset = WriteFile(dir.File("imgset.txt"), "previous imgset\n");
+    const struct {
+        const char* master;
+        bool prepRefused;
+        bool imgsetRefused;
+        const char* value;
+    } cases[] = {
+        {"a.tif;1\n !bang.tif;1;2;3;4;5;low;2;fill\n", true, true, "!bang.tif"},
+        {"a.tif;1\ndir/!b.tif;1;2;3;4;5;low;2;fill\n", false, true, "!b.tif"},
+        {"a.tif;1\ndir/!b.tif;1;2;3;4;5;low;2;prep\n", false, false, ""},
+    };
+    for (const auto& c : cases) {
+        const std::string master =
+            WriteFile(dir.File("master.txt"), std::string("!M\n") + c.master);
+        TOMFileParser parser(master);
+        const std::pair<void (TOMFileParser::*)(const std::string&), const std::string*> writers[] =
+            {{&TOMFileParser::WriteMFilePrep, &prep}, {&TOMFileParser::WriteImgSet, &imgset}};
+        for (const auto& [write, out] : writers) {
+            const bool refused = out == &prep ? c.prepRefused : c.imgsetRefused;
+            const std::string before = ReadFile(*out);
+            try {
+                (parser.*write)(*out);
+                EXPECT_FALSE(refused) << c.master << " written to " << *out;
+            } catch (const DataException& e) {
+                EXPECT_TRUE(refused) << e.GetErrorMessage();
+                const std::string head = master + ", line 3, column 0: the ";
+                EXPECT_EQ(e.GetErrorMessage().rfind(head, 0), 0u) << e.GetErrorMessage();
+                EXPECT_NE(e.GetErrorMessage().find(std::string("\"") + c.value + "\""),
+                          std::string::npos);
+                EXPECT_EQ(ReadFile(*out), before);
+            }
+        }
+    }
 }

@@ -3,7 +3,9 @@
 
 #include "support.h"
 
+#include <atomic>
 #include <memory>
+#include <thread>
 
 using kestrel::DataException;
 using kestrel::ParameterException;
@@ -114,19 +116,41 @@ TEST(TPMFileParser, UnreadableFileIsRefused) {
     }
 }
 
-// Copies share the table, which lives as long as the last of them.
-TEST(TPMFileParser, CopiesShareTheTable) {
+// Copies, made by construction or assignment, outlive the original and share nothing that
+// reading writes: used on several threads at once, each reads its own lines intact.
+TEST(TPMFileParser, CopiesAreIndependentAcrossThreads) {
     TempDir dir;
-    auto other = Open(WriteFile(dir.File("other.txt"), "x.tif\n"));
-    {
-        auto original = Open(WritePrep(dir, "a.tif;1;1\nb.tif;2;2\n"));
-        original->ParseLine(1);
-        TPMFileParser copy(*original);
-        original.reset();
-        EXPECT_EQ(copy.GetFili(), "b.tif");
-        *other = copy;
+    const int lines = 300;
+    std::string text;
+    for (int i = 0; i < lines; ++i) {
+        text += "s" + std::to_string(i) + ";" + std::to_string(i % 7 + 1) + "," +
+                std::to_string(i % 5 + 1) + ";" + std::to_string(i) + ";" + std::to_string(i) +
+                "," + std::to_string(-i) + "\n";
     }
-    other->ParseLine(0);
-    ExpectLine(*other, "a.tif", {1}, 1, {10, 20}, "0", 3);
-    EXPECT_EQ(other->GetMfileLines(), 2u);
+    auto original = Open(WritePrep(dir, text));
+    std::vector<TPMFileParser> copies(3, *original);
+    copies.push_back(*Open(WriteFile(dir.File("other.txt"), "x.tif\n")));
+    copies.back() = *original;
+    original.reset();
+
+    std::atomic<int> wrong{0};
+    std::vector<std::thread> threads;
+    for (TPMFileParser& parser : copies) {
+        threads.emplace_back([&parser, &wrong] {
+            for (int round = 0; round < 20; ++round) {
+                for (int i = 0; i < lines; ++i) {
+                    parser.ParseLine(i);
+                    const Channels dbic{static_cast<unsigned int>(i % 7 + 1),
+                                        static_cast<unsigned int>(i % 5 + 1)};
+                    if (parser.GetDbic() != dbic || parser.GetDbiw() != Ints{i, -i} ||
+                        parser.GetMmseg() != i)
+                        ++wrong;
+                }
+            }
+        });
+    }
+    for (std::thread& thread : threads)
+        thread.join();
+    EXPECT_EQ(wrong, 0);
+    EXPECT_EQ(copies.back().GetMfileLines(), static_cast<unsigned int>(lines));
 }
