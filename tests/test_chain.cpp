@@ -4,8 +4,21 @@
 
 #include "support.h"
 
+#include <kestrel/file.h>
+#include <kestrel/processparams.h>
+
+#include <cerrno>
+#include <clocale>
+#include <cstdio>
+#include <cstring>
+#include <filesystem>
 #include <functional>
+#include <map>
 #include <memory>
+
+#if defined(__linux__)
+#include <sys/mount.h>
+#endif
 
 using kestrel::DataException;
 using kestrel::FileAccessException;
@@ -87,6 +100,53 @@ TEST(FileChain, ImgSetFileReadsBackWithoutPreparationLines) {
     EXPECT_EQ(imgset->GetRadioDif(), RadioDifModerate);
     EXPECT_EQ(imgset->GetDbmPxErr(), 5);
     EXPECT_THROW(imgset->ParseLine(2), DataException);
+}
+
+// Numbers and keywords are read as they are written, whatever locale the process has set: with
+// a decimal comma (de_DE) or a dotless capital I (tr_TR), nothing reads differently.
+TEST(FileChain, EverythingReadsTheSameUnderAnyLocale) {
+    int tried = 0;
+    for (const char* name : {"de_DE.UTF-8", "tr_TR.UTF-8"}) {
+        if (std::setlocale(LC_ALL, name) == nullptr)
+            continue;  // tools/install-deps.sh generates both
+        ++tried;
+        struct Restore {
+            ~Restore() { std::setlocale(LC_ALL, "C"); }
+        } restore;
+        Chain chain;
+        std::unique_ptr<TOImgSetParser> imgset(
+            ParserFactory::CreateImgSetParser(chain.imgset, RadioDifAny, 5));
+        imgset->ParseLine(0);
+        EXPECT_EQ(imgset->GetRadioDif(), RadioDifLow);
+        const std::string high = WriteFile(chain.dir.File("high.txt"), "a;high;1\n");
+        std::unique_ptr<TOImgSetParser> highSet(
+            ParserFactory::CreateImgSetParser(high, RadioDifAny, 5));
+        highSet->ParseLine(0);
+        EXPECT_EQ(highSet->GetRadioDif(), RadioDifHigh) << name;
+
+        ProcessStrategy strategy{};
+        int first = 0, second = 0, third = 0;
+        std::vector<int> devices;
+        GetProcessParameters("gpu:devices=1,2;threads=3", strategy, first, second, third, devices);
+        EXPECT_EQ(devices, (std::vector<int>{1, 2})) << name;
+
+        std::unique_ptr<TOSceneParser> scene(
+            ParserFactory::CreateSceneParser(chain.dir.File("scene.xml")));
+        scene->SetOrthoNoDataValue(-9999.5f);
+        auto* points = new point2_t<double>[1] {
+            { 500000.25, 4100000.5 }
+        };
+        const Polygon<double> footprint(points, 1);
+        scene->SetSceneFootprint(&footprint);
+        scene->Serialize(false);
+        std::unique_ptr<TOSceneParser> back(
+            ParserFactory::CreateSceneParser(chain.dir.File("scene.xml")));
+        EXPECT_EQ(back->GetOrthoNoDataValue(), -9999.5f) << name;
+        EXPECT_EQ(back->GetSceneFootprint()->points[0].x, 500000.25) << name;
+        EXPECT_EQ(back->GetSceneFootprint()->points[0].y, 4100000.5) << name;
+    }
+    if (tried == 0)
+        GTEST_SKIP() << "neither de_DE.UTF-8 nor tr_TR.UTF-8 is installed";
 }
 
 TEST(ParserFactory, EmptyFileNamesAreRefusedWithTheOperationsParameterName) {
@@ -184,3 +244,112 @@ TEST(ParserFactory, SceneParserForABrokenFileThrowsAndKeepsNothing) {
                                              "</TOSceneDesc_Document>");
     EXPECT_THROW(delete ParserFactory::CreateSceneParser(incomplete), FileAccessException);
 }
+
+namespace {
+
+namespace fs = std::filesystem;
+using kestrel::core::fileio::ScopedWriteLimit;
+
+// Every file of a directory with its bytes.
+std::map<std::string, std::string> Snapshot(const fs::path& dir) {
+    std::map<std::string, std::string> files;
+    for (const auto& entry : fs::directory_iterator(dir)) {
+        if (entry.path().filename() != "filler")
+            files[entry.path().filename().string()] = testsupport::ReadFile(entry.path().string());
+    }
+    return files;
+}
+
+// Names and sizes, for a failure message that stays readable.
+std::string Describe(const std::map<std::string, std::string>& files) {
+    std::string text;
+    for (const auto& [name, bytes] : files)
+        text += name + " (" + std::to_string(bytes.size()) + " bytes) ";
+    return text;
+}
+
+// The writings of every kind of output into one directory: the preparation and image-set files
+// of a master file of `lines` lines, and a scene of `lines` footprint points with its DTD.
+std::vector<std::function<void()>> Writers(const TempDir& source, const fs::path& out, int lines) {
+    std::string text = "!MFILE master\n";
+    for (int i = 0; i < lines; ++i)
+        text += "/data/scene_" + std::to_string(i) + ".tif;1,2;3;;0;5;low;2;fill\n";
+    const std::string master =
+        WriteFile(source.File("master" + std::to_string(lines) + ".txt"), text);
+    auto parser = std::make_shared<TOMFileParser>(master);
+    auto scene = std::make_shared<TOSceneParser>();
+    scene->SetXMLFilename((out / "scene.xml").string());
+    scene->SetSceneFilename("src.tif");
+    auto* points = new point2_t<double>[static_cast<std::size_t>(lines)];
+    for (int i = 0; i < lines; ++i)
+        points[i] = {500000.25 + i, 4100000.5 - i};
+    const Polygon<double> footprint(points, static_cast<unsigned int>(lines));
+    scene->SetSceneFootprint(&footprint);
+    return {[parser, out] { parser->WriteMFilePrep((out / "prep.txt").string()); },
+            [parser, out] { parser->WriteImgSet((out / "imgset.txt").string()); },
+            [scene] { scene->Serialize(false); }};
+}
+
+// Rewrites every output with more data than there is room for, then writes the scene without
+// its DTD; every writing must fail and leave the directory as it was.
+void ExpectFailedRewritesChangeNothing(const TempDir& source, const fs::path& out,
+                                       const std::function<void()>& beforeEach) {
+    const auto before = Snapshot(out);
+    for (const auto& write : Writers(source, out, 3000)) {
+        beforeEach();
+        EXPECT_THROW(write(), FileAccessException);
+        const auto after = Snapshot(out);
+        EXPECT_TRUE(after == before) << Describe(after) << "instead of " << Describe(before);
+    }
+    fs::remove(out / "TOSceneDesc_Document.dtd");
+    beforeEach();
+    EXPECT_THROW(Writers(source, out, 3000)[2](), FileAccessException);
+    auto withoutDtd = before;
+    withoutDtd.erase("TOSceneDesc_Document.dtd");
+    const auto after = Snapshot(out);
+    EXPECT_TRUE(after == withoutDtd) << Describe(after) << "instead of " << Describe(withoutDtd);
+}
+
+}  // namespace
+
+// A rewrite that fails part way (a full disk, injected here at every stage of the writing)
+// leaves the previous file byte for byte and no temporary file.
+TEST(FullDisk, FailedWritesLeaveThePreviousFiles) {
+    for (const long long room : {0LL, 1LL, 700LL, 5000LL, 50000LL}) {
+        TempDir dir;
+        for (const auto& write : Writers(dir, dir.Path() / "out", 2)) {
+            fs::create_directories(dir.Path() / "out");
+            write();
+        }
+        std::unique_ptr<ScopedWriteLimit> limit;
+        ExpectFailedRewritesChangeNothing(dir, dir.Path() / "out", [&] {
+            limit.reset();
+            limit = std::make_unique<ScopedWriteLimit>(room);
+        });
+    }
+}
+
+#if defined(__linux__)
+// The same on a real full file system: a small tmpfs, filled up (needs the right to mount).
+TEST(FullDisk, RewritesOnAFullFileSystemLeaveThePreviousFiles) {
+    TempDir dir;
+    const fs::path mnt = dir.Path() / "mnt";
+    fs::create_directory(mnt);
+    if (mount("tmpfs", mnt.c_str(), "tmpfs", 0, "size=256k") != 0)
+        GTEST_SKIP() << "a tmpfs cannot be mounted here: " << std::strerror(errno);
+    struct Unmount {
+        const fs::path& path;
+        ~Unmount() { umount2(path.c_str(), MNT_DETACH); }
+    } unmount{mnt};
+    for (const auto& write : Writers(dir, mnt, 2))
+        write();
+    std::FILE* filler = std::fopen((mnt / "filler").c_str(), "wb");
+    ASSERT_NE(filler, nullptr);
+    const std::string block(4096, 'f');
+    while (std::fwrite(block.data(), 1, block.size(), filler) == block.size() &&
+           std::fflush(filler) == 0) {
+    }
+    std::fclose(filler);
+    ExpectFailedRewritesChangeNothing(dir, mnt, [] {});
+}
+#endif
