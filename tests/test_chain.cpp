@@ -23,6 +23,7 @@
 using kestrel::DataException;
 using kestrel::FileAccessException;
 using kestrel::ParameterException;
+using kestrel::processes::silvan::FileListParser;
 using kestrel::processes::silvan::ParserFactory;
 using kestrel::processes::silvan::TOImgSetParser;
 using kestrel::processes::silvan::TOMFileParser;
@@ -183,19 +184,74 @@ TEST(ParserFactory, EmptyFileNamesAreRefusedWithTheOperationsParameterName) {
     }
 }
 
-// Constructor failures pass through; the sanitizer build checks that nothing is left behind.
-TEST(ParserFactory, ConstructorErrorsPassThrough) {
+// Every parser refuses a file it cannot read ("Invalid MFILE") or without data lines ("Empty
+// text file"), and a line index outside the file, from its own constructor or ParseLine; the
+// factory lets the errors pass (the sanitizer build checks that nothing is left behind).
+TEST(ParserFactory, EveryParserRefusesBadFilesAndIndices) {
     TempDir dir;
-    const std::string empty = WriteFile(dir.File("empty.txt"), "!MFILE\n");
-    std::vector<unsigned int> dbic;
+    const std::string missing = dir.File("no such file.txt");
+    const std::string empty = WriteFile(dir.File("empty.txt"), "!MFILE\n\n  \n\t\r\n");
+    const std::string two = WriteFile(dir.File("two.txt"), "!MFILE\na.tif;1;1\nb.tif;2;2\n");
+    std::vector<unsigned int> dbic{1};
     std::vector<int> dbiw;
-    EXPECT_THROW(delete ParserFactory::CreateFileListParser(empty), ParameterException);
-    EXPECT_THROW(delete ParserFactory::CreateTOMFileParser(dir.File("missing")),
-                 ParameterException);
-    EXPECT_THROW(delete ParserFactory::CreateImgSetParser(empty, RadioDifAny, 0),
-                 ParameterException);
-    EXPECT_THROW(delete ParserFactory::CreateTPMFileParser("  ", dbic, 0, dbiw, "", 0),
-                 ParameterException);
+    const struct {
+        const char* name;
+        std::function<void(const std::string&, int)> open;
+    } parsers[] = {
+        {"FileListParser",
+         [](const std::string& f, int i) {
+             std::unique_ptr<FileListParser> p(ParserFactory::CreateFileListParser(f));
+             p->ParseLine(i);
+         }},
+        {"TOImgSetParser",
+         [](const std::string& f, int i) {
+             std::unique_ptr<TOImgSetParser> p(
+                 ParserFactory::CreateImgSetParser(f, RadioDifAny, 0));
+             p->ParseLine(i);
+         }},
+        {"TPMFileParser",
+         [&](const std::string& f, int i) {
+             std::unique_ptr<TPMFileParser> p(
+                 ParserFactory::CreateTPMFileParser(f, dbic, 0, dbiw, "", 0));
+             p->ParseLine(i);
+         }},
+        {"TOMFileParser",
+         [](const std::string& f, int) { delete ParserFactory::CreateTOMFileParser(f); }},
+    };
+    const std::string source[] = {"filelistparser.cpp", "toimgsetparser.cpp", "tpmfileparser.cpp",
+                                  "tomfileparser.cpp"};
+    for (std::size_t k = 0; k < 4; ++k) {
+        const std::string name = parsers[k].name;
+        for (const std::string& file : {missing, empty}) {
+            try {
+                parsers[k].open(file, 0);
+                ADD_FAILURE() << name << " read " << file;
+            } catch (const ParameterException& e) {
+                EXPECT_EQ(e.GetErrorMessage(), file == empty ? "Empty text file" : "Invalid MFILE");
+                EXPECT_EQ(e.GetParameterName(), "MFILE");
+                EXPECT_EQ(static_cast<int>(e.GetType()), 0);
+                EXPECT_EQ(e.GetValue(), file);
+                EXPECT_EQ(e.GetExpected(), "");
+                EXPECT_NE(e.GetFunction().find(name + "::" + name + "(const std::string&"),
+                          std::string::npos)
+                    << e.GetFunction();
+                EXPECT_EQ(e.GetSourceFile(), source[k]);
+            }
+        }
+        if (name == "TOMFileParser")
+            continue;  // reads lines only for its writers
+        for (const int index : {2, -1}) {
+            try {
+                parsers[k].open(two, index);
+                ADD_FAILURE() << name << " read line " << index;
+            } catch (const DataException& e) {
+                EXPECT_EQ(e.GetErrorMessage(),
+                          "Index " + std::to_string(index) + " is outside of valid range: 2");
+                EXPECT_NE(e.GetFunction().find(name + "::ParseLine"), std::string::npos);
+                EXPECT_EQ(e.GetSourceFile(), source[k]);
+            }
+        }
+    }
 }
 
 TEST(ParserFactory, SceneParserForAMissingFileHoldsTheNameAndNothingRead) {

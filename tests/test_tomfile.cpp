@@ -8,10 +8,7 @@
 using kestrel::DataException;
 using kestrel::FileAccessException;
 using kestrel::MFileParser;
-using kestrel::ParameterException;
-using kestrel::ParametersTableIF;
 using kestrel::processes::silvan::TOMFileParser;
-using testsupport::ExpectThrownFrom;
 using testsupport::ReadFile;
 using testsupport::TempDir;
 using testsupport::WriteFile;
@@ -74,13 +71,6 @@ TEST(TOMFileParser, WritesBothDerivedFilesByteForByte) {
     EXPECT_EQ(m.parser.GetMfileLines(), 8u);
 }
 
-TEST(TOMFileParser, PrepLineKeepsEmptyFieldsInPlace) {
-    TempDir dir;
-    TOMFileParser parser(WriteFile(dir.File("m.txt"), "a;7;3;;0;5;low;1;fill\n"));
-    parser.WriteMFilePrep(dir.File("prep.txt"));
-    EXPECT_EQ(ReadFile(dir.File("prep.txt")), "!MFILE created for VARNOK\na;7;3;;0;5\n");
-}
-
 // Each writer reads only its own columns; the image-set writer upper-cases the role.
 TEST(TOMFileParser, GettersHoldTheLastLineOfEachWritersMode) {
     TempDir dir;
@@ -104,50 +94,6 @@ TEST(TOMFileParser, OnlyPrepRolesGiveAnImgSetWithTheHeaderAlone) {
     parser.WriteMFilePrep(dir.File("prep.txt"));
     EXPECT_EQ(ReadFile(dir.File("imgset.txt")), "!IMGSET created for MELDRA\n");
     EXPECT_EQ(ReadFile(dir.File("prep.txt")), "!MFILE created for VARNOK\nx.tif;1;2;3;4;5\n");
-}
-
-TEST(TOMFileParser, RewritingReplacesTheFile) {
-    Master m;
-    const std::string out = WriteFile(m.dir.File("prep.txt"), std::string(10000, 'x'));
-    m.parser.WriteMFilePrep(out);
-    m.parser.WriteMFilePrep(out);
-    EXPECT_EQ(ReadFile(out), kExpectedPrep);
-}
-
-// The derived files read back through the table reader with the values written.
-TEST(TOMFileParser, DerivedFilesReadBackThroughTheTableReader) {
-    Master m;
-    m.parser.WriteMFilePrep(m.dir.File("prep.txt"));
-    MFileParser reader(0);
-    std::unique_ptr<ParametersTableIF> prep(reader.Create(m.dir.File("prep.txt")));
-    for (int c = 0; c < 6; ++c)
-        prep->AddDefaultString("");
-    ASSERT_EQ(prep->GetLineCount(), 8u);
-    EXPECT_EQ(prep->GetString(1, 0), "C:\\img\\b.pix");
-    EXPECT_EQ(prep->GetIntList(0, 1), (std::vector<int>{1, 2, 3}));
-    EXPECT_EQ(prep->GetInt(0, 2), 7);
-    EXPECT_EQ(prep->GetIntList(0, 3), (std::vector<int>{0, 16}));
-    EXPECT_EQ(prep->GetString(1, 3), "");
-    EXPECT_EQ(prep->GetInt(2, 4), 255);
-    EXPECT_EQ(prep->GetInt(0, 5), 5);
-}
-
-TEST(TOMFileParser, RefusesUnreadableAndEmptyFiles) {
-    TempDir dir;
-    const std::string empty = WriteFile(dir.File("empty.txt"), "!MFILE\n\n");
-    for (const std::string& path : {dir.File("missing.txt"), empty}) {
-        try {
-            TOMFileParser parser(path);
-            FAIL() << path;
-        } catch (const ParameterException& e) {
-            EXPECT_EQ(e.GetErrorMessage(), path == empty ? "Empty text file" : "Invalid MFILE");
-            EXPECT_EQ(e.GetValue(), path);
-            ExpectThrownFrom(e,
-                             "kestrel::processes::silvan::TOMFileParser::TOMFileParser(const "
-                             "std::string&)",
-                             "tomfileparser.cpp");
-        }
-    }
 }
 
 // A file that cannot be created is an error, not a silent success.

@@ -8,7 +8,6 @@
 #include <thread>
 
 using kestrel::DataException;
-using kestrel::ParameterException;
 using kestrel::processes::silvan::TPMFileParser;
 using testsupport::TempDir;
 using testsupport::WriteFile;
@@ -62,24 +61,6 @@ TEST(TPMFileParser, ReadsTypedLinesAndProcessDefaults) {
     ExpectLine(*p, "", {4, 5}, 2, {10, 20}, "0", 3);
 }
 
-TEST(TPMFileParser, IndexOutOfRangeLeavesEveryField) {
-    TempDir dir;
-    auto p = Open(WritePrep(dir, "a.tif;1,2;1;5;bg;6\nb.tif\n"));
-    p->ParseLine(0);
-    for (const int index : {-1, 2}) {
-        try {
-            p->ParseLine(index);
-            ADD_FAILURE() << index << " was read";
-        } catch (const DataException& e) {
-            EXPECT_EQ(e.GetErrorMessage(),
-                      "Index " + std::to_string(index) + " is outside of valid range: 2");
-            EXPECT_NE(e.GetFunction().find("TPMFileParser::ParseLine"), std::string::npos);
-            EXPECT_EQ(e.GetSourceFile(), "tpmfileparser.cpp");
-        }
-        ExpectLine(*p, "a.tif", {1, 2}, 1, {5}, "bg", 6);
-    }
-}
-
 // A channel list naming no channel is refused, whether it comes from the line or from the
 // process default; a default channel number above INT_MAX does not come back as a channel.
 TEST(TPMFileParser, ChannelListsNamingNoChannelAreRefused) {
@@ -98,22 +79,6 @@ TEST(TPMFileParser, ChannelListsNamingNoChannelAreRefused) {
     EXPECT_EQ(p->GetMmseg(), 1);
     EXPECT_THROW(p->ParseLine(2), DataException);
     EXPECT_EQ(p->GetDbic(), (Channels{1}));
-}
-
-TEST(TPMFileParser, UnreadableFileIsRefused) {
-    TempDir dir;
-    const std::string path = dir.File("missing.txt");
-    try {
-        Open(path);
-        ADD_FAILURE() << "a missing file was read";
-    } catch (const ParameterException& e) {
-        EXPECT_EQ(e.GetErrorMessage(), "Invalid MFILE");
-        EXPECT_EQ(e.GetParameterName(), "MFILE");
-        EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
-        EXPECT_EQ(e.GetValue(), path);
-        EXPECT_NE(e.GetFunction().find("TPMFileParser::TPMFileParser"), std::string::npos);
-        EXPECT_EQ(e.GetSourceFile(), "tpmfileparser.cpp");
-    }
 }
 
 // Copies, made by construction or assignment, outlive the original and share nothing that

@@ -52,10 +52,10 @@ class FuzzDir {
 };
 
 // A broken expectation: stops the run so that the fuzzer keeps the input.
-#define FUZZ_EXPECT(condition)                                                  \
-    do {                                                                        \
-        if (!(condition)) {                                                     \
+#define FUZZ_EXPECT(condition)                                                            \
+    do {                                                                                  \
+        if (!(condition)) {                                                               \
             std::fprintf(stderr, "%s:%d: expected %s\n", __FILE__, __LINE__, #condition); \
-            std::abort();                                                       \
-        }                                                                       \
+            std::abort();                                                                 \
+        }                                                                                 \
     } while (0)

@@ -97,8 +97,8 @@ void WriteAndReadBack(const std::string& master) {
         for (char& c : role)
             c = c >= 'a' && c <= 'z' ? static_cast<char>(c - 'a' + 'A') : c;
         if (role.compare(0, 4, "PREP") != 0) {
-            expected.push_back(TrimBlanks(
-                kestrel::core::fileio::File((*masterNames)[line]).GetBasename()));
+            expected.push_back(
+                TrimBlanks(kestrel::core::fileio::File((*masterNames)[line]).GetBasename()));
         }
     }
     if (expected.empty()) {
