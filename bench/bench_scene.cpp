@@ -42,10 +42,10 @@ kestrel::tin::Polygon<double> Footprint(int index) {
 
 void WriteScene(int index, const kestrel::tin::Polygon<double>& footprint) {
     TOSceneParser scene;
-    scene.SetSceneFilename("/data/src/image_" + std::to_string(index) + ".pix");
-    scene.SetOrthoFilename("/data/ortho/ortho_" + std::to_string(index) + ".pix");
-    scene.SetVisIdxFilename("/data/vis/vis_" + std::to_string(index) + ".pix");
-    scene.SetElevMapFilename("/data/dem/elev_" + std::to_string(index) + ".pix");
+    scene.SetSceneFilename("/data/src/image_" + std::to_string(index) + ".tif");
+    scene.SetOrthoFilename("/data/ortho/ortho_" + std::to_string(index) + ".tif");
+    scene.SetVisIdxFilename("/data/vis/vis_" + std::to_string(index) + ".tif");
+    scene.SetElevMapFilename("/data/dem/elev_" + std::to_string(index) + ".tif");
     scene.SetMmseg(2);
     scene.SetOrthoNoDataValue(0.0f);
     scene.SetElevNoDataValue(-32768.0f);

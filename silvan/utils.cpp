@@ -7,6 +7,128 @@
 // ---------------------------------------------------------------------------------------------
 // Elevation sources and vertical datums
 
+#include <cctype>
+
+#include <kestrel/exception.h>
+#include <kestrel/file.h>
+
+using kestrel::ogc::cs::DatumType;
+
+namespace {
+
+// The datum a new elevation source delivers its heights in: the math model's when that is its
+// own, otherwise the one asked for.
+DatumType OutputDatum(DatumType sourceDatum, DatumType requested) {
+    return sourceDatum == kestrel::ogc::cs::DatumMathModel ? kestrel::ogc::cs::DatumMathModel
+                                                            : requested;
+}
+
+std::string UpperCase(const std::string& text) {
+    std::string upper = text;
+    for (char& c : upper)
+        c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+    return upper;
+}
+
+}  // namespace
+
+kestrel::dem::IRasterDEM* GetDem(const std::string& demPath, int band, double offset,
+                                 double scale, float noData, DatumType& demDatum,
+                                 DatumType outDatum) {
+    using kestrel::dem::DEMFactory;
+    if (demPath.empty()) {
+        KESTREL_THROW(kestrel::ParameterException, "sFileDem",
+                      kestrel::ParameterException::EmptyValue, "empty",
+                      "a disk file or directory", "empty dem path");
+    }
+    std::unique_ptr<kestrel::dem::IRasterDEM> dem;
+    if (DEMFactory::IsTileRasterDEMFile(demPath)) {
+        dem.reset(DEMFactory::CreateTileRasterDEM(demPath));
+        demDatum = dem->GetOutputVerticalDatum();
+    } else if (IsFile(demPath)) {
+        dem.reset(DEMFactory::CreateFileRasterDEM(demPath, static_cast<unsigned int>(band),
+                                                  offset, scale, noData, demDatum, false, 10));
+    } else {
+        KESTREL_THROW(kestrel::FileNotFoundException, demPath,
+                      "The given filedem parameter doesn't correspond to an existing file or "
+                      "directory name");
+    }
+    dem->SetOutputVerticalDatum(OutputDatum(demDatum, outDatum));
+    return dem.release();
+}
+
+kestrel::dem::IRasterDEM* GetConstantDem(const kestrel::ogc::cs::ICRS* crs,
+                                         const kestrel::ogc::cs::GeocodingInfo* geocoding,
+                                         unsigned int lines, unsigned int pixels, double height,
+                                         DatumType demDatum, DatumType outDatum) {
+    std::unique_ptr<kestrel::dem::IRasterDEM> dem(
+        kestrel::dem::DEMFactory::CreateConstantDEMDownsampled(
+            crs, geocoding, pixels, lines, static_cast<float>(height), demDatum, 128.0f));
+    dem->SetOutputVerticalDatum(OutputDatum(demDatum, outDatum));
+    return dem.release();
+}
+
+kestrel::tin::TinReader* GetDbm(const std::string& dbmPath, int layer, double offset,
+                                double scale, DatumType dbmDatum, DatumType outDatum) {
+    if (dbmPath.empty())
+        return nullptr;
+    std::unique_ptr<kestrel::tin::TinReader> reader(kestrel::tin::TinReaderFactory::CreateTinReader(
+        dbmPath.c_str(), layer, offset, scale, dbmDatum));
+    if (!reader)
+        return nullptr;
+    reader->SetOutputVerticalDatum(OutputDatum(dbmDatum, outDatum));
+    return reader.release();
+}
+
+DatumType GetVertDatum(const std::string& keyword) {
+    if (keyword.empty())
+        return kestrel::ogc::cs::DatumMSL;
+    const std::string upper = UpperCase(keyword);
+    if (upper == "MSL")
+        return kestrel::ogc::cs::DatumMSL;
+    if (upper == "ELLIPS" || (upper.size() >= 3 && upper.compare(0, 3, "ELL") == 0))
+        return kestrel::ogc::cs::DatumEllipsoid;
+    if (upper == "MATHMODEL")
+        return kestrel::ogc::cs::DatumMathModel;
+    KESTREL_THROW(kestrel::DataException,
+                  kestrel::FormatString("Unrecognized value for -elevref: permissible values are "
+                                        "MSL, ELLIPS or MATHMODEL; a value of %s was entered",
+                                        keyword.c_str()));
+}
+
+DatumType GetModelDatum(const kestrel::mathmodel::IMathModel* model) {
+    if (model == nullptr)
+        return kestrel::ogc::cs::DatumEllipsoid;
+    return kestrel::ogc::utils::GetVerticalDatumType(model->GetCRS());
+}
+
+void GetElFactor(const std::vector<float>& factors, double& offset, double& scale) {
+    offset = 0.0;
+    scale = 1.0;
+    if (factors.empty())
+        return;
+    if (factors.size() > 2) {
+        KESTREL_THROW(kestrel::DataException,
+                      kestrel::FormatString("Invalid -elfactor argument: only 2 elements are "
+                                            "allowed, but %d were passed",
+                                            static_cast<int>(factors.size())));
+    }
+    offset = static_cast<double>(factors[0]);
+    if (factors.size() == 2) {
+        scale = static_cast<double>(factors[1]);
+        if (scale <= 0.0) {
+            KESTREL_THROW(kestrel::DataException,
+                          kestrel::FormatString("Invalid -elfactor argument: the scale parameter "
+                                                "must be positive.  A value of %lf was passed",
+                                                scale));
+        }
+    }
+}
+
+void GetElUnits(const std::string& units, double& scale) {
+    scale *= kestrel::dem::GetScale(UpperCase(units));
+}
+
 // (end of elevation sources and vertical datums)
 
 // ---------------------------------------------------------------------------------------------

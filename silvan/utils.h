@@ -9,6 +9,45 @@
 // ---------------------------------------------------------------------------------------------
 // Elevation sources and vertical datums
 
+#include <kestrel/crs.h>
+#include <kestrel/dem.h>
+#include <kestrel/mathmodel.h>
+#include <kestrel/tin.h>
+
+// The DEM at demPath: a tiled DEM, a raster file or a directory of rasters. band, offset, scale
+// and noData are handed to DEMFactory::CreateFileRasterDEM (docs/elevation.md). demDatum is the
+// datum of a file DEM's heights; for a tiled DEM it is replaced by the tiled DEM's own. The
+// DEM delivers heights in outDatum, or in the math model's datum when its own is that one.
+SILVAN_API kestrel::dem::IRasterDEM* GetDem(const std::string& demPath, int band, double offset,
+                                            double scale, float noData,
+                                            kestrel::ogc::cs::DatumType& demDatum,
+                                            kestrel::ogc::cs::DatumType outDatum);
+
+// A DEM of one height over the grid of lines x pixels that crs and geocoding describe.
+SILVAN_API kestrel::dem::IRasterDEM* GetConstantDem(const kestrel::ogc::cs::ICRS* crs,
+                                                    const kestrel::ogc::cs::GeocodingInfo* geocoding,
+                                                    unsigned int lines, unsigned int pixels,
+                                                    double height,
+                                                    kestrel::ogc::cs::DatumType demDatum,
+                                                    kestrel::ogc::cs::DatumType outDatum);
+
+// A reader of the TIN surface model at dbmPath, or null when the path is empty or names no TIN.
+SILVAN_API kestrel::tin::TinReader* GetDbm(const std::string& dbmPath, int layer, double offset,
+                                           double scale, kestrel::ogc::cs::DatumType dbmDatum,
+                                           kestrel::ogc::cs::DatumType outDatum);
+
+// The datum an -elevref keyword names: empty or MSL, ELL... (ELLIPS), MATHMODEL, in any case.
+SILVAN_API kestrel::ogc::cs::DatumType GetVertDatum(const std::string& keyword);
+
+// The vertical datum of a math model's coordinate system; the ellipsoid for a null model.
+SILVAN_API kestrel::ogc::cs::DatumType GetModelDatum(const kestrel::mathmodel::IMathModel* model);
+
+// Offset (default 0) and scale (default 1) from the -elfactor list of at most two elements.
+SILVAN_API void GetElFactor(const std::vector<float>& factors, double& offset, double& scale);
+
+// Multiplies scale by the factor that takes heights in units into metres.
+SILVAN_API void GetElUnits(const std::string& units, double& scale);
+
 // (end of elevation sources and vertical datums)
 
 // ---------------------------------------------------------------------------------------------

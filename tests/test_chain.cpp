@@ -40,7 +40,7 @@ struct Chain {
     std::string master = WriteFile(dir.File("master.txt"),
                                    "!MFILE true-ortho master\n"
                                    "/data/a.tif;1,2,3;7;0,16;0;5;low;2;fill\n"
-                                   "D:\\data\\b.pix;4;3;;255;;High;1;prep\n"
+                                   "D:\\data\\b.tif;4;3;;255;;High;1;prep\n"
                                    "c.tif;;;1;;1;moderate;;\n");
     std::string prep = dir.File("prep.txt");
     std::string imgset = dir.File("imgset.txt");
@@ -71,7 +71,7 @@ TEST(FileChain, PreparationFileReadsBackTypedWithDefaultsForEmptyColumns) {
     EXPECT_EQ(prep->GetEdgeClip(), 5);
 
     prep->ParseLine(1);
-    EXPECT_EQ(prep->GetFili(), "D:\\data\\b.pix");
+    EXPECT_EQ(prep->GetFili(), "D:\\data\\b.tif");
     EXPECT_EQ(prep->GetDbic(), (std::vector<unsigned int>{4}));
     EXPECT_EQ(prep->GetMmseg(), 3);
     EXPECT_EQ(prep->GetDbiw(), (std::vector<int>{-1, 8}));

@@ -24,10 +24,10 @@ using testsupport::WriteFile;
 namespace {
 
 struct Elements {
-    std::string source = "<SourceRaster>src.pix</SourceRaster>";
-    std::string ortho = "<OrthoRaster>ortho.pix</OrthoRaster>";
-    std::string visIdx = "<VisIdxmapRaster>vis.pix</VisIdxmapRaster>";
-    std::string elevMap = "<ElevMapRaster>elev.pix</ElevMapRaster>";
+    std::string source = "<SourceRaster>src.tif</SourceRaster>";
+    std::string ortho = "<OrthoRaster>ortho.tif</OrthoRaster>";
+    std::string visIdx = "<VisIdxmapRaster>vis.tif</VisIdxmapRaster>";
+    std::string elevMap = "<ElevMapRaster>elev.tif</ElevMapRaster>";
     std::string optional;
     std::string footprint = "<SceneFootprint><Pt>1,2</Pt></SceneFootprint>";
 
@@ -93,10 +93,10 @@ TEST_F(SceneRead, ElementsInAnyOrderAndDefaultsForAbsentOptionalOnes) {
                                  "<Mmseg>4</Mmseg>" + e.visIdx + e.ortho + e.source +
                                  "</TOSceneDesc_Document>";
     TOSceneParser scene(Put("b.xml", shuffled).c_str());
-    EXPECT_EQ(scene.GetSceneFilename(), "src.pix");
-    EXPECT_EQ(scene.GetOrthoFilename(), "ortho.pix");
-    EXPECT_EQ(scene.GetVisIdxFilename(), "vis.pix");
-    EXPECT_EQ(scene.GetElevMapFilename(), "elev.pix");
+    EXPECT_EQ(scene.GetSceneFilename(), "src.tif");
+    EXPECT_EQ(scene.GetOrthoFilename(), "ortho.tif");
+    EXPECT_EQ(scene.GetVisIdxFilename(), "vis.tif");
+    EXPECT_EQ(scene.GetElevMapFilename(), "elev.tif");
     EXPECT_EQ(scene.GetMmseg(), 4);
     EXPECT_EQ(scene.GetOrthoNoDataValue(), -1.5f);
     ASSERT_EQ(scene.GetSceneFootprint()->numPoints, 1u);
@@ -177,7 +177,7 @@ TEST_F(SceneRead, EachMissingRequiredElementOrPointlessFootprintIsReported) {
                 "tosceneparser.cpp");
         }
         // Reading stops at the gap; a footprint without points is kept as an empty polygon.
-        EXPECT_EQ(scene.GetVisIdxFilename(), missing <= 2 ? "" : "vis.pix") << missing;
+        EXPECT_EQ(scene.GetVisIdxFilename(), missing <= 2 ? "" : "vis.tif") << missing;
         const auto* footprint = scene.GetSceneFootprint();
         EXPECT_EQ(footprint ? static_cast<int>(footprint->numPoints) : -1, missing < 4 ? -1 : 0);
     }
@@ -201,7 +201,7 @@ TEST_F(SceneRead, EscapesEntitiesLongTextsAndCharacterSetsGiveBytes) {
     TOSceneParser unicode(Put("u.xml", utf8).c_str());
     EXPECT_EQ(unicode.GetOrthoFilename(), "caf\xE9");
 
-    e.elevMap = "<ElevMapRaster>&#x65E5;.pix</ElevMapRaster>";
+    e.elevMap = "<ElevMapRaster>&#x65E5;.tif</ElevMapRaster>";
     const std::string message = ReadError<DataException>(Put("s.xml", e.Document()));
     EXPECT_TRUE(Contains(message, "U+65E5") && Contains(message, "ElevMapRaster")) << message;
 }
@@ -213,12 +213,12 @@ TEST_F(SceneRead, DeeplyNestedTextIsRead) {
     std::string nested;
     for (int i = 0; i < depth; ++i)
         nested += "<a>";
-    nested += "deep.pix";
+    nested += "deep.tif";
     for (int i = 0; i < depth; ++i)
         nested += "</a>";
     e.source = "<SourceRaster>" + nested + "</SourceRaster>";
     TOSceneParser scene(Put("deep.xml", e.Document()).c_str());
-    EXPECT_EQ(scene.GetSceneFilename(), "deep.pix");
+    EXPECT_EQ(scene.GetSceneFilename(), "deep.tif");
 }
 
 TEST_F(SceneRead, MissingFileOrDirectoryIsReportedWithItsName) {
@@ -247,7 +247,7 @@ TEST_F(SceneRead, EndlessFileIsRefusedAndPipeIsRead) {
     std::thread writer([&fifo] { WriteFile(fifo, Elements().Document()); });
     TOSceneParser scene(fifo.c_str());
     writer.join();
-    EXPECT_EQ(scene.GetSceneFilename(), "src.pix");
+    EXPECT_EQ(scene.GetSceneFilename(), "src.tif");
 }
 #endif
 
@@ -298,7 +298,7 @@ TEST_F(SceneRead, ExternalDtdIsNeitherNeededNorFetched) {
         const std::string doctype =
             std::string("<!DOCTYPE TOSceneDesc_Document SYSTEM \"") + system + "\">\n";
         TOSceneParser scene(Put("s.xml", Elements().Document(doctype)).c_str());
-        EXPECT_EQ(scene.GetSceneFilename(), "src.pix") << system;
+        EXPECT_EQ(scene.GetSceneFilename(), "src.tif") << system;
     }
 }
 

@@ -52,10 +52,10 @@ std::string Write(TOSceneParser& scene, const std::string& path) {
 
 // A scene with every file name and a footprint.
 void Fill(TOSceneParser& scene) {
-    scene.SetSceneFilename("src.pix");
-    scene.SetOrthoFilename("ortho.pix");
-    scene.SetVisIdxFilename("vis.pix");
-    scene.SetElevMapFilename("elev.pix");
+    scene.SetSceneFilename("src.tif");
+    scene.SetOrthoFilename("ortho.tif");
+    scene.SetVisIdxFilename("vis.tif");
+    scene.SetElevMapFilename("elev.tif");
     const Polygon<double> polygon = MakePolygon({{500000.25, 4100000.5}, {-1, 2.5}});
     scene.SetSceneFootprint(&polygon);
 }
@@ -96,10 +96,10 @@ TEST_F(SceneWrite, DocumentLayoutAndTextForms) {
               "<?xml version=\"1.0\" encoding=\"ISO-8859-1\" standalone=\"no\" ?>\n"
               "<!DOCTYPE TOSceneDesc_Document SYSTEM \"TOSceneDesc_Document.dtd\">\n"
               "<TOSceneDesc_Document>\n"
-              "  <SourceRaster>src.pix</SourceRaster>\n"
-              "  <OrthoRaster>ortho.pix</OrthoRaster>\n"
-              "  <VisIdxmapRaster>vis.pix</VisIdxmapRaster>\n"
-              "  <ElevMapRaster>elev.pix</ElevMapRaster>\n"
+              "  <SourceRaster>src.tif</SourceRaster>\n"
+              "  <OrthoRaster>ortho.tif</OrthoRaster>\n"
+              "  <VisIdxmapRaster>vis.tif</VisIdxmapRaster>\n"
+              "  <ElevMapRaster>elev.tif</ElevMapRaster>\n"
               "  <Mmseg>1</Mmseg>\n"
               "  <OrthoNoDataValue>123457</OrthoNoDataValue>\n"
               "  <ElevNoDataValue>-9999.5</ElevNoDataValue>\n"
@@ -119,7 +119,7 @@ TEST_F(SceneWrite, RoundTripKeepsOddNamesAndVerticesExactlyAndMmsegOnlyAboveZero
     for (int byte = 0x20; byte <= 0xFF; ++byte)
         allBytes += static_cast<char>(byte);
     const std::vector<std::string> names = {
-        "a & b < c > \"d\" 'e'.pix", allBytes, "  blanks around  ", "tab\tline\nreturn\r\ncr\rend",
+        "a & b < c > \"d\" 'e'.tif", allBytes, "  blanks around  ", "tab\tline\nreturn\r\ncr\rend",
         "]]> <![CDATA[ &amp; &#65;", ""};
     const double big = std::numeric_limits<double>::max();
     const std::vector<P> points = {{0.1, -0.30000000000000004},

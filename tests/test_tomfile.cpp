@@ -19,7 +19,7 @@ namespace {
 const char* const kMaster =
     "!MFILE master\n"
     "/img/a.tif;1,2,3;7;0,16;0;5;low;2;fill\n"
-    "C:\\img\\b.pix;4;3;;0;5;high;1;FILL\n"
+    "C:\\img\\b.tif;4;3;;0;5;high;1;FILL\n"
     "/img/c.tif;1;2;1,1;255;0;moderate;3;prep\n"
     "d.tif;1;2;1,1;255;0;any;4;Prep\n"
     "rel/e.tif;1;2;1,1;255;0;;;PREPARE\n"
@@ -30,7 +30,7 @@ const char* const kMaster =
 const char* const kExpectedPrep =
     "!MFILE created for VARNOK\n"
     "/img/a.tif;1,2,3;7;0,16;0;5\n"
-    "C:\\img\\b.pix;4;3;;0;5\n"
+    "C:\\img\\b.tif;4;3;;0;5\n"
     "/img/c.tif;1;2;1,1;255;0\n"
     "d.tif;1;2;1,1;255;0\n"
     "rel/e.tif;1;2;1,1;255;0\n"
@@ -41,7 +41,7 @@ const char* const kExpectedPrep =
 const char* const kExpectedImgSet =
     "!IMGSET created for MELDRA\n"
     "a.tif;low;2\n"
-    "b.pix;high;1\n"
+    "b.tif;high;1\n"
     "f.tif;Low;0\n"
     "g g.tif;HIGH;9\n"
     "h.tif;;\n";

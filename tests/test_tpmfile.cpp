@@ -46,13 +46,13 @@ TEST(TPMFileParser, ReadsTypedLinesAndProcessDefaults) {
     TempDir dir;
     auto p = Open(WritePrep(dir,
                             "a.tif;3;1;;-9999;0\n"
-                            "d:\\img\\b.pix;1,2,3,4;7;0,1,-2;none;12\n"
+                            "d:\\img\\b.tif;1,2,3,4;7;0,1,-2;none;12\n"
                             "c.tif\n"
                             ";;;;;\n"));
     ExpectLine(*p, "", {}, 0, {}, "", 0);
     ASSERT_EQ(p->GetMfileLines(), 4u);
     p->ParseLine(1);
-    ExpectLine(*p, "d:\\img\\b.pix", {1, 2, 3, 4}, 7, {0, 1, -2}, "none", 12);
+    ExpectLine(*p, "d:\\img\\b.tif", {1, 2, 3, 4}, 7, {0, 1, -2}, "none", 12);
     p->ParseLine(0);
     ExpectLine(*p, "a.tif", {3}, 1, {10, 20}, "-9999", 0);
     p->ParseLine(2);

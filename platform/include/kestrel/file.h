@@ -98,3 +98,6 @@ class KESTREL_API ScopedWriteLimit {
 }  // namespace fileio
 }  // namespace core
 }  // namespace kestrel
+
+// True when name names an existing file or directory.
+KESTREL_API bool IsFile(const std::string& name);

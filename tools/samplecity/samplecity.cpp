@@ -1,0 +1,722 @@
+#include "samplecity.h"
+
+#include <kestrel/exception.h>
+
+#include <gdal_priv.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cmath>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+#include <thread>
+
+using kestrel::DataException;
+using kestrel::FormatString;
+using kestrel::ogc::cs::CoordinateTransformation;
+using kestrel::ogc::cs::ICRS;
+
+namespace samplecity {
+
+namespace {
+
+constexpr double kPi = 3.14159265358979323846;
+using Vec3 = std::array<double, 3>;
+
+Vec3 Sub(const Vec3& a, const Vec3& b) {
+    return {a[0] - b[0], a[1] - b[1], a[2] - b[2]};
+}
+double Dot(const Vec3& a, const Vec3& b) {
+    return a[0] * b[0] + a[1] * b[1] + a[2] * b[2];
+}
+Vec3 Cross(const Vec3& a, const Vec3& b) {
+    return {a[1] * b[2] - a[2] * b[1], a[2] * b[0] - a[0] * b[2], a[0] * b[1] - a[1] * b[0]};
+}
+Vec3 Normalised(const Vec3& a) {
+    const double n = std::sqrt(Dot(a, a));
+    return {a[0] / n, a[1] / n, a[2] / n};
+}
+
+struct GdalDatasetCloser {
+    void operator()(GDALDataset* ds) const { GDALClose(ds); }
+};
+using DatasetPtr = std::unique_ptr<GDALDataset, GdalDatasetCloser>;
+
+DatasetPtr OpenRaster(const std::string& path) {
+    GDALAllRegister();
+    DatasetPtr ds(GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
+    if (!ds)
+        KESTREL_THROW(DataException, FormatString("%s: cannot open the raster: %s", path.c_str(),
+                                                  CPLGetLastErrorMsg()));
+    return ds;
+}
+
+void CheckWrite(CPLErr err, const std::string& path) {
+    if (err != CE_None)
+        KESTREL_THROW(DataException,
+                      FormatString("%s: write failed: %s", path.c_str(), CPLGetLastErrorMsg()));
+}
+
+// The 20 terms in RPC00B order: 1 L P H LP LH PH L2 P2 H2 PLH L3 LP2 LH2 L2P P3 PH2 L2H P2H H3.
+std::array<double, 20> Terms(double L, double P, double H) {
+    return {1.0,       L,         P,         H,         L * P,     L * H,     P * H,
+            L * L,     P * P,     H * H,     P * L * H, L * L * L, L * P * P, L * H * H,
+            L * L * P, P * P * P, P * H * H, L * L * H, P * P * H, H * H * H};
+}
+
+double Poly(const std::array<double, 20>& c, const std::array<double, 20>& t) {
+    double s = 0;
+    for (int k = 0; k < 20; ++k)
+        s += c[k] * t[k];
+    return s;
+}
+
+// Solves the symmetric system a x = b (n unknowns, a row-major) by Gaussian elimination with
+// partial pivoting.
+std::vector<double> Solve(std::vector<double> a, std::vector<double> b) {
+    const size_t n = b.size();
+    for (size_t c = 0; c < n; ++c) {
+        size_t pivot = c;
+        for (size_t r = c + 1; r < n; ++r)
+            if (std::fabs(a[r * n + c]) > std::fabs(a[pivot * n + c]))
+                pivot = r;
+        if (a[pivot * n + c] == 0.0)
+            KESTREL_THROW(DataException, "RPC fit: singular normal equations");
+        if (pivot != c) {
+            for (size_t k = 0; k < n; ++k)
+                std::swap(a[c * n + k], a[pivot * n + k]);
+            std::swap(b[c], b[pivot]);
+        }
+        for (size_t r = c + 1; r < n; ++r) {
+            const double f = a[r * n + c] / a[c * n + c];
+            for (size_t k = c; k < n; ++k)
+                a[r * n + k] -= f * a[c * n + k];
+            b[r] -= f * b[c];
+        }
+    }
+    std::vector<double> x(n);
+    for (size_t i = n; i-- > 0;) {
+        double s = b[i];
+        for (size_t k = i + 1; k < n; ++k)
+            s -= a[i * n + k] * x[k];
+        x[i] = s / a[i * n + i];
+    }
+    return x;
+}
+
+// Fits value = Num(t) / Den(t), Num of 20 terms, Den = 1 + d1 L + d2 P + d3 H: a frame camera
+// is a ratio of linear functions in a local Cartesian frame, and the cubic numerator absorbs the
+// curvature of longitude and latitude. Reweighted so that the fitted error is the image error.
+void FitRatio(const std::vector<std::array<double, 20>>& terms, const std::vector<double>& values,
+              std::array<double, 20>& num, std::array<double, 20>& den) {
+    constexpr size_t n = 23;
+    std::vector<double> weights(values.size(), 1.0);
+    for (int pass = 0; pass < 3; ++pass) {
+        std::vector<double> ata(n * n, 0.0), atb(n, 0.0);
+        std::array<double, n> row;
+        for (size_t i = 0; i < values.size(); ++i) {
+            const auto& t = terms[i];
+            for (size_t k = 0; k < 20; ++k)
+                row[k] = t[k];
+            for (size_t k = 0; k < 3; ++k)
+                row[20 + k] = -values[i] * t[1 + k];
+            const double w = weights[i];
+            for (size_t r = 0; r < n; ++r) {
+                atb[r] += w * row[r] * values[i];
+                for (size_t c = 0; c < n; ++c)
+                    ata[r * n + c] += w * row[r] * row[c];
+            }
+        }
+        for (size_t k = 0; k < n; ++k)
+            ata[k * n + k] += 1e-12;
+        const std::vector<double> x = Solve(ata, atb);
+        num.fill(0.0);
+        den.fill(0.0);
+        std::copy(x.begin(), x.begin() + 20, num.begin());
+        den[0] = 1.0;
+        den[1] = x[20], den[2] = x[21], den[3] = x[22];
+        for (size_t i = 0; i < values.size(); ++i) {
+            const double d = Poly(den, terms[i]);
+            weights[i] = 1.0 / (d * d);
+        }
+    }
+}
+
+double Hash01(std::uint64_t v) {
+    v ^= v >> 33;
+    v *= 0xff51afd7ed558ccdULL;
+    v ^= v >> 33;
+    v *= 0xc4ceb9fe1a85ec53ULL;
+    v ^= v >> 33;
+    return static_cast<double>(v >> 11) / static_cast<double>(1ULL << 53);
+}
+
+std::uint8_t ToByte(double v) {
+    return static_cast<std::uint8_t>(std::lround(std::min(255.0, std::max(0.0, v))));
+}
+
+}  // namespace
+
+// ---------------------------------------------------------------------------------------------
+// Scenes
+
+CityOptions SmallCity() {
+    CityOptions o;
+    o.slopeX = 0.01;
+    o.slopeY = -0.005;
+    // Blocks along two streets, heights from 6 to 30 m; edges on whole DSM cells.
+    o.buildings = {
+        {30, 30, 60, 70, 12},     {75, 30, 95, 55, 6},      {110, 25, 150, 45, 18},
+        {165, 30, 200, 80, 9},    {30, 100, 55, 125, 24},   {75, 95, 125, 140, 15},
+        {140, 100, 160, 120, 30}, {175, 105, 210, 150, 8},  {30, 160, 70, 200, 10},
+        {90, 165, 110, 185, 21},  {130, 160, 190, 180, 14}, {150, 190, 170, 215, 27},
+    };
+    const char* names[] = {"north", "east", "south", "west"};
+    for (int i = 0; i < 4; ++i)
+        o.cameras.push_back({names[i], 90.0 * i + 10.0, 25.0 + 3.0 * i, 400.0, 512, 512, 0.5});
+    return o;
+}
+
+CityOptions BoxScene(double boxHeight, const std::vector<double>& azimuths, double offNadirDegrees,
+                     unsigned int imageSize) {
+    CityOptions o;
+    o.sizeX = o.sizeY = 160.0;
+    o.buildings = {{60, 60, 100, 90, boxHeight}};
+    for (double az : azimuths) {
+        char name[32];
+        std::snprintf(name, sizeof name, "view%03d", static_cast<int>(std::lround(az)) % 360);
+        o.cameras.push_back({name, az, offNadirDegrees, 300.0, imageSize, imageSize, 0.5});
+    }
+    return o;
+}
+
+// ---------------------------------------------------------------------------------------------
+// Surface
+
+Dsm::Dsm(const CityOptions& options) : options_(options) {
+    if (!(options.dsmPixel > 0) || !(options.sizeX > 0) || !(options.sizeY > 0))
+        KESTREL_THROW(DataException, "Sample city: sizes and DSM pixel must be positive");
+    width_ = static_cast<unsigned int>(std::lround(options.sizeX / options.dsmPixel));
+    height_ = static_cast<unsigned int>(std::lround(options.sizeY / options.dsmPixel));
+    posts_.resize(static_cast<size_t>(width_) * height_);
+    minHeight_ = 1e300, maxHeight_ = -1e300;
+    for (unsigned int j = 0; j < height_; ++j) {
+        for (unsigned int i = 0; i < width_; ++i) {
+            const double lx = (i + 0.5) * options.dsmPixel;
+            const double ly = options.sizeY - (j + 0.5) * options.dsmPixel;
+            double h = options.groundHeight + options.slopeX * lx + options.slopeY * ly;
+            for (const Building& b : options.buildings)
+                if (lx > b.x0 && lx < b.x1 && ly > b.y0 && ly < b.y1)
+                    h = std::max(h, Ground(options.west + (b.x0 + b.x1) / 2,
+                                           options.south + (b.y0 + b.y1) / 2) +
+                                        b.height);
+            posts_[static_cast<size_t>(j) * width_ + i] = static_cast<float>(h);
+            minHeight_ = std::min(minHeight_, h);
+            maxHeight_ = std::max(maxHeight_, h);
+        }
+    }
+}
+
+double Dsm::Ground(double x, double y) const {
+    return options_.groundHeight + options_.slopeX * (x - options_.west) +
+           options_.slopeY * (y - options_.south);
+}
+
+std::array<double, 6> Dsm::GeoTransform() const {
+    return {options_.west, options_.dsmPixel, 0.0, options_.south + options_.sizeY,
+            0.0,           -options_.dsmPixel};
+}
+
+double Dsm::HeightAt(double x, double y) const {
+    double fx = (x - options_.west) / options_.dsmPixel - 0.5;
+    double fy = (options_.south + options_.sizeY - y) / options_.dsmPixel - 0.5;
+    fx = std::min(std::max(fx, 0.0), width_ - 1.0);
+    fy = std::min(std::max(fy, 0.0), height_ - 1.0);
+    const unsigned int i = std::min(static_cast<unsigned int>(fx), width_ - 2);
+    const unsigned int j = std::min(static_cast<unsigned int>(fy), height_ - 2);
+    const double ax = fx - i, ay = fy - j;
+    const float* p = &posts_[static_cast<size_t>(j) * width_ + i];
+    return (1 - ay) * ((1 - ax) * p[0] + ax * p[1]) +
+           ay * ((1 - ax) * p[width_] + ax * p[width_ + 1]);
+}
+
+int Dsm::BuildingAt(double x, double y) const {
+    const double lx = x - options_.west, ly = y - options_.south;
+    for (size_t k = 0; k < options_.buildings.size(); ++k) {
+        const Building& b = options_.buildings[k];
+        if (lx >= b.x0 && lx <= b.x1 && ly >= b.y0 && ly <= b.y1)
+            return static_cast<int>(k) + 1;
+    }
+    return 0;
+}
+
+bool Dsm::Intersect(const Vec3& origin, const Vec3& dir, Vec3& hit) const {
+    if (dir[2] >= 0)
+        return false;
+    // Start where the ray comes down to the highest surface point.
+    double t = std::max(0.0, (maxHeight_ + 0.01 - origin[2]) / dir[2]);
+    const double step = 0.5 * options_.dsmPixel;
+    const double east = options_.west + options_.sizeX, north = options_.south + options_.sizeY;
+    auto above = [&](double tt) {
+        const double x = origin[0] + tt * dir[0], y = origin[1] + tt * dir[1];
+        return origin[2] + tt * dir[2] - HeightAt(x, y);
+    };
+    double previous = t;
+    for (;;) {
+        const double x = origin[0] + t * dir[0], y = origin[1] + t * dir[1];
+        if (x < options_.west || x > east || y < options_.south || y > north)
+            return false;
+        if (above(t) <= 0)
+            break;
+        if (origin[2] + t * dir[2] < minHeight_ - 1)
+            return false;
+        previous = t;
+        t += step;
+    }
+    double lo = previous, hi = t;
+    for (int k = 0; k < 30; ++k) {
+        const double mid = 0.5 * (lo + hi);
+        (above(mid) > 0 ? lo : hi) = mid;
+    }
+    const double tt = 0.5 * (lo + hi);
+    hit = {origin[0] + tt * dir[0], origin[1] + tt * dir[1], origin[2] + tt * dir[2]};
+    return true;
+}
+
+void WriteDsm(const Dsm& dsm, const std::string& path) {
+    GDALAllRegister();
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
+    const char* options[] = {"TILED=YES", "COMPRESS=DEFLATE", "PREDICTOR=3", nullptr};
+    DatasetPtr ds(driver->Create(path.c_str(), static_cast<int>(dsm.Width()),
+                                 static_cast<int>(dsm.Height()), 1, GDT_Float32,
+                                 const_cast<char**>(options)));
+    if (!ds)
+        KESTREL_THROW(DataException, FormatString("%s: cannot create the DSM: %s", path.c_str(),
+                                                  CPLGetLastErrorMsg()));
+    std::array<double, 6> gt = dsm.GeoTransform();
+    ds->SetGeoTransform(gt.data());
+    const ICRS crs(dsm.Options().crs);
+    ds->SetSpatialRef(&crs.GetSpatialReference());
+    GDALRasterBand* band = ds->GetRasterBand(1);
+    band->SetNoDataValue(-32768.0);
+    CheckWrite(band->RasterIO(GF_Write, 0, 0, static_cast<int>(dsm.Width()),
+                              static_cast<int>(dsm.Height()),
+                              const_cast<float*>(dsm.Posts().data()), static_cast<int>(dsm.Width()),
+                              static_cast<int>(dsm.Height()), GDT_Float32, 0, 0, nullptr),
+               path);
+    ds.reset();
+}
+
+// ---------------------------------------------------------------------------------------------
+// Camera
+
+FrameCamera::FrameCamera(const CameraSpec& spec, const Dsm& dsm) : spec_(spec) {
+    const CityOptions& o = dsm.Options();
+    const double cx = o.west + o.sizeX / 2, cy = o.south + o.sizeY / 2;
+    const Vec3 target = {cx, cy, dsm.Ground(cx, cy)};
+    const double az = spec.azimuthDegrees * kPi / 180, tilt = spec.offNadirDegrees * kPi / 180;
+    const double horizontal = spec.altitude * std::tan(tilt);
+    centre_ = {target[0] + horizontal * std::sin(az), target[1] + horizontal * std::cos(az),
+               target[2] + spec.altitude};
+    forward_ = Normalised(Sub(target, centre_));
+    right_ = Normalised(Cross(forward_, {0.0, 0.0, 1.0}));
+    down_ = Cross(forward_, right_);
+    focal_ = spec.altitude / std::cos(tilt) / spec.groundSampleDistance;
+}
+
+bool FrameCamera::Project(double x, double y, double z, double& col, double& row) const {
+    const Vec3 v = Sub({x, y, z}, centre_);
+    const double depth = Dot(v, forward_);
+    if (depth <= 0)
+        return false;
+    col = spec_.width / 2.0 + focal_ * Dot(v, right_) / depth;
+    row = spec_.height / 2.0 + focal_ * Dot(v, down_) / depth;
+    return true;
+}
+
+void FrameCamera::Ray(double col, double row, Vec3& origin, Vec3& dir) const {
+    const double u = (col - spec_.width / 2.0) / focal_, v = (row - spec_.height / 2.0) / focal_;
+    origin = centre_;
+    dir = Normalised({forward_[0] + u * right_[0] + v * down_[0],
+                      forward_[1] + u * right_[1] + v * down_[1],
+                      forward_[2] + u * right_[2] + v * down_[2]});
+}
+
+// ---------------------------------------------------------------------------------------------
+// RPC
+
+void Rpc::Evaluate(double lon, double lat, double h, double& samp, double& line) const {
+    const auto t =
+        Terms((lon - lonOff) / lonScale, (lat - latOff) / latScale, (h - heightOff) / heightScale);
+    line = Poly(lineNum, t) / Poly(lineDen, t) * lineScale + lineOff;
+    samp = Poly(sampNum, t) / Poly(sampDen, t) * sampScale + sampOff;
+}
+
+std::vector<std::string> Rpc::ToMetadata() const {
+    auto number = [](const char* name, double v) { return FormatString("%s=%.17g", name, v); };
+    auto list = [](const char* name, const std::array<double, 20>& c) {
+        std::string s = std::string(name) + "=";
+        for (int k = 0; k < 20; ++k)
+            s += FormatString(k ? " %.17g" : "%.17g", c[k]);
+        return s;
+    };
+    return {number("LINE_OFF", lineOff),     number("SAMP_OFF", sampOff),
+            number("LAT_OFF", latOff),       number("LONG_OFF", lonOff),
+            number("HEIGHT_OFF", heightOff), number("LINE_SCALE", lineScale),
+            number("SAMP_SCALE", sampScale), number("LAT_SCALE", latScale),
+            number("LONG_SCALE", lonScale),  number("HEIGHT_SCALE", heightScale),
+            list("LINE_NUM_COEFF", lineNum), list("LINE_DEN_COEFF", lineDen),
+            list("SAMP_NUM_COEFF", sampNum), list("SAMP_DEN_COEFF", sampDen)};
+}
+
+Rpc Rpc::FromMetadata(const std::vector<std::string>& items) {
+    auto find = [&](const char* name) {
+        const std::string prefix = std::string(name) + "=";
+        for (const std::string& item : items)
+            if (item.compare(0, prefix.size(), prefix) == 0)
+                return item.substr(prefix.size());
+        KESTREL_THROW(DataException, FormatString("RPC metadata without %s", name));
+    };
+    auto number = [&](const char* name) { return std::atof(find(name).c_str()); };
+    auto list = [&](const char* name, std::array<double, 20>& c) {
+        const std::string text = find(name);
+        const char* p = text.c_str();
+        for (int k = 0; k < 20; ++k) {
+            char* end = nullptr;
+            c[k] = std::strtod(p, &end);
+            if (end == p)
+                KESTREL_THROW(DataException,
+                              FormatString("RPC metadata %s holds fewer than 20 numbers", name));
+            p = end;
+        }
+    };
+    Rpc r;
+    r.lineOff = number("LINE_OFF"), r.sampOff = number("SAMP_OFF");
+    r.latOff = number("LAT_OFF"), r.lonOff = number("LONG_OFF");
+    r.heightOff = number("HEIGHT_OFF"), r.lineScale = number("LINE_SCALE");
+    r.sampScale = number("SAMP_SCALE"), r.latScale = number("LAT_SCALE");
+    r.lonScale = number("LONG_SCALE"), r.heightScale = number("HEIGHT_SCALE");
+    list("LINE_NUM_COEFF", r.lineNum), list("LINE_DEN_COEFF", r.lineDen);
+    list("SAMP_NUM_COEFF", r.sampNum), list("SAMP_DEN_COEFF", r.sampDen);
+    return r;
+}
+
+Rpc FitRpc(const FrameCamera& camera, const ICRS& crs, double minHeight, double maxHeight,
+           double* maxResidual) {
+    const ICRS wgs84("EPSG:4326");
+    const CoordinateTransformation toGeographic(crs, wgs84);
+    const double width = camera.Spec().width, height = camera.Spec().height;
+    const double h0 = minHeight - 10, h1 = maxHeight + 10;
+
+    // Ground points of an image grid at several heights: where each ray crosses each height.
+    auto sample = [&](int nGrid, int nHeights, double shift, std::vector<double>& lon,
+                      std::vector<double>& lat, std::vector<double>& h, std::vector<double>& col,
+                      std::vector<double>& row) {
+        for (int a = 0; a < nGrid; ++a)
+            for (int b = 0; b < nGrid; ++b)
+                for (int k = 0; k < nHeights; ++k) {
+                    const double c = width * (a + shift) / (nGrid - 1 + 2 * shift);
+                    const double r = height * (b + shift) / (nGrid - 1 + 2 * shift);
+                    const double z = h0 + (h1 - h0) * (k + shift) / (nHeights - 1 + 2 * shift);
+                    Vec3 o, d;
+                    camera.Ray(c, r, o, d);
+                    const double t = (z - o[2]) / d[2];
+                    lon.push_back(o[0] + t * d[0]);
+                    lat.push_back(o[1] + t * d[1]);
+                    h.push_back(z);
+                    col.push_back(c);
+                    row.push_back(r);
+                }
+        if (!toGeographic.Transform(lon.size(), lon.data(), lat.data()))
+            KESTREL_THROW(DataException, "RPC fit: ground points outside the coordinate system");
+    };
+    std::vector<double> lon, lat, h, col, row;
+    sample(15, 7, 0.0, lon, lat, h, col, row);
+
+    Rpc r;
+    auto range = [](const std::vector<double>& v, double& off, double& scale) {
+        const auto mm = std::minmax_element(v.begin(), v.end());
+        off = 0.5 * (*mm.first + *mm.second);
+        scale = std::max(0.5 * (*mm.second - *mm.first), 1e-9);
+    };
+    range(lon, r.lonOff, r.lonScale);
+    range(lat, r.latOff, r.latScale);
+    range(h, r.heightOff, r.heightScale);
+    r.lineOff = height / 2 - 0.5, r.lineScale = height / 2;
+    r.sampOff = width / 2 - 0.5, r.sampScale = width / 2;
+
+    std::vector<std::array<double, 20>> terms;
+    std::vector<double> lines, samps;
+    for (size_t i = 0; i < lon.size(); ++i) {
+        terms.push_back(Terms((lon[i] - r.lonOff) / r.lonScale, (lat[i] - r.latOff) / r.latScale,
+                              (h[i] - r.heightOff) / r.heightScale));
+        lines.push_back((row[i] - 0.5 - r.lineOff) / r.lineScale);
+        samps.push_back((col[i] - 0.5 - r.sampOff) / r.sampScale);
+    }
+    FitRatio(terms, lines, r.lineNum, r.lineDen);
+    FitRatio(terms, samps, r.sampNum, r.sampDen);
+
+    if (maxResidual != nullptr) {
+        // Checked between the fit points.
+        std::vector<double> clon, clat, ch, ccol, crow;
+        sample(14, 6, 0.5, clon, clat, ch, ccol, crow);
+        double worst = 0;
+        for (size_t i = 0; i < clon.size(); ++i) {
+            double s, l;
+            r.Evaluate(clon[i], clat[i], ch[i], s, l);
+            worst = std::max(worst, std::hypot(s + 0.5 - ccol[i], l + 0.5 - crow[i]));
+        }
+        *maxResidual = worst;
+    }
+    return r;
+}
+
+// ---------------------------------------------------------------------------------------------
+// Texture and rendering
+
+std::array<std::uint8_t, 3> Texture(const Dsm& dsm, double x, double y, double z,
+                                    std::uint64_t seed) {
+    const double phase = Hash01(seed) * 2 * kPi;
+    const double e = 0.05 * dsm.Options().dsmPixel;
+    const double gx = (dsm.HeightAt(x + e, y) - dsm.HeightAt(x - e, y)) / (2 * e);
+    const double gy = (dsm.HeightAt(x, y + e) - dsm.HeightAt(x, y - e)) / (2 * e);
+    if (std::hypot(gx, gy) > 1.5) {  // a wall: horizontal courses
+        const double v = 95 + 25 * std::sin(z * 1.9 + phase) + 10 * std::sin((x + y) * 0.7);
+        return {ToByte(v), ToByte(v - 5), ToByte(v - 10)};
+    }
+    if (z > dsm.Ground(x, y) + 1.0) {  // a roof: its building's colour, softly patterned
+        const int id = dsm.BuildingAt(x, y);
+        const double base = 120 + 80 * Hash01(seed * 31 + static_cast<std::uint64_t>(id));
+        const double p = 12 * std::sin(x * 0.9 + phase) * std::sin(y * 0.8);
+        return {ToByte(base + p), ToByte(255 - base + p), ToByte(90 + 60 * Hash01(id + 5u) + p)};
+    }
+    // Ground: smooth fields with a darker street grid.
+    const double field = 40 * std::sin(x / 7.3 + phase) * std::cos(y / 9.1) +
+                         18 * std::sin((x + 2 * y) / 4.1) + 10 * std::cos((x - y) / 2.3);
+    const double street =
+        0.5 +
+        0.5 * std::tanh((std::fabs(std::fmod(x - dsm.Options().west, 60.0) - 30.0) - 26.0) / 1.2);
+    const double v = 125 + field - 55 * street;
+    return {ToByte(v * 0.85), ToByte(v + 8), ToByte(v * 0.7 + 20)};
+}
+
+namespace {
+
+void RenderImage(const FrameCamera& camera, const Dsm& dsm, const Rpc& rpc, const std::string& path,
+                 std::uint64_t seed, unsigned int threads) {
+    const unsigned int w = camera.Spec().width, h = camera.Spec().height;
+    std::vector<std::uint8_t> pixels(static_cast<size_t>(w) * h * 3, 0);
+    std::atomic<unsigned int> nextRow{0};
+    auto work = [&] {
+        for (unsigned int r; (r = nextRow++) < h;) {
+            for (unsigned int c = 0; c < w; ++c) {
+                Vec3 o, d, hit;
+                camera.Ray(c + 0.5, r + 0.5, o, d);
+                if (!dsm.Intersect(o, d, hit))
+                    continue;  // off the surface model: background 0
+                const auto rgb = Texture(dsm, hit[0], hit[1], hit[2], seed);
+                std::uint8_t* p = &pixels[(static_cast<size_t>(r) * w + c) * 3];
+                // 0 is kept for the background.
+                p[0] = std::max<std::uint8_t>(rgb[0], 1);
+                p[1] = std::max<std::uint8_t>(rgb[1], 1);
+                p[2] = std::max<std::uint8_t>(rgb[2], 1);
+            }
+        }
+    };
+    if (threads == 0)
+        threads = std::max(1u, std::thread::hardware_concurrency());
+    std::vector<std::thread> pool;
+    for (unsigned int t = 1; t < threads; ++t)
+        pool.emplace_back(work);
+    work();
+    for (auto& t : pool)
+        t.join();
+
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
+    const char* options[] = {"TILED=YES", "INTERLEAVE=PIXEL", "PHOTOMETRIC=RGB", nullptr};
+    DatasetPtr ds(driver->Create(path.c_str(), static_cast<int>(w), static_cast<int>(h), 3,
+                                 GDT_Byte, const_cast<char**>(options)));
+    if (!ds)
+        KESTREL_THROW(DataException, FormatString("%s: cannot create the image: %s", path.c_str(),
+                                                  CPLGetLastErrorMsg()));
+    std::vector<std::string> items = rpc.ToMetadata();
+    std::vector<char*> list;
+    for (auto& s : items)
+        list.push_back(&s[0]);
+    list.push_back(nullptr);
+    ds->SetMetadata(list.data(), "RPC");
+    for (int b = 1; b <= 3; ++b)
+        ds->GetRasterBand(b)->SetNoDataValue(0);
+    int bands[] = {1, 2, 3};
+    CheckWrite(ds->RasterIO(GF_Write, 0, 0, static_cast<int>(w), static_cast<int>(h), pixels.data(),
+                            static_cast<int>(w), static_cast<int>(h), GDT_Byte, 3, bands, 3,
+                            3 * static_cast<GSpacing>(w), 1, nullptr),
+               path);
+    ds.reset();
+}
+
+}  // namespace
+
+Sample MakeSample(const std::string& directory, const CityOptions& options, unsigned int threads) {
+    GDALAllRegister();
+    const Dsm dsm(options);
+    Sample sample;
+    sample.dsmPath = directory + "/dsm.tif";
+    WriteDsm(dsm, sample.dsmPath);
+    const ICRS crs(options.crs);
+    for (size_t i = 0; i < options.cameras.size(); ++i) {
+        SampleImage image;
+        image.camera = std::make_unique<FrameCamera>(options.cameras[i], dsm);
+        const Rpc rpc =
+            FitRpc(*image.camera, crs, dsm.MinHeight(), dsm.MaxHeight(), &image.rpcMaxResidual);
+        image.path = directory + "/" + options.cameras[i].name + ".tif";
+        RenderImage(*image.camera, dsm, rpc, image.path, options.seed, threads);
+        sample.images.push_back(std::move(image));
+    }
+    // The master parameter file: fili; dbic; mmseg; dbiw; srcBgd; edgeClip; radioDif; dbmPxErr;
+    // role. The radiometric levels differ so that the fill order shows.
+    sample.masterPath = directory + "/master.txt";
+    std::ofstream master(sample.masterPath, std::ios::binary);
+    master << "!MFILE sample city: fili;dbic;mmseg;dbiw;srcBgd;edgeClip;radioDif;dbmPxErr;role\n";
+    const char* levels[] = {"LOW", "LOW", "MODERATE", "HIGH"};
+    for (size_t i = 0; i < sample.images.size(); ++i)
+        master << sample.images[i].path << ";1,2,3;0;;0;0;" << levels[i % 4] << ";1;ORTHO\n";
+    if (!master.flush())
+        KESTREL_THROW(DataException,
+                      FormatString("%s: cannot write the master file", sample.masterPath.c_str()));
+    return sample;
+}
+
+// ---------------------------------------------------------------------------------------------
+// Surface and model for tests
+
+GridSurface::GridSurface(const std::string& path) {
+    DatasetPtr ds = OpenRaster(path);
+    std::array<double, 6> gt;
+    if (ds->GetGeoTransform(gt.data()) != CE_None)
+        KESTREL_THROW(DataException, FormatString("%s: no geotransform", path.c_str()));
+    geocoding_ = kestrel::ogc::cs::GeocodingInfo(gt);
+    if (const OGRSpatialReference* srs = ds->GetSpatialRef())
+        crs_ = std::make_unique<ICRS>(*srs);
+    width_ = static_cast<unsigned int>(ds->GetRasterXSize());
+    height_ = static_cast<unsigned int>(ds->GetRasterYSize());
+    posts_.resize(static_cast<size_t>(width_) * height_);
+    GDALRasterBand* band = ds->GetRasterBand(1);
+    if (band->RasterIO(GF_Read, 0, 0, static_cast<int>(width_), static_cast<int>(height_),
+                       posts_.data(), static_cast<int>(width_), static_cast<int>(height_),
+                       GDT_Float32, 0, 0, nullptr) != CE_None)
+        KESTREL_THROW(DataException, FormatString("%s: cannot read the heights", path.c_str()));
+    int hasNoData = 0;
+    const double noData = band->GetNoDataValue(&hasNoData);
+    if (hasNoData)
+        for (float& v : posts_)
+            if (v == static_cast<float>(noData))
+                v = NAN;
+}
+
+GridSurface::~GridSurface() = default;
+
+void GridSurface::GetExtent(double& minX, double& minY, double& maxX, double& maxY) const {
+    double x0, y0, x1, y1;
+    geocoding_.PixelToGround(0, 0, x0, y0);
+    geocoding_.PixelToGround(width_, height_, x1, y1);
+    minX = std::min(x0, x1), maxX = std::max(x0, x1);
+    minY = std::min(y0, y1), maxY = std::max(y0, y1);
+}
+
+void GridSurface::SetInputCRS(const ICRS* crs) {
+    input_.reset();
+    if (crs != nullptr && crs_ && !crs->IsSame(*crs_))
+        input_ = std::make_unique<CoordinateTransformation>(*crs, *crs_);
+}
+
+void GridSurface::GetHeights(std::size_t n, const double* x, const double* y,
+                             double* heights) const {
+    std::vector<double> tx, ty;
+    if (input_) {
+        tx.assign(x, x + n), ty.assign(y, y + n);
+        CoordinateTransformation(*input_).Transform(n, tx.data(), ty.data());
+        x = tx.data(), y = ty.data();
+    }
+    for (std::size_t k = 0; k < n; ++k) {
+        double px, py;
+        geocoding_.GroundToPixel(x[k], y[k], px, py);
+        if (!(px >= 0 && py >= 0 && px <= width_ && py <= height_)) {
+            heights[k] = NAN;
+            continue;
+        }
+        const double fx = std::min(std::max(px - 0.5, 0.0), width_ - 1.0);
+        const double fy = std::min(std::max(py - 0.5, 0.0), height_ - 1.0);
+        const unsigned int i = std::min(static_cast<unsigned int>(fx), width_ > 1 ? width_ - 2 : 0);
+        const unsigned int j =
+            std::min(static_cast<unsigned int>(fy), height_ > 1 ? height_ - 2 : 0);
+        const double ax = fx - i, ay = fy - j;
+        double sum = 0, weight = 0;
+        const double w[4] = {(1 - ax) * (1 - ay), ax * (1 - ay), (1 - ax) * ay, ax * ay};
+        const unsigned int di[4] = {0, 1, 0, 1}, dj[4] = {0, 0, 1, 1};
+        for (int q = 0; q < 4; ++q) {
+            const unsigned int ii = std::min(i + di[q], width_ - 1);
+            const unsigned int jj = std::min(j + dj[q], height_ - 1);
+            const float v = posts_[static_cast<size_t>(jj) * width_ + ii];
+            if (w[q] > 0 && !std::isnan(v))
+                sum += w[q] * v, weight += w[q];
+        }
+        heights[k] = weight > 0 ? sum / weight : NAN;
+    }
+}
+
+RpcModel::RpcModel(const std::string& imagePath) {
+    DatasetPtr ds = OpenRaster(imagePath);
+    std::vector<std::string> items;
+    if (char** md = ds->GetMetadata("RPC"))
+        for (char** p = md; *p != nullptr; ++p)
+            items.emplace_back(*p);
+    if (items.empty())
+        KESTREL_THROW(DataException, FormatString("%s: no RPC metadata", imagePath.c_str()));
+    rpc_ = Rpc::FromMetadata(items);
+    width_ = static_cast<unsigned int>(ds->GetRasterXSize());
+    height_ = static_cast<unsigned int>(ds->GetRasterYSize());
+    crs_ = std::make_unique<ICRS>("EPSG:4979");
+}
+
+RpcModel::~RpcModel() = default;
+
+void RpcModel::GroundToImage(std::size_t n, const double* x, const double* y, const double* z,
+                             double* pixel, double* line, bool* ok) const {
+    for (std::size_t k = 0; k < n; ++k) {
+        double s, l;
+        rpc_.Evaluate(x[k], y[k], z[k], s, l);
+        pixel[k] = s + 0.5, line[k] = l + 0.5;
+        ok[k] = std::isfinite(s) && std::isfinite(l);
+    }
+}
+
+void RpcModel::ImageToGround(std::size_t n, const double* pixel, const double* line,
+                             const double* z, double* x, double* y, bool* ok) const {
+    for (std::size_t k = 0; k < n; ++k) {
+        double lon = rpc_.lonOff, lat = rpc_.latOff;
+        ok[k] = false;
+        for (int it = 0; it < 30; ++it) {
+            double s, l, s1, l1, s2, l2;
+            rpc_.Evaluate(lon, lat, z[k], s, l);
+            const double dl = 1e-3 * rpc_.lonScale, dp = 1e-3 * rpc_.latScale;
+            rpc_.Evaluate(lon + dl, lat, z[k], s1, l1);
+            rpc_.Evaluate(lon, lat + dp, z[k], s2, l2);
+            const double a = (s1 - s) / dl, b = (s2 - s) / dp, c = (l1 - l) / dl, d = (l2 - l) / dp;
+            const double det = a * d - b * c;
+            if (det == 0 || !std::isfinite(det))
+                break;
+            const double es = pixel[k] - 0.5 - s, el = line[k] - 0.5 - l;
+            lon += (d * es - b * el) / det;
+            lat += (-c * es + a * el) / det;
+            if (std::hypot(es, el) < 1e-6) {
+                ok[k] = true;
+                break;
+            }
+        }
+        x[k] = lon, y[k] = lat;
+    }
+}
+
+}  // namespace samplecity

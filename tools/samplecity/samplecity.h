@@ -1,0 +1,194 @@
+// A synthetic city for examples, tests and benchmarks: a surface model (DSM) with box buildings,
+// oblique frame-camera images rendered by casting rays through it onto a procedural texture,
+// RPC coefficients fitted to each camera, and the master parameter file that names the images.
+//
+// Heights are ellipsoidal (WGS 84) in a UTM coordinate system without a vertical part, which is
+// how both GDAL's RPC transformer and the platform read such a DSM: RPC heights are ellipsoidal
+// too, so no geoid enters anywhere.
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include <kestrel/crs.h>
+#include <kestrel/elevation.h>
+#include <kestrel/mathmodel.h>
+
+namespace samplecity {
+
+// A building: a flat roof at `height` metres above the ground over [x0, x1] x [y0, y1] (metres
+// from the west and south edges of the scene).
+struct Building {
+    double x0, y0, x1, y1;
+    double height;
+};
+
+// A frame camera that looks at the scene centre from a side.
+struct CameraSpec {
+    std::string name;        // the image is <name>.tif
+    double azimuthDegrees;   // direction from the scene centre to the camera, from north
+    double offNadirDegrees;  // angle between the viewing direction and the vertical
+    double altitude;         // metres above the scene's ground at its centre
+    unsigned int width, height;
+    double groundSampleDistance;  // metres per pixel at the scene centre
+};
+
+struct CityOptions {
+    std::string crs = "EPSG:32632";
+    double west = 514800.0, south = 5033800.0;  // lower-left corner of the DSM
+    double sizeX = 240.0, sizeY = 240.0;        // metres
+    double dsmPixel = 0.5;                      // metres
+    double groundHeight = 250.0;                // ellipsoidal height at the south-west corner
+    double slopeX = 0.0, slopeY = 0.0;          // gentle terrain: metres of rise per metre
+    std::vector<Building> buildings;
+    std::vector<CameraSpec> cameras;
+    std::uint64_t seed = 7;  // varies the texture
+};
+
+// The default sample: a block of buildings of 6 to 30 m on gently sloping ground, four images
+// seen from north, east, south and west.
+CityOptions SmallCity();
+// One box building on flat ground, seen from the given sides (azimuths in degrees).
+CityOptions BoxScene(double boxHeight, const std::vector<double>& azimuths,
+                     double offNadirDegrees = 30.0, unsigned int imageSize = 384);
+
+// The surface model as a grid, bilinear between posts at cell centres.
+class Dsm {
+  public:
+    explicit Dsm(const CityOptions& options);
+    // Ellipsoidal height at a ground point; the nearest edge value outside.
+    double HeightAt(double x, double y) const;
+    double Ground(double x, double y) const;  // the terrain without buildings
+    double MaxHeight() const { return maxHeight_; }
+    double MinHeight() const { return minHeight_; }
+    // First intersection of the ray origin + t dir (t > 0) with the surface; false when it leaves
+    // the DSM first.
+    bool Intersect(const std::array<double, 3>& origin, const std::array<double, 3>& dir,
+                   std::array<double, 3>& hit) const;
+    // Index + 1 of the building whose footprint holds the point, 0 for none.
+    int BuildingAt(double x, double y) const;
+
+    unsigned int Width() const { return width_; }
+    unsigned int Height() const { return height_; }
+    std::array<double, 6> GeoTransform() const;
+    const std::vector<float>& Posts() const { return posts_; }
+    const CityOptions& Options() const { return options_; }
+
+  private:
+    CityOptions options_;
+    unsigned int width_, height_;
+    std::vector<float> posts_;
+    double minHeight_, maxHeight_;
+};
+
+// A pin-hole camera in the scene's projected coordinates. Image coordinates are continuous with
+// (0, 0) at the top-left corner of the first pixel, as GDAL counts them.
+class FrameCamera {
+  public:
+    FrameCamera(const CameraSpec& spec, const Dsm& dsm);
+    bool Project(double x, double y, double z, double& col, double& row) const;
+    // The viewing ray through an image position: from the camera centre, unit direction.
+    void Ray(double col, double row, std::array<double, 3>& origin,
+             std::array<double, 3>& dir) const;
+    const std::array<double, 3>& Centre() const { return centre_; }
+    const CameraSpec& Spec() const { return spec_; }
+
+  private:
+    CameraSpec spec_;
+    std::array<double, 3> centre_, right_, down_, forward_;
+    double focal_;
+};
+
+// Rational polynomial coefficients in the RPC00B layout (offsets, scales, four times 20 terms).
+// Line and sample address pixel centres: RPC value v is GDAL image coordinate v + 0.5.
+struct Rpc {
+    double lineOff = 0, sampOff = 0, latOff = 0, lonOff = 0, heightOff = 0;
+    double lineScale = 1, sampScale = 1, latScale = 1, lonScale = 1, heightScale = 1;
+    std::array<double, 20> lineNum{}, lineDen{}, sampNum{}, sampDen{};
+
+    // Ground (longitude, latitude, ellipsoidal height) to RPC sample and line.
+    void Evaluate(double lon, double lat, double h, double& samp, double& line) const;
+    // The items of GDAL's "RPC" metadata domain, as NAME=VALUE texts.
+    std::vector<std::string> ToMetadata() const;
+    // From GDAL's "RPC" metadata items; throws DataException naming the first missing item.
+    static Rpc FromMetadata(const std::vector<std::string>& items);
+};
+
+// Fits RPCs to the camera over its image and the height range [minHeight, maxHeight];
+// maxResidual receives the largest fit error in pixels at the fit points.
+Rpc FitRpc(const FrameCamera& camera, const kestrel::ogc::cs::ICRS& crs, double minHeight,
+           double maxHeight, double* maxResidual = nullptr);
+
+// Colour of the surface at a point: ground, roof or wall (three byte channels).
+std::array<std::uint8_t, 3> Texture(const Dsm& dsm, double x, double y, double z,
+                                    std::uint64_t seed);
+
+struct SampleImage {
+    std::string path;       // the GeoTIFF with its RPCs
+    double rpcMaxResidual;  // pixels
+    std::unique_ptr<FrameCamera> camera;
+};
+
+struct Sample {
+    std::string dsmPath;
+    std::string masterPath;
+    std::vector<SampleImage> images;
+};
+
+// Writes the DSM (dsm.tif), the images (<camera name>.tif) and master.txt into an existing
+// directory. threads: rendering threads (0: the hardware's count).
+Sample MakeSample(const std::string& directory, const CityOptions& options,
+                  unsigned int threads = 0);
+
+// Writes the DSM alone as a Float32 GeoTIFF.
+void WriteDsm(const Dsm& dsm, const std::string& path);
+
+// A raster surface model read whole into memory, bilinear between post centres; no height
+// outside. For tests and examples until the platform's own DEMs are used.
+class GridSurface : public kestrel::dem::IElevationSource {
+  public:
+    explicit GridSurface(const std::string& path);
+    ~GridSurface() override;
+    void SetOutputVerticalDatum(kestrel::ogc::cs::DatumType datum) override { datum_ = datum; }
+    kestrel::ogc::cs::DatumType GetOutputVerticalDatum() const override { return datum_; }
+    const kestrel::ogc::cs::ICRS* GetCRS() const override { return crs_.get(); }
+    void GetExtent(double& minX, double& minY, double& maxX, double& maxY) const override;
+    void SetInputCRS(const kestrel::ogc::cs::ICRS* crs) override;
+    void GetHeights(std::size_t n, const double* x, const double* y,
+                    double* heights) const override;
+
+  private:
+    std::unique_ptr<kestrel::ogc::cs::ICRS> crs_;
+    std::unique_ptr<kestrel::ogc::cs::CoordinateTransformation> input_;
+    kestrel::ogc::cs::GeocodingInfo geocoding_;
+    unsigned int width_ = 0, height_ = 0;
+    std::vector<float> posts_;
+    kestrel::ogc::cs::DatumType datum_ = kestrel::ogc::cs::DatumEllipsoid;
+};
+
+// The RPC model of an image file: ground is geographic WGS 84 (longitude, latitude) with
+// ellipsoidal heights. For tests and examples until the platform's own models are used.
+class RpcModel : public kestrel::mathmodel::IMathModel {
+  public:
+    explicit RpcModel(const std::string& imagePath);
+    ~RpcModel() override;
+    const kestrel::ogc::cs::ICRS* GetCRS() const override { return crs_.get(); }
+    unsigned int GetImageWidth() const override { return width_; }
+    unsigned int GetImageHeight() const override { return height_; }
+    void GroundToImage(std::size_t n, const double* x, const double* y, const double* z,
+                       double* pixel, double* line, bool* ok) const override;
+    // Newton iteration on the inverse at the given heights.
+    void ImageToGround(std::size_t n, const double* pixel, const double* line, const double* z,
+                       double* x, double* y, bool* ok) const override;
+    const Rpc& Coefficients() const { return rpc_; }
+
+  private:
+    Rpc rpc_;
+    unsigned int width_ = 0, height_ = 0;
+    std::unique_ptr<kestrel::ogc::cs::ICRS> crs_;
+};
+
+}  // namespace samplecity
