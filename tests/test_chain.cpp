@@ -61,30 +61,25 @@ TEST(FileChain, PreparationFileReadsBackTypedWithDefaultsForEmptyColumns) {
     std::unique_ptr<TPMFileParser> prep(
         ParserFactory::CreateTPMFileParser(chain.prep, dbic, 11, dbiw, "-32768", 4));
     ASSERT_EQ(prep->GetMfileLines(), 3u);
-
-    prep->ParseLine(0);
-    EXPECT_EQ(prep->GetFili(), "/data/a.tif");
-    EXPECT_EQ(prep->GetDbic(), (std::vector<unsigned int>{1, 2, 3}));
-    EXPECT_EQ(prep->GetMmseg(), 7);
-    EXPECT_EQ(prep->GetDbiw(), (std::vector<int>{0, 16}));
-    EXPECT_EQ(prep->GetSrcBgd(), "0");
-    EXPECT_EQ(prep->GetEdgeClip(), 5);
-
-    prep->ParseLine(1);
-    EXPECT_EQ(prep->GetFili(), "D:\\data\\b.tif");
-    EXPECT_EQ(prep->GetDbic(), (std::vector<unsigned int>{4}));
-    EXPECT_EQ(prep->GetMmseg(), 3);
-    EXPECT_EQ(prep->GetDbiw(), (std::vector<int>{-1, 8}));
-    EXPECT_EQ(prep->GetSrcBgd(), "255");
-    EXPECT_EQ(prep->GetEdgeClip(), 4);
-
-    prep->ParseLine(2);
-    EXPECT_EQ(prep->GetFili(), "c.tif");
-    EXPECT_EQ(prep->GetDbic(), (std::vector<unsigned int>{9}));
-    EXPECT_EQ(prep->GetMmseg(), 11);
-    EXPECT_EQ(prep->GetDbiw(), (std::vector<int>{1}));
-    EXPECT_EQ(prep->GetSrcBgd(), "-32768");
-    EXPECT_EQ(prep->GetEdgeClip(), 1);
+    const struct {
+        const char* fili;
+        std::vector<unsigned int> dbic;
+        int mmseg;
+        std::vector<int> dbiw;
+        const char* srcBgd;
+        int edgeClip;
+    } lines[] = {{"/data/a.tif", {1, 2, 3}, 7, {0, 16}, "0", 5},
+                 {"D:\\data\\b.tif", {4}, 3, {-1, 8}, "255", 4},
+                 {"c.tif", {9}, 11, {1}, "-32768", 1}};
+    for (int i = 0; i < 3; ++i) {
+        prep->ParseLine(i);
+        EXPECT_EQ(prep->GetFili(), lines[i].fili);
+        EXPECT_EQ(prep->GetDbic(), lines[i].dbic);
+        EXPECT_EQ(prep->GetMmseg(), lines[i].mmseg);
+        EXPECT_EQ(prep->GetDbiw(), lines[i].dbiw);
+        EXPECT_EQ(prep->GetSrcBgd(), lines[i].srcBgd);
+        EXPECT_EQ(prep->GetEdgeClip(), lines[i].edgeClip);
+    }
 }
 
 TEST(FileChain, ImgSetFileReadsBackWithoutPreparationLines) {

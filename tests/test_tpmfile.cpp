@@ -86,11 +86,20 @@ TEST(TPMFileParser, ChannelListsNamingNoChannelAreRefused) {
 TEST(TPMFileParser, CopiesAreIndependentAcrossThreads) {
     TempDir dir;
     const int lines = 300;
+    // Lists of many lengths, so that a list shared between threads would be seen torn.
+    const auto dbiwOf = [](int i) {
+        Ints list;
+        for (int k = 0; k < 1 + (i * 7) % 40; ++k)
+            list.push_back(i * 100 + k);
+        return list;
+    };
     std::string text;
     for (int i = 0; i < lines; ++i) {
+        std::string dbiw;
+        for (const int v : dbiwOf(i))
+            dbiw += (dbiw.empty() ? "" : ",") + std::to_string(v);
         text += "s" + std::to_string(i) + ";" + std::to_string(i % 7 + 1) + "," +
-                std::to_string(i % 5 + 1) + ";" + std::to_string(i) + ";" + std::to_string(i) +
-                "," + std::to_string(-i) + "\n";
+                std::to_string(i % 5 + 1) + ";" + std::to_string(i) + ";" + dbiw + "\n";
     }
     auto original = Open(WritePrep(dir, text));
     std::vector<TPMFileParser> copies(3, *original);
@@ -101,13 +110,13 @@ TEST(TPMFileParser, CopiesAreIndependentAcrossThreads) {
     std::atomic<int> wrong{0};
     std::vector<std::thread> threads;
     for (TPMFileParser& parser : copies) {
-        threads.emplace_back([&parser, &wrong] {
+        threads.emplace_back([&parser, &wrong, &dbiwOf] {
             for (int round = 0; round < 20; ++round) {
                 for (int i = 0; i < lines; ++i) {
                     parser.ParseLine(i);
                     const Channels dbic{static_cast<unsigned int>(i % 7 + 1),
                                         static_cast<unsigned int>(i % 5 + 1)};
-                    if (parser.GetDbic() != dbic || parser.GetDbiw() != Ints{i, -i} ||
+                    if (parser.GetDbic() != dbic || parser.GetDbiw() != dbiwOf(i) ||
                         parser.GetMmseg() != i)
                         ++wrong;
                 }
