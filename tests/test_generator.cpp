@@ -10,6 +10,7 @@
 #include <cmath>
 #include <cstdio>
 #include <filesystem>
+#include <functional>
 #include <memory>
 #include <sstream>
 
@@ -265,6 +266,108 @@ TEST_F(BoxFixture, VisibleGroundMatchesGdalwarpWithin1) {
             }
         EXPECT_GT(compared, 60000u);
         EXPECT_EQ(differing, 0u) << "band " << band;
+    }
+}
+
+// No output, final or partial, is left in the directory.
+void ExpectNoOutputs(const TempDir& dir) {
+    for (const auto& entry : std::filesystem::directory_iterator(dir.Path())) {
+        const std::string name = entry.path().filename().string();
+        EXPECT_EQ(name.find("ortho"), std::string::npos) << name;
+        EXPECT_EQ(name.find("visibility"), std::string::npos) << name;
+    }
+}
+
+struct Cancelling {
+    bool* flag;
+    bool answer;  // what the callback returns
+    int calls = 0;
+    static bool Progress(double fraction, const char*, void* data) {
+        auto* self = static_cast<Cancelling*>(data);
+        ++self->calls;
+        if (fraction > 0)
+            *self->flag = true;
+        return fraction == 0 || self->answer;
+    }
+};
+
+TEST_F(BoxFixture, CancelledRunStopsAfterTheTileAtHandAndLeavesNoOutput) {
+    for (const bool byCallback : {false, true}) {
+        bool cancel = false;
+        kestrel::processes::GeneratorSettings settings;
+        settings.threadCount = 1;
+        TorthoGenerator generator(settings);
+        Cancelling progress{&cancel, !byCallback};
+        generator.SetCancelFlag(&cancel);
+        generator.SetProgress(&Cancelling::Progress, &progress);
+        const TorthoResult result = generator.Generate(Job());
+        EXPECT_FALSE(result.completed);
+        EXPECT_EQ(progress.calls, 2);  // the start and the first of 25 tiles
+        ExpectNoOutputs(dir);
+    }
+    // A flag set before the run: nothing is written at all.
+    bool cancel = true;
+    TorthoGenerator generator;
+    generator.SetCancelFlag(&cancel);
+    EXPECT_FALSE(generator.Generate(Job()).completed);
+    ExpectNoOutputs(dir);
+}
+
+// The same height everywhere, with no edge.
+class FlatEverywhere : public kestrel::dem::IElevationSource {
+  public:
+    void SetOutputVerticalDatum(kestrel::ogc::cs::DatumType) override {}
+    kestrel::ogc::cs::DatumType GetOutputVerticalDatum() const override {
+        return kestrel::ogc::cs::DatumEllipsoid;
+    }
+    const kestrel::ogc::cs::ICRS* GetCRS() const override { return nullptr; }
+    void GetExtent(double& minX, double& minY, double& maxX, double& maxY) const override {
+        minX = minY = -1e12, maxX = maxY = 1e12;
+    }
+    void SetInputCRS(const kestrel::ogc::cs::ICRS*) override {}
+    void GetHeights(std::size_t n, const double*, const double*, double* h) const override {
+        std::fill(h, h + n, 250.0);
+    }
+};
+
+TEST_F(BoxFixture, BadInputIsRefusedWithWhatAndWhere) {
+    FlatEverywhere flat;
+    const struct {
+        const char* what;
+        std::function<void(TorthoJob&)> spoil;
+        const char* message;
+    } cases[] = {
+        {"no pixels", [](TorthoJob& j) { j.pixels = 0; }, "0 pixels"},
+        {"surface elsewhere",
+         [&](TorthoJob& j) {
+             j.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(516000, 5034000, 0.5, 0.5);
+         },
+         "does not cover the output grid"},
+        {"grid outside the image",
+         [&](TorthoJob& j) {
+             j.surface = &flat;
+             j.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(520000, 5040000, 0.5, 0.5);
+         },
+         "outside the image"},
+        {"missing channel",
+         [](TorthoJob& j) {
+             j.channels = {1, 4};
+         },
+         "channel 4 of"},
+        {"unknown method", [](TorthoJob& j) { j.resampling = "lanczos"; }, "\"lanczos\""},
+        {"no model", [](TorthoJob& j) { j.model = nullptr; }, "no math model"},
+    };
+    for (const auto& c : cases) {
+        TorthoJob job = Job();
+        c.spoil(job);
+        try {
+            TorthoGenerator().Generate(job);
+            ADD_FAILURE() << c.what << ": no exception";
+        } catch (const kestrel::DataException& e) {
+            EXPECT_NE(std::string(e.what()).find(c.message), std::string::npos)
+                << c.what << ": " << e.what();
+        }
+        ExpectNoOutputs(dir);
     }
 }
 
