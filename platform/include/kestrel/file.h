@@ -41,3 +41,6 @@ class KESTREL_API File {
 }  // namespace fileio
 }  // namespace core
 }  // namespace kestrel
+
+// True when name names an existing file or directory.
+KESTREL_API bool IsFile(const std::string& name);

@@ -1,0 +1,214 @@
+#include "griddem.h"
+
+#include <algorithm>
+#include <array>
+#include <cmath>
+#include <cstdint>
+#include <limits>
+#include <utility>
+
+namespace kestrel {
+namespace dem {
+namespace detail {
+
+PostSource::~PostSource() = default;
+
+GridDEM::GridDEM(std::unique_ptr<PostSource> posts, const ogc::cs::GeocodingInfo& geocoding,
+                 std::unique_ptr<ogc::cs::ICRS> crs, ogc::cs::DatumType datum, std::string name)
+    : GridDEM(std::move(posts), geocoding, std::move(crs), datum, std::move(name),
+              PixelArea{0.0, 0.0, 0.0, 0.0}) {
+    area_ = PixelArea{0.0, 0.0, static_cast<double>(posts_->width),
+                      static_cast<double>(posts_->height)};
+}
+
+GridDEM::GridDEM(std::unique_ptr<PostSource> posts, const ogc::cs::GeocodingInfo& geocoding,
+                 std::unique_ptr<ogc::cs::ICRS> crs, ogc::cs::DatumType datum, std::string name,
+                 const PixelArea& area)
+    : posts_(std::move(posts)),
+      geocoding_(geocoding),
+      frame_(std::move(crs), datum, std::move(name)),
+      area_(area) {}
+
+GridDEM::~GridDEM() = default;
+
+void GridDEM::GetExtent(double& minX, double& minY, double& maxX, double& maxY) const {
+    minX = minY = std::numeric_limits<double>::infinity();
+    maxX = maxY = -minX;
+    for (double p : {area_.left, area_.right}) {
+        for (double l : {area_.top, area_.bottom}) {
+            double x, y;
+            geocoding_.PixelToGround(p, l, x, y);
+            minX = std::min(minX, x), maxX = std::max(maxX, x);
+            minY = std::min(minY, y), maxY = std::max(maxY, y);
+        }
+    }
+}
+
+void GridDEM::GetHeights(std::size_t n, const double* x, const double* y, double* heights) const {
+    frame_.Query(
+        n, x, y, heights,
+        [this](std::size_t m, const double* gx, const double* gy, double* h) {
+            Sample(m, gx, gy, h);
+        },
+        !postsConverted_);
+}
+
+namespace {
+
+constexpr std::uint32_t kOutside = std::numeric_limits<std::uint32_t>::max();
+
+// The blocks a run of lookups needs, fetched once each while the run lasts.
+class BlockMemo {
+  public:
+    explicit BlockMemo(const PostSource& posts)
+        : posts_(posts), blocksX_((posts.width + posts.blockWidth - 1) / posts.blockWidth) {}
+
+    const PostBlock& Get(std::uint32_t key) {
+        for (auto& slot : slots_) {
+            if (slot.block && slot.key == key)
+                return *slot.block;
+        }
+        Slot& slot = slots_[next_];
+        next_ = (next_ + 1) % slots_.size();
+        slot.key = key;
+        slot.block = posts_.GetBlock(key % blocksX_, key / blocksX_);
+        return *slot.block;
+    }
+
+    // The height of post (i, j); NaN outside the grid.
+    float Post(long long i, long long j) {
+        if (i < 0 || j < 0 || i >= posts_.width || j >= posts_.height)
+            return NAN;
+        const auto bx = static_cast<std::uint32_t>(i / posts_.blockWidth);
+        const auto by = static_cast<std::uint32_t>(j / posts_.blockHeight);
+        const PostBlock& b = Get(by * blocksX_ + bx);
+        const auto ci =
+            static_cast<std::size_t>(i - static_cast<long long>(bx) * posts_.blockWidth);
+        const auto cj =
+            static_cast<std::size_t>(j - static_cast<long long>(by) * posts_.blockHeight);
+        return b.heights[cj * b.width + ci];
+    }
+
+    std::uint32_t BlocksX() const { return blocksX_; }
+
+  private:
+    struct Slot {
+        std::uint32_t key = 0;
+        std::shared_ptr<const PostBlock> block;
+    };
+    const PostSource& posts_;
+    std::uint32_t blocksX_;
+    std::array<Slot, 4> slots_;
+    std::size_t next_ = 0;
+};
+
+// Bilinear weighting of the posts around a point; posts without a height are left out and the
+// weights of the others renormalised.
+double Blend(float v00, float v10, float v01, float v11, double tx, double ty) {
+    double sum = 0.0, weight = 0.0;
+    const auto add = [&](float v, double w) {
+        if (!std::isnan(v)) {
+            sum += w * v;
+            weight += w;
+        }
+    };
+    add(v00, (1.0 - tx) * (1.0 - ty));
+    add(v10, tx * (1.0 - ty));
+    add(v01, (1.0 - tx) * ty);
+    add(v11, tx * ty);
+    return weight > 0.0 ? sum / weight : NAN;
+}
+
+}  // namespace
+
+void GridDEM::Sample(std::size_t n, const double* x, const double* y, double* heights) const {
+    const PostSource& posts = *posts_;
+    BlockMemo memo(posts);
+    const long long width = posts.width, height = posts.height;
+    const unsigned int bw = posts.blockWidth, bh = posts.blockHeight;
+
+    // Post coordinates of a ground point: post (i, j) stands at pixel (i + 0.5, j + 0.5).
+    const auto toPost = [&](std::size_t i, double& fx, double& fy) {
+        double pixel, line;
+        geocoding_.GroundToPixel(x[i], y[i], pixel, line);
+        if (!(pixel >= area_.left && pixel <= area_.right && line >= area_.top &&
+              line <= area_.bottom))
+            return false;
+        fx = pixel - 0.5;
+        fy = line - 0.5;
+        return true;
+    };
+
+    const auto evaluate = [&](std::size_t i, std::uint32_t key) {
+        double fx = 0.0, fy = 0.0;
+        toPost(i, fx, fy);
+        const double fi = std::floor(fx), fj = std::floor(fy);
+        const double tx = fx - fi, ty = fy - fj;
+        const auto i0 = static_cast<long long>(fi), j0 = static_cast<long long>(fj);
+        const PostBlock& b = memo.Get(key);
+        const long long ox = static_cast<long long>(key % memo.BlocksX()) * bw;
+        const long long oy = static_cast<long long>(key / memo.BlocksX()) * bh;
+        if (i0 >= ox && j0 >= oy && i0 + 1 < ox + b.width && j0 + 1 < oy + b.height) {
+            const float* p = &b.heights[static_cast<std::size_t>(j0 - oy) * b.width +
+                                        static_cast<std::size_t>(i0 - ox)];
+            heights[i] = Blend(p[0], p[1], p[b.width], p[b.width + 1], tx, ty);
+        } else {
+            heights[i] = Blend(memo.Post(i0, j0), memo.Post(i0 + 1, j0), memo.Post(i0, j0 + 1),
+                               memo.Post(i0 + 1, j0 + 1), tx, ty);
+        }
+    };
+
+    // Each point is keyed by the block of its upper-left post (clamped into the grid).
+    const auto keyOf = [&](std::size_t i) {
+        double fx = 0.0, fy = 0.0;
+        if (!toPost(i, fx, fy))
+            return kOutside;
+        const long long i0 = std::clamp(static_cast<long long>(std::floor(fx)), 0LL, width - 1);
+        const long long j0 = std::clamp(static_cast<long long>(std::floor(fy)), 0LL, height - 1);
+        return static_cast<std::uint32_t>(j0 / bh) * memo.BlocksX() +
+               static_cast<std::uint32_t>(i0 / bw);
+    };
+
+    const std::uint32_t blockCount =
+        memo.BlocksX() * static_cast<std::uint32_t>((posts.height + bh - 1) / bh);
+    constexpr std::size_t kSortFrom = 64;
+    if (n < kSortFrom || blockCount == 1) {
+        for (std::size_t i = 0; i < n; ++i) {
+            const std::uint32_t key = keyOf(i);
+            if (key == kOutside)
+                heights[i] = NAN;
+            else
+                evaluate(i, key);
+        }
+        return;
+    }
+
+    // A batch is answered block by block (a counting sort of the points by block), so that each
+    // block is fetched once however the points are scattered.
+    constexpr std::size_t kChunk = std::size_t(1) << 30;
+    for (std::size_t start = 0; start < n; start += kChunk) {
+        const std::size_t count = std::min(kChunk, n - start);
+        std::vector<std::uint32_t> keys(count);
+        std::vector<std::uint32_t> offsets(static_cast<std::size_t>(blockCount) + 1, 0);
+        for (std::size_t k = 0; k < count; ++k) {
+            keys[k] = keyOf(start + k);
+            if (keys[k] == kOutside)
+                heights[start + k] = NAN;
+            else
+                ++offsets[keys[k] + 1];
+        }
+        for (std::size_t b = 1; b < offsets.size(); ++b)
+            offsets[b] += offsets[b - 1];
+        std::vector<std::uint32_t> order(offsets.back());
+        for (std::size_t k = 0; k < count; ++k) {
+            if (keys[k] != kOutside)
+                order[offsets[keys[k]]++] = static_cast<std::uint32_t>(k);
+        }
+        for (std::uint32_t k : order)
+            evaluate(start + k, keys[k]);
+    }
+}
+
+}  // namespace detail
+}  // namespace dem
+}  // namespace kestrel

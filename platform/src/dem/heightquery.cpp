@@ -1,0 +1,210 @@
+#include "heightquery.h"
+
+#include <algorithm>
+#include <cmath>
+#include <utility>
+
+#include <ogr_spatialref.h>
+
+#include <kestrel/exception.h>
+
+namespace kestrel {
+namespace dem {
+namespace detail {
+
+using ogc::cs::CoordinateTransformation;
+using ogc::cs::DatumType;
+using ogc::cs::ICRS;
+
+TransformPool::TransformPool(const ICRS& from, const ICRS& to) : prototype_(from, to) {}
+
+TransformPool::~TransformPool() = default;
+
+std::unique_ptr<CoordinateTransformation> TransformPool::Acquire() const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (idle_.empty())
+        return std::make_unique<CoordinateTransformation>(prototype_);
+    auto transform = std::move(idle_.back());
+    idle_.pop_back();
+    return transform;
+}
+
+void TransformPool::Release(std::unique_ptr<CoordinateTransformation> transform) const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    idle_.push_back(std::move(transform));
+}
+
+void TransformPool::Transform(std::size_t n, double* x, double* y, double* z) const {
+    auto transform = Acquire();
+    struct Returner {
+        const TransformPool* pool;
+        std::unique_ptr<CoordinateTransformation>& transform;
+        ~Returner() { pool->Release(std::move(transform)); }
+    } returner{this, transform};
+    transform->Transform(n, x, y, z);
+}
+
+// ---------------------------------------------------------------------------------------------
+
+std::string DatumName(DatumType datum) {
+    switch (datum) {
+        case ogc::cs::DatumMSL:
+            return "MSL";
+        case ogc::cs::DatumEllipsoid:
+            return "ELLIPS";
+        case ogc::cs::DatumMathModel:
+            return "MATHMODEL";
+    }
+    return std::to_string(static_cast<int>(datum));
+}
+
+namespace {
+
+bool IsKnownDatum(DatumType datum) {
+    return datum == ogc::cs::DatumMSL || datum == ogc::cs::DatumEllipsoid ||
+           datum == ogc::cs::DatumMathModel;
+}
+
+// The horizontal part of a coordinate system, two-dimensional.
+OGRSpatialReference Horizontal(const ICRS& crs) {
+    OGRSpatialReference srs(crs.GetSpatialReference());
+    if (srs.IsCompound())
+        srs.StripVertical();
+    if (srs.GetAxesCount() == 3)
+        srs.DemoteTo2D(nullptr);
+    return srs;
+}
+
+// The source's coordinates with heights above mean sea level: its own system when that has a
+// gravity-related vertical part, otherwise its horizontal part with EGM96 heights.
+ICRS MeanSeaLevelCRS(const ICRS& crs) {
+    if (crs.IsCompound())
+        return crs;
+    const OGRSpatialReference horizontal = Horizontal(crs);
+    OGRSpatialReference egm96;
+    egm96.importFromEPSG(5773);
+    OGRSpatialReference compound;
+    compound.SetCompoundCS((std::string(horizontal.GetName()) + " + EGM96 height").c_str(),
+                           &horizontal, &egm96);
+    return ICRS(compound);
+}
+
+// The source's coordinates with heights above the ellipsoid of its horizontal datum.
+ICRS EllipsoidalCRS(const ICRS& crs) {
+    OGRSpatialReference srs = Horizontal(crs);
+    srs.PromoteTo3D(nullptr);
+    return ICRS(srs);
+}
+
+}  // namespace
+
+QueryFrame::QueryFrame(std::unique_ptr<ICRS> crs, DatumType datum, std::string name)
+    : crs_(std::move(crs)), datum_(datum), output_(datum), name_(std::move(name)) {
+    if (!IsKnownDatum(datum)) {
+        KESTREL_THROW(DataException,
+                      FormatString("%s: unknown vertical datum %d (expected 2000 MATHMODEL, 2001 "
+                                   "MSL or 2002 ELLIPS)",
+                                   name_.c_str(), static_cast<int>(datum)));
+    }
+}
+
+QueryFrame::~QueryFrame() = default;
+
+void QueryFrame::SetOutputDatum(DatumType datum) {
+    if (!IsKnownDatum(datum)) {
+        KESTREL_THROW(DataException,
+                      FormatString("%s: unknown output vertical datum %d (expected 2000 "
+                                   "MATHMODEL, 2001 MSL or 2002 ELLIPS)",
+                                   name_.c_str(), static_cast<int>(datum)));
+    }
+    if (datum == datum_) {
+        vertical_.reset();
+        output_ = datum;
+        return;
+    }
+    if (datum == ogc::cs::DatumMathModel || datum_ == ogc::cs::DatumMathModel) {
+        KESTREL_THROW(
+            DataException,
+            FormatString("%s: heights in the %s datum cannot be delivered in the %s "
+                         "datum: the math model's datum is not known to the DEM",
+                         name_.c_str(), DatumName(datum_).c_str(), DatumName(datum).c_str()));
+    }
+    if (!crs_) {
+        KESTREL_THROW(
+            DataException,
+            FormatString("%s has no coordinate system, so its %s heights cannot be "
+                         "converted to %s",
+                         name_.c_str(), DatumName(datum_).c_str(), DatumName(datum).c_str()));
+    }
+    const ICRS msl = MeanSeaLevelCRS(*crs_);
+    const ICRS ellipsoidal = EllipsoidalCRS(*crs_);
+    try {
+        vertical_ = datum == ogc::cs::DatumEllipsoid
+                        ? std::make_unique<TransformPool>(msl, ellipsoidal)
+                        : std::make_unique<TransformPool>(ellipsoidal, msl);
+    } catch (const DataException& e) {
+        KESTREL_THROW(
+            DataException,
+            FormatString("%s: heights cannot be converted from %s to %s: %s", name_.c_str(),
+                         DatumName(datum_).c_str(), DatumName(datum).c_str(), e.what()));
+    }
+    output_ = datum;
+}
+
+void QueryFrame::SetInputCRS(const ICRS* crs) {
+    if (crs == nullptr || (crs_ && crs->IsSame(*crs_))) {
+        input_.reset();
+        return;
+    }
+    if (!crs_) {
+        KESTREL_THROW(DataException,
+                      FormatString("%s has no coordinate system, so points in \"%s\" cannot be "
+                                   "taken into it",
+                                   name_.c_str(), crs->GetName().c_str()));
+    }
+    input_ = std::make_unique<TransformPool>(*crs, *crs_);
+}
+
+void QueryFrame::CheckFinite(std::size_t n, const double* x, const double* y) const {
+    for (std::size_t i = 0; i < n; ++i) {
+        if (!std::isfinite(x[i]) || !std::isfinite(y[i])) {
+            KESTREL_THROW(DataException,
+                          FormatString("%s: height asked at a point that is not finite: point "
+                                       "%zu is (%g, %g)",
+                                       name_.c_str(), i, x[i], y[i]));
+        }
+    }
+}
+
+void QueryFrame::ConvertHeights(std::size_t n, const double* x, const double* y,
+                                double* heights) const {
+    if (!vertical_)
+        return;
+    // Only points with a height go through PROJ, in chunks that stay in the processor's cache.
+    constexpr std::size_t chunk = 4096;
+    std::vector<double> cx, cy, cz;
+    std::vector<std::size_t> index;
+    cx.reserve(std::min(n, chunk));
+    cy.reserve(cx.capacity());
+    cz.reserve(cx.capacity());
+    index.reserve(cx.capacity());
+    std::size_t i = 0;
+    while (i < n) {
+        cx.clear(), cy.clear(), cz.clear(), index.clear();
+        for (; i < n && index.size() < chunk; ++i) {
+            if (std::isnan(heights[i]))
+                continue;
+            cx.push_back(x[i]);
+            cy.push_back(y[i]);
+            cz.push_back(heights[i]);
+            index.push_back(i);
+        }
+        vertical_->Transform(index.size(), cx.data(), cy.data(), cz.data());
+        for (std::size_t k = 0; k < index.size(); ++k)
+            heights[index[k]] = cz[k];
+    }
+}
+
+}  // namespace detail
+}  // namespace dem
+}  // namespace kestrel
