@@ -112,8 +112,9 @@ TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
             ASSERT_EQ(source[k], 1) << k;
             ASSERT_EQ(mosaic[k], ortho1[k]) << k;
         }
-        if (vis1[k] != VISIBILITY_SEEN && vis2[k] != VISIBILITY_SEEN)
+        if (vis1[k] != VISIBILITY_SEEN && vis2[k] != VISIBILITY_SEEN) {
             EXPECT_EQ(source[k], 0) << k;
+        }
     }
     EXPECT_GT(hidden[0], 1000u);
     EXPECT_GT(hidden[1], 1000u);
@@ -140,8 +141,9 @@ TEST_F(OppositeViews, ChoiceRulesAmongScenesThatSeeAPixel) {
     ASSERT_TRUE(OcclusionRecovery().Recover(Job(3, 1, 0, true)).completed);
     auto source = ReadBand(dir->File("source.tif"));
     for (size_t k = 0; k < source.size(); ++k)
-        if (both(k))
+        if (both(k)) {
             ASSERT_EQ(source[k], 2) << k;
+        }
 
     // Near its own hidden strip (within the pixel error) a scene gives way, whatever its level.
     ASSERT_TRUE(OcclusionRecovery().Recover(Job(1, 3, 3, true)).completed);
