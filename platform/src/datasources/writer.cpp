@@ -1,0 +1,672 @@
+#include <array>
+#include <mutex>
+#include <optional>
+#include <random>
+
+#include <cpl_string.h>
+#include <cpl_vsi.h>
+
+#include <kestrel/exception.h>
+#include <kestrel/formats.h>
+#include <kestrel/rasterio.h>
+
+#include "../gdalsupport.h"
+#include "channelinfo.h"
+#include "gdaldataset.h"
+#include "tiling.h"
+
+#if defined(_WIN32)
+#define WIN32_LEAN_AND_MEAN
+#include <windows.h>
+#endif
+
+namespace kestrel {
+namespace datasources {
+
+namespace {
+
+struct MetadataItem {
+    std::string name;
+    std::string value;
+    std::string domain;
+};
+
+struct PathParts {
+    std::string dir;   // with its trailing separator, or empty
+    std::string stem;  // base name without the extension
+    std::string ext;   // with its dot, or empty
+};
+
+PathParts Split(const std::string& path) {
+    PathParts parts;
+    const std::size_t slash = path.find_last_of("/\\");
+    const std::size_t start = slash == std::string::npos ? 0 : slash + 1;
+    parts.dir = path.substr(0, start);
+    const std::string base = path.substr(start);
+    const std::size_t dot = base.find_last_of('.');
+    if (dot == std::string::npos || dot == 0) {
+        parts.stem = base;
+    } else {
+        parts.stem = base.substr(0, dot);
+        parts.ext = base.substr(dot);
+    }
+    return parts;
+}
+
+std::string RandomTag() {
+    static const char digits[] = "abcdefghijklmnopqrstuvwxyz0123456789";
+    std::random_device device;
+    std::string tag;
+    for (int i = 0; i < 8; ++i)
+        tag += digits[device() % 36];
+    return tag;
+}
+
+bool Exists(const std::string& path) {
+    VSIStatBufL stat;
+    return VSIStatL(path.c_str(), &stat) == 0;
+}
+
+// Every file of the directory whose name begins with prefix.
+std::vector<std::string> FilesWithPrefix(const std::string& dir, const std::string& prefix) {
+    std::vector<std::string> names;
+    char** list = VSIReadDir(dir.empty() ? "." : dir.c_str());
+    for (char** entry = list; entry != nullptr && *entry != nullptr; ++entry) {
+        const std::string name = *entry;
+        if (name.compare(0, prefix.size(), prefix) == 0)
+            names.push_back(name);
+    }
+    CSLDestroy(list);
+    return names;
+}
+
+// Moves a file over another, replacing it in one step where the system allows.
+bool ReplaceFile(const std::string& from, const std::string& to) {
+#if defined(_WIN32)
+    return MoveFileExA(from.c_str(), to.c_str(),
+                       MOVEFILE_REPLACE_EXISTING | MOVEFILE_WRITE_THROUGH) != 0;
+#else
+    return VSIRename(from.c_str(), to.c_str()) == 0;
+#endif
+}
+
+CPLStringList DefaultCreationOptions(const std::string& format, DataType type) {
+    CPLStringList options;
+    if (format == "GTiff") {
+        options.SetNameValue("TILED", "YES");
+        options.SetNameValue("BLOCKXSIZE", "256");
+        options.SetNameValue("BLOCKYSIZE", "256");
+        options.SetNameValue("COMPRESS", "DEFLATE");
+        options.SetNameValue("PREDICTOR",
+                             type == DataType::Float32 || type == DataType::Float64 ? "3" : "2");
+        options.SetNameValue("BIGTIFF", "IF_SAFER");
+    }
+    return options;
+}
+
+// Options "NAME=VALUE" separated by commas, semicolons or blanks.
+void AddOptions(CPLStringList& options, const std::string& text) {
+    char** tokens = CSLTokenizeString2(text.c_str(), ",; \t", CSLT_HONOURSTRINGS);
+    for (char** token = tokens; token != nullptr && *token != nullptr; ++token) {
+        char* key = nullptr;
+        const char* value = CPLParseNameValue(*token, &key);
+        if (key != nullptr && value != nullptr)
+            options.SetNameValue(key, value);
+        CPLFree(key);
+    }
+    CSLDestroy(tokens);
+}
+
+}  // namespace
+
+struct BasicWriter::Impl {
+    std::string path;
+    std::string format;
+    GDALDriver* driver = nullptr;
+    bool copyOnClose = false;  // the format is made by CreateCopy from a GeoTIFF
+    bool update = false;       // an existing file written in place
+    std::string options;
+    std::vector<unsigned int> channelNumbers;
+    unsigned int channelCount = 1;
+    DataType type = DataType::Unknown;
+    Tiling tiling;
+    bool tileSizeSet = false;
+    std::unique_ptr<ogc::cs::ICRS> crs;
+    std::unique_ptr<ogc::cs::GeocodingInfo> geocoding;
+    std::vector<std::optional<double>> noData;
+    std::vector<std::string> descriptions;
+    std::vector<MetadataItem> metadata;
+
+    GDALDatasetPtr dataset;  // the file being written
+    std::string tempStem;    // base-name prefix of every temporary file
+    std::string tempPath;    // the file being written (temporary unless update)
+    bool closed = false;
+    ChannelInfoList infos;
+    std::mutex mutex;
+
+    std::vector<unsigned int> Bands() const {
+        std::vector<unsigned int> bands;
+        for (unsigned int c = 1; c <= channelCount; ++c)
+            bands.push_back(c);
+        return bands;
+    }
+
+    void RefreshInfos() {
+        infos.Clear();
+        for (unsigned int c = 0; c < channelCount; ++c) {
+            const unsigned int number = c < channelNumbers.size() ? channelNumbers[c] : c + 1;
+            const bool has = c < noData.size() && noData[c].has_value();
+            infos.Add(
+                std::make_unique<ChannelInfo>(number, type, has, has ? *noData[c] : 0.0,
+                                              c < descriptions.size() ? descriptions[c] : ""));
+        }
+    }
+
+    void RemoveTemporaries() {
+        if (tempStem.empty())
+            return;
+        const PathParts parts = Split(path);
+        for (const std::string& name : FilesWithPrefix(parts.dir, tempStem))
+            VSIUnlink((parts.dir + name).c_str());
+    }
+};
+
+namespace {
+
+void RequireNotCreated(const BasicWriter::Impl& impl, const char* what,
+                       const SourceLocation& where) {
+    if (impl.dataset != nullptr || impl.closed || impl.update) {
+        KESTREL_THROW_AT(where, DataException,
+                         FormatString("The %s of %s cannot change once the file exists", what,
+                                      impl.path.c_str()));
+    }
+}
+
+GDALDriver* RasterDriver(const std::string& format, const std::string& path,
+                         const SourceLocation& where) {
+    gdalsupport::EnsureRegistered();
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName(format.c_str());
+    if (driver == nullptr || driver->GetMetadataItem(GDAL_DCAP_RASTER) == nullptr ||
+        (driver->GetMetadataItem(GDAL_DCAP_CREATE) == nullptr &&
+         driver->GetMetadataItem(GDAL_DCAP_CREATECOPY) == nullptr)) {
+        KESTREL_THROW_AT(where, ParameterException, "format", ParameterException::Unsupported,
+                         format, "a GDAL raster driver that can write files",
+                         FormatString("GDAL cannot write %s in the format \"%s\"", path.c_str(),
+                                      format.c_str()));
+    }
+    return driver;
+}
+
+}  // namespace
+
+BasicWriter::BasicWriter(const std::string& path) : impl_(std::make_unique<Impl>()) {
+    gdalsupport::EnsureRegistered();
+    impl_->path = path;
+    if (Exists(path)) {
+        gdalsupport::ErrorCapture errors;
+        impl_->dataset.reset(GDALDataset::Open(
+            path.c_str(), GDAL_OF_RASTER | GDAL_OF_UPDATE | GDAL_OF_VERBOSE_ERROR));
+        if (impl_->dataset == nullptr) {
+            KESTREL_THROW(FileAccessException, path, FileAccessException::OpenFailed,
+                          FormatString("Could not open %s for update as a raster: %s", path.c_str(),
+                                       errors.Reason().c_str()));
+        }
+        GDALDataset& ds = *impl_->dataset;
+        impl_->update = true;
+        impl_->tempPath = path;
+        impl_->driver = ds.GetDriver();
+        impl_->format = impl_->driver != nullptr ? impl_->driver->GetDescription() : "";
+        impl_->channelCount = static_cast<unsigned int>(ds.GetRasterCount());
+        impl_->type = impl_->channelCount > 0 ? FromGDAL(ds.GetRasterBand(1)->GetRasterDataType())
+                                              : DataType::Unknown;
+        impl_->tiling.width = static_cast<unsigned int>(ds.GetRasterXSize());
+        impl_->tiling.height = static_cast<unsigned int>(ds.GetRasterYSize());
+        if (impl_->channelCount > 0) {
+            int w = 0;
+            int h = 0;
+            ds.GetRasterBand(1)->GetBlockSize(&w, &h);
+            impl_->tiling.tileWidth = static_cast<unsigned int>(std::max(1, w));
+            impl_->tiling.tileHeight = static_cast<unsigned int>(std::max(1, h));
+        }
+        impl_->crs = ReadCRS(ds);
+        impl_->geocoding = ReadGeocoding(ds);
+        for (unsigned int c = 1; c <= impl_->channelCount; ++c) {
+            int has = 0;
+            const double value = ds.GetRasterBand(int(c))->GetNoDataValue(&has);
+            impl_->noData.push_back(has ? std::optional<double>(value) : std::nullopt);
+            impl_->descriptions.push_back(ds.GetRasterBand(int(c))->GetDescription());
+        }
+    } else {
+        impl_->format = core::FormatNameOfPath(path);
+        if (impl_->format.empty())
+            impl_->format = "GTiff";
+        impl_->driver = RasterDriver(impl_->format, path, KESTREL_HERE);
+        impl_->copyOnClose = impl_->driver->GetMetadataItem(GDAL_DCAP_CREATE) == nullptr;
+    }
+    impl_->RefreshInfos();
+    if (auto observer = RasterIOObserver::Current())
+        observer->WriterCreated(this, path, {}, "", "");
+}
+
+BasicWriter::BasicWriter(const std::string& path, const std::vector<unsigned int>& channels,
+                         const std::string& format, const std::string& options)
+    : impl_(std::make_unique<Impl>()) {
+    impl_->path = path;
+    impl_->format = format;
+    impl_->options = options;
+    impl_->driver = RasterDriver(format, path, KESTREL_HERE);
+    impl_->format = impl_->driver->GetDescription();
+    impl_->copyOnClose = impl_->driver->GetMetadataItem(GDAL_DCAP_CREATE) == nullptr;
+    if (channels.empty()) {
+        KESTREL_THROW(
+            DataException,
+            FormatString("A raster writer on %s needs at least one channel", path.c_str()));
+    }
+    impl_->channelNumbers = channels;
+    impl_->channelCount = static_cast<unsigned int>(channels.size());
+    impl_->RefreshInfos();
+    if (auto observer = RasterIOObserver::Current())
+        observer->WriterCreated(this, path, channels, format, options);
+}
+
+BasicWriter::~BasicWriter() {
+    if (impl_->closed)
+        return;
+    impl_->dataset.reset();
+    if (!impl_->update)
+        impl_->RemoveTemporaries();
+}
+
+std::string BasicWriter::GetFormatName() const {
+    return impl_->format;
+}
+
+void BasicWriter::SetSize(unsigned int width, unsigned int height) {
+    RequireNotCreated(*impl_, "size", KESTREL_HERE);
+    if (width == 0 || height == 0 || width > 0x7fffffffu || height > 0x7fffffffu) {
+        KESTREL_THROW(DataException, FormatString("%s cannot be %u x %u pixels",
+                                                  impl_->path.c_str(), width, height));
+    }
+    impl_->tiling.width = width;
+    impl_->tiling.height = height;
+}
+
+void BasicWriter::SetDataType(DataType type) {
+    RequireNotCreated(*impl_, "data type", KESTREL_HERE);
+    if (DataTypeSize(type) == 0) {
+        KESTREL_THROW(DataException, FormatString("%s cannot be written with data type %s",
+                                                  impl_->path.c_str(), DataTypeName(type).c_str()));
+    }
+    impl_->type = type;
+    impl_->RefreshInfos();
+}
+
+void BasicWriter::SetChannelCount(unsigned int count) {
+    RequireNotCreated(*impl_, "channel count", KESTREL_HERE);
+    if (count == 0 || count > 65535) {
+        KESTREL_THROW(DataException,
+                      FormatString("%s cannot have %u channels", impl_->path.c_str(), count));
+    }
+    impl_->channelCount = count;
+    impl_->channelNumbers.clear();
+    impl_->RefreshInfos();
+}
+
+void BasicWriter::SetCRS(const ogc::cs::ICRS* crs) {
+    RequireNotCreated(*impl_, "coordinate system", KESTREL_HERE);
+    impl_->crs.reset(crs != nullptr ? new ogc::cs::ICRS(*crs) : nullptr);
+}
+
+void BasicWriter::SetGeocoding(const ogc::cs::GeocodingInfo& geocoding) {
+    RequireNotCreated(*impl_, "geocoding", KESTREL_HERE);
+    impl_->geocoding = std::make_unique<ogc::cs::GeocodingInfo>(geocoding);
+}
+
+void BasicWriter::SetNoDataValue(double value) {
+    RequireNotCreated(*impl_, "no-data value", KESTREL_HERE);
+    impl_->noData.assign(impl_->channelCount, value);
+    impl_->RefreshInfos();
+}
+
+void BasicWriter::SetNoDataValue(unsigned int c, double value) {
+    RequireNotCreated(*impl_, "no-data value", KESTREL_HERE);
+    if (c >= impl_->channelCount) {
+        KESTREL_THROW(DataException, FormatString("%s has no channel at position %u of %u",
+                                                  impl_->path.c_str(), c, impl_->channelCount));
+    }
+    impl_->noData.resize(impl_->channelCount);
+    impl_->noData[c] = value;
+    impl_->RefreshInfos();
+}
+
+void BasicWriter::SetChannelDescription(unsigned int c, const std::string& text) {
+    RequireNotCreated(*impl_, "channel description", KESTREL_HERE);
+    if (c >= impl_->channelCount) {
+        KESTREL_THROW(DataException, FormatString("%s has no channel at position %u of %u",
+                                                  impl_->path.c_str(), c, impl_->channelCount));
+    }
+    impl_->descriptions.resize(impl_->channelCount);
+    impl_->descriptions[c] = text;
+    impl_->RefreshInfos();
+}
+
+void BasicWriter::SetMetadataItem(const std::string& name, const std::string& value,
+                                  const std::string& domain) {
+    RequireNotCreated(*impl_, "metadata", KESTREL_HERE);
+    impl_->metadata.push_back({name, value, domain});
+}
+
+namespace {
+
+void ApplyDescription(BasicWriter::Impl& impl, GDALDataset& ds, const SourceLocation& where) {
+    gdalsupport::ErrorCapture errors;
+    auto fail = [&](const char* what) {
+        KESTREL_THROW_AT(where, FileAccessException, impl.path, FileAccessException::WriteFailed,
+                         FormatString("Could not set the %s of %s: %s", what, impl.path.c_str(),
+                                      errors.Reason().c_str()));
+    };
+    if (impl.geocoding != nullptr) {
+        std::array<double, 6> transform = impl.geocoding->GetGeoTransform();
+        if (ds.SetGeoTransform(transform.data()) != CE_None)
+            fail("geocoding");
+    }
+    if (impl.crs != nullptr && ds.SetSpatialRef(&impl.crs->GetSpatialReference()) != CE_None)
+        fail("coordinate system");
+    for (unsigned int c = 0; c < impl.channelCount; ++c) {
+        GDALRasterBand* band = ds.GetRasterBand(static_cast<int>(c) + 1);
+        if (c < impl.noData.size() && impl.noData[c].has_value() &&
+            band->SetNoDataValue(*impl.noData[c]) != CE_None)
+            fail("no-data value");
+        if (c < impl.descriptions.size() && !impl.descriptions[c].empty())
+            band->SetDescription(impl.descriptions[c].c_str());
+    }
+    for (const MetadataItem& item : impl.metadata) {
+        if (ds.SetMetadataItem(item.name.c_str(), item.value.c_str(), item.domain.c_str()) !=
+            CE_None)
+            fail("metadata");
+    }
+}
+
+void CreateLocked(BasicWriter::Impl& impl, const SourceLocation& where) {
+    if (impl.dataset != nullptr)
+        return;
+    if (impl.closed) {
+        KESTREL_THROW_AT(where, DataException, FormatString("%s is closed", impl.path.c_str()));
+    }
+    if (impl.tiling.width == 0 || impl.type == DataType::Unknown) {
+        KESTREL_THROW_AT(where, DataException,
+                         FormatString("%s cannot be created before its size and data type are "
+                                      "set",
+                                      impl.path.c_str()));
+    }
+    const PathParts parts = Split(impl.path);
+    impl.tempStem = parts.stem + ".tmp-" + RandomTag();
+    // A format made by copying is first written as a plain tiled GeoTIFF.
+    const std::string workFormat = impl.copyOnClose ? "GTiff" : impl.format;
+    const std::string workExt = impl.copyOnClose ? ".tif" : parts.ext;
+    impl.tempPath = parts.dir + impl.tempStem + (impl.copyOnClose ? ".work" : "") + workExt;
+
+    CPLStringList options;
+    GDALDriver* driver = impl.driver;
+    if (impl.copyOnClose) {
+        driver = GetGDALDriverManager()->GetDriverByName("GTiff");
+        options.SetNameValue("TILED", "YES");
+        options.SetNameValue("BIGTIFF", "IF_SAFER");
+    } else {
+        options = DefaultCreationOptions(workFormat, impl.type);
+        AddOptions(options, impl.options);
+    }
+    gdalsupport::ErrorCapture errors;
+    impl.dataset.reset(driver->Create(impl.tempPath.c_str(), static_cast<int>(impl.tiling.width),
+                                      static_cast<int>(impl.tiling.height),
+                                      static_cast<int>(impl.channelCount), ToGDAL(impl.type),
+                                      options.List()));
+    if (impl.dataset == nullptr) {
+        const std::string reason = errors.Reason();
+        impl.RemoveTemporaries();
+        KESTREL_THROW_AT(where, FileAccessException, impl.path, FileAccessException::CreateFailed,
+                         FormatString("Could not create %s as %s (%u x %u pixels, %u channels "
+                                      "of %s): %s",
+                                      impl.path.c_str(), impl.format.c_str(), impl.tiling.width,
+                                      impl.tiling.height, impl.channelCount,
+                                      DataTypeName(impl.type).c_str(), reason.c_str()));
+    }
+    try {
+        ApplyDescription(impl, *impl.dataset, where);
+        if (!impl.tileSizeSet) {
+            int w = 0;
+            int h = 0;
+            impl.dataset->GetRasterBand(1)->GetBlockSize(&w, &h);
+            impl.tiling.tileWidth = static_cast<unsigned int>(std::max(1, w));
+            impl.tiling.tileHeight = static_cast<unsigned int>(std::max(1, h));
+        }
+    } catch (...) {
+        impl.dataset.reset();
+        impl.RemoveTemporaries();
+        throw;
+    }
+}
+
+}  // namespace
+
+void BasicWriter::Create() {
+    std::lock_guard<std::mutex> lock(impl_->mutex);
+    CreateLocked(*impl_, KESTREL_HERE);
+}
+
+void BasicWriter::WriteWindow(const gobs::Raster& raster, unsigned int x, unsigned int y) {
+    std::lock_guard<std::mutex> lock(impl_->mutex);
+    CreateLocked(*impl_, KESTREL_HERE);
+    if (raster.GetChannelCount() != impl_->channelCount) {
+        KESTREL_THROW(
+            DataException,
+            FormatString("A raster of %u channels cannot be written to %s, which has "
+                         "%u",
+                         raster.GetChannelCount(), impl_->path.c_str(), impl_->channelCount));
+    }
+    CheckWindow(impl_->path, impl_->tiling.width, impl_->tiling.height, x, y, raster.GetWidth(),
+                raster.GetHeight(), KESTREL_HERE);
+    TransferWindow(*impl_->dataset, GF_Write, impl_->path, impl_->Bands(),
+                   const_cast<gobs::Raster&>(raster), x, y, KESTREL_HERE);
+}
+
+void BasicWriter::Write(const gobs::Raster& raster) {
+    WriteWindow(raster, raster.GetX(), raster.GetY());
+}
+
+gobs::Raster* BasicWriter::ReadWindow(unsigned int x, unsigned int y, unsigned int width,
+                                      unsigned int height) {
+    std::unique_ptr<gobs::Raster> raster;
+    {
+        std::lock_guard<std::mutex> lock(impl_->mutex);
+        CreateLocked(*impl_, KESTREL_HERE);
+        CheckWindow(impl_->path, impl_->tiling.width, impl_->tiling.height, x, y, width, height,
+                    KESTREL_HERE);
+        raster = std::make_unique<gobs::Raster>(width, height, impl_->channelCount, impl_->type);
+        raster->SetOrigin(x, y);
+        TransferWindow(*impl_->dataset, GF_Read, impl_->path, impl_->Bands(), *raster, x, y,
+                       KESTREL_HERE);
+    }
+    if (auto observer = RasterIOObserver::Current())
+        observer->WindowRead(this, x, y, width, height, raster.get());
+    return raster.release();
+}
+
+void BasicWriter::Close() {
+    std::lock_guard<std::mutex> lock(impl_->mutex);
+    Impl& impl = *impl_;
+    if (impl.closed)
+        return;
+    if (impl.update) {
+        gdalsupport::ErrorCapture errors;
+        impl.dataset->FlushCache(false);
+        impl.dataset.reset();
+        impl.closed = true;
+        if (errors.Failed()) {
+            KESTREL_THROW(FileAccessException, impl.path, FileAccessException::WriteFailed,
+                          FormatString("Could not complete %s: %s", impl.path.c_str(),
+                                       errors.Reason().c_str()));
+        }
+        return;
+    }
+    CreateLocked(impl, KESTREL_HERE);
+    const PathParts parts = Split(impl.path);
+    auto fail = [&](const std::string& what, const std::string& reason) {
+        impl.dataset.reset();
+        impl.RemoveTemporaries();
+        impl.closed = true;
+        KESTREL_THROW(
+            FileAccessException, impl.path, FileAccessException::WriteFailed,
+            FormatString("Could not %s %s: %s", what.c_str(), impl.path.c_str(), reason.c_str()));
+    };
+    {
+        gdalsupport::ErrorCapture errors;
+        impl.dataset->FlushCache(false);
+        if (impl.copyOnClose && !errors.Failed()) {
+            CPLStringList options = DefaultCreationOptions(impl.format, impl.type);
+            AddOptions(options, impl.options);
+            const std::string copyPath = parts.dir + impl.tempStem + parts.ext;
+            GDALDatasetPtr copy(impl.driver->CreateCopy(copyPath.c_str(), impl.dataset.get(), TRUE,
+                                                        options.List(), nullptr, nullptr));
+            if (copy == nullptr || errors.Failed())
+                fail("write", errors.Reason());
+            copy.reset();
+        }
+        impl.dataset.reset();
+        if (errors.Failed())
+            fail("write", errors.Reason());
+    }
+    if (impl.copyOnClose) {
+        for (const std::string& name : FilesWithPrefix(parts.dir, impl.tempStem + ".work"))
+            VSIUnlink((parts.dir + name).c_str());
+    }
+    if (impl.format == "MEM") {
+        impl.closed = true;
+        return;
+    }
+    // Files of an older dataset under the final name that the new one does not replace (side
+    // files such as .aux.xml) would describe the new file wrongly: remove them after the move.
+    std::vector<std::string> stale;
+    if (Exists(impl.path)) {
+        gdalsupport::ErrorCapture errors;
+        GDALDatasetPtr old(GDALDataset::Open(impl.path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
+        if (old != nullptr) {
+            char** files = old->GetFileList();
+            for (char** f = files; f != nullptr && *f != nullptr; ++f)
+                stale.emplace_back(*f);
+            CSLDestroy(files);
+        }
+    }
+    std::vector<std::string> moved;
+    for (const std::string& name : FilesWithPrefix(parts.dir, impl.tempStem)) {
+        const std::string target = parts.dir + parts.stem + name.substr(impl.tempStem.size());
+        if (!ReplaceFile(parts.dir + name, target))
+            fail("move the finished file into place as", VSIStrerror(errno));
+        moved.push_back(target);
+    }
+    for (const std::string& file : stale) {
+        bool replaced = false;
+        for (const std::string& m : moved)
+            replaced = replaced || m == file;
+        if (!replaced)
+            VSIUnlink(file.c_str());
+    }
+    impl.closed = true;
+}
+
+bool BasicWriter::IsClosed() const {
+    return impl_->closed;
+}
+
+gobs::Raster* BasicWriter::GetRaster(unsigned int index) {
+    if (index >= impl_->tiling.Count()) {
+        KESTREL_THROW(DataException,
+                      FormatString("Tile %u of %s does not exist: there are %u", index,
+                                   impl_->path.c_str(), impl_->tiling.Count()));
+    }
+    const Window w = impl_->tiling.Tile(index);
+    return ReadWindow(w.x, w.y, w.width, w.height);
+}
+
+RasterIterator BasicWriter::FindRaster(unsigned int x, unsigned int y) {
+    return RasterIterator(this, impl_->tiling.Find(x, y));
+}
+RasterIterator BasicWriter::Begin() {
+    return RasterIterator(this, 0);
+}
+RasterIterator BasicWriter::End() {
+    return RasterIterator(this, impl_->tiling.Count());
+}
+unsigned int BasicWriter::GetTileCount() const {
+    return impl_->tiling.Count();
+}
+void BasicWriter::SetOptimalTileSize() {
+    std::lock_guard<std::mutex> lock(impl_->mutex);
+    impl_->tileSizeSet = false;
+    if (impl_->dataset != nullptr) {
+        int w = 0;
+        int h = 0;
+        impl_->dataset->GetRasterBand(1)->GetBlockSize(&w, &h);
+        impl_->tiling.tileWidth = static_cast<unsigned int>(std::max(1, w));
+        impl_->tiling.tileHeight = static_cast<unsigned int>(std::max(1, h));
+    } else {
+        // The block size of the files this writer creates.
+        impl_->tiling.tileWidth = 256;
+        impl_->tiling.tileHeight = 256;
+    }
+}
+void BasicWriter::SetTileSize(unsigned int width, unsigned int height) {
+    if (width == 0 || height == 0) {
+        KESTREL_THROW(DataException,
+                      FormatString("Tile size %u x %u of %s: tiles need at least one pixel", width,
+                                   height, impl_->path.c_str()));
+    }
+    impl_->tiling.tileWidth = width;
+    impl_->tiling.tileHeight = height;
+    impl_->tileSizeSet = true;
+}
+unsigned int BasicWriter::GetTileWidth() const {
+    return impl_->tiling.tileWidth;
+}
+unsigned int BasicWriter::GetTileHeight() const {
+    return impl_->tiling.tileHeight;
+}
+const std::vector<IChannelInfo*>& BasicWriter::GetChannelsInfo() const {
+    return impl_->infos.View();
+}
+std::string BasicWriter::GetPath() const {
+    return impl_->path;
+}
+unsigned int BasicWriter::GetWidth() const {
+    return impl_->tiling.width;
+}
+unsigned int BasicWriter::GetHeight() const {
+    return impl_->tiling.height;
+}
+unsigned int BasicWriter::GetChannelCount() const {
+    return impl_->channelCount;
+}
+std::vector<unsigned int> BasicWriter::GetChannels() const {
+    std::vector<unsigned int> channels;
+    for (unsigned int c = 0; c < impl_->channelCount; ++c)
+        channels.push_back(c < impl_->channelNumbers.size() ? impl_->channelNumbers[c] : c + 1);
+    return channels;
+}
+DataType BasicWriter::GetDataType() const {
+    return impl_->type;
+}
+const ogc::cs::ICRS* BasicWriter::GetCRS() const {
+    return impl_->crs.get();
+}
+const ogc::cs::GeocodingInfo* BasicWriter::GetGeocoding() const {
+    return impl_->geocoding.get();
+}
+bool BasicWriter::GetNoDataValue(unsigned int c, double& value) const {
+    if (c >= impl_->noData.size() || !impl_->noData[c].has_value())
+        return false;
+    value = *impl_->noData[c];
+    return true;
+}
+
+}  // namespace datasources
+}  // namespace kestrel

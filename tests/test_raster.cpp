@@ -1,0 +1,537 @@
+// Raster datasets, readers and writers on GDAL, and the utility functions that make them.
+#include <cstdlib>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include <gdal_priv.h>
+#include <gtest/gtest.h>
+
+#include <kestrel/formats.h>
+#include <kestrel/orthoutils.h>
+#include <kestrel/rasterio.h>
+#include <silvan/utils.h>
+
+#include "support.h"
+
+#if defined(_WIN32)
+#define popen _popen
+#define pclose _pclose
+#endif
+
+using kestrel::datasources::BasicReader;
+using kestrel::datasources::BasicWriter;
+using kestrel::datasources::DataType;
+using kestrel::datasources::IDataset;
+using kestrel::datasources::IRasterDataset;
+using kestrel::datasources::IRasterReader;
+using kestrel::datasources::IRasterWriter;
+using kestrel::gobs::Raster;
+using testsupport::TempDir;
+
+namespace {
+
+// The value of a test image at (x, y) of band b (from 1): distinct per band and pixel.
+double Pattern(int x, int y, int b) {
+    return (x * 7 + y * 13 + b * 50) % 251;
+}
+
+struct ImageSpec {
+    int width = 300;
+    int height = 200;
+    std::vector<GDALDataType> types{GDT_Byte, GDT_Byte, GDT_Byte};
+    const char* blocks = "TILED=YES";
+    bool noData = false;
+};
+
+// A georeferenced GeoTIFF made with GDAL itself (bands of mixed types through a VRT of MEM
+// bands is more than a test needs: mixed types are made as separate GeoTIFF bands in a VRT).
+std::string MakeImage(const TempDir& dir, const std::string& name, const ImageSpec& spec) {
+    GDALAllRegister();
+    const std::string path = dir.File(name);
+    std::vector<std::string> parts;
+    for (std::size_t b = 0; b < spec.types.size(); ++b) {
+        const std::string part = spec.types.size() == 1 || spec.types[0] == spec.types[b]
+                                     ? path
+                                     : dir.File(name + ".band" + std::to_string(b + 1) + ".tif");
+        parts.push_back(part);
+    }
+    const bool mixed = std::any_of(spec.types.begin(), spec.types.end(),
+                                   [&](GDALDataType t) { return t != spec.types[0]; });
+    auto make = [&](const std::string& file, int bands, GDALDataType type, int firstBand) {
+        char** options = CSLAddString(nullptr, spec.blocks);
+        GDALDataset* ds = GetGDALDriverManager()->GetDriverByName("GTiff")->Create(
+            file.c_str(), spec.width, spec.height, bands, type, options);
+        CSLDestroy(options);
+        double gt[6] = {500000, 0.5, 0, 4100000, 0, -0.5};
+        ds->SetGeoTransform(gt);
+        OGRSpatialReference srs;
+        srs.importFromEPSG(32632);
+        ds->SetSpatialRef(&srs);
+        std::vector<double> line(spec.width);
+        for (int b = 1; b <= bands; ++b) {
+            GDALRasterBand* band = ds->GetRasterBand(b);
+            if (spec.noData)
+                band->SetNoDataValue(0);
+            for (int y = 0; y < spec.height; ++y) {
+                for (int x = 0; x < spec.width; ++x)
+                    line[x] = Pattern(x, y, firstBand + b - 1);
+                EXPECT_EQ(band->RasterIO(GF_Write, 0, y, spec.width, 1, line.data(), spec.width, 1,
+                                         GDT_Float64, 0, 0, nullptr),
+                          CE_None);
+            }
+        }
+        GDALClose(ds);
+    };
+    if (!mixed) {
+        make(path, static_cast<int>(spec.types.size()), spec.types[0], 1);
+        return path;
+    }
+    // Mixed types: one file per band, gathered by a VRT.
+    const std::string vrt = dir.File(name + ".vrt");
+    std::string xml = "<VRTDataset rasterXSize=\"" + std::to_string(spec.width) +
+                      "\" rasterYSize=\"" + std::to_string(spec.height) + "\">\n";
+    for (std::size_t b = 0; b < spec.types.size(); ++b) {
+        const std::string file = dir.File(name + ".band" + std::to_string(b + 1) + ".tif");
+        make(file, 1, spec.types[b], static_cast<int>(b) + 1);
+        xml += "<VRTRasterBand dataType=\"" + std::string(GDALGetDataTypeName(spec.types[b])) +
+               "\" band=\"" + std::to_string(b + 1) + "\"><SimpleSource><SourceFilename>" + file +
+               "</SourceFilename><SourceBand>1</SourceBand></SimpleSource></VRTRasterBand>\n";
+    }
+    xml += "</VRTDataset>\n";
+    testsupport::WriteFile(vrt, xml);
+    return vrt;
+}
+
+std::string RunCommand(const std::string& command) {
+    std::string output;
+    FILE* pipe = popen(command.c_str(), "r");
+    if (pipe == nullptr)
+        return output;
+    char buffer[4096];
+    std::size_t n = 0;
+    while ((n = fread(buffer, 1, sizeof buffer, pipe)) > 0)
+        output.append(buffer, n);
+    pclose(pipe);
+    return output;
+}
+
+}  // namespace
+
+// ---------------------------------------------------------------------------------------------
+// Datasets
+
+TEST(RasterDataset, DescribesTheFileAsGdalDoes) {
+    TempDir dir;
+    ImageSpec spec;
+    spec.noData = true;
+    const std::string path = MakeImage(dir, "a.tif", spec);
+    std::unique_ptr<IDataset> ds(GetRasterDataset(path));
+    auto* raster = dynamic_cast<IRasterDataset*>(ds.get());
+    ASSERT_NE(raster, nullptr);
+    EXPECT_EQ(raster->GetWidth(), 300u);
+    EXPECT_EQ(raster->GetHeight(), 200u);
+    EXPECT_EQ(raster->GetChannelCount(), 3u);
+    EXPECT_EQ(raster->GetDataType(2), DataType::Byte);
+    double noData = -1;
+    EXPECT_TRUE(raster->GetNoDataValue(3, noData));
+    EXPECT_EQ(noData, 0);
+    ASSERT_NE(raster->GetCRS(), nullptr);
+    EXPECT_TRUE(raster->GetCRS()->IsSame(kestrel::ogc::cs::ICRS("EPSG:32632")));
+    ASSERT_NE(raster->GetGeocoding(), nullptr);
+    EXPECT_EQ(raster->GetGeocoding()->GetGeoTransform()[0], 500000);
+    EXPECT_EQ(raster->GetFormatName(), "GTiff");
+}
+
+TEST(RasterDataset, PathThatIsNoRasterThrowsFileNotFoundWithThePath) {
+    TempDir dir;
+    for (const std::string& path :
+         {dir.File("missing.tif"), testsupport::WriteFile(dir.File("junk.tif"), "not a tiff")}) {
+        try {
+            delete GetRasterDataset(path);
+            ADD_FAILURE() << path;
+        } catch (const kestrel::FileNotFoundException& e) {
+            EXPECT_EQ(e.GetFileName(), path);
+            EXPECT_EQ(e.GetErrorMessage(), "");
+            testsupport::ExpectThrownFrom(e, e.GetFunction(), "utils.cpp");
+            EXPECT_NE(e.GetFunction().find("GetRasterDataset"), std::string::npos);
+        }
+    }
+    // The platform's own dataset is never null and says why it is not valid.
+    IDataset* ds = nullptr;
+    unsigned int w = 1;
+    unsigned int h = 1;
+    GetSrcDataset(dir.File("missing.tif"), ds, w, h);
+    ASSERT_NE(ds, nullptr);
+    EXPECT_FALSE(ds->IsValid());
+    EXPECT_NE(ds->GetInvalidReason().find("missing.tif"), std::string::npos);
+    delete ds;
+}
+
+// ---------------------------------------------------------------------------------------------
+// Readers
+
+TEST(RasterReader, ReadsTheSamePixelsAsGdal) {
+    TempDir dir;
+    ImageSpec spec;
+    spec.blocks = "BLOCKYSIZE=7";  // strips, cut across by the window
+    const std::string path = MakeImage(dir, "a.tif", spec);
+    std::unique_ptr<IRasterReader> reader(GetRasterReader(path));
+    std::unique_ptr<Raster> window(reader->ReadWindow(290, 195, 10, 5));
+    ASSERT_EQ(window->GetChannelCount(), 3u);
+    EXPECT_EQ(window->GetX(), 290u);
+    EXPECT_EQ(window->GetY(), 195u);
+    for (unsigned int c = 0; c < 3; ++c)
+        for (unsigned int y = 0; y < 5; ++y)
+            for (unsigned int x = 0; x < 10; ++x)
+                ASSERT_EQ(window->GetValue(c, x, y), Pattern(290 + x, 195 + y, c + 1));
+    // Band-sequential buffer.
+    const auto* bytes = static_cast<const unsigned char*>(window->GetData());
+    EXPECT_EQ(bytes[50 + 10 + 3], Pattern(293, 196, 2));
+}
+
+TEST(RasterReader, ChannelsOfADatasetInTheOrderGiven) {
+    TempDir dir;
+    const std::string path = MakeImage(dir, "a.tif", ImageSpec());
+    std::unique_ptr<IDataset> ds(GetRasterDataset(path));
+    std::unique_ptr<IRasterReader> reader(GetRasterReader(ds.get(), {3, 1}));
+    EXPECT_EQ(reader->GetChannels(), (std::vector<unsigned int>{3, 1}));
+    std::unique_ptr<Raster> window(reader->ReadWindow(4, 5, 2, 2));
+    EXPECT_EQ(window->GetValue(0, 1, 1), Pattern(5, 6, 3));
+    EXPECT_EQ(window->GetValue(1, 1, 1), Pattern(5, 6, 1));
+    ASSERT_EQ(reader->GetChannelsInfo().size(), 2u);
+    EXPECT_EQ(reader->GetChannelsInfo()[0]->GetChannel(), 3u);
+    reader.reset();
+    // The dataset stays the caller's.
+    EXPECT_TRUE(ds->IsValid());
+}
+
+TEST(RasterReader, TilesCoverTheImageOnce) {
+    TempDir dir;
+    const std::string path = MakeImage(dir, "a.tif", ImageSpec());
+    BasicReader reader(path);
+    reader.SetOptimalTileSize();
+    EXPECT_EQ(reader.GetTileWidth(), 256u);  // the file's blocks
+    reader.SetTileSize(128, 64);
+    EXPECT_EQ(reader.GetTileCount(), 3u * 4u);
+    unsigned long long pixels = 0;
+    unsigned int count = 0;
+    for (auto it = reader.Begin(); it != reader.End(); ++it, ++count) {
+        std::unique_ptr<Raster> tile(*it);
+        EXPECT_EQ(tile->GetX(), it.GetX());
+        EXPECT_EQ(tile->GetValue(1, 0, 0), Pattern(it.GetX(), it.GetY(), 2));
+        pixels += static_cast<unsigned long long>(tile->GetWidth()) * tile->GetHeight();
+    }
+    EXPECT_EQ(count, 12u);
+    EXPECT_EQ(pixels, 300u * 200u);
+    auto found = reader.FindRaster(299, 199);
+    EXPECT_EQ(found.GetIndex(), 11u);
+    EXPECT_EQ(found.GetWidth(), 300u - 256u);
+    EXPECT_TRUE(reader.FindRaster(300, 0) == reader.End());
+}
+
+TEST(RasterReader, BadInputGivesClearErrors) {
+    TempDir dir;
+    const std::string path = MakeImage(dir, "a.tif", ImageSpec());
+    BasicReader reader(path);
+    for (auto w : std::vector<std::vector<unsigned int>>{
+             {0, 0, 0, 1}, {299, 0, 2, 1}, {0, 199, 1, 2}, {4000000000u, 0, 1, 1}}) {
+        try {
+            delete reader.ReadWindow(w[0], w[1], w[2], w[3]);
+            ADD_FAILURE() << w[0];
+        } catch (const kestrel::DataException& e) {
+            EXPECT_NE(std::string(e.what()).find("a.tif"), std::string::npos) << e.what();
+        }
+    }
+    std::unique_ptr<IDataset> ds(GetRasterDataset(path));
+    try {
+        delete GetRasterReader(ds.get(), {1, 4});
+        ADD_FAILURE();
+    } catch (const kestrel::DataException& e) {
+        EXPECT_NE(std::string(e.what()).find("Channel 4"), std::string::npos) << e.what();
+        EXPECT_NE(std::string(e.what()).find("3 channels"), std::string::npos) << e.what();
+    }
+    EXPECT_THROW(BasicReader(dir.File("none.tif")), kestrel::FileNotFoundException);
+    // A truncated file opens but cannot be read: the probe reports it with GDAL's reason.
+    const std::string bytes = testsupport::ReadFile(path);
+    const std::string cut =
+        testsupport::WriteFile(dir.File("cut.tif"), bytes.substr(0, bytes.size() / 3));
+    try {
+        delete GetRasterReader(cut);
+        ADD_FAILURE();
+    } catch (const kestrel::FileAccessException& e) {
+        EXPECT_EQ(e.GetFileName(), cut);
+    }
+}
+
+// ---------------------------------------------------------------------------------------------
+// Writers
+
+namespace {
+
+// Writes a 64 x 48 three-channel byte ortho with CRS, geocoding and no-data 0, tile by tile.
+void WriteOrtho(IRasterWriter& writer) {
+    writer.SetSize(64, 48);
+    writer.SetDataType(DataType::Byte);
+    const kestrel::ogc::cs::ICRS crs("EPSG:32632");
+    writer.SetCRS(&crs);
+    writer.SetGeocoding(kestrel::ogc::cs::GeocodingInfo::NorthUp(500000, 4100000, 0.5, 0.5));
+    writer.SetNoDataValue(0);
+    writer.SetTileSize(32, 16);
+    for (auto it = writer.Begin(); it != writer.End(); ++it) {
+        std::unique_ptr<Raster> tile(*it);
+        for (unsigned int c = 0; c < 3; ++c)
+            for (unsigned int y = 0; y < tile->GetHeight(); ++y)
+                for (unsigned int x = 0; x < tile->GetWidth(); ++x)
+                    tile->SetValue(c, x, y, Pattern(tile->GetX() + x, tile->GetY() + y, c + 1));
+        writer.Write(*tile);
+    }
+}
+
+}  // namespace
+
+TEST(RasterWriter, EachFileTypeOpensInGdalinfoWithWhatWasWritten) {
+    TempDir dir;
+    for (const char* type : {"tif", "COG", "gpkg", "png", "img"}) {
+        SCOPED_TRACE(type);
+        const std::string path = dir.File(std::string("ortho.") + type);
+        {
+            std::unique_ptr<IRasterWriter> writer(GetRasterWriter(path, type, {1, 2, 3}));
+            WriteOrtho(*writer);
+            EXPECT_FALSE(std::filesystem::exists(path));
+            writer->Close();
+        }
+        const std::string info = RunCommand("gdalinfo -json '" + path + "'");
+        EXPECT_NE(info.find("ID[\\\"EPSG\\\",32632]"), std::string::npos) << info;
+        EXPECT_NE(info.find("500000.0,"), std::string::npos) << info;
+        EXPECT_NE(info.find("4100000.0,"), std::string::npos) << info;
+        if (std::string(type) != "gpkg") {  // GeoPackage has no no-data for byte tiles
+            EXPECT_NE(info.find("\"noDataValue\":0.0"), std::string::npos) << info;
+        }
+        BasicReader reader(path);
+        std::unique_ptr<Raster> all(reader.ReadWindow(0, 0, 64, 48));
+        for (unsigned int c = 0; c < 3; ++c)
+            for (unsigned int y = 0; y < 48; y += 5)
+                for (unsigned int x = 0; x < 64; x += 3)
+                    ASSERT_EQ(all->GetValue(c, x, y), Pattern(x, y, c + 1)) << c << " " << x;
+    }
+    // Nothing but the outputs (and their side files) is left in the directory.
+    for (const auto& entry : std::filesystem::directory_iterator(dir.Path()))
+        EXPECT_EQ(entry.path().filename().string().find(".tmp-"), std::string::npos)
+            << entry.path();
+}
+
+TEST(RasterWriter, WithoutCloseTheFinalNameIsUntouched) {
+    TempDir dir;
+    const std::string path = dir.File("ortho.tif");
+    testsupport::WriteFile(path, "previous");
+    for (const char* type : {"tif", "cog"}) {
+        std::unique_ptr<IRasterWriter> writer(GetRasterWriter(path, type, {1, 2, 3}));
+        WriteOrtho(*writer);
+    }
+    EXPECT_EQ(testsupport::ReadFile(path), "previous");
+    EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path()),
+                            std::filesystem::directory_iterator()),
+              1);
+}
+
+TEST(RasterWriter, FailuresNameTheFileAndLeaveNothing) {
+    TempDir dir;
+    // A directory that cannot be written (skipped where permissions do not apply, as for root).
+    const auto locked = dir.Path() / "locked";
+    std::filesystem::create_directory(locked);
+    std::filesystem::permissions(
+        locked, std::filesystem::perms::owner_read | std::filesystem::perms::owner_exec);
+    if (!testsupport::WriteFile((locked / "probe").string(), "x").empty() &&
+        std::filesystem::exists(locked / "probe")) {
+        std::filesystem::remove(locked / "probe");
+    } else {
+        const std::string path = (locked / "ortho.tif").string();
+        std::unique_ptr<IRasterWriter> writer(GetRasterWriter(path, "tif", {1}));
+        writer->SetSize(16, 16);
+        writer->SetDataType(DataType::Byte);
+        try {
+            writer->Create();
+            ADD_FAILURE();
+        } catch (const kestrel::FileAccessException& e) {
+            EXPECT_EQ(e.GetFileName(), path);
+            EXPECT_EQ(e.GetType(), kestrel::FileAccessException::CreateFailed);
+        }
+    }
+    std::filesystem::permissions(locked, std::filesystem::perms::owner_all);
+    // PNG cannot hold floating-point values: the copy on close fails, and no file is left.
+    const std::string png = dir.File("ortho.png");
+    {
+        std::unique_ptr<IRasterWriter> writer(GetRasterWriter(png, "png", {1}));
+        writer->SetSize(16, 16);
+        writer->SetDataType(DataType::Float64);
+        try {
+            writer->Close();
+            ADD_FAILURE();
+        } catch (const kestrel::FileAccessException& e) {
+            EXPECT_EQ(e.GetFileName(), png);
+        }
+    }
+    EXPECT_TRUE(std::filesystem::is_empty(dir.Path() / "locked"));
+    std::filesystem::remove(dir.Path() / "locked");
+    EXPECT_TRUE(std::filesystem::is_empty(dir.Path()));
+    // Unknown types and formats.
+    try {
+        delete GetRasterWriter(dir.File("a.xyz1"), "xyz1", {1});
+        ADD_FAILURE();
+    } catch (const kestrel::ParameterException& e) {
+        EXPECT_EQ(e.GetType(), kestrel::ParameterException::Unsupported);
+        EXPECT_EQ(e.GetValue(), "xyz1");
+        EXPECT_NE(e.GetExpected().find("gpkg"), std::string::npos);
+    }
+}
+
+// ---------------------------------------------------------------------------------------------
+// What the utility functions pass to the raster components
+
+namespace {
+
+// Records the raster components' calls as texts, in order.
+class Recorder : public kestrel::datasources::RasterIOObserver {
+  public:
+    void ReaderCreated(const IRasterReader* reader, const std::string& /*path*/,
+                       const std::vector<unsigned int>& channels) override {
+        Add("reader " + Channels(channels), reader);
+    }
+    void WindowRead(const IRasterReader* reader, unsigned int x, unsigned int y, unsigned int w,
+                    unsigned int h, const Raster* result) override {
+        Add("read " + std::to_string(x) + "," + std::to_string(y) + "," + std::to_string(w) + "," +
+                std::to_string(h),
+            reader);
+        lastRead = result;
+    }
+    void WriterCreated(const IRasterWriter* writer, const std::string& /*path*/,
+                       const std::vector<unsigned int>& channels, const std::string& format,
+                       const std::string& options) override {
+        Add("writer " + Channels(channels) + " " + format + " [" + options + "]", writer);
+    }
+    void FormatNameLookedUp(const std::string& fileType, const std::string& format) override {
+        Add("lookup " + fileType + " " + format, nullptr);
+    }
+    void RasterDeleted(const Raster* raster) override {
+        if (raster == lastRead)
+            Add("deleted the read raster", nullptr);
+    }
+
+    std::vector<std::string> events;
+    std::vector<const void*> subjects;
+    const Raster* lastRead = nullptr;
+
+  private:
+    static std::string Channels(const std::vector<unsigned int>& channels) {
+        std::string text;
+        for (unsigned int c : channels)
+            text += (text.empty() ? "" : ",") + std::to_string(c);
+        return "{" + text + "}";
+    }
+    void Add(const std::string& event, const void* subject) {
+        events.push_back(event);
+        subjects.push_back(subject);
+    }
+};
+
+}  // namespace
+
+TEST(RasterUtils, ReadersAreProbedOnceAtTheFirstPixelAndTheProbeIsDeleted) {
+    TempDir dir;
+    const std::string path = MakeImage(dir, "a.tif", ImageSpec());
+    std::unique_ptr<IDataset> ds(GetRasterDataset(path));
+    auto recorder = std::make_shared<Recorder>();
+    kestrel::datasources::ScopedRasterIOObserver scope(recorder);
+    std::unique_ptr<IRasterReader> onFile(GetRasterReader(path));
+    std::unique_ptr<IRasterReader> onDataset(GetRasterReader(ds.get(), {2, 3}));
+    EXPECT_EQ(recorder->events, (std::vector<std::string>{
+                                    "reader {1,2,3}", "read 0,0,1,1", "deleted the read raster",
+                                    "reader {2,3}", "read 0,0,1,1", "deleted the read raster"}));
+    EXPECT_EQ(recorder->subjects[1], onFile.get());
+    EXPECT_EQ(recorder->subjects[4], onDataset.get());
+}
+
+TEST(RasterUtils, WritersGetTheFormatNameFirstAndNoProbe) {
+    TempDir dir;
+    auto recorder = std::make_shared<Recorder>();
+    kestrel::datasources::ScopedRasterIOObserver scope(recorder);
+    std::unique_ptr<IRasterWriter> typed(GetRasterWriter(dir.File("o.tif"), "TIF", {1, 2}));
+    std::unique_ptr<IRasterWriter> plain(GetRasterWriter(dir.File("p.tif")));
+    EXPECT_EQ(recorder->events, (std::vector<std::string>{
+                                    "lookup TIF GTiff", "writer {1,2} GTiff []", "writer {}  []"}));
+    EXPECT_EQ(dynamic_cast<BasicWriter*>(plain.get())->GetFormatName(), "GTiff");
+}
+
+TEST(RasterUtils, FileTypesNameGdalFormats) {
+    const std::vector<std::pair<std::string, std::string>> table = {
+        {"tif", "GTiff"}, {"TIFF", "GTiff"},  {"cog", "COG"},       {"vrt", "VRT"},
+        {"img", "HFA"},   {"Gpkg", "GPKG"},   {"png", "PNG"},       {"jpg", "JPEG"},
+        {"JPEG", "JPEG"}, {"hdr", "ENVI"},    {"envi", "ENVI"},     {"ntf", "NITF"},
+        {"mem", "MEM"},   {"GTiff", "GTiff"}, {"netcdf", "netCDF"}, {"SAGA", "SAGA"}};
+    for (const auto& [type, format] : table)
+        EXPECT_EQ(kestrel::core::FType2FormatName(type), format) << type;
+    for (const std::string& type :
+         std::vector<std::string>{"", "tiff2", "ESRI Shapefile", std::string("tif\0x", 5)}) {
+        try {
+            kestrel::core::FType2FormatName(type);
+            ADD_FAILURE() << type;
+        } catch (const kestrel::ParameterException& e) {
+            EXPECT_EQ(e.GetType(), kestrel::ParameterException::Unsupported);
+            EXPECT_EQ(e.GetValue(), type);
+            EXPECT_NE(std::string(e.what()).find("tif, tiff"), std::string::npos) << e.what();
+        }
+    }
+}
+
+TEST(RasterUtils, SourceAndOrthoChannelsOfOneDataType) {
+    TempDir dir;
+    ImageSpec spec;
+    spec.types = {GDT_Byte, GDT_UInt16, GDT_Byte};
+    std::unique_ptr<IDataset> ds(GetRasterDataset(MakeImage(dir, "mixed", spec)));
+    std::vector<unsigned int> src{9};
+    std::vector<unsigned int> ortho{8, 7};
+    GetSrcOrthoChans(ds.get(), {3, 1}, src, ortho);
+    EXPECT_EQ(src, (std::vector<unsigned int>{3, 1}));
+    EXPECT_EQ(ortho, (std::vector<unsigned int>{1, 2}));
+    try {
+        GetSrcOrthoChans(ds.get(), {1, 2}, src, ortho);
+        ADD_FAILURE();
+    } catch (const kestrel::DataException& e) {
+        EXPECT_EQ(e.GetErrorMessage(),
+                  "All channels must belong to the same datatype, but 2 data types are found.");
+        EXPECT_EQ(e.GetSourceFile(), "utils.cpp");
+    }
+    EXPECT_EQ(src, (std::vector<unsigned int>{3, 1}));
+    EXPECT_EQ(ortho, (std::vector<unsigned int>{1, 2}));
+    // GetChanGroups itself: groups by type in order, an empty list for every channel, ortho
+    // channels numbered in the group or across the list.
+    std::vector<SrcChanInfo> infos;
+    std::vector<ChanGroup> groups;
+    GetChanGroups("", {}, ds.get(), infos, groups, false);
+    ASSERT_EQ(groups.size(), 2u);
+    EXPECT_EQ(groups[0].srcChans, (std::vector<unsigned int>{1, 3}));
+    EXPECT_EQ(groups[0].orthoChans, (std::vector<unsigned int>{1, 2}));
+    EXPECT_EQ(groups[1].srcChans, (std::vector<unsigned int>{2}));
+    EXPECT_EQ(groups[1].dataType, DataType::UInt16);
+    EXPECT_EQ(infos.size(), 3u);
+    GetChanGroups("", {2, 1, 3}, ds.get(), infos, groups, true);
+    EXPECT_EQ(groups[1].orthoChans, (std::vector<unsigned int>{2, 3}));
+    try {
+        GetSrcOrthoChans(ds.get(), {1, 0}, src, ortho);
+        ADD_FAILURE();
+    } catch (const kestrel::DataException& e) {
+        EXPECT_NE(std::string(e.what()).find("Channel 0"), std::string::npos) << e.what();
+        EXPECT_NE(std::string(e.what()).find("3 channels"), std::string::npos) << e.what();
+    }
+}
+
+TEST(RasterUtils, DiskIdIsTheDeviceOfTheFile) {
+    TempDir dir;
+    const std::string a = testsupport::WriteFile(dir.File("a.txt"), "a");
+    const std::string b = testsupport::WriteFile(dir.File("b.txt"), "b");
+    EXPECT_NE(GetDiskId(a), 0u);
+    EXPECT_EQ(GetDiskId(a), GetDiskId(b));
+    EXPECT_EQ(GetDiskId(dir.File("missing.txt")), 0u);
+    EXPECT_EQ(GetDiskId(""), 0u);
+}

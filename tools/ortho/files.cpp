@@ -1,0 +1,72 @@
+#include "files.h"
+
+#include <chrono>
+#include <filesystem>
+#include <system_error>
+
+#ifdef _WIN32
+#include <process.h>
+#else
+#include <unistd.h>
+#endif
+
+namespace fs = std::filesystem;
+
+namespace ortho {
+
+std::string PartName(const std::string& path) {
+    const fs::path p(path);
+    return (p.parent_path() / (p.stem().string() + ".part" + p.extension().string())).string();
+}
+
+std::string UniquePartName(const std::string& path) {
+#ifdef _WIN32
+    const long long pid = _getpid();
+#else
+    const long long pid = getpid();
+#endif
+    return PartName(path) + "." + std::to_string(pid);
+}
+
+void Publish(const std::string& part, const std::string& path) {
+    std::error_code ec;
+    fs::rename(part, path, ec);
+    if (ec)
+        KESTREL_THROW(kestrel::FileAccessException, path, kestrel::FileAccessException::WriteFailed,
+                      "cannot be renamed from " + part + ": " + ec.message());
+}
+
+bool FileExists(const std::string& path) {
+    std::error_code ec;
+    return fs::exists(path, ec);
+}
+
+void RemoveFile(const std::string& path) {
+    std::error_code ec;
+    fs::remove(path, ec);
+}
+
+double ModifiedTime(const std::string& path) {
+    std::error_code ec;
+    const auto time = fs::last_write_time(path, ec);
+    if (ec)
+        return -1.0;
+    return std::chrono::duration<double>(time.time_since_epoch()).count();
+}
+
+std::string Explain(const std::exception& error) {
+    const auto* file = dynamic_cast<const kestrel::FileException*>(&error);
+    if (file == nullptr || file->GetFileName().empty())
+        return error.what();
+    std::string message = file->GetErrorMessage();
+    if (message.empty())
+        message = dynamic_cast<const kestrel::FileNotFoundException*>(&error) != nullptr
+                      ? "not found or not readable"
+                      : "cannot be used";
+    // Some messages name the file already.
+    if (message.find(file->GetFileName()) != std::string::npos)
+        return message;
+    return file->GetFileName() + ": " + message;
+}
+
+}  // namespace ortho

@@ -1,0 +1,211 @@
+#include "options.h"
+
+#include <cerrno>
+#include <cmath>
+#include <cstdlib>
+#include <limits>
+
+namespace ortho {
+
+namespace {
+
+std::string Quoted(const std::string& text) {
+    return "\"" + text + "\"";
+}
+
+double ParseNumber(const std::string& option, const std::string& text) {
+    const char* begin = text.c_str();
+    char* end = nullptr;
+    errno = 0;
+    const double value = std::strtod(begin, &end);
+    if (text.empty() || end != begin + text.size() || errno == ERANGE || !std::isfinite(value))
+        throw UsageError(option + ": " + Quoted(text) + " is not a number");
+    return value;
+}
+
+unsigned int ParseCount(const std::string& option, const std::string& text) {
+    if (text.empty() || text.find_first_not_of("0123456789") != std::string::npos)
+        throw UsageError(option + ": " + Quoted(text) + " is not a whole number");
+    errno = 0;
+    const unsigned long long value = std::strtoull(text.c_str(), nullptr, 10);
+    if (errno == ERANGE || value > std::numeric_limits<unsigned int>::max())
+        throw UsageError(option + ": " + Quoted(text) + " is too large");
+    return static_cast<unsigned int>(value);
+}
+
+std::vector<float> ParseFactors(const std::string& option, const std::string& text) {
+    std::vector<float> factors;
+    std::string::size_type start = 0;
+    for (;;) {
+        const auto comma = text.find(',', start);
+        const std::string item = text.substr(start, comma - start);
+        const double value = ParseNumber(option, item);
+        if (std::fabs(value) > std::numeric_limits<float>::max())
+            throw UsageError(option + ": " + Quoted(item) + " is too large");
+        factors.push_back(static_cast<float>(value));
+        if (comma == std::string::npos)
+            break;
+        start = comma + 1;
+    }
+    return factors;
+}
+
+// "A:B", "A:" (to the end) or "A" (one line).
+void ParseLines(const std::string& text, Options& options) {
+    const auto colon = text.find(':');
+    options.hasLines = true;
+    options.firstLine = ParseCount("--lines", text.substr(0, colon));
+    if (colon == std::string::npos) {
+        if (options.firstLine == std::numeric_limits<unsigned int>::max())
+            throw UsageError("--lines: " + Quoted(text) + " is too large");
+        options.endLine = options.firstLine + 1;
+        return;
+    }
+    const std::string end = text.substr(colon + 1);
+    options.endLine =
+        end.empty() ? std::numeric_limits<unsigned int>::max() : ParseCount("--lines", end);
+    if (options.endLine <= options.firstLine)
+        throw UsageError("--lines: " + Quoted(text) +
+                         " is an empty slice (A:B runs lines A to B-1, counted from 0)");
+}
+
+}  // namespace
+
+Options ParseOptions(const std::vector<std::string>& args) {
+    Options options;
+    std::vector<std::string> positional;
+    for (std::size_t i = 0; i < args.size(); ++i) {
+        std::string name = args[i];
+        std::string value;
+        bool hasValue = false;
+        if (name.size() > 2 && name.compare(0, 2, "--") == 0) {
+            const auto equals = name.find('=');
+            if (equals != std::string::npos) {
+                value = name.substr(equals + 1);
+                name.erase(equals);
+                hasValue = true;
+            }
+        } else if (name.empty() || name[0] != '-' || name == "-") {
+            positional.push_back(name);
+            continue;
+        }
+        const auto flag = [&]() {
+            if (hasValue)
+                throw UsageError(name + " takes no value");
+        };
+        const auto take = [&]() -> std::string {
+            if (hasValue)
+                return value;
+            if (i + 1 >= args.size())
+                throw UsageError(name + " needs a value");
+            return args[++i];
+        };
+        if (name == "-h" || name == "--help") {
+            flag();
+            options.help = true;
+        } else if (name == "--out" || name == "-o") {
+            options.outDir = take();
+        } else if (name == "--dem") {
+            options.dem = take();
+        } else if (name == "--tin") {
+            options.tin = take();
+        } else if (name == "--elevref") {
+            options.elevref = take();
+        } else if (name == "--elfactor") {
+            options.elfactor = ParseFactors(name, take());
+        } else if (name == "--elunits") {
+            options.elunits = take();
+        } else if (name == "--srs") {
+            options.srs = take();
+        } else if (name == "--pixel-size") {
+            const std::string text = take();
+            options.pixelSize = ParseNumber(name, text);
+            if (options.pixelSize < 0.0)
+                throw UsageError(name + ": " + Quoted(text) + " is negative");
+        } else if (name == "--resample") {
+            options.resample = take();
+        } else if (name == "--proc") {
+            options.proc = take();
+        } else if (name == "--of") {
+            options.format = take();
+        } else if (name == "--jobs" || name == "-j") {
+            const std::string text = take();
+            options.jobs = ParseCount(name, text);
+            if (options.jobs == 0)
+                throw UsageError(name + ": at least one job is needed");
+        } else if (name == "--lines") {
+            ParseLines(take(), options);
+        } else if (name == "--keep-going" || name == "-k") {
+            flag();
+            options.keepGoing = true;
+        } else if (name == "--quiet" || name == "-q") {
+            flag();
+            options.quiet = true;
+        } else {
+            throw UsageError("unknown option " + Quoted(name) + " (see --help)");
+        }
+    }
+    if (options.help)
+        return options;
+    if (positional.size() != 1)
+        throw UsageError(positional.empty() ? "the master parameter file is missing"
+                                            : "one master parameter file is expected, not " +
+                                                  std::to_string(positional.size()));
+    options.master = positional[0];
+    if (options.outDir.empty())
+        throw UsageError("--out DIR is missing");
+    if (options.dem.empty() == options.tin.empty())
+        throw UsageError("give the surface model with exactly one of --dem and --tin");
+    if (options.format.empty())
+        throw UsageError("--of: the file type is empty");
+    if (options.resample.empty())
+        throw UsageError("--resample: the method is empty");
+    return options;
+}
+
+std::string UsageText() {
+    return R"(usage: silvan-ortho MASTER --out DIR (--dem DSM | --tin TIN) [options]
+
+Runs the true-ortho workflow of a master parameter file: derives the preparation and image-set
+files, makes the ortho, visibility index, scene description and footprint of every scene on one
+common grid, then fills the hidden ground of each image from the others (occlusion recovery)
+into a true-ortho mosaic, with PNG quicklooks. A run that was stopped does only what is missing
+when started again.
+
+Surface model (the terrain with its buildings):
+  --dem PATH          raster DSM: a file GDAL reads, a directory of tiles or a VRT mosaic
+  --tin PATH          TIN surface: a vector file of triangles or 3-D points
+  --elevref KEYWORD   vertical datum of the surface heights: MSL (default), ELLIPS, MATHMODEL
+  --elfactor O[,S]    height correction: offset O, then scale S (> 0)
+  --elunits UNIT      unit of the surface heights: METER (default), FOOT, US_FOOT
+
+Output:
+  --out DIR           output directory (created when missing)
+  --srs CRS           output coordinate system (EPSG:32632, WKT, PROJ string; default: the
+                      UTM zone of the scene)
+  --pixel-size SIZE   output pixel size in CRS units (default: the source's resolution)
+  --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
+  --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
+  --of TYPE           file type of the ortho and visibility rasters: tif (default), cog, img,
+                      gpkg, ...
+
+Running:
+  --jobs N, -j N      scenes run at the same time (default 1)
+  --lines A:B         only lines A to B-1 of the preparation file (from 0; "A:" to the end,
+                      "A" one line), for a scheduler that runs slices; the recovery step then
+                      waits for a run without --lines
+  --keep-going, -k    go on after a scene fails; the failures are listed in the summary
+  --quiet, -q         print errors only
+  --help, -h          this text
+
+Outputs in DIR: prep.txt and imgset.txt (derived parameter files), per scene NAME_ortho.tif,
+NAME_vis.tif, NAME.xml (scene description, with TOSceneDesc_Document.dtd) and
+NAME_footprint.gpkg; footprints.gpkg (one layer per scene), mosaic.tif, mosaic_source.tif,
+mosaic.png, NAME_vis.png, and summary.json (summary-A-B.json for a slice).
+
+Exit status: 0 when everything asked for was done, 1 when something failed, 2 for a bad
+command line.
+)";
+}
+
+}  // namespace ortho

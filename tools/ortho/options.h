@@ -1,0 +1,50 @@
+// Command-line options of silvan-ortho.
+#pragma once
+
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+namespace ortho {
+
+// A command line that cannot be used; the message names the option and the value.
+class UsageError : public std::runtime_error {
+  public:
+    using std::runtime_error::runtime_error;
+};
+
+struct Options {
+    std::string master;  // the master parameter file
+    std::string outDir;  // --out
+
+    // Surface model: a raster DSM (--dem) or a TIN (--tin), exactly one of them.
+    std::string dem;
+    std::string tin;
+    std::string elevref;          // -elevref keyword: MSL (default), ELLIPS, MATHMODEL
+    std::vector<float> elfactor;  // offset[,scale]
+    std::string elunits;          // unit of the surface heights, e.g. METER, FOOT
+
+    std::string srs;         // output CRS; empty: chosen from the scene
+    double pixelSize = 0.0;  // output pixel size in CRS units; 0: the source's resolution
+    std::string resample = "bilinear";
+    std::string proc;            // PROC text of the generator
+    std::string format = "tif";  // file type of the ortho and visibility rasters
+
+    unsigned int jobs = 1;  // scenes run at the same time
+    // Slice of the preparation file's lines, [firstLine, endLine) counted from 0.
+    bool hasLines = false;
+    unsigned int firstLine = 0;
+    unsigned int endLine = 0;
+
+    bool keepGoing = false;
+    bool quiet = false;
+    bool help = false;
+};
+
+// Parses the arguments after the program name. Throws UsageError.
+Options ParseOptions(const std::vector<std::string>& args);
+
+// The text of --help.
+std::string UsageText();
+
+}  // namespace ortho

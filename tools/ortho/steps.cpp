@@ -1,0 +1,327 @@
+#include "steps.h"
+
+#include "files.h"
+
+#include <silvan/parserfactory.h>
+#include <silvan/toppfbase.h>
+#include <silvan/utils.h>
+
+#include <kestrel/crs.h>
+#include <kestrel/exception.h>
+
+#include <cpl_error.h>
+#include <gdal_priv.h>
+#include <ogrsf_frmts.h>
+
+#include <algorithm>
+#include <cmath>
+#include <cstdio>
+#include <sstream>
+
+namespace ortho {
+
+namespace {
+
+// GDAL's errors inside the tool: collected quietly while the object lives, then cleared.
+class GdalErrors {
+  public:
+    GdalErrors() {
+        GDALAllRegister();
+        CPLPushErrorHandler(CPLQuietErrorHandler);
+        CPLErrorReset();
+    }
+    ~GdalErrors() {
+        CPLErrorReset();
+        CPLPopErrorHandler();
+    }
+    GdalErrors(const GdalErrors&) = delete;
+    GdalErrors& operator=(const GdalErrors&) = delete;
+    std::string Reason() const {
+        const char* message = CPLGetLastErrorMsg();
+        return message != nullptr && *message != '\0' ? message : "unknown reason";
+    }
+};
+
+struct DatasetClose {
+    void operator()(GDALDataset* dataset) const { GDALClose(dataset); }
+};
+using DatasetPtr = std::unique_ptr<GDALDataset, DatasetClose>;
+
+[[noreturn]] void FailFile(const std::string& path, const std::string& what,
+                           const GdalErrors& errors) {
+    KESTREL_THROW(kestrel::FileAccessException, path, kestrel::FileAccessException::AccessFailed,
+                  what + ": " + errors.Reason());
+}
+
+DatasetPtr CreateVector(const std::string& path, const GdalErrors& errors) {
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GPKG");
+    RemoveFile(path);
+    DatasetPtr dataset(
+        driver == nullptr ? nullptr : driver->Create(path.c_str(), 0, 0, 0, GDT_Unknown, nullptr));
+    if (!dataset)
+        FailFile(path, "cannot be created as a GeoPackage", errors);
+    return dataset;
+}
+
+OGRSpatialReference GridSrs(const Grid& grid) {
+    OGRSpatialReference srs;
+    srs.SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
+    if (srs.importFromWkt(grid.crs.c_str()) != OGRERR_NONE)
+        KESTREL_THROW(kestrel::DataException, "the grid's CRS cannot be read: " + grid.crs);
+    return srs;
+}
+
+// Not yet available in the library: says which step is missing instead of writing nothing.
+[[noreturn]] void Unavailable(const std::string& step) {
+    KESTREL_THROW(kestrel::DataException, step + " is not available in this build of the library");
+}
+
+}  // namespace
+
+double Grid::PixelSize() const {
+    return std::hypot(geoTransform[1], geoTransform[4]);
+}
+
+bool Grid::SameAs(const Grid& other) const {
+    if (pixels != other.pixels || lines != other.lines)
+        return false;
+    const double tolerance = 1e-3 * std::max(PixelSize(), 1e-12);
+    for (std::size_t i = 0; i < geoTransform.size(); ++i) {
+        if (std::fabs(geoTransform[i] - other.geoTransform[i]) > tolerance)
+            return false;
+    }
+    if (crs == other.crs)
+        return true;
+    try {
+        return kestrel::ogc::cs::ICRS(crs).IsSame(kestrel::ogc::cs::ICRS(other.crs));
+    } catch (const kestrel::Exception&) {
+        return false;
+    }
+}
+
+std::string Grid::Describe() const {
+    std::string name = crs;
+    try {
+        name = kestrel::ogc::cs::ICRS(crs).GetName();
+    } catch (const kestrel::Exception&) {
+    }
+    char text[256];
+    std::snprintf(text, sizeof text, "%u x %u pixels of %.6g, top left (%.3f, %.3f), ", pixels,
+                  lines, PixelSize(), geoTransform[0], geoTransform[3]);
+    return text + name;
+}
+
+Grid CommonGrid(const std::vector<Grid>& grids) {
+    if (grids.empty())
+        KESTREL_THROW(kestrel::DataException, "no grid to join");
+    const Grid& first = grids.front();
+    const auto& g = first.geoTransform;
+    if (g[2] != 0.0 || g[4] != 0.0 || g[1] <= 0.0 || g[5] >= 0.0)
+        KESTREL_THROW(kestrel::DataException,
+                      "a common grid needs north-up grids; the first is " + first.Describe());
+    double left = g[0], right = g[0] + first.pixels * g[1];
+    double top = g[3], bottom = g[3] + first.lines * g[5];
+    const kestrel::ogc::cs::ICRS crs(first.crs);
+    for (const Grid& grid : grids) {
+        const auto& t = grid.geoTransform;
+        if (std::fabs(t[1] - g[1]) > 1e-9 * g[1] || std::fabs(t[5] - g[5]) > 1e-9 * g[1] ||
+            t[2] != 0.0 || t[4] != 0.0)
+            KESTREL_THROW(kestrel::DataException,
+                          "grids of different pixel sizes cannot be "
+                          "joined: " +
+                              first.Describe() + " and " + grid.Describe());
+        if (grid.crs != first.crs && !crs.IsSame(kestrel::ogc::cs::ICRS(grid.crs)))
+            KESTREL_THROW(kestrel::DataException, "grids in different CRSs cannot be joined: " +
+                                                      first.Describe() + " and " + grid.Describe());
+        left = std::min(left, t[0]);
+        right = std::max(right, t[0] + grid.pixels * t[1]);
+        top = std::max(top, t[3]);
+        bottom = std::min(bottom, t[3] + grid.lines * t[5]);
+    }
+    // Snap outwards onto the first grid's pixel lattice; whole blocks of 16.
+    const double step = g[1], height = -g[5];
+    const double x0 = g[0] + std::floor((left - g[0]) / step + 1e-6) * step;
+    const double y0 = g[3] + std::ceil((top - g[3]) / height - 1e-6) * height;
+    const auto blocks = [](double cells) {
+        const auto n = static_cast<unsigned int>(std::ceil(cells - 1e-6));
+        return (n + 15u) / 16u * 16u;
+    };
+    Grid common;
+    common.crs = first.crs;
+    common.pixels = blocks((right - x0) / step);
+    common.lines = blocks((y0 - bottom) / height);
+    common.geoTransform = {x0, step, 0.0, y0, 0.0, g[5]};
+    return common;
+}
+
+bool ReadGrid(const std::string& path, Grid& grid) {
+    GdalErrors errors;
+    DatasetPtr dataset(
+        GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY, nullptr, nullptr));
+    if (!dataset)
+        return false;
+    Grid read;
+    if (dataset->GetGeoTransform(read.geoTransform.data()) != CE_None)
+        return false;
+    const OGRSpatialReference* srs = dataset->GetSpatialRef();
+    if (srs == nullptr)
+        return false;
+    char* wkt = nullptr;
+    const char* wktOptions[] = {"FORMAT=WKT2_2019", "MULTILINE=NO", nullptr};
+    if (srs->exportToWkt(&wkt, wktOptions) != OGRERR_NONE) {
+        CPLFree(wkt);
+        return false;
+    }
+    read.crs = wkt;
+    CPLFree(wkt);
+    read.pixels = static_cast<unsigned int>(dataset->GetRasterXSize());
+    read.lines = static_cast<unsigned int>(dataset->GetRasterYSize());
+    grid = read;
+    return true;
+}
+
+Grid SceneLayout(const Options&, const SceneInput&, const std::string&, double, Footprint*) {
+    Unavailable("the ortho layout (GetOrthoParams)");
+}
+
+OrthoResult MakeOrtho(const Options&, const SceneInput&, const Grid&, const std::string&,
+                      const std::string&, const StepProgress&) {
+    Unavailable("the true-ortho generator");
+}
+
+void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>&) {
+    {
+        GdalErrors errors;
+        CreateVector(path, errors);
+    }
+    Unavailable("the footprint writer (WriteSceneFootprint)");
+}
+
+void RecoverMosaic(const Options&, const std::vector<RecoveryScene>&, const Grid&,
+                   const std::string&, const std::string&, const StepProgress&) {
+    Unavailable("occlusion recovery");
+}
+
+void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid,
+                     const std::string& path) {
+    GdalErrors errors;
+    DatasetPtr merged = CreateVector(path, errors);
+    OGRSpatialReference srs = GridSrs(grid);
+    for (const FootprintLayer& entry : layers) {
+        DatasetPtr scene(GDALDataset::Open(entry.path.c_str(), GDAL_OF_VECTOR | GDAL_OF_READONLY,
+                                           nullptr, nullptr));
+        if (!scene || scene->GetLayerCount() < 1)
+            FailFile(entry.path, "holds no footprint layer", errors);
+        OGRLayer* from = scene->GetLayer(0);
+        OGRLayer* to = merged->CreateLayer(entry.name.c_str(), &srs, wkbPolygon, nullptr);
+        if (to == nullptr)
+            FailFile(path, "layer " + entry.name + " cannot be created", errors);
+        OGRFieldDefn name("Name", OFTString);
+        OGRFieldDefn source("Source", OFTString);
+        if (to->CreateField(&name) != OGRERR_NONE || to->CreateField(&source) != OGRERR_NONE)
+            FailFile(path, "the fields of layer " + entry.name + " cannot be created", errors);
+        from->ResetReading();
+        while (OGRFeature* read = from->GetNextFeature()) {
+            std::unique_ptr<OGRFeature> in(read);
+            std::unique_ptr<OGRFeature> out(OGRFeature::CreateFeature(to->GetLayerDefn()));
+            const int field = in->GetFieldIndex("Name");
+            out->SetField("Name", field >= 0 ? in->GetFieldAsString(field) : "");
+            out->SetField("Source", entry.source.c_str());
+            if (in->GetGeometryRef() != nullptr)
+                out->SetGeometry(in->GetGeometryRef());
+            if (to->CreateFeature(out.get()) != OGRERR_NONE)
+                FailFile(path, "the footprint of " + entry.name + " cannot be written", errors);
+        }
+    }
+    merged.reset();
+    if (CPLGetLastErrorType() == CE_Failure)
+        FailFile(path, "cannot be written", errors);
+}
+
+void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook kind) {
+    GdalErrors errors;
+    DatasetPtr source(
+        GDALDataset::Open(raster.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY, nullptr, nullptr));
+    if (!source)
+        FailFile(raster, "cannot be opened", errors);
+    const int width = source->GetRasterXSize(), height = source->GetRasterYSize();
+    const double shrink = std::max(1.0, width / 2048.0);
+    const int outWidth = std::max(1, static_cast<int>(width / shrink));
+    const int outHeight = std::max(1, static_cast<int>(height / shrink));
+    const std::size_t count = static_cast<std::size_t>(outWidth) * outHeight;
+    const int bands = kind == Quicklook::Image ? std::min(3, source->GetRasterCount()) : 1;
+
+    // Pixels at the quicklook's size, and where they hold no data.
+    std::vector<std::vector<double>> values(static_cast<std::size_t>(bands));
+    std::vector<bool> empty(count, false);
+    for (int b = 0; b < bands; ++b) {
+        GDALRasterBand* band = source->GetRasterBand(b + 1);
+        values[b].resize(count);
+        if (band->RasterIO(GF_Read, 0, 0, width, height, values[b].data(), outWidth, outHeight,
+                           GDT_Float64, 0, 0, nullptr) != CE_None)
+            FailFile(raster, "cannot be read", errors);
+        int hasNoData = 0;
+        const double noData = band->GetNoDataValue(&hasNoData);
+        for (std::size_t i = 0; i < count; ++i) {
+            if (std::isnan(values[b][i]) || (hasNoData && values[b][i] == noData))
+                empty[i] = true;
+        }
+    }
+
+    // Red, green, blue, alpha.
+    std::vector<std::vector<unsigned char>> rgba(4, std::vector<unsigned char>(count, 0));
+    if (kind == Quicklook::Image) {
+        for (int b = 0; b < bands; ++b) {
+            // Stretch between the 2nd and 98th percentiles of the pixels with data.
+            std::vector<double> sorted;
+            for (std::size_t i = 0; i < count; ++i) {
+                if (!empty[i])
+                    sorted.push_back(values[b][i]);
+            }
+            std::sort(sorted.begin(), sorted.end());
+            const double low = sorted.empty() ? 0.0 : sorted[sorted.size() * 2 / 100];
+            const double high = sorted.empty() ? 1.0 : sorted[sorted.size() * 98 / 100];
+            const double scale = high > low ? 254.0 / (high - low) : 0.0;
+            for (std::size_t i = 0; i < count; ++i) {
+                const double v = 1.0 + (values[b][i] - low) * scale;
+                const auto byte = static_cast<unsigned char>(std::clamp(v, 1.0, 255.0));
+                for (int c = b; c < (bands == 1 ? 3 : b + 1); ++c)
+                    rgba[c][i] = byte;
+            }
+        }
+    } else {
+        // Classes and image numbers as distinct colours.
+        static const unsigned char palette[][3] = {{40, 40, 40},   {80, 200, 80},  {220, 60, 60},
+                                                   {60, 120, 230}, {240, 200, 40}, {200, 80, 220},
+                                                   {60, 210, 210}, {250, 140, 40}, {150, 150, 150}};
+        constexpr int kColours = sizeof palette / sizeof palette[0];
+        for (std::size_t i = 0; i < count; ++i) {
+            const auto v = static_cast<long long>(std::llround(values[0][i]));
+            const int index = static_cast<int>(((v % kColours) + kColours) % kColours);
+            for (int c = 0; c < 3; ++c)
+                rgba[c][i] = palette[index][c];
+        }
+    }
+    for (std::size_t i = 0; i < count; ++i)
+        rgba[3][i] = empty[i] ? 0 : 255;
+
+    GDALDriver* memory = GetGDALDriverManager()->GetDriverByName("MEM");
+    GDALDriver* pngDriver = GetGDALDriverManager()->GetDriverByName("PNG");
+    DatasetPtr picture(memory->Create("", outWidth, outHeight, 4, GDT_Byte, nullptr));
+    for (int c = 0; c < 4; ++c) {
+        if (picture->GetRasterBand(c + 1)->RasterIO(GF_Write, 0, 0, outWidth, outHeight,
+                                                    rgba[c].data(), outWidth, outHeight, GDT_Byte,
+                                                    0, 0, nullptr) != CE_None)
+            FailFile(png, "cannot be drawn", errors);
+    }
+    picture->GetRasterBand(4)->SetColorInterpretation(GCI_AlphaBand);
+    RemoveFile(png);
+    DatasetPtr written(
+        pngDriver->CreateCopy(png.c_str(), picture.get(), FALSE, nullptr, nullptr, nullptr));
+    if (!written)
+        FailFile(png, "cannot be written", errors);
+    written.reset();
+    RemoveFile(png + ".aux.xml");
+}
+
+}  // namespace ortho

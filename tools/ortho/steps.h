@@ -1,0 +1,99 @@
+// The steps of the workflow that do the photogrammetry, each a call chain into the library:
+// layout, ortho and visibility index, footprint, occlusion recovery, quicklooks.
+#pragma once
+
+#include "options.h"
+
+#include <silvan/polygon.h>
+#include <silvan/toimgsetparser.h>
+
+#include <array>
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace ortho {
+
+// Where a raster grid lies: its CRS as WKT, GDAL's geotransform, and its size.
+struct Grid {
+    std::string crs;
+    std::array<double, 6> geoTransform{};
+    unsigned int pixels = 0;
+    unsigned int lines = 0;
+
+    double PixelSize() const;
+    // Same size, same placement (to a thousandth of a pixel), same CRS text.
+    bool SameAs(const Grid& other) const;
+    std::string Describe() const;
+};
+
+// One line of the preparation file, as a process reads it; the source path resolved.
+struct SceneInput {
+    std::string source;
+    std::vector<unsigned int> channels;
+    int mmseg = 0;
+    std::vector<int> dbiw;
+    std::string srcBgd;
+    int edgeClip = 0;
+};
+
+using Footprint = std::unique_ptr<kestrel::tin::Polygon<double>>;
+// Progress of one step: the fraction done. Returns false to stop.
+using StepProgress = std::function<bool(double fraction)>;
+
+// The layout of a scene on its own: the grid in crs (empty: chosen for the scene) with the
+// pixel size (0: the source's resolution), and the scene's footprint when asked for.
+Grid SceneLayout(const Options& options, const SceneInput& scene, const std::string& crs,
+                 double pixelSize, Footprint* footprint);
+
+// The smallest grid that holds every grid, on the pixel lattice of the first one, in whole
+// blocks of 16 pixels and lines. All grids must share the first one's CRS and pixel size.
+Grid CommonGrid(const std::vector<Grid>& grids);
+
+// The grid of an existing raster; false when it cannot be opened as one.
+bool ReadGrid(const std::string& path, Grid& grid);
+
+// What the ortho step wrote besides the rasters.
+struct OrthoResult {
+    double orthoNoData = 0.0;
+    double elevationNoData = -32768.0;
+};
+
+// The true ortho and the visibility index of a scene on the grid, written to the two paths.
+OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Grid& grid,
+                      const std::string& ortho, const std::string& visibility,
+                      const StepProgress& progress);
+
+// A new GeoPackage at path holding the footprint layer of the scene.
+void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>& footprint);
+
+// One scene of the image set, as occlusion recovery takes it.
+struct RecoveryScene {
+    std::string id;  // the image set's scene identifier
+    std::string ortho;
+    std::string visibility;
+    RadiometricDiff radioDif = RadioDifAny;
+    int dbmPxErr = 0;
+};
+
+// Fills the hidden ground of each scene from the others into the mosaic, and records in
+// source which scene each mosaic pixel came from.
+void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes,
+                   const Grid& grid, const std::string& mosaic, const std::string& source,
+                   const StepProgress& progress);
+
+// Copies each scene's footprint layer into one GeoPackage, one layer per scene named after it.
+struct FootprintLayer {
+    std::string name;    // layer name: the scene's name
+    std::string path;    // the scene's footprint file
+    std::string source;  // the source image, recorded in a field
+};
+void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid,
+                     const std::string& path);
+
+// A PNG picture of a raster for people to look at, at most 2048 pixels wide.
+enum class Quicklook { Image, Visibility, SourceIndex };
+void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook kind);
+
+}  // namespace ortho

@@ -1,0 +1,41 @@
+// The run's summary for pipelines: summary.json.
+#pragma once
+
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace ortho {
+
+struct SceneSummary {
+    int line = 0;        // data line of the preparation file, from 0
+    std::string source;  // source image as the master file names it
+    std::string ortho;   // paths as written
+    std::string visibility;
+    std::string scene;      // the scene description XML
+    std::string footprint;  // the scene's footprint file
+    std::string status;     // "done", "complete" (found done before), "failed", "not run"
+    double seconds = 0.0;   // time spent on the scene in this run
+    std::string error;      // why it failed
+};
+
+struct RunSummary {
+    std::string master;
+    std::string status;  // "complete", "partial" (a slice), "failed"
+    std::vector<SceneSummary> scenes;
+    std::string mosaic;        // empty: not made by this run
+    std::string mosaicSource;  // which image each mosaic pixel came from
+    std::string footprints;
+    std::vector<std::string> quicklooks;
+    std::vector<std::string> errors;  // failures outside the scenes
+    // Seconds per step of the run, in order.
+    std::vector<std::pair<std::string, double>> timings;
+};
+
+std::string ToJson(const RunSummary& summary);
+
+// Writes the text under a temporary name and renames it over path, so that a reader never sees
+// a half-written file. Throws kestrel::FileAccessException naming the path.
+void WriteFileAtomically(const std::string& path, const std::string& text);
+
+}  // namespace ortho
