@@ -1,4 +1,5 @@
 #include <array>
+#include <cerrno>
 #include <mutex>
 #include <optional>
 #include <random>
