@@ -2,7 +2,6 @@
 
 #include <cmath>
 #include <cstring>
-#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -15,6 +14,7 @@
 
 #include <kestrel/exception.h>
 
+#include "factoryslot.h"
 #include "gdalsupport.h"
 
 GDBFile::~GDBFile() = default;
@@ -355,35 +355,23 @@ class OgrVectorFiles final : public VectorFileImpl {
     }
 };
 
-struct ImplSlot {
-    std::mutex mutex;
-    std::shared_ptr<VectorFileImpl> builtIn = std::make_shared<OgrVectorFiles>();
-    std::shared_ptr<VectorFileImpl> current = builtIn;
-};
-
-ImplSlot& Slot() {
-    static ImplSlot slot;
+FactorySlot<VectorFileImpl>& Slot() {
+    static FactorySlot<VectorFileImpl> slot(std::make_shared<OgrVectorFiles>());
     return slot;
 }
 
 std::shared_ptr<VectorFileImpl> Current() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().current;
+    return Slot().Current();
 }
 
 }  // namespace
 
 std::shared_ptr<VectorFileImpl> GetDefaultImplementation() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().builtIn;
+    return Slot().BuiltIn();
 }
 
 std::shared_ptr<VectorFileImpl> SetImplementation(std::shared_ptr<VectorFileImpl> impl) {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    if (!impl)
-        impl = Slot().builtIn;
-    std::swap(Slot().current, impl);
-    return impl;
+    return Slot().Install(std::move(impl));
 }
 
 ScopedVectorFileImpl::ScopedVectorFileImpl(std::shared_ptr<VectorFileImpl> impl)

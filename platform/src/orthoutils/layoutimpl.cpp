@@ -2,7 +2,6 @@
 // them and the built-in one.
 #include <cmath>
 #include <memory>
-#include <mutex>
 #include <utility>
 
 #include <kestrel/dem.h>
@@ -10,6 +9,7 @@
 #include <kestrel/exception.h>
 #include <kestrel/orthoutils.h>
 
+#include "../factoryslot.h"
 #include "../mathmodel/models.h"
 #include "layoutinternal.h"
 
@@ -114,35 +114,23 @@ class BuiltInLayout final : public LayoutImpl {
     }
 };
 
-struct ImplSlot {
-    std::mutex mutex;
-    std::shared_ptr<LayoutImpl> builtIn = std::make_shared<BuiltInLayout>();
-    std::shared_ptr<LayoutImpl> current = builtIn;
-};
-
-ImplSlot& Slot() {
-    static ImplSlot slot;
+FactorySlot<LayoutImpl>& Slot() {
+    static FactorySlot<LayoutImpl> slot(std::make_shared<BuiltInLayout>());
     return slot;
 }
 
 std::shared_ptr<LayoutImpl> Current() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().current;
+    return Slot().Current();
 }
 
 }  // namespace
 
 std::shared_ptr<LayoutImpl> GetDefaultLayoutImplementation() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().builtIn;
+    return Slot().BuiltIn();
 }
 
 std::shared_ptr<LayoutImpl> SetLayoutImplementation(std::shared_ptr<LayoutImpl> impl) {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    if (!impl)
-        impl = Slot().builtIn;
-    std::swap(Slot().current, impl);
-    return impl;
+    return Slot().Install(std::move(impl));
 }
 
 ScopedLayoutImpl::ScopedLayoutImpl(std::shared_ptr<LayoutImpl> impl)
