@@ -203,7 +203,7 @@ CityOptions BenchCity(unsigned int imageSize) {
                          d = 12 + std::floor(16 * Hash01(key + 1));
             o.buildings.push_back({x, y, x + w, y + d, 6 + std::floor(34 * Hash01(key + 2))});
         }
-    o.cameras.push_back({"oblique", 30.0, 20.0, 1000.0, imageSize, imageSize, 0.5});
+    o.cameras.push_back({"oblique", 30.0, 20.0, 2500.0, imageSize, imageSize, 0.5});
     return o;
 }
 

@@ -56,7 +56,7 @@ CityOptions BoxScene(double boxHeight, const std::vector<double>& azimuths,
                      double offNadirDegrees = 30.0, unsigned int imageSize = 384);
 
 // A large town for benchmarks: one image of imageSize x imageSize pixels at 0.5 m, seen 20
-// degrees off nadir, over a 1 m DSM 1.2 times the image's width, with a building every 40 m.
+// degrees off nadir from 2500 m, over a 1 m DSM 1.2 times the image's width, with a building every 40 m.
 CityOptions BenchCity(unsigned int imageSize);
 
 // The surface model as a grid, bilinear between posts at cell centres.
