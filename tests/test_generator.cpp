@@ -276,6 +276,19 @@ TEST_F(BoxFixture, VisibleGroundMatchesGdalwarpWithin1) {
     }
 }
 
+TEST_F(BoxFixture, TwoThreadsWriteWhatOneWrites) {
+    std::vector<std::vector<double>> outputs[2];
+    for (unsigned int threads : {1u, 2u}) {
+        kestrel::processes::GeneratorSettings settings;
+        settings.threadCount = threads;
+        ASSERT_TRUE(TorthoGenerator(settings).Generate(Job()).completed);
+        for (int band = 1; band <= 3; ++band)
+            outputs[threads - 1].push_back(ReadBand(dir.File("ortho.tif"), band));
+        outputs[threads - 1].push_back(ReadBand(dir.File("visibility.tif")));
+    }
+    EXPECT_TRUE(outputs[0] == outputs[1]);
+}
+
 // No output, final or partial, is left in the directory.
 void ExpectNoOutputs(const TempDir& dir) {
     for (const auto& entry : std::filesystem::directory_iterator(dir.Path())) {
