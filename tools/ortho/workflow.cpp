@@ -43,6 +43,11 @@ std::string Join(const std::string& directory, const std::string& name) {
     return (fs::path(directory) / name).string();
 }
 
+// A message about a file, naming it once.
+std::string About(const std::string& path, const std::string& message) {
+    return message.find(path) != std::string::npos ? message : path + ": " + message;
+}
+
 // The line numbers (from 1) of the data lines of a parameter file: every line but header and
 // comment lines ("!" first) and blank ones, as the parameter-table reader counts them.
 std::vector<unsigned int> DataLineNumbers(const std::string& path) {
@@ -234,7 +239,7 @@ void Workflow::Prepare() {
         DeriveFile(prepFile_, [&](const std::string& part) { master->WriteMFilePrep(part); });
         DeriveFile(imgSetFile_, [&](const std::string& part) { master->WriteImgSet(part); });
     } catch (const kestrel::Exception& e) {
-        throw RunError(options_.master + ": " + Explain(e));
+        throw RunError(About(options_.master, Explain(e)));
     }
     const std::vector<unsigned int> masterLines = DataLineNumbers(options_.master);
 
@@ -249,9 +254,9 @@ void Workflow::Prepare() {
     } catch (const kestrel::ParameterException& e) {
         // Every line has a preparation role: there is nothing to recover.
         if (e.GetErrorMessage() != "Empty text file")
-            throw RunError(imgSetFile_ + ": " + Explain(e));
+            throw RunError(About(imgSetFile_, Explain(e)));
     } catch (const kestrel::Exception& e) {
-        throw RunError(imgSetFile_ + ": " + Explain(e));
+        throw RunError(About(imgSetFile_, Explain(e)));
     }
 
     std::vector<unsigned int> noChannels;  // a line without channels reads all of them
@@ -260,7 +265,7 @@ void Workflow::Prepare() {
     try {
         prep.reset(ParserFactory::CreateTPMFileParser(prepFile_, noChannels, 0, noWindow, "", 0));
     } catch (const kestrel::Exception& e) {
-        throw RunError(options_.master + ": " + Explain(e));
+        throw RunError(About(options_.master, Explain(e)));
     }
     const unsigned int count = prep->GetMfileLines();
     const fs::path masterDir = fs::absolute(options_.master, ec).parent_path();
