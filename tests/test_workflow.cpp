@@ -227,14 +227,16 @@ TEST(Workflow, SampleCityEndToEnd) {
     const std::string summary = ReadFile(dir.File("out/summary.json"));
     EXPECT_NE(summary.find("\"status\": \"complete\""), std::string::npos) << summary;
 
-    std::unique_ptr<kestrel::processes::silvan::TOSceneParser> any;
+    // The scenes in the image set's order, in which the mosaic's source raster numbers them.
     std::vector<std::string> names;
-    for (const auto& entry : std::filesystem::directory_iterator(dir.Path() / "out")) {
-        if (entry.path().extension() == ".xml")
-            names.push_back(entry.path().stem().string());
+    std::unique_ptr<kestrel::processes::silvan::TOImgSetParser> set(
+        kestrel::processes::silvan::ParserFactory::CreateImgSetParser(dir.File("out/imgset.txt"),
+                                                                      RadioDifAny, 0));
+    for (unsigned int i = 0; i < set->GetMfileLines(); ++i) {
+        set->ParseLine(static_cast<int>(i));
+        names.push_back(std::filesystem::path(set->GetSceneId()).stem().string());
     }
     ASSERT_GE(names.size(), 3u);
-    std::sort(names.begin(), names.end());
 
     // One grid for all: same size and placement, whole blocks of 16, the CRS asked for.
     double geo[6] = {0}, first_geo[6] = {0};

@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <filesystem>
+#include <limits>
 #include <system_error>
 
 #ifdef _WIN32
@@ -50,7 +51,7 @@ double ModifiedTime(const std::string& path) {
     std::error_code ec;
     const auto time = fs::last_write_time(path, ec);
     if (ec)
-        return -1.0;
+        return -std::numeric_limits<double>::infinity();
     return std::chrono::duration<double>(time.time_since_epoch()).count();
 }
 

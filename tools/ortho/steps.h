@@ -86,7 +86,9 @@ void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>
 
 // One scene of the image set, as occlusion recovery takes it.
 struct RecoveryScene {
-    std::string id;  // the image set's scene identifier
+    std::string id;      // the image set's scene identifier
+    std::string source;  // the source image and its math-model segment, for viewing angles
+    int mmseg = 0;
     std::string ortho;
     std::string visibility;
     RadiometricDiff radioDif = RadioDifAny;

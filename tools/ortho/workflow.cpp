@@ -483,8 +483,7 @@ void Workflow::RunScene(Scene& scene) {
         };
     };
     const std::vector<std::string> parts = {PartName(scene.ortho), PartName(scene.visibility),
-                                            PartName(scene.footprint), PartName(scene.quicklook),
-                                            PartName(scene.xml)};
+                                            PartName(scene.quicklook), PartName(scene.xml)};
     try {
         // Outputs of an earlier, unfinished attempt are made again from the start.
         for (const std::string& path :
@@ -509,19 +508,20 @@ void Workflow::RunScene(Scene& scene) {
         Publish(parts[1], scene.visibility);
         timed("scene ortho");
 
+        // The footprint layer is labelled with its file's name, so it is written in place; the
+        // scene description written after it says that it is whole.
         report(0.9, 0.95, "footprint")(0.0);
-        WriteFootprint(parts[2], *footprint);
-        Publish(parts[2], scene.footprint);
+        WriteFootprint(scene.footprint, *footprint);
         timed("scene footprint");
-        WriteQuicklook(scene.visibility, parts[3], Quicklook::Visibility);
-        Publish(parts[3], scene.quicklook);
+        WriteQuicklook(scene.visibility, parts[2], Quicklook::Visibility);
+        Publish(parts[2], scene.quicklook);
         timed("scene quicklook");
 
         // The scene description comes last: its presence says the scene is complete.
         report(0.95, 1.0, "scene")(0.0);
         {
             std::lock_guard<std::mutex> lock(SceneFileMutex());
-            std::unique_ptr<TOSceneParser> description(ParserFactory::CreateSceneParser(parts[4]));
+            std::unique_ptr<TOSceneParser> description(ParserFactory::CreateSceneParser(parts[3]));
             description->SetSceneFilename(scene.input.source);
             description->SetOrthoFilename(scene.ortho);
             description->SetVisIdxFilename(scene.visibility);
@@ -532,7 +532,7 @@ void Workflow::RunScene(Scene& scene) {
             description->SetSceneFootprint(footprint.get());
             description->Serialize(false);
         }
-        Publish(parts[4], scene.xml);
+        Publish(parts[3], scene.xml);
         timed("scene description");
         scene.status = "done";
     } catch (const std::exception& e) {
@@ -555,7 +555,7 @@ void Workflow::Recover() {
     std::vector<RecoveryScene> inputs;
     std::vector<FootprintLayer> layers;
     std::string inputsText;
-    double newest = -1.0;
+    double newest = -std::numeric_limits<double>::infinity();
     for (const Scene& scene : scenes_) {
         if (scene.status != "done" && scene.status != "complete")
             continue;
@@ -570,8 +570,9 @@ void Workflow::Recover() {
             std::lock_guard<std::mutex> lock(SceneFileMutex());
             description.reset(ParserFactory::CreateSceneParser(scene.xml));
         }
-        inputs.push_back({scene.id, description->GetOrthoFilename(),
-                          description->GetVisIdxFilename(), scene.radioDif, scene.dbmPxErr});
+        inputs.push_back({scene.id, scene.input.source, scene.input.mmseg,
+                          description->GetOrthoFilename(), description->GetVisIdxFilename(),
+                          scene.radioDif, scene.dbmPxErr});
     }
     if (layers.empty())
         return;
@@ -628,6 +629,10 @@ void Workflow::Recover() {
     if (!inputs.empty()) {
         summary_.mosaic = mosaic;
         summary_.mosaicSource = source;
+        for (const Scene& scene : scenes_) {
+            if (scene.inImageSet && (scene.status == "done" || scene.status == "complete"))
+                summary_.mosaicScenes.push_back(scene.name);
+        }
         summary_.quicklooks = quicklooks;
     }
 }
