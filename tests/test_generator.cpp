@@ -1,5 +1,6 @@
 // The true-ortho generator on synthetic scenes: the sample builder's RPC fit, hidden strips,
 // roof positions, agreement with gdalwarp on visible ground, cancellation and bad input.
+#include <kestrel/trueortho.h>
 #include <samplecity.h>
 
 #include "support.h"
@@ -8,6 +9,9 @@
 
 #include <cmath>
 #include <cstdio>
+#include <filesystem>
+#include <functional>
+#include <memory>
 #include <sstream>
 
 #if defined(_WIN32)
@@ -17,6 +21,10 @@
 
 namespace {
 
+using kestrel::DataException;
+using kestrel::processes::TorthoGenerator;
+using kestrel::processes::TorthoJob;
+using kestrel::processes::TorthoResult;
 using testsupport::TempDir;
 
 // Runs a command and returns what it printed.
@@ -65,6 +73,301 @@ TEST(SampleCity, RpcsAgreeWithTheCameraThroughGdalsTransformer) {
             EXPECT_NEAR(col, e.first, 0.01);
             EXPECT_NEAR(row, e.second, 0.01);
         }
+    }
+}
+
+// A raster band read whole, as doubles.
+std::vector<double> ReadBand(const std::string& path, int band = 1) {
+    std::unique_ptr<GDALDataset> ds(
+        GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
+    if (!ds)
+        return {};
+    const int w = ds->GetRasterXSize(), h = ds->GetRasterYSize();
+    std::vector<double> v(static_cast<size_t>(w) * h);
+    if (ds->GetRasterBand(band)->RasterIO(GF_Read, 0, 0, w, h, v.data(), w, h, GDT_Float64, 0, 0,
+                                          nullptr) != CE_None)
+        return {};
+    return v;
+}
+
+// A box building 20 m high on flat ground, seen from the north at 30 degrees off nadir, with its
+// ortho grid at 0.5 m over the whole surface model.
+struct BoxFixture : ::testing::Test {
+    TempDir dir;
+    samplecity::CityOptions options = samplecity::BoxScene(20.0, {0.0});
+    samplecity::Sample sample;
+    std::unique_ptr<samplecity::Dsm> dsm;
+    std::unique_ptr<samplecity::GridSurface> surface;
+    std::unique_ptr<samplecity::RpcModel> model;
+    kestrel::ogc::cs::ICRS crs{"EPSG:32632"};
+    // The ortho's pixel: the image's at the scene centre. gdalwarp widens its kernels where the
+    // output is coarser than the image, so it is compared on a grid finer than the image.
+    double pixel = 0.5;
+    // Metres between the grid and the surface model's edges.
+    double inset = 0.0;
+    unsigned int size = 0;
+
+    void SetUp() override {
+        sample = samplecity::MakeSample(dir.Path().string(), options, 2);
+        dsm = std::make_unique<samplecity::Dsm>(options);
+        surface = std::make_unique<samplecity::GridSurface>(sample.dsmPath);
+        model = std::make_unique<samplecity::RpcModel>(sample.images[0].path);
+        UsePixel(0.5);
+    }
+    void UsePixel(double p, double i = 0.0) {
+        pixel = p, inset = i;
+        size = static_cast<unsigned int>(std::lround((options.sizeX - 2 * inset) / pixel));
+    }
+    TorthoJob Job() const {
+        TorthoJob job;
+        job.sourcePath = sample.images[0].path;
+        job.model = model.get();
+        job.surface = surface.get();
+        job.crs = &crs;
+        job.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(
+            options.west + inset, options.south + options.sizeY - inset, pixel, pixel);
+        job.pixels = job.lines = size;
+        job.orthoPath = dir.File("ortho.tif");
+        job.visibilityPath = dir.File("visibility.tif");
+        job.tileSize = 64;  // several tiles, so that occluders lie in neighbouring tiles
+        return job;
+    }
+    // gdalwarp's ortho of the same image on the same grid, without occlusion handling.
+    std::string FormatCommand(const std::string& out) const {
+        std::ostringstream c;
+        c.precision(12);
+        c << "gdalwarp -q -overwrite -rpc -to RPC_DEM=" << sample.dsmPath
+          << " -to RPC_DEMINTERPOLATION=bilinear -t_srs EPSG:32632 -tr " << pixel << ' ' << pixel
+          << " -te " << options.west + inset << ' ' << options.south + inset << ' '
+          << options.west + options.sizeX - inset << ' ' << options.south + options.sizeY - inset
+          << " -r bilinear -et 0 " << sample.images[0].path << ' ' << out;
+        return c.str();
+    }
+    void Ground(unsigned int i, unsigned int j, double& x, double& y) const {
+        x = options.west + inset + (i + 0.5) * pixel;
+        y = options.south + options.sizeY - inset - (j + 0.5) * pixel;
+    }
+    // Whether the segment from a ground point to the camera passes through the box.
+    bool GeometricallyHidden(double x, double y) const {
+        const auto& b = options.buildings[0];
+        const auto& c = sample.images[0].camera->Centre();
+        const double z = dsm->HeightAt(x, y);
+        if (z > options.groundHeight + 1)
+            return false;  // on the roof
+        double t0 = 0, t1 = 1;
+        const double from[3] = {x, y, z}, to[3] = {c[0], c[1], c[2]};
+        const double lo[3] = {options.west + b.x0, options.south + b.y0, -1e9};
+        const double hi[3] = {options.west + b.x1, options.south + b.y1,
+                              options.groundHeight + b.height};
+        for (int a = 0; a < 3; ++a) {
+            const double d = to[a] - from[a];
+            if (std::fabs(d) < 1e-12) {
+                if (from[a] < lo[a] || from[a] > hi[a])
+                    return false;
+                continue;
+            }
+            double ta = (lo[a] - from[a]) / d, tb = (hi[a] - from[a]) / d;
+            if (ta > tb)
+                std::swap(ta, tb);
+            t0 = std::max(t0, ta), t1 = std::min(t1, tb);
+        }
+        return t0 < t1;
+    }
+};
+
+TEST_F(BoxFixture, HiddenStripRoofAndGroundStandWhereGeometryPutsThem) {
+    const TorthoResult result = TorthoGenerator().Generate(Job());
+    ASSERT_TRUE(result.completed);
+    const std::vector<double> visibility = ReadBand(dir.File("visibility.tif"));
+    const std::vector<double> red = ReadBand(dir.File("ortho.tif"), 1);
+    ASSERT_EQ(visibility.size(), static_cast<size_t>(size) * size);
+
+    // The hidden strip: every pixel whose state differs from geometry has a neighbour within
+    // one pixel whose state agrees.
+    auto at = [&](int i, int j) { return static_cast<size_t>(j) * size + i; };
+    std::vector<char> expected(visibility.size());
+    size_t hiddenByGeometry = 0;
+    for (unsigned int j = 0; j < size; ++j)
+        for (unsigned int i = 0; i < size; ++i) {
+            double x, y;
+            Ground(i, j, x, y);
+            expected[at(i, j)] = GeometricallyHidden(x, y);
+            hiddenByGeometry += expected[at(i, j)];
+        }
+    EXPECT_GT(hiddenByGeometry, 1000u);
+    size_t wrong = 0;
+    for (int j = 1; j + 1 < static_cast<int>(size); ++j)
+        for (int i = 1; i + 1 < static_cast<int>(size); ++i) {
+            if (visibility[at(i, j)] == 0)
+                continue;  // outside the image
+            const bool hidden = visibility[at(i, j)] == 2;
+            if (hidden == static_cast<bool>(expected[at(i, j)]))
+                continue;
+            bool nearby = false;
+            for (int dj = -1; dj <= 1; ++dj)
+                for (int di = -1; di <= 1; ++di)
+                    nearby |= static_cast<bool>(expected[at(i + di, j + dj)]) == hidden;
+            wrong += !nearby;
+        }
+    EXPECT_EQ(wrong, 0u);
+    EXPECT_NEAR(static_cast<double>(result.hidden), static_cast<double>(hiddenByGeometry),
+                0.1 * hiddenByGeometry);
+
+    // The roof at its true ground position, seen, in its own colour.
+    const auto& b = options.buildings[0];
+    size_t roofPixels = 0;
+    for (unsigned int j = 0; j < size; ++j)
+        for (unsigned int i = 0; i < size; ++i) {
+            double x, y;
+            Ground(i, j, x, y);
+            const double lx = x - options.west, ly = y - options.south;
+            if (lx < b.x0 + 1 || lx > b.x1 - 1 || ly < b.y0 + 1 || ly > b.y1 - 1)
+                continue;
+            ++roofPixels;
+            ASSERT_EQ(visibility[at(i, j)], 1) << "roof pixel " << i << ", " << j;
+            const auto rgb = samplecity::Texture(*dsm, x, y, dsm->HeightAt(x, y), options.seed);
+            EXPECT_NEAR(red[at(i, j)], rgb[0], 12) << "roof pixel " << i << ", " << j;
+        }
+    EXPECT_GT(roofPixels, 3000u);
+}
+
+TEST_F(BoxFixture, VisibleGroundMatchesGdalwarpWithin1) {
+    // Away from the surface model's edges, where gdalwarp's source windows miss parts of the
+    // image (its RPC inversion fails off the DEM).
+    UsePixel(0.4, 10.0);
+    const TorthoResult result = TorthoGenerator().Generate(Job());
+    ASSERT_TRUE(result.completed);
+    const std::string reference = dir.File("gdalwarp.tif");
+    const std::string command = FormatCommand(reference);
+    ASSERT_EQ(std::system(command.c_str()), 0) << command;
+    const std::vector<double> visibility = ReadBand(dir.File("visibility.tif"));
+    for (int band = 1; band <= 3; ++band) {
+        const std::vector<double> ours = ReadBand(dir.File("ortho.tif"), band);
+        const std::vector<double> theirs = ReadBand(reference, band);
+        ASSERT_EQ(ours.size(), theirs.size());
+        size_t compared = 0, differing = 0;
+        for (unsigned int j = 3; j + 3 < size; ++j)
+            for (unsigned int i = 3; i + 3 < size; ++i) {
+                // Seen ground, away from the building and the hidden strip.
+                bool clear = true;
+                for (int dj = -3; dj <= 3 && clear; ++dj)
+                    for (int di = -3; di <= 3 && clear; ++di) {
+                        const size_t k = static_cast<size_t>(j + dj) * size + (i + di);
+                        double x, y;
+                        Ground(i + di, j + dj, x, y);
+                        clear =
+                            visibility[k] == 1 && dsm->HeightAt(x, y) < options.groundHeight + 0.01;
+                    }
+                if (!clear)
+                    continue;
+                const size_t k = static_cast<size_t>(j) * size + i;
+                ++compared;
+                differing += std::fabs(ours[k] - theirs[k]) > 1;
+            }
+        EXPECT_GT(compared, 60000u);
+        EXPECT_EQ(differing, 0u) << "band " << band;
+    }
+}
+
+// No output, final or partial, is left in the directory.
+void ExpectNoOutputs(const TempDir& dir) {
+    for (const auto& entry : std::filesystem::directory_iterator(dir.Path())) {
+        const std::string name = entry.path().filename().string();
+        EXPECT_EQ(name.find("ortho"), std::string::npos) << name;
+        EXPECT_EQ(name.find("visibility"), std::string::npos) << name;
+    }
+}
+
+struct Cancelling {
+    bool* flag;
+    bool answer;  // what the callback returns
+    int calls = 0;
+    static bool Progress(double fraction, const char*, void* data) {
+        auto* self = static_cast<Cancelling*>(data);
+        ++self->calls;
+        if (fraction > 0)
+            *self->flag = true;
+        return fraction == 0 || self->answer;
+    }
+};
+
+TEST_F(BoxFixture, CancelledRunStopsAfterTheTileAtHandAndLeavesNoOutput) {
+    for (const bool byCallback : {false, true}) {
+        bool cancel = false;
+        kestrel::processes::GeneratorSettings settings;
+        settings.threadCount = 1;
+        TorthoGenerator generator(settings);
+        Cancelling progress{&cancel, !byCallback};
+        generator.SetCancelFlag(&cancel);
+        generator.SetProgress(&Cancelling::Progress, &progress);
+        const TorthoResult result = generator.Generate(Job());
+        EXPECT_FALSE(result.completed);
+        EXPECT_EQ(progress.calls, 2);  // the start and the first of 25 tiles
+        ExpectNoOutputs(dir);
+    }
+    // A flag set before the run: nothing is written at all.
+    bool cancel = true;
+    TorthoGenerator generator;
+    generator.SetCancelFlag(&cancel);
+    EXPECT_FALSE(generator.Generate(Job()).completed);
+    ExpectNoOutputs(dir);
+}
+
+// The same height everywhere, with no edge.
+class FlatEverywhere : public kestrel::dem::IElevationSource {
+  public:
+    void SetOutputVerticalDatum(kestrel::ogc::cs::DatumType) override {}
+    kestrel::ogc::cs::DatumType GetOutputVerticalDatum() const override {
+        return kestrel::ogc::cs::DatumEllipsoid;
+    }
+    const kestrel::ogc::cs::ICRS* GetCRS() const override { return nullptr; }
+    void GetExtent(double& minX, double& minY, double& maxX, double& maxY) const override {
+        minX = minY = -1e12, maxX = maxY = 1e12;
+    }
+    void SetInputCRS(const kestrel::ogc::cs::ICRS*) override {}
+    void GetHeights(std::size_t n, const double*, const double*, double* h) const override {
+        std::fill(h, h + n, 250.0);
+    }
+};
+
+TEST_F(BoxFixture, BadInputIsRefusedWithWhatAndWhere) {
+    FlatEverywhere flat;
+    const struct {
+        const char* what;
+        std::function<void(TorthoJob&)> spoil;
+        const char* message;
+    } cases[] = {
+        {"no pixels", [](TorthoJob& j) { j.pixels = 0; }, "0 pixels"},
+        {"surface elsewhere",
+         [&](TorthoJob& j) {
+             j.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(516000, 5034000, 0.5, 0.5);
+         },
+         "does not cover the output grid"},
+        {"grid outside the image",
+         [&](TorthoJob& j) {
+             j.surface = &flat;
+             j.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(520000, 5040000, 0.5, 0.5);
+         },
+         "outside the image"},
+        {"missing channel",
+         [](TorthoJob& j) {
+             j.channels = {1, 4};
+         },
+         "channel 4 of"},
+        {"unknown method", [](TorthoJob& j) { j.resampling = "lanczos"; }, "\"lanczos\""},
+        {"no model", [](TorthoJob& j) { j.model = nullptr; }, "no math model"},
+    };
+    for (const auto& c : cases) {
+        TorthoJob job = Job();
+        c.spoil(job);
+        try {
+            TorthoGenerator().Generate(job);
+            ADD_FAILURE() << c.what << ": no exception";
+        } catch (const kestrel::DataException& e) {
+            EXPECT_NE(std::string(e.what()).find(c.message), std::string::npos)
+                << c.what << ": " << e.what();
+        }
+        ExpectNoOutputs(dir);
     }
 }
 

@@ -385,3 +385,153 @@ TEST(RasterWriter, FailuresNameTheFileAndLeaveNothing) {
         EXPECT_NE(e.GetExpected().find("gpkg"), std::string::npos);
     }
 }
+
+// ---------------------------------------------------------------------------------------------
+// What the utility functions pass to the raster components
+
+namespace {
+
+// Records the raster components' calls as texts, in order.
+class Recorder : public kestrel::datasources::RasterIOObserver {
+  public:
+    void ReaderCreated(const IRasterReader* reader, const std::string& /*path*/,
+                       const std::vector<unsigned int>& channels) override {
+        Add("reader " + Channels(channels), reader);
+    }
+    void WindowRead(const IRasterReader* reader, unsigned int x, unsigned int y, unsigned int w,
+                    unsigned int h, const Raster* result) override {
+        Add("read " + std::to_string(x) + "," + std::to_string(y) + "," + std::to_string(w) + "," +
+                std::to_string(h),
+            reader);
+        lastRead = result;
+    }
+    void WriterCreated(const IRasterWriter* writer, const std::string& /*path*/,
+                       const std::vector<unsigned int>& channels, const std::string& format,
+                       const std::string& options) override {
+        Add("writer " + Channels(channels) + " " + format + " [" + options + "]", writer);
+    }
+    void FormatNameLookedUp(const std::string& fileType, const std::string& format) override {
+        Add("lookup " + fileType + " " + format, nullptr);
+    }
+    void RasterDeleted(const Raster* raster) override {
+        if (raster == lastRead)
+            Add("deleted the read raster", nullptr);
+    }
+
+    std::vector<std::string> events;
+    std::vector<const void*> subjects;
+    const Raster* lastRead = nullptr;
+
+  private:
+    static std::string Channels(const std::vector<unsigned int>& channels) {
+        std::string text;
+        for (unsigned int c : channels)
+            text += (text.empty() ? "" : ",") + std::to_string(c);
+        return "{" + text + "}";
+    }
+    void Add(const std::string& event, const void* subject) {
+        events.push_back(event);
+        subjects.push_back(subject);
+    }
+};
+
+}  // namespace
+
+TEST(RasterUtils, ReadersAreProbedOnceAtTheFirstPixelAndTheProbeIsDeleted) {
+    TempDir dir;
+    const std::string path = MakeImage(dir, "a.tif", ImageSpec());
+    std::unique_ptr<IDataset> ds(GetRasterDataset(path));
+    auto recorder = std::make_shared<Recorder>();
+    kestrel::datasources::ScopedRasterIOObserver scope(recorder);
+    std::unique_ptr<IRasterReader> onFile(GetRasterReader(path));
+    std::unique_ptr<IRasterReader> onDataset(GetRasterReader(ds.get(), {2, 3}));
+    EXPECT_EQ(recorder->events, (std::vector<std::string>{
+                                    "reader {1,2,3}", "read 0,0,1,1", "deleted the read raster",
+                                    "reader {2,3}", "read 0,0,1,1", "deleted the read raster"}));
+    EXPECT_EQ(recorder->subjects[1], onFile.get());
+    EXPECT_EQ(recorder->subjects[4], onDataset.get());
+}
+
+TEST(RasterUtils, WritersGetTheFormatNameFirstAndNoProbe) {
+    TempDir dir;
+    auto recorder = std::make_shared<Recorder>();
+    kestrel::datasources::ScopedRasterIOObserver scope(recorder);
+    std::unique_ptr<IRasterWriter> typed(GetRasterWriter(dir.File("o.tif"), "TIF", {1, 2}));
+    std::unique_ptr<IRasterWriter> plain(GetRasterWriter(dir.File("p.tif")));
+    EXPECT_EQ(recorder->events, (std::vector<std::string>{
+                                    "lookup TIF GTiff", "writer {1,2} GTiff []", "writer {}  []"}));
+    EXPECT_EQ(dynamic_cast<BasicWriter*>(plain.get())->GetFormatName(), "GTiff");
+}
+
+TEST(RasterUtils, FileTypesNameGdalFormats) {
+    const std::vector<std::pair<std::string, std::string>> table = {
+        {"tif", "GTiff"}, {"TIFF", "GTiff"},  {"cog", "COG"},       {"vrt", "VRT"},
+        {"img", "HFA"},   {"Gpkg", "GPKG"},   {"png", "PNG"},       {"jpg", "JPEG"},
+        {"JPEG", "JPEG"}, {"hdr", "ENVI"},    {"envi", "ENVI"},     {"ntf", "NITF"},
+        {"mem", "MEM"},   {"GTiff", "GTiff"}, {"netcdf", "netCDF"}, {"SAGA", "SAGA"}};
+    for (const auto& [type, format] : table)
+        EXPECT_EQ(kestrel::core::FType2FormatName(type), format) << type;
+    for (const std::string& type :
+         std::vector<std::string>{"", "tiff2", "ESRI Shapefile", std::string("tif\0x", 5)}) {
+        try {
+            kestrel::core::FType2FormatName(type);
+            ADD_FAILURE() << type;
+        } catch (const kestrel::ParameterException& e) {
+            EXPECT_EQ(e.GetType(), kestrel::ParameterException::Unsupported);
+            EXPECT_EQ(e.GetValue(), type);
+            EXPECT_NE(std::string(e.what()).find("tif, tiff"), std::string::npos) << e.what();
+        }
+    }
+}
+
+TEST(RasterUtils, SourceAndOrthoChannelsOfOneDataType) {
+    TempDir dir;
+    ImageSpec spec;
+    spec.types = {GDT_Byte, GDT_UInt16, GDT_Byte};
+    std::unique_ptr<IDataset> ds(GetRasterDataset(MakeImage(dir, "mixed", spec)));
+    std::vector<unsigned int> src{9};
+    std::vector<unsigned int> ortho{8, 7};
+    GetSrcOrthoChans(ds.get(), {3, 1}, src, ortho);
+    EXPECT_EQ(src, (std::vector<unsigned int>{3, 1}));
+    EXPECT_EQ(ortho, (std::vector<unsigned int>{1, 2}));
+    try {
+        GetSrcOrthoChans(ds.get(), {1, 2}, src, ortho);
+        ADD_FAILURE();
+    } catch (const kestrel::DataException& e) {
+        EXPECT_EQ(e.GetErrorMessage(),
+                  "All channels must belong to the same datatype, but 2 data types are found.");
+        EXPECT_EQ(e.GetSourceFile(), "utils.cpp");
+    }
+    EXPECT_EQ(src, (std::vector<unsigned int>{3, 1}));
+    EXPECT_EQ(ortho, (std::vector<unsigned int>{1, 2}));
+    // GetChanGroups itself: groups by type in order, an empty list for every channel, ortho
+    // channels numbered in the group or across the list.
+    std::vector<SrcChanInfo> infos;
+    std::vector<ChanGroup> groups;
+    GetChanGroups("", {}, ds.get(), infos, groups, false);
+    ASSERT_EQ(groups.size(), 2u);
+    EXPECT_EQ(groups[0].srcChans, (std::vector<unsigned int>{1, 3}));
+    EXPECT_EQ(groups[0].orthoChans, (std::vector<unsigned int>{1, 2}));
+    EXPECT_EQ(groups[1].srcChans, (std::vector<unsigned int>{2}));
+    EXPECT_EQ(groups[1].dataType, DataType::UInt16);
+    EXPECT_EQ(infos.size(), 3u);
+    GetChanGroups("", {2, 1, 3}, ds.get(), infos, groups, true);
+    EXPECT_EQ(groups[1].orthoChans, (std::vector<unsigned int>{2, 3}));
+    try {
+        GetSrcOrthoChans(ds.get(), {1, 0}, src, ortho);
+        ADD_FAILURE();
+    } catch (const kestrel::DataException& e) {
+        EXPECT_NE(std::string(e.what()).find("Channel 0"), std::string::npos) << e.what();
+        EXPECT_NE(std::string(e.what()).find("3 channels"), std::string::npos) << e.what();
+    }
+}
+
+TEST(RasterUtils, DiskIdIsTheDeviceOfTheFile) {
+    TempDir dir;
+    const std::string a = testsupport::WriteFile(dir.File("a.txt"), "a");
+    const std::string b = testsupport::WriteFile(dir.File("b.txt"), "b");
+    EXPECT_NE(GetDiskId(a), 0u);
+    EXPECT_EQ(GetDiskId(a), GetDiskId(b));
+    EXPECT_EQ(GetDiskId(dir.File("missing.txt")), 0u);
+    EXPECT_EQ(GetDiskId(""), 0u);
+}

@@ -2,9 +2,13 @@
 #pragma once
 
 #include <memory>
+#include <string>
 #include <vector>
 
+#include <kestrel/crs.h>
+#include <kestrel/elevation.h>
 #include <kestrel/export.h>
+#include <kestrel/mathmodel.h>
 
 namespace kestrel {
 namespace processes {
@@ -31,6 +35,19 @@ struct GeneratorSettings {
     unsigned int streamCount = 0;
 };
 
+// Progress in GDAL's style: the fraction done (0 to 1), a message (may be null) and the user
+// data given with the function. Returning false cancels the run. Generators call it from one
+// thread at a time, though not always from the thread that started the run.
+typedef bool (*ProgressFunc)(double fraction, const char* message, void* userData);
+
+// Values of the visibility index, a Byte raster on the ortho's grid.
+enum VisibilityValue : unsigned char {
+    VISIBILITY_OUTSIDE = 0,  // the ground point projects outside the image, or onto its no-data
+    VISIBILITY_SEEN = 1,     // the sensor sees the ground point; the ortho holds its value
+    VISIBILITY_HIDDEN = 2,   // higher surface stands between the ground point and the sensor
+    VISIBILITY_NODATA = 255  // the surface model has no height there
+};
+
 // Every generator. Generators are made by TrueOrthoFactory and owned by the caller.
 class KESTREL_API ITrueOrtho {
   public:
@@ -47,25 +64,117 @@ class KESTREL_API ITrueOrtho {
     unsigned int GetDeviceCount() const { return settings_.deviceCount; }
     unsigned int GetStreamCount() const { return settings_.streamCount; }
 
+    // The process's cancel flag (TOPPFBase::GetCancelFlag), or null for none. The generator
+    // reads it while it runs, several times within each tile; once it is set the run stops.
+    void SetCancelFlag(const bool* cancel) { cancel_ = cancel; }
+    void SetProgress(ProgressFunc progress, void* userData) {
+        progress_ = progress, progressData_ = userData;
+    }
+
   protected:
     explicit ITrueOrtho(GeneratorSettings settings);
+    // The central-processor threads to use: the thread count, or the hardware's when it is 0.
+    unsigned int ThreadsToUse() const;
+    const bool* CancelFlag() const { return cancel_; }
+    ProgressFunc Progress() const { return progress_; }
+    void* ProgressData() const { return progressData_; }
 
   private:
     GeneratorSettings settings_;
+    const bool* cancel_ = nullptr;
+    ProgressFunc progress_ = nullptr;
+    void* progressData_ = nullptr;
 };
 
+// What a true-ortho run works on. The generator keeps no pointer beyond the run.
+struct KESTREL_API TorthoJob {
+    // The source raster (any raster GDAL reads) and its channels, counted from 1; empty means
+    // every channel. All channels must share one data type, which the ortho takes.
+    std::string sourcePath;
+    std::vector<unsigned int> channels;
+    // The source's math model. Ground points reach it in its own CRS (x, y transformed from the
+    // ortho's CRS); heights are passed as the surface gives them.
+    const mathmodel::IMathModel* model = nullptr;
+    // The surface model with raised objects (a DSM or a TIN). Its output vertical datum must be
+    // the model's (GetModelDatum); the generator sets its input CRS to the ortho's CRS.
+    dem::IElevationSource* surface = nullptr;
+    // GDAL's names: "near", "bilinear", "cubic".
+    std::string resampling = "bilinear";
+    // The ortho's grid.
+    const ogc::cs::ICRS* crs = nullptr;
+    ogc::cs::GeocodingInfo geocoding;
+    unsigned int pixels = 0, lines = 0;
+    // Outputs, written under a temporary name beside the final one and renamed when complete.
+    std::string orthoPath, visibilityPath;
+    std::string format = "GTiff";  // a GDAL driver that can create files
+    // Value of ortho pixels that are not seen. The source's own no-data values are never used.
+    double orthoNoData = 0.0;
+    // Metres a ground point may lie below the surface that the sensor sees at its image position
+    // and still count as seen: absorbs the surface's interpolation and rounding.
+    double heightTolerance = 0.2;
+    // Output pixels per tile side: memory grows with its square.
+    unsigned int tileSize = 256;
+};
+
+// Counts of the visibility index after a run.
+struct TorthoResult {
+    bool completed = false;  // false: cancelled, nothing left under the final names
+    unsigned long long seen = 0, hidden = 0, outside = 0, noHeight = 0;
+};
+
+// The true-ortho generator. The central-processor work is here; a graphics-processor generator
+// derives from it and overrides Generate, with the same job and the same outputs.
 class KESTREL_API TorthoGenerator : public ITrueOrtho {
   public:
     explicit TorthoGenerator(GeneratorSettings settings = GeneratorSettings());
     ~TorthoGenerator() override;
     GeneratorType GetGeneratorType() const override { return GENERATOR_TORTHO; }
+
+    // Writes the ortho and its visibility index. Throws DataException for bad input (saying
+    // what and where) and FileAccessException for outputs that cannot be written; in both
+    // cases, and when cancelled, nothing is left under the outputs' final names.
+    virtual TorthoResult Generate(const TorthoJob& job);
 };
 
+// The radiometric difference level of a scene (as RadiometricDiff: 0 ANY, 1 LOW, 2 MODERATE,
+// 3 HIGH): a scene of a higher level is a later choice for filling.
+struct KESTREL_API RecoveryScene {
+    std::string orthoPath, visibilityPath;
+    int radiometricLevel = 0;
+    // The surface model's pixel error in ortho pixels: a seen pixel closer than this to a
+    // hidden one is trusted only when no other image sees the pixel clearly.
+    int dbmPixelError = 0;
+    // The scene's math model, for its viewing angle at each pixel; null: angle unknown, the
+    // scene comes after those whose angle is known.
+    const mathmodel::IMathModel* model = nullptr;
+};
+
+struct KESTREL_API RecoveryJob {
+    std::vector<RecoveryScene> scenes;  // orthos on one common grid
+    // Heights for the viewing angles (may be null: angles unknown), in the models' datum.
+    dem::IElevationSource* surface = nullptr;
+    std::string mosaicPath, sourcePath;  // the mosaic and the raster of source scenes
+    std::string format = "GTiff";
+    unsigned int tileSize = 256;
+};
+
+struct TorthoRecoveryResult {
+    bool completed = false;
+    unsigned long long filled = 0;    // pixels that came from a scene
+    unsigned long long unfilled = 0;  // pixels that no scene sees
+};
+
+// Occlusion recovery: the true-ortho mosaic of several orthos of one image set.
 class KESTREL_API OcclusionRecovery : public ITrueOrtho {
   public:
     explicit OcclusionRecovery(GeneratorSettings settings = GeneratorSettings());
     ~OcclusionRecovery() override;
     GeneratorType GetGeneratorType() const override { return GENERATOR_OCCLUSION_RECOVERY; }
+
+    // Writes the mosaic (the orthos' data type and no-data value) and the source raster (Byte,
+    // 1 + the scene's index in the job, 0 where no scene sees the pixel). Failures and
+    // cancellation as for TorthoGenerator::Generate.
+    virtual TorthoRecoveryResult Recover(const RecoveryJob& job);
 };
 
 // The four ways of making a generator. Each returns a new object owned by the caller, or null

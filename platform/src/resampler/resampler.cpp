@@ -418,18 +418,25 @@ class Resampler : public IRasterResampler {
             }
             const double sx = x[i] - p0.x0;
             const double sy = y[i] - p0.y0;
-            if (fourSamples_) {
-                for (std::size_t c = 0; c < planes.size(); ++c) {
-                    values[c * n + i] = method_ == Method::Bilinear
-                                            ? Bilinear4(planes[c], validity[c], sx, sy)
-                                            : Cubic4(planes[c], validity[c], sx, sy);
-                }
-                continue;
+            if (!fourSamples_) {
+                Weights(sx, radiusX_, scaleX_, ax);
+                Weights(sy, radiusY_, scaleY_, ay);
             }
-            Weights(sx, radiusX_, scaleX_, ax);
-            Weights(sy, radiusY_, scaleY_, ay);
-            for (std::size_t c = 0; c < planes.size(); ++c)
-                values[c * n + i] = Separable(planes[c], validity[c], ax, ay);
+            for (std::size_t c = 0; c < planes.size(); ++c) {
+                const Plane<T>& p = planes[c];
+                // As in GDAL, a position on a missing pixel has no value, whatever its
+                // neighbours hold.
+                if (validity[c].template Possible<T>() &&
+                    !validity[c].IsValid(static_cast<double>(p.At(ix, iy)))) {
+                    values[c * n + i] = kNaN;
+                } else if (!fourSamples_) {
+                    values[c * n + i] = Separable(p, validity[c], ax, ay);
+                } else if (method_ == Method::Bilinear) {
+                    values[c * n + i] = Bilinear4(p, validity[c], sx, sy);
+                } else {
+                    values[c * n + i] = Cubic4(p, validity[c], sx, sy);
+                }
+            }
         }
     }
 

@@ -2,7 +2,9 @@
 
 #include <kestrel/exception.h>
 
+#include <algorithm>
 #include <mutex>
+#include <thread>
 #include <utility>
 
 namespace kestrel {
@@ -10,6 +12,12 @@ namespace processes {
 
 ITrueOrtho::ITrueOrtho(GeneratorSettings settings) : settings_(std::move(settings)) {}
 ITrueOrtho::~ITrueOrtho() = default;
+
+unsigned int ITrueOrtho::ThreadsToUse() const {
+    if (settings_.threadCount > 0)
+        return settings_.threadCount;
+    return std::max(1u, std::thread::hardware_concurrency());
+}
 
 TorthoGenerator::TorthoGenerator(GeneratorSettings settings) : ITrueOrtho(std::move(settings)) {}
 TorthoGenerator::~TorthoGenerator() = default;

@@ -1,0 +1,435 @@
+// The central-processor true-ortho generator: tile by tile, the surface under each output pixel
+// is projected into the image, a z-buffer of the surface in image space tells seen from hidden,
+// and seen pixels take the resampled image value.
+#include <kestrel/exception.h>
+#include <kestrel/trueortho.h>
+
+#include "../gdalsupport.h"
+#include "kernels.h"
+#include "rasterfiles.h"
+#include "runcontrol.h"
+#include "zbuffer.h"
+
+#include <gdal_priv.h>
+
+#include <algorithm>
+#include <array>
+#include <cmath>
+#include <limits>
+
+namespace kestrel {
+namespace processes {
+
+using trueortho::DatasetPtr;
+using trueortho::Kernel;
+using trueortho::OutputRaster;
+using trueortho::RunControl;
+
+namespace {
+
+// The output grid and everything each tile needs from it, fixed before the tiles run.
+struct Plan {
+    const TorthoJob* job;
+    Kernel kernel;
+    std::vector<int> bands;
+    int imageWidth, imageHeight;
+    std::vector<char> hasNoData;
+    std::vector<float> noData;
+    // Output pixels by which a tile's surface is extended on each side so that every surface
+    // that can stand between the tile's ground and the sensor is projected.
+    int extendLeft = 0, extendRight = 0, extendUp = 0, extendDown = 0;
+    const ogc::cs::CoordinateTransformation* toModel = nullptr;  // null: same CRS
+};
+
+// Per-thread state: a source dataset of its own (GDAL datasets are not shared between
+// threads), a transformation of its own (PROJ objects neither) and the tile buffers.
+struct Worker {
+    DatasetPtr source;
+    std::unique_ptr<ogc::cs::CoordinateTransformation> toModel;
+    std::vector<double> x, y, h, mx, my, col, row;
+    std::unique_ptr<bool[]> ok;
+    size_t okSize = 0;
+    trueortho::ZBuffer zbuffer;
+    trueortho::SourceWindow window;
+    std::vector<float> ortho, visibility;
+};
+
+// Ground positions of output pixel centres in a window of the grid, their surface heights and
+// their image positions.
+void ProjectWindow(const Plan& plan, Worker& w, int x0, int y0, int width, int height,
+                   const RunControl& control) {
+    const TorthoJob& job = *plan.job;
+    const size_t n = static_cast<size_t>(width) * height;
+    w.x.resize(n), w.y.resize(n), w.h.resize(n), w.col.resize(n), w.row.resize(n);
+    if (w.okSize < n)
+        w.ok.reset(new bool[n]), w.okSize = n;
+    for (int j = 0; j < height; ++j)
+        for (int i = 0; i < width; ++i) {
+            const size_t k = static_cast<size_t>(j) * width + i;
+            job.geocoding.PixelToGround(x0 + i + 0.5, y0 + j + 0.5, w.x[k], w.y[k]);
+        }
+    job.surface->GetHeights(n, w.x.data(), w.y.data(), w.h.data());
+    if (control.Stopped())
+        return;
+    const double* mx = w.x.data();
+    const double* my = w.y.data();
+    if (w.toModel) {
+        w.mx.assign(w.x.begin(), w.x.end());
+        w.my.assign(w.y.begin(), w.y.end());
+        w.toModel->Transform(n, w.mx.data(), w.my.data());
+        mx = w.mx.data(), my = w.my.data();
+    }
+    job.model->GroundToImage(n, mx, my, w.h.data(), w.col.data(), w.row.data(), w.ok.get());
+    for (size_t k = 0; k < n; ++k)
+        if (std::isnan(w.h[k]) || !std::isfinite(w.col[k]) || !std::isfinite(w.row[k]))
+            w.ok[k] = false;
+}
+
+void ProcessTile(const Plan& plan, Worker& w, OutputRaster& ortho, OutputRaster& visibility, int tx,
+                 int ty, int tw, int th, const RunControl& control, TorthoResult& counts) {
+    const TorthoJob& job = *plan.job;
+    // The tile with its surroundings, so that occluders outside the tile are projected too.
+    const int ex = tx - plan.extendLeft, ey = ty - plan.extendUp;
+    const int ew = tw + plan.extendLeft + plan.extendRight;
+    const int eh = th + plan.extendUp + plan.extendDown;
+    ProjectWindow(plan, w, ex, ey, ew, eh, control);
+    if (control.Stopped())
+        return;
+    auto at = [&](int i, int j) { return static_cast<size_t>(j - ey) * ew + (i - ex); };
+
+    // The image area the tile's own ground projects into.
+    double minC = std::numeric_limits<double>::infinity(), maxC = -minC, minR = minC, maxR = -minC;
+    for (int j = ty; j < ty + th; ++j)
+        for (int i = tx; i < tx + tw; ++i) {
+            const size_t k = at(i, j);
+            if (!w.ok[k])
+                continue;
+            minC = std::min(minC, w.col[k]), maxC = std::max(maxC, w.col[k]);
+            minR = std::min(minR, w.row[k]), maxR = std::max(maxR, w.row[k]);
+        }
+    const bool anyInside =
+        minC <= maxC && maxC >= 0 && maxR >= 0 && minC < plan.imageWidth && minR < plan.imageHeight;
+    int zx0 = 0, zy0 = 0, zx1 = 0, zy1 = 0;
+    if (anyInside) {
+        zx0 = std::max(static_cast<int>(std::floor(minC)) - 2, 0);
+        zy0 = std::max(static_cast<int>(std::floor(minR)) - 2, 0);
+        zx1 = std::min(static_cast<int>(std::ceil(maxC)) + 2, plan.imageWidth);
+        zy1 = std::min(static_cast<int>(std::ceil(maxR)) + 2, plan.imageHeight);
+    }
+
+    // Surface cells into the z-buffer: two triangles between each four neighbouring centres.
+    w.zbuffer.Reset(zx0, zy0, zx1 - zx0, zy1 - zy0);
+    if (anyInside) {
+        for (int j = ey; j + 1 < ey + eh; ++j) {
+            if ((j & 15) == 0 && control.Stopped())
+                return;
+            for (int i = ex; i + 1 < ex + ew; ++i) {
+                const size_t q[4] = {at(i, j), at(i + 1, j), at(i, j + 1), at(i + 1, j + 1)};
+                static const int triangles[2][3] = {{0, 1, 2}, {1, 3, 2}};
+                for (const auto& t : triangles) {
+                    const size_t a = q[t[0]], b = q[t[1]], c = q[t[2]];
+                    if (!w.ok[a] || !w.ok[b] || !w.ok[c])
+                        continue;
+                    const double cols[3] = {w.col[a], w.col[b], w.col[c]};
+                    const double rows[3] = {w.row[a], w.row[b], w.row[c]};
+                    if (std::max({cols[0], cols[1], cols[2]}) < zx0 ||
+                        std::min({cols[0], cols[1], cols[2]}) > zx1 ||
+                        std::max({rows[0], rows[1], rows[2]}) < zy0 ||
+                        std::min({rows[0], rows[1], rows[2]}) > zy1)
+                        continue;
+                    const double heights[3] = {w.h[a], w.h[b], w.h[c]};
+                    w.zbuffer.AddTriangle(cols, rows, heights);
+                }
+            }
+        }
+    }
+
+    // The source pixels the tile samples.
+    trueortho::SourceWindow& src = w.window;
+    src.imageWidth = plan.imageWidth, src.imageHeight = plan.imageHeight;
+    src.bands = static_cast<int>(plan.bands.size());
+    src.hasNoData = plan.hasNoData, src.noData = plan.noData;
+    const int radius = trueortho::KernelRadius(plan.kernel);
+    src.x0 = zx0 - radius, src.y0 = zy0 - radius;
+    src.width = anyInside ? zx1 - zx0 + 2 * radius : 0;
+    src.height = anyInside ? zy1 - zy0 + 2 * radius : 0;
+    src.values.assign(static_cast<size_t>(src.width) * src.height * src.bands, 0.0f);
+    if (anyInside)
+        trueortho::ReadWindow(*w.source, job.sourcePath, plan.bands, src.x0, src.y0, src.width,
+                              src.height, src.values.data());
+
+    // Each output pixel: seen, hidden, outside, or without height.
+    const size_t tileSize = static_cast<size_t>(tw) * th;
+    w.ortho.assign(tileSize * src.bands, static_cast<float>(job.orthoNoData));
+    w.visibility.assign(tileSize, static_cast<float>(VISIBILITY_OUTSIDE));
+    std::vector<float> value(src.bands);
+    for (int j = ty; j < ty + th; ++j) {
+        if ((j & 15) == 0 && control.Stopped())
+            return;
+        for (int i = tx; i < tx + tw; ++i) {
+            const size_t k = at(i, j), o = static_cast<size_t>(j - ty) * tw + (i - tx);
+            if (std::isnan(w.h[k])) {
+                w.visibility[o] = VISIBILITY_NODATA, ++counts.noHeight;
+                continue;
+            }
+            const double c = w.col[k], r = w.row[k];
+            if (!w.ok[k] || !(c >= 0 && r >= 0 && c < plan.imageWidth && r < plan.imageHeight)) {
+                ++counts.outside;
+                continue;
+            }
+            if (w.h[k] + job.heightTolerance < w.zbuffer.SurfaceBound(c, r)) {
+                w.visibility[o] = VISIBILITY_HIDDEN, ++counts.hidden;
+                continue;
+            }
+            if (!trueortho::Sample(src, plan.kernel, c, r, value.data())) {
+                ++counts.outside;
+                continue;
+            }
+            w.visibility[o] = VISIBILITY_SEEN, ++counts.seen;
+            for (int b = 0; b < src.bands; ++b)
+                w.ortho[tileSize * b + o] = value[b];
+        }
+    }
+    ortho.Write(tx, ty, tw, th, w.ortho.data());
+    visibility.Write(tx, ty, tw, th, w.visibility.data());
+}
+
+void Require(bool condition, const std::string& message, const SourceLocation& where) {
+    if (!condition)
+        KESTREL_THROW_AT(where, DataException, message);
+}
+
+// Checks the job and opens what the tiles share; throws DataException saying what is wrong.
+Plan MakePlan(const TorthoJob& job, GDALDataset& source) {
+    const SourceLocation where = KESTREL_HERE;
+    Require(job.model != nullptr, "True ortho: no math model given", where);
+    Require(job.surface != nullptr, "True ortho: no surface model given", where);
+    Require(job.crs != nullptr, "True ortho: the output layout has no coordinate system", where);
+    Require(job.pixels > 0 && job.lines > 0,
+            FormatString("True ortho: the output layout has %u pixels and %u lines; both must "
+                         "be at least 1",
+                         job.pixels, job.lines),
+            where);
+    Require(job.pixels <= 1u << 30 && job.lines <= 1u << 30,
+            FormatString("True ortho: output layout of %u x %u pixels is too large", job.pixels,
+                         job.lines),
+            where);
+    Require(!job.orthoPath.empty() && !job.visibilityPath.empty() &&
+                job.orthoPath != job.visibilityPath,
+            "True ortho: the ortho and the visibility index need two different output paths",
+            where);
+    Require(job.tileSize >= 16 && job.tileSize <= 8192,
+            FormatString("True ortho: tile size %u is outside 16 to 8192", job.tileSize), where);
+    Require(std::isfinite(job.heightTolerance) && job.heightTolerance >= 0,
+            FormatString("True ortho: height tolerance %g must be finite and not negative",
+                         job.heightTolerance),
+            where);
+
+    Plan plan;
+    plan.job = &job;
+    plan.kernel = trueortho::KernelByName(job.resampling);
+    plan.imageWidth = source.GetRasterXSize();
+    plan.imageHeight = source.GetRasterYSize();
+    const int count = source.GetRasterCount();
+    std::vector<unsigned int> channels = job.channels;
+    if (channels.empty())
+        for (int b = 1; b <= count; ++b)
+            channels.push_back(static_cast<unsigned int>(b));
+    GDALDataType type = GDT_Unknown;
+    for (unsigned int c : channels) {
+        Require(c >= 1 && c <= static_cast<unsigned int>(count),
+                FormatString("True ortho: channel %u of %s does not exist (it has %d)", c,
+                             job.sourcePath.c_str(), count),
+                where);
+        GDALRasterBand* band = source.GetRasterBand(static_cast<int>(c));
+        if (type == GDT_Unknown)
+            type = band->GetRasterDataType();
+        Require(band->GetRasterDataType() == type,
+                FormatString("True ortho: channels of %s have different data types (%s and %s); "
+                             "one ortho holds one data type",
+                             job.sourcePath.c_str(), GDALGetDataTypeName(type),
+                             GDALGetDataTypeName(band->GetRasterDataType())),
+                where);
+        plan.bands.push_back(static_cast<int>(c));
+        int has = 0;
+        const double nd = band->GetNoDataValue(&has);
+        plan.hasNoData.push_back(has ? 1 : 0);
+        plan.noData.push_back(static_cast<float>(nd));
+    }
+    Require(job.model->GetImageWidth() == static_cast<unsigned int>(plan.imageWidth) &&
+                job.model->GetImageHeight() == static_cast<unsigned int>(plan.imageHeight),
+            FormatString("True ortho: the math model is for a %u x %u image, but %s is %d x %d",
+                         job.model->GetImageWidth(), job.model->GetImageHeight(),
+                         job.sourcePath.c_str(), plan.imageWidth, plan.imageHeight),
+            where);
+    return plan;
+}
+
+// The surface must cover the output grid: a grid partly without heights is a wrong input
+// rather than a smaller ortho.
+void CheckSurfaceCovers(const TorthoJob& job) {
+    double minX, minY, maxX, maxY;
+    job.surface->GetExtent(minX, minY, maxX, maxY);
+    const ogc::cs::ICRS* surfaceCrs = job.surface->GetCRS();
+    std::array<double, 4> gx, gy;
+    const double corners[4][2] = {{0.5, 0.5},
+                                  {job.pixels - 0.5, 0.5},
+                                  {0.5, job.lines - 0.5},
+                                  {job.pixels - 0.5, job.lines - 0.5}};
+    for (int k = 0; k < 4; ++k)
+        job.geocoding.PixelToGround(corners[k][0], corners[k][1], gx[k], gy[k]);
+    if (surfaceCrs != nullptr && !surfaceCrs->IsSame(*job.crs))
+        ogc::cs::CoordinateTransformation(*job.crs, *surfaceCrs).Transform(4, gx.data(), gy.data());
+    const double slackX = 1e-6 * std::max(1.0, std::fabs(maxX - minX));
+    const double slackY = 1e-6 * std::max(1.0, std::fabs(maxY - minY));
+    for (int k = 0; k < 4; ++k)
+        if (!(gx[k] >= minX - slackX && gx[k] <= maxX + slackX && gy[k] >= minY - slackY &&
+              gy[k] <= maxY + slackY))
+            KESTREL_THROW(DataException,
+                          FormatString("True ortho: the surface model (%.3f, %.3f to %.3f, %.3f) "
+                                       "does not cover the output grid: its corner pixel (%.1f, "
+                                       "%.1f) lies at (%.3f, %.3f)",
+                                       minX, minY, maxX, maxY, corners[k][0] - 0.5,
+                                       corners[k][1] - 0.5, gx[k], gy[k]));
+}
+
+// Looks at the grid through the model on a sparse sample: the surface's height range, how far
+// occluders can stand from the ground they hide, and whether the image is reached at all.
+void Survey(const TorthoJob& job, Plan& plan, Worker& w, const RunControl& control) {
+    // Heights on every second pixel and line: the highest surface within reach of every tile.
+    double lowest = std::numeric_limits<double>::infinity(), highest = -lowest;
+    const unsigned int band = 64;
+    for (unsigned int y0 = 0; y0 < job.lines && !control.Stopped(); y0 += band * 2) {
+        const unsigned int rows = std::min(band, (job.lines - y0 + 1) / 2);
+        const unsigned int cols = (job.pixels + 1) / 2;
+        std::vector<double> x(static_cast<size_t>(rows) * cols), y(x.size()), h(x.size());
+        for (unsigned int j = 0; j < rows; ++j)
+            for (unsigned int i = 0; i < cols; ++i)
+                job.geocoding.PixelToGround(2 * i + 0.5, y0 + 2 * j + 0.5,
+                                            x[static_cast<size_t>(j) * cols + i],
+                                            y[static_cast<size_t>(j) * cols + i]);
+        job.surface->GetHeights(x.size(), x.data(), y.data(), h.data());
+        for (double v : h)
+            if (!std::isnan(v))
+                lowest = std::min(lowest, v), highest = std::max(highest, v);
+    }
+    if (control.Stopped())
+        return;
+    if (!(lowest <= highest))
+        KESTREL_THROW(DataException,
+                      "True ortho: the surface model has no height anywhere on the output grid");
+
+    // Ground displacement of the line of sight per metre of height, in output pixels, on a
+    // 17 x 17 grid; the same grid tells whether any ground reaches the image.
+    const int n = 17;
+    int inside = 0;
+    double left = 0, right = 0, up = 0, down = 0;
+    for (int a = 0; a < n; ++a)
+        for (int b = 0; b < n; ++b) {
+            const double p = job.pixels * (a + 0.5) / n, l = job.lines * (b + 0.5) / n;
+            // Ground at p, at p + 1 pixel and at l + 1 line, projected at two heights.
+            double px[4] = {p, p + 1, p, p}, py[4] = {l, l, l + 1, l};
+            double gx[4], gy[4], gz[4], c[4], r[4];
+            bool ok[4];
+            for (int k = 0; k < 4; ++k)
+                job.geocoding.PixelToGround(px[k], py[k], gx[k], gy[k]);
+            double h;
+            if (!job.surface->GetHeight(gx[0], gy[0], h))
+                continue;
+            for (int k = 0; k < 4; ++k)
+                gz[k] = k == 3 ? h + 1 : h;
+            if (w.toModel)
+                w.toModel->Transform(4, gx, gy);
+            job.model->GroundToImage(4, gx, gy, gz, c, r, ok);
+            if (!(ok[0] && ok[1] && ok[2] && ok[3]))
+                continue;
+            if (c[0] >= 0 && r[0] >= 0 && c[0] < plan.imageWidth && r[0] < plan.imageHeight)
+                ++inside;
+            // Image shift of one metre of height, expressed as ground pixels: J^-1 (d image).
+            const double j00 = c[1] - c[0], j01 = c[2] - c[0], j10 = r[1] - r[0], j11 = r[2] - r[0];
+            const double det = j00 * j11 - j01 * j10;
+            if (!(std::fabs(det) > 1e-12))
+                continue;
+            const double dc = c[3] - c[0], dr = r[3] - r[0];
+            // Occluders of a point stand towards the sensor: against the image shift.
+            const double dp = -(j11 * dc - j01 * dr) / det, dl = -(-j10 * dc + j00 * dr) / det;
+            right = std::max(right, dp), left = std::max(left, -dp);
+            down = std::max(down, dl), up = std::max(up, -dl);
+        }
+    if (inside == 0)
+        KESTREL_THROW(DataException,
+                      FormatString("True ortho: the math model projects the output grid outside "
+                                   "the image %s (%d x %d): layout and image do not match",
+                                   job.sourcePath.c_str(), plan.imageWidth, plan.imageHeight));
+    const double range = highest - lowest + 1.0;
+    auto pixels = [&](double perMetre) {
+        return static_cast<int>(std::min(std::ceil(perMetre * range) + 2, 1e5));
+    };
+    plan.extendLeft = pixels(left), plan.extendRight = pixels(right);
+    plan.extendUp = pixels(up), plan.extendDown = pixels(down);
+}
+
+}  // namespace
+
+TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
+    RunControl control(CancelFlag(), Progress(), ProgressData());
+    DatasetPtr source = trueortho::OpenRaster(job.sourcePath, "source image");
+    Plan plan = MakePlan(job, *source);
+    job.surface->SetInputCRS(job.crs);
+    CheckSurfaceCovers(job);
+    std::unique_ptr<ogc::cs::CoordinateTransformation> toModel;
+    if (job.model->GetCRS() != nullptr && !job.model->GetCRS()->IsSame(*job.crs))
+        toModel =
+            std::make_unique<ogc::cs::CoordinateTransformation>(*job.crs, *job.model->GetCRS());
+    {
+        Worker surveyor;
+        if (toModel)
+            surveyor.toModel = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel);
+        Survey(job, plan, surveyor, control);
+    }
+    TorthoResult result;
+    if (control.Stopped())
+        return result;
+
+    const GDALDataType type = source->GetRasterBand(plan.bands[0])->GetRasterDataType();
+    OutputRaster ortho(job.orthoPath, job.format, job.pixels, job.lines,
+                       static_cast<int>(plan.bands.size()), type, job.crs, job.geocoding,
+                       job.orthoNoData);
+    OutputRaster visibility(job.visibilityPath, job.format, job.pixels, job.lines, 1, GDT_Byte,
+                            job.crs, job.geocoding, VISIBILITY_NODATA);
+
+    const unsigned int tile = job.tileSize;
+    const unsigned int tilesX = (job.pixels + tile - 1) / tile,
+                       tilesY = (job.lines + tile - 1) / tile;
+    std::vector<TorthoResult> counts(ThreadsToUse());
+    std::vector<std::unique_ptr<Worker>> workers(counts.size());
+    control.RunTiles(
+        static_cast<size_t>(tilesX) * tilesY, static_cast<unsigned int>(counts.size()),
+        "True ortho", [&](unsigned int thread, size_t index) {
+            std::unique_ptr<Worker>& w = workers[thread];
+            if (!w) {
+                w = std::make_unique<Worker>();
+                w->source = trueortho::OpenRaster(job.sourcePath, "source image");
+                if (toModel)
+                    w->toModel = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel);
+            }
+            const int tx = static_cast<int>((index % tilesX) * tile);
+            const int ty = static_cast<int>((index / tilesX) * tile);
+            const int tw = static_cast<int>(std::min(tile, job.pixels - tx));
+            const int th = static_cast<int>(std::min(tile, job.lines - ty));
+            ProcessTile(plan, *w, ortho, visibility, tx, ty, tw, th, control, counts[thread]);
+        });
+    if (control.Stopped())
+        return result;  // the outputs discard themselves
+    ortho.Commit();
+    visibility.Commit();
+    for (const TorthoResult& c : counts) {
+        result.seen += c.seen, result.hidden += c.hidden;
+        result.outside += c.outside, result.noHeight += c.noHeight;
+    }
+    result.completed = true;
+    return result;
+}
+
+}  // namespace processes
+}  // namespace kestrel

@@ -1,0 +1,43 @@
+// Running a generator's tiles on several threads, with the process's cancel flag and a
+// progress callback in GDAL's style.
+#pragma once
+
+#include <kestrel/trueortho.h>
+
+#include <atomic>
+#include <cstddef>
+#include <functional>
+#include <mutex>
+
+namespace kestrel {
+namespace processes {
+namespace trueortho {
+
+class RunControl {
+  public:
+    RunControl(const bool* cancel, ProgressFunc progress, void* userData)
+        : cancel_(cancel), progress_(progress), userData_(userData) {}
+
+    // True once the cancel flag is set, the progress callback has returned false or a tile has
+    // failed. Cheap enough to ask every few lines.
+    bool Stopped() const;
+    bool Cancelled() const { return cancelled_; }
+
+    // Runs work(thread, index) for every index in [0, count) on up to `threads` threads, tiles
+    // taken in order, and reports progress after each. Every thread has ended when it returns;
+    // a failure of any tile stops the others and is thrown here.
+    void RunTiles(std::size_t count, unsigned int threads, const char* message,
+                  const std::function<void(unsigned int thread, std::size_t index)>& work);
+
+  private:
+    const bool* cancel_;
+    ProgressFunc progress_;
+    void* userData_;
+    mutable std::atomic<bool> stop_{false};
+    mutable std::atomic<bool> cancelled_{false};
+    std::mutex progressMutex_;
+};
+
+}  // namespace trueortho
+}  // namespace processes
+}  // namespace kestrel
