@@ -17,6 +17,9 @@
 #if defined(_WIN32)
 #define popen _popen
 #define pclose _pclose
+#else
+#include <sys/resource.h>
+#include <csignal>
 #endif
 
 using kestrel::datasources::BasicReader;
@@ -375,6 +378,17 @@ TEST(RasterWriter, FailuresNameTheFileAndLeaveNothing) {
     EXPECT_TRUE(std::filesystem::is_empty(dir.Path() / "locked"));
     std::filesystem::remove(dir.Path() / "locked");
     EXPECT_TRUE(std::filesystem::is_empty(dir.Path()));
+    // A directory that does not exist.
+    try {
+        std::unique_ptr<IRasterWriter> writer(
+            GetRasterWriter(dir.File("no/such/dir/o.tif"), "tif", {1}));
+        writer->SetSize(16, 16);
+        writer->SetDataType(DataType::Byte);
+        writer->Create();
+        ADD_FAILURE();
+    } catch (const kestrel::FileAccessException& e) {
+        EXPECT_NE(std::string(e.what()).find("no/such/dir/o.tif"), std::string::npos);
+    }
     // Unknown types and formats.
     try {
         delete GetRasterWriter(dir.File("a.xyz1"), "xyz1", {1});
@@ -535,3 +549,36 @@ TEST(RasterUtils, DiskIdIsTheDeviceOfTheFile) {
     EXPECT_EQ(GetDiskId(dir.File("missing.txt")), 0u);
     EXPECT_EQ(GetDiskId(""), 0u);
 }
+
+#if !defined(_WIN32)
+// A disk that fills up while the ortho is written (a file size limit stands in for it): the
+// failure is reported with the file's name and nothing is left under either name.
+TEST(RasterWriter, DiskFullLeavesNoPartialFile) {
+    TempDir dir;
+    const std::string path = dir.File("big.tif");
+    rlimit before{};
+    getrlimit(RLIMIT_FSIZE, &before);
+    const auto previous = std::signal(SIGXFSZ, SIG_IGN);
+    rlimit limit = before;
+    limit.rlim_cur = 200000;
+    ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &limit), 0);
+    bool failed = false;
+    try {
+        std::unique_ptr<IRasterWriter> writer(
+            new BasicWriter(path, {1, 2, 3}, "GTiff", "COMPRESS=NONE"));
+        writer->SetSize(512, 512);
+        writer->SetDataType(DataType::Byte);
+        Raster tile(512, 512, 3, DataType::Byte);
+        tile.Fill(7);
+        writer->WriteWindow(tile, 0, 0);
+        writer->Close();
+    } catch (const kestrel::FileAccessException& e) {
+        failed = true;
+        EXPECT_EQ(e.GetFileName(), path);
+    }
+    setrlimit(RLIMIT_FSIZE, &before);
+    std::signal(SIGXFSZ, previous);
+    EXPECT_TRUE(failed);
+    EXPECT_TRUE(std::filesystem::is_empty(dir.Path()));
+}
+#endif

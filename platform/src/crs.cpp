@@ -2,8 +2,12 @@
 
 #include <cmath>
 
+#include <set>
+
+#include <cpl_string.h>
 #include <gdal_alg.h>
 #include <ogr_spatialref.h>
+#include <proj.h>
 
 #include <kestrel/exception.h>
 
@@ -134,8 +138,61 @@ struct CoordinateTransformation::Impl {
 
 namespace {
 
-std::unique_ptr<OGRCoordinateTransformation> CreateTransformation(const OGRSpatialReference& source,
-                                                                  const OGRSpatialReference& target) {
+// PROJ's data directories as OGR uses them, separated by commas.
+std::string SearchPaths() {
+    const CPLStringList paths(OSRGetPROJSearchPaths());
+    std::string text;
+    for (int i = 0; i < paths.size(); ++i)
+        text += (text.empty() ? "" : ", ") + std::string(paths[i]);
+    return text;
+}
+
+// The grids that PROJ's operations from source to target need and PROJ cannot find, by their
+// short names ("us_nga_egm96_15.tif"), separated by commas; empty when none is missing.
+std::string MissingGrids(const OGRSpatialReference& source, const OGRSpatialReference& target) {
+    const ICRS from(source), to(target);
+    PJ_CONTEXT* ctx = proj_context_create();
+    const CPLStringList paths(OSRGetPROJSearchPaths());
+    proj_context_set_search_paths(ctx, paths.size(), paths.List());
+    PJ* src = proj_create(ctx, from.GetWKT().c_str());
+    PJ* dst = proj_create(ctx, to.GetWKT().c_str());
+    PJ_OPERATION_FACTORY_CONTEXT* factory = proj_create_operation_factory_context(ctx, nullptr);
+    PJ_OBJ_LIST* operations = nullptr;
+    if (src != nullptr && dst != nullptr && factory != nullptr) {
+        proj_operation_factory_context_set_grid_availability_use(ctx, factory,
+                                                                 PROJ_GRID_AVAILABILITY_IGNORED);
+        proj_operation_factory_context_set_spatial_criterion(
+            ctx, factory, PROJ_SPATIAL_CRITERION_PARTIAL_INTERSECTION);
+        operations = proj_create_operations(ctx, src, dst, factory);
+    }
+    std::set<std::string> missing;
+    const int count = operations != nullptr ? proj_list_get_count(operations) : 0;
+    for (int i = 0; i < count; ++i) {
+        PJ* operation = proj_list_get(ctx, operations, i);
+        const int grids = proj_coordoperation_get_grid_used_count(ctx, operation);
+        for (int g = 0; g < grids; ++g) {
+            const char* name = nullptr;
+            int available = 1;
+            if (proj_coordoperation_get_grid_used(ctx, operation, g, &name, nullptr, nullptr,
+                                                  nullptr, nullptr, nullptr, &available) &&
+                !available && name != nullptr && *name != '\0')
+                missing.insert(name);
+        }
+        proj_destroy(operation);
+    }
+    proj_list_destroy(operations);
+    proj_operation_factory_context_destroy(factory);
+    proj_destroy(src);
+    proj_destroy(dst);
+    proj_context_destroy(ctx);
+    std::string names;
+    for (const auto& name : missing)
+        names += (names.empty() ? "" : ", ") + name;
+    return names;
+}
+
+std::unique_ptr<OGRCoordinateTransformation> CreateTransformation(
+    const OGRSpatialReference& source, const OGRSpatialReference& target) {
     gdalsupport::EnsureRegistered();
     gdalsupport::ErrorCapture errors;
     OGRCoordinateTransformationOptions options;
@@ -146,11 +203,20 @@ std::unique_ptr<OGRCoordinateTransformation> CreateTransformation(const OGRSpati
         OGRCreateCoordinateTransformation(&source, &target, options));
     if (!transform) {
         const ICRS from(source), to(target);
-        KESTREL_THROW(DataException,
-                      FormatString("No transformation from \"%s\" to \"%s\" without a ballpark "
-                                   "step (is a datum or geoid grid missing?): %s",
-                                   from.GetName().c_str(), to.GetName().c_str(),
-                                   errors.Reason().c_str()));
+        const std::string grids = MissingGrids(source, target);
+        if (!grids.empty()) {
+            KESTREL_THROW(DataException,
+                          FormatString("No transformation from \"%s\" to \"%s\": PROJ cannot find "
+                                       "the grid %s in its data directories (%s), and a "
+                                       "\"ballpark\" step without it would be wrong by metres",
+                                       from.GetName().c_str(), to.GetName().c_str(), grids.c_str(),
+                                       SearchPaths().c_str()));
+        }
+        KESTREL_THROW(
+            DataException,
+            FormatString("No transformation from \"%s\" to \"%s\" without a ballpark "
+                         "step (is a datum or geoid grid missing?): %s",
+                         from.GetName().c_str(), to.GetName().c_str(), errors.Reason().c_str()));
     }
     return transform;
 }

@@ -21,9 +21,13 @@ namespace gobs {
 // raster read from a window can be resampled and written back by image coordinates.
 class KESTREL_API Raster {
   public:
-    // Zero-filled. Throws DataException for DataType::Unknown, a zero size or zero channels.
+    // What a new raster's buffer holds: zeros, or nothing yet (for a caller that sets every
+    // value, such as a read).
+    enum class Initial { Zeros, Unset };
+
+    // Throws DataException for DataType::Unknown, a zero size or zero channels.
     Raster(unsigned int width, unsigned int height, unsigned int channels,
-           datasources::DataType type);
+           datasources::DataType type, Initial initial = Initial::Zeros);
     Raster(const Raster& other);
     Raster& operator=(const Raster& other);
     Raster(Raster&& other) noexcept;

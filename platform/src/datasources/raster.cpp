@@ -13,10 +13,11 @@ namespace gobs {
 
 namespace {
 
-std::unique_ptr<std::max_align_t[]> Allocate(std::size_t bytes) {
+std::unique_ptr<std::max_align_t[]> Allocate(std::size_t bytes, bool zeros) {
     const std::size_t units = (bytes + sizeof(std::max_align_t) - 1) / sizeof(std::max_align_t);
-    // Value-initialised: zero-filled.
-    return std::unique_ptr<std::max_align_t[]>(new std::max_align_t[units]());
+    if (zeros)
+        return std::unique_ptr<std::max_align_t[]>(new std::max_align_t[units]());
+    return std::unique_ptr<std::max_align_t[]>(new std::max_align_t[units]);
 }
 
 template <typename T>
@@ -61,7 +62,7 @@ auto Dispatch(datasources::DataType type, F&& f) {
 }  // namespace
 
 Raster::Raster(unsigned int width, unsigned int height, unsigned int channels,
-               datasources::DataType type)
+               datasources::DataType type, Initial initial)
     : width_(width),
       height_(height),
       channels_(channels),
@@ -74,7 +75,7 @@ Raster::Raster(unsigned int width, unsigned int height, unsigned int channels,
                          "cannot be made",
                          width, height, channels, datasources::DataTypeName(type).c_str()));
     }
-    data_ = Allocate(GetByteSize());
+    data_ = Allocate(GetByteSize(), initial == Initial::Zeros);
 }
 
 Raster::Raster(const Raster& other)
@@ -85,7 +86,7 @@ Raster::Raster(const Raster& other)
       valueSize_(other.valueSize_),
       x_(other.x_),
       y_(other.y_),
-      data_(Allocate(other.GetByteSize())) {
+      data_(Allocate(other.GetByteSize(), false)) {
     std::memcpy(data_.get(), other.data_.get(), GetByteSize());
 }
 

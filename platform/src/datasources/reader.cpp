@@ -246,8 +246,9 @@ gobs::Raster* BasicReader::ReadWindow(unsigned int x, unsigned int y, unsigned i
                                       unsigned int height) {
     CheckWindow(GetPath(), impl_->tiling.width, impl_->tiling.height, x, y, width, height,
                 KESTREL_HERE);
-    auto raster = std::make_unique<gobs::Raster>(
-        width, height, static_cast<unsigned int>(impl_->channels.size()), impl_->type);
+    auto raster = std::make_unique<gobs::Raster>(width, height,
+                                                 static_cast<unsigned int>(impl_->channels.size()),
+                                                 impl_->type, gobs::Raster::Initial::Unset);
     raster->SetOrigin(x, y);
     {
         std::lock_guard<std::mutex> lock(impl_->mutex);

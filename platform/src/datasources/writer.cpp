@@ -1,4 +1,5 @@
 #include <array>
+#include <cerrno>
 #include <mutex>
 #include <optional>
 #include <random>
@@ -482,7 +483,8 @@ gobs::Raster* BasicWriter::ReadWindow(unsigned int x, unsigned int y, unsigned i
         CreateLocked(*impl_, KESTREL_HERE);
         CheckWindow(impl_->path, impl_->tiling.width, impl_->tiling.height, x, y, width, height,
                     KESTREL_HERE);
-        raster = std::make_unique<gobs::Raster>(width, height, impl_->channelCount, impl_->type);
+        raster = std::make_unique<gobs::Raster>(width, height, impl_->channelCount, impl_->type,
+                                                gobs::Raster::Initial::Unset);
         raster->SetOrigin(x, y);
         TransferWindow(*impl_->dataset, GF_Read, impl_->path, impl_->Bands(), *raster, x, y,
                        KESTREL_HERE);

@@ -199,9 +199,14 @@ std::vector<std::string> RastersIn(const std::string& directory) {
         const std::string full = CPLFormFilename(directory.c_str(), name.c_str(), nullptr);
         if (IsDirectory(full))
             continue;
+        // A format that holds rasters or vectors (GeoPackage) is identified either way: only
+        // a file that opens with a band counts.
         gdalsupport::ErrorCapture quiet;
-        GDALDriverH driver = GDALIdentifyDriverEx(full.c_str(), GDAL_OF_RASTER, nullptr, nullptr);
-        if (driver != nullptr)
+        if (GDALIdentifyDriverEx(full.c_str(), GDAL_OF_RASTER, nullptr, nullptr) == nullptr)
+            continue;
+        const DatasetPtr raster(GDALDataset::Open(full.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY),
+                                &CloseDataset);
+        if (raster && raster->GetRasterCount() > 0)
             rasters.push_back(full);
     }
     std::sort(rasters.begin(), rasters.end());

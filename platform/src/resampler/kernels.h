@@ -8,6 +8,8 @@ namespace kestrel {
 namespace utils {
 namespace kernels {
 
+constexpr double kPi = 3.14159265358979323846;
+
 inline double Bilinear(double x) {
     const double a = std::fabs(x);
     return a <= 1.0 ? 1.0 - a : 0.0;
@@ -41,7 +43,7 @@ inline double Lanczos(double x) {
         return 1.0;
     if (std::fabs(x) >= 3.0)
         return 0.0;
-    const double pix = M_PI * x;
+    const double pix = kPi * x;
     const double pixOver3 = pix / 3.0;
     return std::sin(pix) * std::sin(pixOver3) / (pix * pixOver3);
 }
