@@ -308,9 +308,7 @@ TEST(RasterWriter, EachFileTypeOpensInGdalinfoWithWhatWasWritten) {
         EXPECT_NE(info.find("ID[\\\"EPSG\\\",32632]"), std::string::npos) << info;
         EXPECT_NE(info.find("500000.0,"), std::string::npos) << info;
         EXPECT_NE(info.find("4100000.0,"), std::string::npos) << info;
-        if (std::string(type) != "gpkg") {  // GeoPackage has no no-data for byte tiles
-            EXPECT_NE(info.find("\"noDataValue\":0.0"), std::string::npos) << info;
-        }
+        EXPECT_NE(info.find("\"noDataValue\":0.0"), std::string::npos) << info;
         BasicReader reader(path);
         std::unique_ptr<Raster> all(reader.ReadWindow(0, 0, 64, 48));
         for (unsigned int c = 0; c < 3; ++c)
