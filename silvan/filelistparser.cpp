@@ -6,9 +6,9 @@ namespace silvan {
 
 namespace parsercore {
 
-std::shared_ptr<ParametersTableIF> ReadTable(MFileParser& parser, const std::string& filename,
-                                             unsigned int& lineCount, const SourceLocation& where) {
-    std::shared_ptr<ParametersTableIF> table(parser.Create(filename));
+OwnedTable ReadTable(MFileParser& parser, const std::string& filename, unsigned int& lineCount,
+                     const SourceLocation& where) {
+    OwnedTable table(parser.Create(filename));
     if (!table) {
         KESTREL_THROW_AT(where, ParameterException, "MFILE", ParameterException::InvalidFile,
                          filename, "", "Invalid MFILE");

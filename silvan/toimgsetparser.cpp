@@ -2,7 +2,7 @@
 
 #include <silvan/filelistparser.h>
 
-#include <cctype>
+#include <string>
 
 namespace kestrel {
 namespace processes {
@@ -45,7 +45,7 @@ RadiometricDiff TOImgSetParser::EncodeRadioDif(const std::string& text) const {
         return RadioDifAny;
     std::string upper(text);
     for (char& c : upper)
-        c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+        c = c >= 'a' && c <= 'z' ? static_cast<char>(c - 'a' + 'A') : c;  // as in the "C" locale
     if (StartsWith(upper, "LOW"))
         return RadioDifLow;
     if (StartsWith(upper, "MODERATE"))

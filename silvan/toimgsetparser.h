@@ -8,6 +8,7 @@
 
 #include <kestrel/mfileparser.h>
 #include <silvan/export.h>
+#include <silvan/filelistparser.h>
 
 // Level of radiometric difference between a scene and its neighbours. Its text forms are "ANY",
 // "LOW", "MODERATE" and "HIGH".
@@ -27,7 +28,7 @@ class SILVAN_API TOImgSetParser : public MFileParser {
     // radioDif and dbmPxErr are the values of a line that leaves columns 1 and 2 out or empty.
     TOImgSetParser(const std::string& filename, RadiometricDiff radioDif, int dbmPxErr);
     ~TOImgSetParser() override;
-    // Copies share the table; it is released with the last of them.
+    // A copy has its own table, which shares the file's bytes with the original.
     TOImgSetParser(const TOImgSetParser&);
     TOImgSetParser& operator=(const TOImgSetParser&);
 
@@ -51,7 +52,7 @@ class SILVAN_API TOImgSetParser : public MFileParser {
     RadiometricDiff radioDif = RadioDifAny;
     int dbmPxErr = 0;
     unsigned int mfileLines = 0;
-    std::shared_ptr<ParametersTableIF> table;
+    parsercore::OwnedTable table;
 };
 
 }  // namespace silvan

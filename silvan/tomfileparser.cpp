@@ -4,13 +4,7 @@
 
 #include <kestrel/file.h>
 
-#include <cctype>
-#include <cerrno>
-#include <cstdio>
-#include <cstring>
-#include <filesystem>
-#include <system_error>
-#include <utility>
+#include <string>
 
 namespace kestrel {
 namespace processes {
@@ -21,33 +15,16 @@ namespace {
 enum Column { kFili, kDbic, kMmseg, kDbiw, kSrcBgd, kEdgeClip, kRadioDif, kDbmPxErr, kRole };
 constexpr int kColumnCount = 9;
 
-// Writes a text file line by line. Lines are collected in whole and written in batches, so the
-// file ends at a line end whenever it is written to, also when a line's values cannot be read
-// and the exception unwinds through the writer. Failures to create or write the file are
-// reported as FileAccessException at `where`; a file that did not exist before is then removed
-// again rather than left half written.
+// Writes a text file line by line, whole or not at all: the lines are collected and written in
+// batches to a temporary file that replaces the target only when every line has been written
+// (kestrel::core::fileio::ReplacingFile). Any failure, of the disk or of reading a line, leaves
+// the previous file as it was.
 class LineWriter {
   public:
     LineWriter(const std::string& filename, const SourceLocation& where)
-        : filename_(filename), where_(where) {
-        std::error_code ec;
-        existed_ = std::filesystem::exists(std::filesystem::path(filename_), ec);
-        file_ = std::fopen(filename_.c_str(), "w");
-        if (file_ == nullptr)
-            Fail("cannot be created", errno);
+        : file_(filename, where, true) {
         pending_.reserve(kBatchBytes + 4096);
     }
-
-    ~LineWriter() {
-        if (file_ == nullptr)
-            return;
-        // Unwinding from an exception: keep the complete lines collected so far.
-        WritePending();
-        std::fclose(file_);
-    }
-
-    LineWriter(const LineWriter&) = delete;
-    LineWriter& operator=(const LineWriter&) = delete;
 
     // Appends to the current line.
     LineWriter& operator<<(const std::string& text) {
@@ -62,54 +39,46 @@ class LineWriter {
     // Ends the current line.
     void EndLine() {
         pending_ += '\n';
-        if (pending_.size() >= kBatchBytes && !WritePending())
-            Fail("cannot be written", errno);
+        if (pending_.size() >= kBatchBytes)
+            WritePending();
     }
 
-    // Writes what is left and closes the file.
-    void Close() {
-        bool ok = WritePending() && std::fflush(file_) == 0;
-        int error = ok ? 0 : errno;
-        std::FILE* file = std::exchange(file_, nullptr);
-        if (std::fclose(file) != 0 && ok) {
-            ok = false;
-            error = errno;
-        }
-        if (!ok)
-            Fail("cannot be written", error);
+    // Writes what is left and puts the file in place.
+    void Commit() {
+        WritePending();
+        file_.Commit();
     }
 
   private:
     static constexpr std::size_t kBatchBytes = 1 << 16;
 
-    bool WritePending() {
-        const std::size_t size = pending_.size();
-        const bool written = size == 0 || std::fwrite(pending_.data(), 1, size, file_) == size;
+    void WritePending() {
+        file_.Write(pending_);
         pending_.clear();
-        return written;
     }
 
-    [[noreturn]] void Fail(const char* what, int error) {
-        if (file_ != nullptr) {
-            std::fclose(file_);
-            file_ = nullptr;
-        }
-        if (!existed_) {
-            std::error_code ec;
-            std::filesystem::remove(std::filesystem::path(filename_), ec);
-        }
-        const std::string reason = error != 0 ? std::generic_category().message(error) : "";
-        KESTREL_THROW_AT(where_, FileAccessException, filename_, FileAccessException::CreateFailed,
-                         FormatString("\"%s\" %s%s%s", filename_.c_str(), what,
-                                      reason.empty() ? "" : ": ", reason.c_str()));
-    }
-
-    std::string filename_;
-    SourceLocation where_;
-    bool existed_ = false;
-    std::FILE* file_ = nullptr;
+    core::fileio::ReplacingFile file_;
     std::string pending_;
 };
+
+// toupper as in the "C" locale, whatever the process's locale.
+char AsciiUpper(char c) {
+    return c >= 'a' && c <= 'z' ? static_cast<char>(c - 'a' + 'A') : c;
+}
+
+// A record whose line would begin with "!" reads back as a comment, so the derived file would
+// silently lose it: refused, naming where the value comes from and the file being written.
+void RefuseCommentLike(const ParametersTableIF& table, int line, const char* what,
+                       const std::string& value, const std::string& output,
+                       const SourceLocation& where) {
+    if (!value.empty() && value[0] == '!') {
+        KESTREL_THROW_AT(where, DataException,
+                         FormatString("%s: the %s \"%s\" begins with \"!\", so its record in %s "
+                                      "would read back as a comment line; it is not written",
+                                      table.DescribePosition(line, kFili).c_str(), what,
+                                      value.c_str(), output.c_str()));
+    }
+}
 
 }  // namespace
 
@@ -153,11 +122,13 @@ void TOMFileParser::WriteMFilePrep(const std::string& filename) {
     out.EndLine();
     for (unsigned int line = 0; line < mfileLines; ++line) {
         ParseLineForPrep(static_cast<int>(line));
+        RefuseCommentLike(*table, static_cast<int>(line), "file name", fili, filename,
+                          KESTREL_HERE);
         out << fili << ';' << dbic << ';' << mmseg << ';' << dbiw << ';' << srcBgd << ';'
             << edgeClip;
         out.EndLine();
     }
-    out.Close();
+    out.Commit();
 }
 
 void TOMFileParser::WriteImgSet(const std::string& filename) {
@@ -167,14 +138,16 @@ void TOMFileParser::WriteImgSet(const std::string& filename) {
     for (unsigned int line = 0; line < mfileLines; ++line) {
         ParseLineForFill(static_cast<int>(line));
         for (char& c : role)
-            c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+            c = AsciiUpper(c);
         if (role.compare(0, 4, "PREP") == 0)
             continue;
-        const core::fileio::File image(fili);
-        out << image.GetBasename() << ';' << radioDif << ';' << dbmPxErr;
+        const std::string basename = core::fileio::File(fili).GetBasename();
+        RefuseCommentLike(*table, static_cast<int>(line), "base name", basename, filename,
+                          KESTREL_HERE);
+        out << basename << ';' << radioDif << ';' << dbmPxErr;
         out.EndLine();
     }
-    out.Close();
+    out.Commit();
 }
 
 }  // namespace silvan

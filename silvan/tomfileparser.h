@@ -7,6 +7,7 @@
 #include <kestrel/exception.h>
 #include <kestrel/mfileparser.h>
 #include <silvan/export.h>
+#include <silvan/filelistparser.h>
 
 namespace kestrel {
 namespace processes {
@@ -18,7 +19,7 @@ class SILVAN_API TOMFileParser : public MFileParser {
   public:
     explicit TOMFileParser(const std::string& filename);
     ~TOMFileParser() override;
-    // Copies share the table; it is released with the last of them.
+    // A copy has its own table, which shares the file's bytes with the original.
     TOMFileParser(const TOMFileParser&);
     TOMFileParser& operator=(const TOMFileParser&);
 
@@ -62,7 +63,7 @@ class SILVAN_API TOMFileParser : public MFileParser {
     std::string dbmPxErr;
     std::string role;
     unsigned int mfileLines = 0;
-    std::shared_ptr<ParametersTableIF> table;
+    parsercore::OwnedTable table;
 };
 
 }  // namespace silvan

@@ -9,6 +9,7 @@
 
 #include <kestrel/disk.h>
 #include <kestrel/file.h>
+#include <kestrel/stringlist.h>
 #include <silvan/utils.h>
 
 namespace kestrel {
@@ -50,8 +51,9 @@ int TextToInt(const std::string& text) {
     return static_cast<int>(value);
 }
 
+// atof's reading in the "C" locale, whatever the process's locale: the writer writes with ".".
 float TextToFloat(const std::string& text) {
-    return static_cast<float>(std::atof(text.c_str()));
+    return static_cast<float>(ClassicAtof(text.c_str()));
 }
 
 }  // namespace
@@ -159,8 +161,8 @@ bool TOSceneParser::GetSceneFootprintFromXML() {
                                          "\"%s\" does not hold two coordinates"),
                                        GetXMLFilename().c_str(), texts[i].c_str()));
         }
-        points[i].x = std::atof(tokens[0].c_str());
-        points[i].y = std::atof(tokens[1].c_str());
+        points[i].x = ClassicAtof(tokens[0].c_str());
+        points[i].y = ClassicAtof(tokens[1].c_str());
     }
     // The polygon takes the array over once it is built.
     std::unique_ptr<Footprint> footprint(new Footprint(points.get(), count));
@@ -187,24 +189,20 @@ XERCES_CPP_NAMESPACE::DOMDocumentType* TOSceneParser::GetDOMDocumenType() const 
 
 void TOSceneParser::CreateDTDFile(const std::string& directory) const {
     const std::string path = core::fileio::File(directory + kDocName + ".dtd").GetNormalizedName();
-    std::FILE* file = nullptr;
+    // Written completely now, put in place by the base together with the XML file, and never
+    // left behind by a writing that fails.
+    std::unique_ptr<core::fileio::ReplacingFile> dtd;
     try {
-        file = DKOpen(path.c_str(), 4, "w");
+        dtd = std::make_unique<core::fileio::ReplacingFile>(path, KESTREL_HERE, true);
+        for (const char* text : kDtdText)
+            dtd->Write(text);
+        dtd->Close();
     } catch (const Exception& e) {
         KESTREL_THROW(FileAccessException, path, FileAccessException::CreateFailed,
                       FormatString(_(" Scene XML file: %s couldn't be created because\n %s\n"),
                                    path.c_str(), e.what()));
     }
-    for (const char* text : kDtdText)
-        std::fputs(text, file);
-    try {
-        DKClose(file);  // reports a failed write as well
-    } catch (const Exception& e) {
-        std::remove(path.c_str());  // a cut DTD would stop later writers from making a whole one
-        KESTREL_THROW(FileAccessException, path, FileAccessException::CreateFailed,
-                      FormatString(_(" Scene XML file: %s couldn't be created because\n %s\n"),
-                                   path.c_str(), e.what()));
-    }
+    KeepWithXMLFile(std::move(dtd));
 }
 
 void TOSceneParser::AddElementsToDocument() {

@@ -8,6 +8,7 @@
 
 #include <kestrel/mfileparser.h>
 #include <silvan/export.h>
+#include <silvan/filelistparser.h>
 
 namespace kestrel {
 namespace processes {
@@ -21,7 +22,7 @@ class SILVAN_API TPMFileParser : public MFileParser {
                   int defaultMmseg, std::vector<int>& defaultDbiw, const std::string& defaultSrcBgd,
                   int defaultEdgeClip);
     ~TPMFileParser() override;
-    // Copies share the table; it is released with the last of them.
+    // A copy has its own table, which shares the file's bytes with the original.
     TPMFileParser(const TPMFileParser&);
     TPMFileParser& operator=(const TPMFileParser&);
 
@@ -52,7 +53,7 @@ class SILVAN_API TPMFileParser : public MFileParser {
     std::string srcBgd;
     int edgeClip = 0;
     unsigned int mfileLines = 0;
-    std::shared_ptr<ParametersTableIF> table;
+    parsercore::OwnedTable table;
 };
 
 }  // namespace silvan

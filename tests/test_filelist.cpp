@@ -4,7 +4,6 @@
 #include "support.h"
 
 using kestrel::DataException;
-using kestrel::ParameterException;
 using kestrel::processes::silvan::FileListParser;
 using testsupport::ExpectThrownFrom;
 using testsupport::TempDir;
@@ -61,56 +60,4 @@ TEST(FileListParser, EmptyFieldReadsAsEmptyName) {
     FileListParser files(WriteFile(dir.File("list.txt"), "a.tif\n ;x\n"));
     files.ParseLine(1);
     EXPECT_EQ(files.GetFili(), "");
-}
-
-TEST(FileListParser, UnreadableFileIsInvalidMfile) {
-    TempDir dir;
-    const std::string name = dir.File("no such list.txt");
-    try {
-        FileListParser files(name);
-        FAIL();
-    } catch (const ParameterException& e) {
-        EXPECT_EQ(e.GetErrorMessage(), "Invalid MFILE");
-        EXPECT_EQ(e.GetParameterName(), "MFILE");
-        EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
-        EXPECT_EQ(static_cast<int>(e.GetType()), 0);
-        EXPECT_EQ(e.GetValue(), name);
-        EXPECT_EQ(e.GetExpected(), "");
-        ExpectThrownFrom(e,
-                         "kestrel::processes::silvan::FileListParser::FileListParser(const "
-                         "std::string&)",
-                         "filelistparser.cpp");
-    }
-}
-
-TEST(FileListParser, FileWithoutDataLinesIsEmptyTextFile) {
-    TempDir dir;
-    for (const char* bytes : {"", "!MFILE created for nobody\n", "\n  \n\t\r\n"}) {
-        const std::string name = WriteFile(dir.File("empty.txt"), bytes);
-        try {
-            FileListParser files(name);
-            FAIL() << "accepted \"" << bytes << "\"";
-        } catch (const ParameterException& e) {
-            EXPECT_EQ(e.GetErrorMessage(), "Empty text file");
-            EXPECT_EQ(e.GetParameterName(), "MFILE");
-            EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
-            EXPECT_EQ(e.GetValue(), name);
-        }
-    }
-}
-
-TEST(FileListParser, CopiesShareTheTableAndOutliveTheOriginal) {
-    TempDir dir;
-    auto original = std::make_unique<FileListParser>(ThreeFiles(dir));
-    original->ParseLine(2);
-    FileListParser copy(*original);
-    FileListParser assigned(WriteFile(dir.File("other.txt"), "x\n"));
-    assigned = *original;
-    original.reset();
-    EXPECT_EQ(copy.GetFili(), "c d.tif");
-    copy.ParseLine(0);
-    assigned.ParseLine(1);
-    EXPECT_EQ(copy.GetFili(), "a.tif");
-    EXPECT_EQ(assigned.GetFili(), "sub/b.tif");
-    EXPECT_EQ(assigned.GetMfileLines(), 3u);
 }

@@ -3,8 +3,6 @@
 
 #include "support.h"
 
-using kestrel::DataException;
-using kestrel::ParameterException;
 using kestrel::processes::silvan::TOImgSetParser;
 using testsupport::TempDir;
 using testsupport::WriteFile;
@@ -73,41 +71,5 @@ TEST(TOImgSetParser, ColumnsLeftOutReadAsConstructorDefaults) {
         parser.ParseLine(0);
         EXPECT_EQ(parser.GetRadioDif(), RadioDifAny);
         EXPECT_EQ(parser.GetDbmPxErr(), -3);
-    }
-}
-
-TEST(TOImgSetParser, IndexOutOfRangeLeavesCurrentLine) {
-    TempDir dir;
-    TOImgSetParser parser(WriteImgSet(dir, "a;low;1\nb;high;2\n"), RadioDifAny, 0);
-    parser.ParseLine(1);
-    for (const int index : {2, -1}) {
-        try {
-            parser.ParseLine(index);
-            ADD_FAILURE() << index << " was read";
-        } catch (const DataException& e) {
-            EXPECT_EQ(e.GetErrorMessage(),
-                      "Index " + std::to_string(index) + " is outside of valid range: 2");
-            EXPECT_NE(e.GetFunction().find("TOImgSetParser::ParseLine"), std::string::npos);
-            EXPECT_EQ(e.GetSourceFile(), "toimgsetparser.cpp");
-        }
-        EXPECT_EQ(parser.GetSceneId(), "b");
-        EXPECT_EQ(parser.GetRadioDif(), RadioDifHigh);
-        EXPECT_EQ(parser.GetDbmPxErr(), 2);
-    }
-}
-
-TEST(TOImgSetParser, FileWithoutScenesIsRefused) {
-    TempDir dir;
-    const std::string path = WriteImgSet(dir, "\n! no scene\n");
-    try {
-        TOImgSetParser parser(path, RadioDifAny, 0);
-        ADD_FAILURE() << "a file without scenes was read";
-    } catch (const ParameterException& e) {
-        EXPECT_EQ(e.GetErrorMessage(), "Empty text file");
-        EXPECT_EQ(e.GetParameterName(), "MFILE");
-        EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
-        EXPECT_EQ(e.GetValue(), path);
-        EXPECT_NE(e.GetFunction().find("TOImgSetParser::TOImgSetParser"), std::string::npos);
-        EXPECT_EQ(e.GetSourceFile(), "toimgsetparser.cpp");
     }
 }

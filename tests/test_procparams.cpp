@@ -78,6 +78,19 @@ TEST(ProcOption, UnreadableTextQuotesItListsFormsAndLeavesOutputsAlone) {
     }
 }
 
+// The message shows the whole text, a NUL or other control byte included.
+TEST(ProcOption, MessageShowsControlBytesOfTheText) {
+    Parsed p;
+    try {
+        GetProcessParameters(std::string("CPU:4\0x\n", 8), p.strategy, p.first, p.second, p.third,
+                             p.list);
+        ADD_FAILURE() << "accepted";
+    } catch (const DataException& e) {
+        EXPECT_NE(std::string(e.what()).find("\"CPU:4\\x00x\\x0A\""), std::string::npos)
+            << e.what();
+    }
+}
+
 TEST(ProcOption, InstalledReaderIsUsedUntilItsScopeEnds) {
     {
         ScopedProcessParametersReader reader(

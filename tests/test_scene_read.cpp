@@ -4,10 +4,16 @@
 
 #include "support.h"
 
+#include <cstring>
 #include <limits>
 #include <string>
+#include <thread>
 #include <type_traits>
 #include <vector>
+
+#if defined(__linux__)
+#include <sys/stat.h>
+#endif
 
 using kestrel::DataException;
 using kestrel::FileAccessException;
@@ -220,6 +226,30 @@ TEST_F(SceneRead, MissingFileOrDirectoryIsReportedWithItsName) {
     EXPECT_TRUE(Contains(ReadError<kestrel::FileNotFoundException>(path), path));
     ReadError(dir.Path().string());
 }
+
+// A document of another kind is not taken for a scene, whatever elements it holds.
+TEST_F(SceneRead, OtherRootElementIsRefused) {
+    std::string other = Elements().Document();
+    for (const char* tag : {"<TOSceneDesc_Document>", "</TOSceneDesc_Document>"})
+        other.replace(other.find(tag), std::strlen(tag), tag[1] == '/' ? "</Other>" : "<Other>");
+    const std::string path = Put("other.xml", other);
+    const std::string message = ReadError(path);
+    EXPECT_TRUE(Contains(message, path) && Contains(message, "\"Other\"")) << message;
+}
+
+#if defined(__linux__)
+// A file that never ends is refused at the size limit instead of filling the memory; a pipe
+// is read like a file.
+TEST_F(SceneRead, EndlessFileIsRefusedAndPipeIsRead) {
+    EXPECT_TRUE(Contains(ReadError("/dev/zero"), "larger than 64 MiB")) << ReadError("/dev/zero");
+    const std::string fifo = dir.File("fifo");
+    ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+    std::thread writer([&fifo] { WriteFile(fifo, Elements().Document()); });
+    TOSceneParser scene(fifo.c_str());
+    writer.join();
+    EXPECT_EQ(scene.GetSceneFilename(), "src.tif");
+}
+#endif
 
 TEST_F(SceneRead, MalformedXmlNamesFileAndPosition) {
     const std::string whole = Elements().Document();

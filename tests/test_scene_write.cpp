@@ -214,6 +214,16 @@ TEST_F(SceneWrite, DtdIsWrittenExactlyBesideTheXmlFileUnlessPresent) {
     EXPECT_EQ(ReadFile(dtd), "mine\n");
 }
 
+// A scene that cannot be written leaves no DTD behind, and the previous file as it was.
+TEST_F(SceneWrite, FailedWritingLeavesNoDtd) {
+    TOSceneParser scene;
+    Fill(scene);
+    std::filesystem::create_directory(dir.File("s.xml"));  // the XML file cannot be made
+    EXPECT_THROW(Write(scene, dir.File("s.xml")), FileAccessException);
+    EXPECT_FALSE(std::filesystem::exists(dir.File("TOSceneDesc_Document.dtd")));
+    EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path()), {}), 1);
+}
+
 TEST_F(SceneWrite, DtdThatCannotBeCreatedIsReported) {
     const std::string directory = dir.File("missing") + "/";
     const std::string dtd = directory + "TOSceneDesc_Document.dtd";
@@ -228,7 +238,7 @@ TEST_F(SceneWrite, DtdThatCannotBeCreatedIsReported) {
         const std::string head = " Scene XML file: " + dtd + " couldn't be created because\n ";
         const std::string message = e.GetErrorMessage();
         EXPECT_EQ(message.substr(0, head.size()), head) << message;
-        EXPECT_TRUE(Contains(message, "Cannot open file")) << message;  // the opening error
+        EXPECT_TRUE(Contains(message, "cannot be created: No such file")) << message;
         EXPECT_EQ(message.back(), '\n');
         testsupport::ExpectThrownFrom(
             e,

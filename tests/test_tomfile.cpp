@@ -5,12 +5,10 @@
 
 #include <filesystem>
 
+using kestrel::DataException;
 using kestrel::FileAccessException;
 using kestrel::MFileParser;
-using kestrel::ParameterException;
-using kestrel::ParametersTableIF;
 using kestrel::processes::silvan::TOMFileParser;
-using testsupport::ExpectThrownFrom;
 using testsupport::ReadFile;
 using testsupport::TempDir;
 using testsupport::WriteFile;
@@ -73,13 +71,6 @@ TEST(TOMFileParser, WritesBothDerivedFilesByteForByte) {
     EXPECT_EQ(m.parser.GetMfileLines(), 8u);
 }
 
-TEST(TOMFileParser, PrepLineKeepsEmptyFieldsInPlace) {
-    TempDir dir;
-    TOMFileParser parser(WriteFile(dir.File("m.txt"), "a;7;3;;0;5;low;1;fill\n"));
-    parser.WriteMFilePrep(dir.File("prep.txt"));
-    EXPECT_EQ(ReadFile(dir.File("prep.txt")), "!MFILE created for VARNOK\na;7;3;;0;5\n");
-}
-
 // Each writer reads only its own columns; the image-set writer upper-cases the role.
 TEST(TOMFileParser, GettersHoldTheLastLineOfEachWritersMode) {
     TempDir dir;
@@ -103,63 +94,6 @@ TEST(TOMFileParser, OnlyPrepRolesGiveAnImgSetWithTheHeaderAlone) {
     parser.WriteMFilePrep(dir.File("prep.txt"));
     EXPECT_EQ(ReadFile(dir.File("imgset.txt")), "!IMGSET created for MELDRA\n");
     EXPECT_EQ(ReadFile(dir.File("prep.txt")), "!MFILE created for VARNOK\nx.tif;1;2;3;4;5\n");
-}
-
-TEST(TOMFileParser, RewritingReplacesTheFile) {
-    Master m;
-    const std::string out = WriteFile(m.dir.File("prep.txt"), std::string(10000, 'x'));
-    m.parser.WriteMFilePrep(out);
-    m.parser.WriteMFilePrep(out);
-    EXPECT_EQ(ReadFile(out), kExpectedPrep);
-}
-
-// The derived files read back through the table reader with the values written.
-TEST(TOMFileParser, DerivedFilesReadBackThroughTheTableReader) {
-    Master m;
-    m.parser.WriteMFilePrep(m.dir.File("prep.txt"));
-    MFileParser reader(0);
-    std::unique_ptr<ParametersTableIF> prep(reader.Create(m.dir.File("prep.txt")));
-    for (int c = 0; c < 6; ++c)
-        prep->AddDefaultString("");
-    ASSERT_EQ(prep->GetLineCount(), 8u);
-    EXPECT_EQ(prep->GetString(1, 0), "C:\\img\\b.tif");
-    EXPECT_EQ(prep->GetIntList(0, 1), (std::vector<int>{1, 2, 3}));
-    EXPECT_EQ(prep->GetInt(0, 2), 7);
-    EXPECT_EQ(prep->GetIntList(0, 3), (std::vector<int>{0, 16}));
-    EXPECT_EQ(prep->GetString(1, 3), "");
-    EXPECT_EQ(prep->GetInt(2, 4), 255);
-    EXPECT_EQ(prep->GetInt(0, 5), 5);
-}
-
-TEST(TOMFileParser, RefusesUnreadableAndEmptyFiles) {
-    TempDir dir;
-    const std::string empty = WriteFile(dir.File("empty.txt"), "!MFILE\n\n");
-    for (const std::string& path : {dir.File("missing.txt"), empty}) {
-        try {
-            TOMFileParser parser(path);
-            FAIL() << path;
-        } catch (const ParameterException& e) {
-            EXPECT_EQ(e.GetErrorMessage(), path == empty ? "Empty text file" : "Invalid MFILE");
-            EXPECT_EQ(e.GetValue(), path);
-            ExpectThrownFrom(e,
-                             "kestrel::processes::silvan::TOMFileParser::TOMFileParser(const "
-                             "std::string&)",
-                             "tomfileparser.cpp");
-        }
-    }
-}
-
-TEST(TOMFileParser, CopiesShareTheTable) {
-    Master m;
-    auto original = std::make_unique<TOMFileParser>(m.path);
-    TOMFileParser copy(*original);
-    TOMFileParser assigned(WriteFile(m.dir.File("one.txt"), "x\n"));
-    assigned = *original;
-    original.reset();
-    copy.WriteMFilePrep(m.dir.File("prep.txt"));
-    assigned.WriteImgSet(m.dir.File("imgset.txt"));
-    EXPECT_EQ(ReadFile(m.dir.File("prep.txt")), kExpectedPrep);
-    EXPECT_EQ(ReadFile(m.dir.File("imgset.txt")), kExpectedImgSet);
 }
 
 // A file that cannot be created is an error, not a silent success.
@@ -200,4 +134,45 @@ TEST(TOMFileParser, WritingOverItsOwnMasterFile) {
     m.parser.WriteImgSet(m.dir.File("imgset.txt"));
     EXPECT_EQ(ReadFile(m.path), kExpectedPrep);
     EXPECT_EQ(ReadFile(m.dir.File("imgset.txt")), kExpectedImgSet);
+}
+
+// A record whose line in a derived file would begin with "!" would read back as a comment, so
+// the file would lose it: refused naming the master file, line and value, and the previous
+// output stays as it was.
+TEST(TOMFileParser, RecordsThatWouldReadBackAsCommentsAreRefused) {
+    TempDir dir;
+    const std::string prep = WriteFile(dir.File("prep.txt"), "previous prep\n");
+    const std::string imgset = WriteFile(dir.File("imgset.txt"), "previous imgset\n");
+    const struct {
+        const char* master;
+        bool prepRefused;
+        bool imgsetRefused;
+        const char* value;
+    } cases[] = {
+        {"a.tif;1\n !bang.tif;1;2;3;4;5;low;2;fill\n", true, true, "!bang.tif"},
+        {"a.tif;1\ndir/!b.tif;1;2;3;4;5;low;2;fill\n", false, true, "!b.tif"},
+        {"a.tif;1\ndir/!b.tif;1;2;3;4;5;low;2;prep\n", false, false, ""},
+    };
+    for (const auto& c : cases) {
+        const std::string master =
+            WriteFile(dir.File("master.txt"), std::string("!M\n") + c.master);
+        TOMFileParser parser(master);
+        const std::pair<void (TOMFileParser::*)(const std::string&), const std::string*> writers[] =
+            {{&TOMFileParser::WriteMFilePrep, &prep}, {&TOMFileParser::WriteImgSet, &imgset}};
+        for (const auto& [write, out] : writers) {
+            const bool refused = out == &prep ? c.prepRefused : c.imgsetRefused;
+            const std::string before = ReadFile(*out);
+            try {
+                (parser.*write)(*out);
+                EXPECT_FALSE(refused) << c.master << " written to " << *out;
+            } catch (const DataException& e) {
+                EXPECT_TRUE(refused) << e.GetErrorMessage();
+                const std::string head = master + ", line 3, column 0: the ";
+                EXPECT_EQ(e.GetErrorMessage().rfind(head, 0), 0u) << e.GetErrorMessage();
+                EXPECT_NE(e.GetErrorMessage().find(std::string("\"") + c.value + "\""),
+                          std::string::npos);
+                EXPECT_EQ(ReadFile(*out), before);
+            }
+        }
+    }
 }

@@ -3,10 +3,11 @@
 
 #include "support.h"
 
+#include <atomic>
 #include <memory>
+#include <thread>
 
 using kestrel::DataException;
-using kestrel::ParameterException;
 using kestrel::processes::silvan::TPMFileParser;
 using testsupport::TempDir;
 using testsupport::WriteFile;
@@ -60,24 +61,6 @@ TEST(TPMFileParser, ReadsTypedLinesAndProcessDefaults) {
     ExpectLine(*p, "", {4, 5}, 2, {10, 20}, "0", 3);
 }
 
-TEST(TPMFileParser, IndexOutOfRangeLeavesEveryField) {
-    TempDir dir;
-    auto p = Open(WritePrep(dir, "a.tif;1,2;1;5;bg;6\nb.tif\n"));
-    p->ParseLine(0);
-    for (const int index : {-1, 2}) {
-        try {
-            p->ParseLine(index);
-            ADD_FAILURE() << index << " was read";
-        } catch (const DataException& e) {
-            EXPECT_EQ(e.GetErrorMessage(),
-                      "Index " + std::to_string(index) + " is outside of valid range: 2");
-            EXPECT_NE(e.GetFunction().find("TPMFileParser::ParseLine"), std::string::npos);
-            EXPECT_EQ(e.GetSourceFile(), "tpmfileparser.cpp");
-        }
-        ExpectLine(*p, "a.tif", {1, 2}, 1, {5}, "bg", 6);
-    }
-}
-
 // A channel list naming no channel is refused, whether it comes from the line or from the
 // process default; a default channel number above INT_MAX does not come back as a channel.
 TEST(TPMFileParser, ChannelListsNamingNoChannelAreRefused) {
@@ -98,35 +81,50 @@ TEST(TPMFileParser, ChannelListsNamingNoChannelAreRefused) {
     EXPECT_EQ(p->GetDbic(), (Channels{1}));
 }
 
-TEST(TPMFileParser, UnreadableFileIsRefused) {
+// Copies, made by construction or assignment, outlive the original and share nothing that
+// reading writes: used on several threads at once, each reads its own lines intact.
+TEST(TPMFileParser, CopiesAreIndependentAcrossThreads) {
     TempDir dir;
-    const std::string path = dir.File("missing.txt");
-    try {
-        Open(path);
-        ADD_FAILURE() << "a missing file was read";
-    } catch (const ParameterException& e) {
-        EXPECT_EQ(e.GetErrorMessage(), "Invalid MFILE");
-        EXPECT_EQ(e.GetParameterName(), "MFILE");
-        EXPECT_EQ(e.GetType(), ParameterException::InvalidFile);
-        EXPECT_EQ(e.GetValue(), path);
-        EXPECT_NE(e.GetFunction().find("TPMFileParser::TPMFileParser"), std::string::npos);
-        EXPECT_EQ(e.GetSourceFile(), "tpmfileparser.cpp");
+    const int lines = 300;
+    // Lists of many lengths, so that a list shared between threads would be seen torn.
+    const auto dbiwOf = [](int i) {
+        Ints list;
+        for (int k = 0; k < 1 + (i * 7) % 40; ++k)
+            list.push_back(i * 100 + k);
+        return list;
+    };
+    std::string text;
+    for (int i = 0; i < lines; ++i) {
+        std::string dbiw;
+        for (const int v : dbiwOf(i))
+            dbiw += (dbiw.empty() ? "" : ",") + std::to_string(v);
+        text += "s" + std::to_string(i) + ";" + std::to_string(i % 7 + 1) + "," +
+                std::to_string(i % 5 + 1) + ";" + std::to_string(i) + ";" + dbiw + "\n";
     }
-}
+    auto original = Open(WritePrep(dir, text));
+    std::vector<TPMFileParser> copies(3, *original);
+    copies.push_back(*Open(WriteFile(dir.File("other.txt"), "x.tif\n")));
+    copies.back() = *original;
+    original.reset();
 
-// Copies share the table, which lives as long as the last of them.
-TEST(TPMFileParser, CopiesShareTheTable) {
-    TempDir dir;
-    auto other = Open(WriteFile(dir.File("other.txt"), "x.tif\n"));
-    {
-        auto original = Open(WritePrep(dir, "a.tif;1;1\nb.tif;2;2\n"));
-        original->ParseLine(1);
-        TPMFileParser copy(*original);
-        original.reset();
-        EXPECT_EQ(copy.GetFili(), "b.tif");
-        *other = copy;
+    std::atomic<int> wrong{0};
+    std::vector<std::thread> threads;
+    for (TPMFileParser& parser : copies) {
+        threads.emplace_back([&parser, &wrong, &dbiwOf] {
+            for (int round = 0; round < 20; ++round) {
+                for (int i = 0; i < lines; ++i) {
+                    parser.ParseLine(i);
+                    const Channels dbic{static_cast<unsigned int>(i % 7 + 1),
+                                        static_cast<unsigned int>(i % 5 + 1)};
+                    if (parser.GetDbic() != dbic || parser.GetDbiw() != dbiwOf(i) ||
+                        parser.GetMmseg() != i)
+                        ++wrong;
+                }
+            }
+        });
     }
-    other->ParseLine(0);
-    ExpectLine(*other, "a.tif", {1}, 1, {10, 20}, "0", 3);
-    EXPECT_EQ(other->GetMfileLines(), 2u);
+    for (std::thread& thread : threads)
+        thread.join();
+    EXPECT_EQ(wrong, 0);
+    EXPECT_EQ(copies.back().GetMfileLines(), static_cast<unsigned int>(lines));
 }

@@ -27,6 +27,14 @@ struct Span {
     std::size_t Size() const { return static_cast<std::size_t>(end - begin); }
 };
 
+// The first line end (LF, or CR alone or before LF) in [p, end), or null.
+const char* FindLineEnd(const char* p, const char* end) {
+    const char* lf = static_cast<const char*>(std::memchr(p, '\n', end - p));
+    // Carriage returns are rare: look for one only before the next line feed.
+    const char* cr = static_cast<const char*>(std::memchr(p, '\r', (lf ? lf : end) - p));
+    return cr != nullptr ? cr : lf;
+}
+
 Span Trim(Span s) {
     while (s.begin != s.end && IsBlank(*s.begin))
         ++s.begin;
@@ -35,8 +43,10 @@ Span Trim(Span s) {
     return s;
 }
 
-// A parameter file as read: its bytes, and the offset of each data line in them.
+// A parameter file as read: its name, its bytes, and the offset of each data line in them.
+// Never changed once read, so that tables may share it across threads.
 struct LoadedFile {
+    std::string filename;
     std::unique_ptr<char[]> bytes;  // not zero-initialised: every byte is written by the read
     std::size_t size = 0;
     std::vector<std::size_t> lineStarts;
@@ -57,30 +67,39 @@ class LineIndexer {
         const char* const end = bytes + size;
         const char* p = bytes + scanned_;
         while (p < end) {
-            const char* eol = static_cast<const char*>(std::memchr(p, '\n', end - p));
-            if (eol == nullptr)
+            const char* eol = FindLineEnd(p, end);
+            if (eol == nullptr) {
+                p = end;
                 break;
-            AddLine(bytes, static_cast<std::size_t>(eol - bytes));
-            p = eol + 1;
+            }
+            if (*eol == '\r' && eol + 1 == end)
+                break;  // whether a line feed follows is known with the next bytes
+            const char* next = eol + 1 + (*eol == '\r' && eol[1] == '\n' ? 1 : 0);
+            AddLine(bytes, static_cast<std::size_t>(eol - bytes),
+                    static_cast<std::size_t>(next - bytes));
+            p = next;
         }
-        scanned_ = size;
+        scanned_ = static_cast<std::size_t>(p - bytes);
     }
 
-    // Indexes a last line that has no line end.
+    // Indexes a last line that has no line end, or ends in a carriage return.
     void Finish(const char* bytes, std::size_t size) {
-        if (lineStart_ < size)
-            AddLine(bytes, size);
+        if (lineStart_ < size) {
+            const bool cr = scanned_ + 1 == size && bytes[scanned_] == '\r';
+            AddLine(bytes, cr ? scanned_ : size, size);
+        }
     }
 
   private:
     // Records the line [lineStart_, eol) when it is a data line: not a "!" line, not blank.
-    void AddLine(const char* bytes, std::size_t eol) {
+    // The next line starts at next.
+    void AddLine(const char* bytes, std::size_t eol, std::size_t next) {
         const std::size_t start = lineStart_;
-        lineStart_ = eol + 1;
+        lineStart_ = next;
         if (start == eol || bytes[start] == '!')
             return;
         const char* q = bytes + start;
-        while (q < bytes + eol && (IsBlank(*q) || *q == '\r'))
+        while (q < bytes + eol && IsBlank(*q))
             ++q;
         if (q == bytes + eol)
             return;
@@ -97,17 +116,33 @@ class LineIndexer {
     std::size_t scanned_ = 0;
 };
 
+[[noreturn]] void ThrowTooLarge(const std::string& filename) {
+    KESTREL_THROW(FileAccessException, filename, FileAccessException::ReadFailed,
+                  FormatString("%s is larger than %llu MiB, the most that a parameter file may "
+                               "hold; it is not read",
+                               filename.c_str(), MFileParser::kMaxFileBytes >> 20));
+}
+
 // Reads the whole file and indexes its data lines. False when it cannot be opened or read. The
 // table keeps its own copy rather than a mapping of the file, so that it stays valid when the
-// file is rewritten while it is in use.
+// file is rewritten while it is in use. Pipes and devices are read to their end, up to the
+// size limit.
 bool LoadFile(const std::string& filename, LoadedFile& loaded) {
+    constexpr std::size_t kLimit = static_cast<std::size_t>(MFileParser::kMaxFileBytes);
     std::error_code ec;
     const std::filesystem::path path(filename);
-    if (!std::filesystem::is_regular_file(path, ec))
+    const std::filesystem::file_status status = std::filesystem::status(path, ec);
+    if (ec || !std::filesystem::exists(status) || std::filesystem::is_directory(status))
         return false;
-    std::size_t capacity = static_cast<std::size_t>(std::filesystem::file_size(path, ec));
-    if (ec)
-        return false;
+    std::size_t capacity = 0;  // unknown for what is not a regular file
+    if (std::filesystem::is_regular_file(status)) {
+        const std::uintmax_t size = std::filesystem::file_size(path, ec);
+        if (ec)
+            return false;
+        if (size > kLimit)
+            ThrowTooLarge(filename);
+        capacity = static_cast<std::size_t>(size);
+    }
     std::unique_ptr<std::FILE, int (*)(std::FILE*)> file(std::fopen(filename.c_str(), "rb"),
                                                          &std::fclose);
     if (!file)
@@ -121,7 +156,7 @@ bool LoadFile(const std::string& filename, LoadedFile& loaded) {
     for (;;) {
         if (loaded.size == capacity + 1) {
             // The file has grown since its size was taken: make room and go on reading.
-            const std::size_t larger = 2 * capacity + kChunk;
+            const std::size_t larger = std::min(2 * capacity + kChunk, kLimit);
             std::unique_ptr<char[]> bytes(new char[larger + 1]);
             std::memcpy(bytes.get(), loaded.bytes.get(), loaded.size);
             loaded.bytes = std::move(bytes);
@@ -134,6 +169,8 @@ bool LoadFile(const std::string& filename, LoadedFile& loaded) {
         if (got == 0)
             break;
         loaded.size += got;
+        if (loaded.size > kLimit)
+            ThrowTooLarge(filename);
         indexer.Scan(loaded.bytes.get(), loaded.size);
     }
     indexer.Finish(loaded.bytes.get(), loaded.size);
@@ -144,11 +181,7 @@ bool LoadFile(const std::string& filename, LoadedFile& loaded) {
 
 class MFileTable final : public ParametersTableIF {
   public:
-    MFileTable(std::string filename, LoadedFile file)
-        : filename_(std::move(filename)),
-          bytes_(std::move(file.bytes)),
-          size_(file.size),
-          lineStarts_(std::move(file.lineStarts)) {}
+    explicit MFileTable(std::shared_ptr<const LoadedFile> file) : file_(std::move(file)) {}
 
     int GetInt(int line, int column) const override {
         const Field f = Lookup(line, column, KESTREL_HERE);
@@ -161,7 +194,7 @@ class MFileTable final : public ParametersTableIF {
     }
 
     unsigned int GetLineCount() const override {
-        return static_cast<unsigned int>(lineStarts_.size());
+        return static_cast<unsigned int>(file_->lineStarts.size());
     }
 
     const std::vector<int>& GetIntList(int line, int column) const override {
@@ -194,6 +227,19 @@ class MFileTable final : public ParametersTableIF {
 
     void AddDefaultString(const std::string& value) override { defaults_.push_back(value); }
 
+    // The copy shares the file's bytes, which never change, and has its own defaults and list.
+    ParametersTableIF* Clone() const override {
+        auto copy = std::make_unique<MFileTable>(file_);
+        copy->defaults_ = defaults_;
+        return copy.release();
+    }
+
+    std::string DescribePosition(int line, int column) const override {
+        if (line < 0 || static_cast<std::size_t>(line) >= file_->lineStarts.size())
+            return FormatString("%s, data line %d, column %d", Name(), line, column);
+        return FormatString("%s, line %u, column %d", Name(), FileLineOf(line), column);
+    }
+
   private:
     // A field as it is read: its text, and where it came from for messages.
     struct Field {
@@ -204,23 +250,20 @@ class MFileTable final : public ParametersTableIF {
     };
 
     Field Lookup(int line, int column, const SourceLocation& where) const {
-        if (line < 0 || static_cast<std::size_t>(line) >= lineStarts_.size()) {
+        if (line < 0 || static_cast<std::size_t>(line) >= file_->lineStarts.size()) {
             KESTREL_THROW_AT(where, DataException,
-                             FormatString("%s: data line %d is outside of valid range: %u",
-                                          filename_.c_str(), line, GetLineCount()));
+                             FormatString("%s: data line %d is outside of valid range: %u", Name(),
+                                          line, GetLineCount()));
         }
         if (column < 0) {
-            KESTREL_THROW_AT(
-                where, DataException,
-                FormatString("%s: column %d is not a valid column", filename_.c_str(), column));
+            KESTREL_THROW_AT(where, DataException,
+                             FormatString("%s: column %d is not a valid column", Name(), column));
         }
-        const char* const end = bytes_.get() + size_;
-        const char* p = bytes_.get() + lineStarts_[static_cast<std::size_t>(line)];
-        const char* eol = static_cast<const char*>(std::memchr(p, '\n', end - p));
+        const char* const end = file_->bytes.get() + file_->size;
+        const char* p = file_->bytes.get() + file_->lineStarts[static_cast<std::size_t>(line)];
+        const char* eol = FindLineEnd(p, end);
         if (eol == nullptr)
             eol = end;
-        if (eol != p && eol[-1] == '\r')
-            --eol;
 
         for (int c = 0; c < column && p != eol; ++c) {
             p = std::find(p, eol, ';');
@@ -232,6 +275,22 @@ class MFileTable final : public ParametersTableIF {
         const Span text = Trim(Span{p, std::find(p, eol, ';')});
         if (text.Empty())
             return DefaultOf(line, column, where);
+        // A control byte would be cut off or misread by whoever uses the value as a C string or
+        // as text; only tab, which a field may hold inside, passes.
+        for (const char* q = text.begin; q != text.end; ++q) {
+            const unsigned char c = static_cast<unsigned char>(*q);
+            if ((c < 0x20 && c != '\t') || c == 0x7F) {
+                const char* const lineStart =
+                    file_->bytes.get() + file_->lineStarts[static_cast<std::size_t>(line)];
+                KESTREL_THROW_AT(
+                    where, DataException,
+                    FormatString("%s, line %u, column %d: the value holds the control "
+                                 "byte 0x%02X at character %lld of the line; only "
+                                 "tab is allowed",
+                                 Name(), FileLineOf(line), column, static_cast<unsigned int>(c),
+                                 static_cast<long long>(q - lineStart) + 1));
+            }
+        }
         return Field{text, line, column, false};
     }
 
@@ -240,43 +299,55 @@ class MFileTable final : public ParametersTableIF {
             KESTREL_THROW_AT(where, DataException,
                              FormatString("%s, line %u, column %d: no value and no default for "
                                           "the column",
-                                          filename_.c_str(), FileLineOf(line), column));
+                                          Name(), FileLineOf(line), column));
         }
         const std::string& d = defaults_[static_cast<std::size_t>(column)];
         return Field{Span{d.data(), d.data() + d.size()}, line, column, true};
     }
 
     int ParseInt(Span s, const Field& f, const SourceLocation& where) const {
+        // One sign at most: from_chars takes "-" but not "+", so "+" is skipped here, and must
+        // not be followed by another sign.
         const char* b = s.begin;
         if (b != s.end && *b == '+')
             ++b;
         int value = 0;
         const auto result = std::from_chars(b, s.end, value);
-        if (s.Empty() || result.ec != std::errc() || result.ptr != s.end) {
+        const bool twoSigns = b != s.begin && b != s.end && *b == '-';
+        if (s.Empty() || twoSigns || result.ec != std::errc() || result.ptr != s.end) {
             const char* problem = result.ec == std::errc::result_out_of_range
                                       ? "is out of the 32-bit integer range"
                                       : "is not an integer";
             KESTREL_THROW_AT(
                 where, DataException,
-                FormatString("%s, line %u, column %d: \"%s\" %s%s", filename_.c_str(),
-                             FileLineOf(f.line), f.column, std::string(s.begin, s.Size()).c_str(),
-                             problem, f.fromDefault ? " (the column's default)" : ""));
+                FormatString("%s, line %u, column %d: \"%s\" %s%s", Name(), FileLineOf(f.line),
+                             f.column, std::string(s.begin, s.Size()).c_str(), problem,
+                             f.fromDefault ? " (the column's default)" : ""));
         }
         return value;
     }
 
-    // The line number in the file (from 1) of a data line; only asked for in messages.
+    // The line number in the file (from 1) of a data line; only asked for in messages. Counts
+    // line feeds and carriage returns, a CR LF pair once.
     unsigned int FileLineOf(int line) const {
-        const char* const begin = bytes_.get();
-        const char* const start = begin + lineStarts_[static_cast<std::size_t>(line)];
-        return static_cast<unsigned int>(std::count(begin, start, '\n')) + 1;
+        const char* p = file_->bytes.get();
+        const char* const start = p + file_->lineStarts[static_cast<std::size_t>(line)];
+        unsigned int number = 1;
+        while (p < start) {
+            const char* eol = FindLineEnd(p, start);
+            if (eol == nullptr)
+                break;
+            ++number;
+            p = eol + 1 + (*eol == '\r' && eol + 1 < start && eol[1] == '\n' ? 1 : 0);
+        }
+        return number;
     }
 
-    std::string filename_;
-    std::unique_ptr<char[]> bytes_;
-    std::size_t size_;
-    std::vector<std::size_t> lineStarts_;
+    const char* Name() const { return file_->filename.c_str(); }
+
+    std::shared_ptr<const LoadedFile> file_;
     std::vector<std::string> defaults_;
+    // Written by GetIntList, so never shared: each table, clones included, has its own.
     mutable std::vector<int> listScratch_;
 };
 
@@ -289,10 +360,11 @@ MFileParser::MFileParser(int flags) : flags_(flags) {}
 MFileParser::~MFileParser() = default;
 
 ParametersTableIF* MFileParser::Create(const std::string& filename) {
-    LoadedFile file;
-    if (!LoadFile(filename, file))
+    auto file = std::make_shared<LoadedFile>();
+    file->filename = filename;
+    if (!LoadFile(filename, *file))
         return nullptr;
-    return new MFileTable(filename, std::move(file));
+    return new MFileTable(std::move(file));
 }
 
 }  // namespace kestrel

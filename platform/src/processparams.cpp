@@ -3,7 +3,6 @@
 #include <kestrel/exception.h>
 
 #include <algorithm>
-#include <cctype>
 #include <charconv>
 #include <mutex>
 #include <utility>
@@ -45,9 +44,24 @@ std::string Trim(const std::string& s) {
 }
 
 std::string Upper(std::string s) {
-    std::transform(s.begin(), s.end(), s.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::toupper(c)); });
+    std::transform(s.begin(), s.end(), s.begin(), [](char c) {
+        return c >= 'a' && c <= 'z' ? static_cast<char>(c - 'a' + 'A') : c;
+    });
     return s;
+}
+
+// The text for a message: control bytes, the NUL included, are shown as \xNN, so that the
+// message shows all of the text and nothing that would cut or garble it.
+std::string Printable(const std::string& text) {
+    std::string out;
+    for (const char c : text) {
+        const unsigned char byte = static_cast<unsigned char>(c);
+        if (byte < 0x20 || byte == 0x7F)
+            out += FormatString("\\x%02X", static_cast<unsigned int>(byte));
+        else
+            out += c;
+    }
+    return out;
 }
 
 // Splits at every separator, keeping empty pieces so that they can be refused.
@@ -65,7 +79,7 @@ std::vector<std::string> Split(const std::string& s, char separator) {
 
 // A whole non-negative decimal number that fits a signed 32-bit integer, digits only.
 bool ReadCount(const std::string& text, int& value) {
-    if (text.empty() || !std::isdigit(static_cast<unsigned char>(text[0])))
+    if (text.empty() || text[0] < '0' || text[0] > '9')
         return false;
     const char* end = text.data() + text.size();
     const auto result = std::from_chars(text.data(), end, value);
@@ -91,7 +105,7 @@ class Reader {
         } else if (kind == "GPU") {
             p.strategy = PROCESS_STRATEGY_GPU;
         } else {
-            Fail(FormatString("unknown processor \"%s\"", kind.c_str()));
+            Fail(FormatString("unknown processor \"%s\"", Printable(kind).c_str()));
         }
         if (colon == std::string::npos)
             return p;
@@ -122,7 +136,8 @@ class Reader {
                 Once(devicesSet, "devices");
                 p.devices = Devices(value);
             } else {
-                Fail(FormatString("unknown setting \"%s\" for %s", item.c_str(), kind.c_str()));
+                Fail(FormatString("unknown setting \"%s\" for %s", Printable(item).c_str(),
+                                  kind.c_str()));
             }
         }
         if (devicesSet && countSet)
@@ -133,8 +148,8 @@ class Reader {
   private:
     [[noreturn]] void Fail(const std::string& reason) const {
         KESTREL_THROW_AT(where_, DataException,
-                         FormatString("Cannot read PROC option \"%s\": %s; %s", proc_.c_str(),
-                                      reason.c_str(), kAcceptedForms));
+                         FormatString("Cannot read PROC option \"%s\": %s; %s",
+                                      Printable(proc_).c_str(), reason.c_str(), kAcceptedForms));
     }
 
     void Once(bool& seen, const char* name) const {
@@ -146,7 +161,7 @@ class Reader {
     int Count(const char* name, const std::string& value) const {
         int n = 0;
         if (!ReadCount(value, n)) {
-            Fail(FormatString("%s \"%s\" is not %s", name, value.c_str(), kCountRange));
+            Fail(FormatString("%s \"%s\" is not %s", name, Printable(value).c_str(), kCountRange));
         }
         return n;
     }

@@ -1,8 +1,18 @@
 #include <kestrel/stringlist.h>
 
 #include <algorithm>
+#include <cstdlib>
 #include <cstring>
 #include <vector>
+
+#if defined(_WIN32)
+#include <locale.h>
+#else
+#include <locale.h>
+#if defined(__APPLE__)
+#include <xlocale.h>
+#endif
+#endif
 
 namespace {
 
@@ -71,4 +81,16 @@ std::string TrimWhitespace(const std::string& text) {
         return std::string();
     const std::string::size_type last = text.find_last_not_of(kWhite);
     return text.substr(first, last - first + 1);
+}
+
+double ClassicAtof(const char* text) {
+    if (text == nullptr)
+        return 0.0;
+#if defined(_WIN32)
+    static const _locale_t classic = _create_locale(LC_ALL, "C");
+    return _strtod_l(text, nullptr, classic);
+#else
+    static const locale_t classic = newlocale(LC_ALL_MASK, "C", static_cast<locale_t>(0));
+    return strtod_l(text, nullptr, classic);
+#endif
 }

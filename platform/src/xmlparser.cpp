@@ -242,6 +242,12 @@ std::vector<char> ReadBytes(const std::string& name, const SourceLocation& where
     try {
         while ((got = std::fread(chunk, 1, sizeof chunk, file)) > 0) {
             bytes.insert(bytes.end(), chunk, chunk + got);
+            if (bytes.size() > XMLParser::kMaxFileBytes) {
+                KESTREL_THROW_AT(where, FileAccessException, name, FileAccessException::ReadFailed,
+                                 FormatString("XML file %s is larger than %llu MiB, the most "
+                                              "that is read; it is not read",
+                                              name.c_str(), XMLParser::kMaxFileBytes >> 20));
+            }
         }
     } catch (...) {
         std::fclose(file);
@@ -519,6 +525,17 @@ void XMLParser::LoadDocument() {
         KESTREL_THROW(FileAccessException, name, FileAccessException::ReadFailed,
                       FormatString("XML file %s has no root element", name.c_str()));
     }
+    // A document of another kind is not read as one of this kind.
+    const std::string expected = GetDocNameTag();
+    const XString expectedName = ToXML(expected);
+    if (!xc::XMLString::equals(document_->getDocumentElement()->getTagName(),
+                               expectedName.c_str())) {
+        const std::string root = MessageText(document_->getDocumentElement()->getTagName());
+        document_.reset();
+        ThrowFileError(
+            KESTREL_HERE, name, FileAccessException::ReadFailed, "cannot be read",
+            FormatString("its root element is \"%s\", not \"%s\"", root.c_str(), expected.c_str()));
+    }
 }
 
 xc::DOMElement* XMLParser::Root(const char* operation) const {
@@ -638,6 +655,13 @@ void XMLParser::WriteXMLFile() {
                       "No XML file name was given to write");
     }
     document_.reset();
+    // Companions kept by the hooks live only for this writing; those not put in place are
+    // removed.
+    struct DropCompanions {
+        std::vector<std::unique_ptr<core::fileio::ReplacingFile>>& companions;
+        ~DropCompanions() { companions.clear(); }
+    } dropCompanions{companions_};
+    companions_.clear();
 
     xc::DOMImplementation* implementation = Implementation();
     std::unique_ptr<xc::DOMDocumentType, TypeRelease> type(GetDOMDocumenType());
@@ -689,24 +713,32 @@ void XMLParser::WriteXMLFile() {
                        MessageText(e.getMessage()));
     }
 
-    errno = 0;
-    std::FILE* file = std::fopen(name.c_str(), "wb");
-    if (file == nullptr) {
-        const int error = errno;
-        ThrowFileError(KESTREL_HERE, name, FileAccessException::CreateFailed, "cannot be created",
-                       SystemReason(error));
-    }
+    // Written beside the file and put in place only when complete, so that a failure leaves the
+    // previous file (and no companion of this writing) behind.
     const std::string text = WithPrologLines(reinterpret_cast<const char*>(target.getRawBuffer()),
                                              static_cast<std::size_t>(target.getLen()));
-    errno = 0;
-    const bool written = std::fwrite(text.data(), 1, text.size(), file) == text.size();
-    const bool closed = std::fclose(file) == 0;
-    const int error = errno;
-    if (!written || !closed) {
-        std::remove(name.c_str());  // a cut file must not pass for a scene
-        ThrowFileError(KESTREL_HERE, name, FileAccessException::WriteFailed, "cannot be written",
-                       error != 0 ? SystemReason(error) : "short write");
+    core::fileio::ReplacingFile out(name, KESTREL_HERE);
+    out.Write(text);
+    out.Close();
+    std::vector<std::string> placed;  // companions that did not exist before
+    try {
+        for (const auto& companion : companions_) {
+            const bool existed = core::fileio::File(companion->GetTarget()).Exists();
+            companion->Commit();
+            if (!existed)
+                placed.push_back(companion->GetTarget());
+        }
+        out.Commit();
+    } catch (...) {
+        for (const std::string& path : placed)
+            std::remove(path.c_str());
+        throw;
     }
+}
+
+void XMLParser::KeepWithXMLFile(std::unique_ptr<core::fileio::ReplacingFile> file) const {
+    if (file)
+        companions_.push_back(std::move(file));
 }
 
 // ---------------------------------------------------------------------------------------------

@@ -1,17 +1,35 @@
-// Reads arbitrary text as a PROC option.
+// Reads arbitrary text as a PROC option and makes both kinds of generator from it, as a
+// process does through its base class.
 #include <kestrel/exception.h>
-#include <kestrel/processparams.h>
+#include <silvan/toppfbase.h>
 
+#include <memory>
 #include <string>
-#include <vector>
+
+#include "fuzz_input.h"
+
+namespace {
+
+class Process : public kestrel::processes::silvan::TOPPFBase {
+  public:
+    void Execute() override {}
+};
+
+}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-    const std::string proc(reinterpret_cast<const char*>(data), size);
-    ProcessStrategy strategy{};
-    int first = 0, second = 0, third = 0;
-    std::vector<int> list;
+    Process process;
+    process.SetProc(std::string(reinterpret_cast<const char*>(data), size));
     try {
-        GetProcessParameters(proc, strategy, first, second, third, list);
+        std::unique_ptr<kestrel::processes::TorthoGenerator> generator(
+            process.CreateTorthoGenerator());
+        FUZZ_EXPECT(generator != nullptr);
+    } catch (const kestrel::DataException&) {
+    }
+    try {
+        std::unique_ptr<kestrel::processes::OcclusionRecovery> generator(
+            process.CreateOcclusionRecovery());
+        FUZZ_EXPECT(generator != nullptr);
     } catch (const kestrel::DataException&) {
     }
     return 0;

@@ -19,3 +19,9 @@ KESTREL_API void DestroyStringList(char** list);
 
 // The text without leading and trailing blanks, tabs, line ends, vertical tabs and form feeds.
 KESTREL_API std::string TrimWhitespace(const std::string& text);
+
+// The C library's atof as it reads in the "C" locale, whatever locale the process has set: the
+// decimal point is ".", leading white space is skipped, hexadecimal, "inf" and "nan" forms are
+// read, reading stops at the first character that does not belong to the number, and a text
+// without one gives 0. Numbers written in the classic locale read back the same everywhere.
+KESTREL_API double ClassicAtof(const char* text);

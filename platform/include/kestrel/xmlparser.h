@@ -16,6 +16,7 @@
 #include <xercesc/util/XercesDefs.hpp>
 
 #include <kestrel/export.h>
+#include <kestrel/file.h>
 
 XERCES_CPP_NAMESPACE_BEGIN
 class DOMDocument;
@@ -29,6 +30,8 @@ class KESTREL_API XMLParser {
   public:
     // Size of the buffer that the C-string form of ReadTagFromFile fills.
     static constexpr std::size_t kTagTextSize = 192;
+    // Files larger than this are refused rather than read into memory.
+    static constexpr unsigned long long kMaxFileBytes = 64ull << 20;
 
     XMLParser();
     explicit XMLParser(const char* xmlFilename);
@@ -42,6 +45,9 @@ class KESTREL_API XMLParser {
     // true: loads the named file and calls ReadXMLFile; false: calls WriteXMLFile, which builds
     // the document through the writing hooks and stores it in the named file. Exceptions of the
     // hooks pass out unchanged; the document lives only for the duration of the call.
+    // Reading takes any file that can be read to its end (a pipe too) of at most kMaxFileBytes,
+    // whose root element is named GetDocNameTag(). Writing replaces the file only once the
+    // whole document has been written: a failure leaves the previous file as it was.
     virtual void Serialize(bool reading);
 
   protected:
@@ -74,6 +80,13 @@ class KESTREL_API XMLParser {
         XERCES_CPP_NAMESPACE::DOMElement* parent, const std::string& tag,
         const std::vector<std::string>& texts);
 
+    // From a writing hook: a file that belongs with the XML file (its DTD), written and closed
+    // but not yet in place. It is put in place once the XML file has been written completely,
+    // just before the XML file replaces the previous one; when the writing fails it is dropped,
+    // and when the XML file cannot be put in place it is removed again unless it replaced a
+    // file that existed before.
+    void KeepWithXMLFile(std::unique_ptr<core::fileio::ReplacingFile> file) const;
+
   private:
     class Session;
     struct DocumentRelease {
@@ -91,6 +104,7 @@ class KESTREL_API XMLParser {
     std::unique_ptr<Session> session_;
     std::string xmlFilename_;
     DocumentPtr document_;
+    mutable std::vector<std::unique_ptr<core::fileio::ReplacingFile>> companions_;
 };
 
 // Helpers of the XML base.
