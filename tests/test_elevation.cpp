@@ -343,3 +343,13 @@ TEST(IsFile, FilesAndDirectoriesExist) {
     EXPECT_FALSE(IsFile(dir.File("b.tif")));
     EXPECT_FALSE(IsFile(""));
 }
+
+TEST(FactorySeams, InstallingNullRestoresTheBuiltInImplementation) {
+    const auto dems = std::make_shared<RecordingDEMFactory>();
+    EXPECT_EQ(DEMFactory::SetImplementation(dems), DEMFactory::GetDefaultImplementation());
+    EXPECT_EQ(DEMFactory::SetImplementation(nullptr), dems);
+    const auto tins = std::make_shared<RecordingTinFactory>();
+    EXPECT_EQ(TinReaderFactory::SetImplementation(tins),
+              TinReaderFactory::GetDefaultImplementation());
+    EXPECT_EQ(TinReaderFactory::SetImplementation(nullptr), tins);
+}

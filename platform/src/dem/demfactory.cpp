@@ -3,11 +3,11 @@
 #include <kestrel/dem.h>
 
 #include <cmath>
-#include <mutex>
 #include <utility>
 
 #include <kestrel/exception.h>
 
+#include "../factoryslot.h"
 #include "constantdem.h"
 #include "rasterdem.h"
 #include "tileindex.h"
@@ -51,22 +51,13 @@ class BuiltInFactory final : public DEMFactoryImpl {
     }
 };
 
-struct ImplSlot {
-    std::mutex mutex;
-    std::shared_ptr<DEMFactoryImpl> builtIn = std::make_shared<BuiltInFactory>();
-    std::shared_ptr<DEMFactoryImpl> current = builtIn;
-};
-
-ImplSlot& Slot() {
-    static ImplSlot slot;
+FactorySlot<DEMFactoryImpl>& Slot() {
+    static FactorySlot<DEMFactoryImpl> slot(std::make_shared<BuiltInFactory>());
     return slot;
 }
 
-// The installed implementation, held for the duration of one call even if it is replaced
-// meanwhile.
 std::shared_ptr<DEMFactoryImpl> Current() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().current;
+    return Slot().Current();
 }
 
 }  // namespace
@@ -97,17 +88,12 @@ IRasterDEM* DEMFactory::CreateConstantDEMDownsampled(const ogc::cs::ICRS* crs,
 }
 
 std::shared_ptr<DEMFactoryImpl> DEMFactory::GetDefaultImplementation() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().builtIn;
+    return Slot().BuiltIn();
 }
 
 std::shared_ptr<DEMFactoryImpl> DEMFactory::SetImplementation(
     std::shared_ptr<DEMFactoryImpl> impl) {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    if (!impl)
-        impl = Slot().builtIn;
-    std::swap(Slot().current, impl);
-    return impl;
+    return Slot().Install(std::move(impl));
 }
 
 ScopedDEMFactoryImpl::ScopedDEMFactoryImpl(std::shared_ptr<DEMFactoryImpl> impl)

@@ -139,9 +139,8 @@ void GridDEM::Sample(std::size_t n, const double* x, const double* y, double* he
         return true;
     };
 
-    const auto evaluate = [&](std::size_t i, std::uint32_t key) {
-        double fx = 0.0, fy = 0.0;
-        toPost(i, fx, fy);
+    // The height at post coordinates (fx, fy) of a point whose upper-left post is in block key.
+    const auto evaluate = [&](double fx, double fy, std::uint32_t key) {
         const double fi = std::floor(fx), fj = std::floor(fy);
         const double tx = fx - fi, ty = fy - fj;
         const auto i0 = static_cast<long long>(fi), j0 = static_cast<long long>(fj);
@@ -151,18 +150,14 @@ void GridDEM::Sample(std::size_t n, const double* x, const double* y, double* he
         if (i0 >= ox && j0 >= oy && i0 + 1 < ox + b.width && j0 + 1 < oy + b.height) {
             const float* p = &b.heights[static_cast<std::size_t>(j0 - oy) * b.width +
                                         static_cast<std::size_t>(i0 - ox)];
-            heights[i] = Blend(p[0], p[1], p[b.width], p[b.width + 1], tx, ty);
-        } else {
-            heights[i] = Blend(memo.Post(i0, j0), memo.Post(i0 + 1, j0), memo.Post(i0, j0 + 1),
-                               memo.Post(i0 + 1, j0 + 1), tx, ty);
+            return Blend(p[0], p[1], p[b.width], p[b.width + 1], tx, ty);
         }
+        return Blend(memo.Post(i0, j0), memo.Post(i0 + 1, j0), memo.Post(i0, j0 + 1),
+                     memo.Post(i0 + 1, j0 + 1), tx, ty);
     };
 
     // Each point is keyed by the block of its upper-left post (clamped into the grid).
-    const auto keyOf = [&](std::size_t i) {
-        double fx = 0.0, fy = 0.0;
-        if (!toPost(i, fx, fy))
-            return kOutside;
+    const auto keyOf = [&](double fx, double fy) {
         const long long i0 = std::clamp(static_cast<long long>(std::floor(fx)), 0LL, width - 1);
         const long long j0 = std::clamp(static_cast<long long>(std::floor(fy)), 0LL, height - 1);
         return static_cast<std::uint32_t>(j0 / bh) * memo.BlocksX() +
@@ -174,38 +169,47 @@ void GridDEM::Sample(std::size_t n, const double* x, const double* y, double* he
     constexpr std::size_t kSortFrom = 64;
     if (n < kSortFrom || blockCount == 1) {
         for (std::size_t i = 0; i < n; ++i) {
-            const std::uint32_t key = keyOf(i);
-            if (key == kOutside)
-                heights[i] = NAN;
-            else
-                evaluate(i, key);
+            double fx, fy;
+            heights[i] = toPost(i, fx, fy) ? evaluate(fx, fy, keyOf(fx, fy)) : NAN;
         }
         return;
     }
 
     // A batch is answered block by block (a counting sort of the points by block), so that each
-    // block is fetched once however the points are scattered.
+    // block is fetched once however the points are scattered. The sorted points are evaluated in
+    // order and their heights scattered back.
     constexpr std::size_t kChunk = std::size_t(1) << 30;
     for (std::size_t start = 0; start < n; start += kChunk) {
         const std::size_t count = std::min(kChunk, n - start);
         std::vector<std::uint32_t> keys(count);
         std::vector<std::uint32_t> offsets(static_cast<std::size_t>(blockCount) + 1, 0);
         for (std::size_t k = 0; k < count; ++k) {
-            keys[k] = keyOf(start + k);
-            if (keys[k] == kOutside)
-                heights[start + k] = NAN;
-            else
+            double fx, fy;
+            if (toPost(start + k, fx, fy)) {
+                keys[k] = keyOf(fx, fy);
                 ++offsets[keys[k] + 1];
+            } else {
+                keys[k] = kOutside;
+                heights[start + k] = NAN;
+            }
         }
         for (std::size_t b = 1; b < offsets.size(); ++b)
             offsets[b] += offsets[b - 1];
-        std::vector<std::uint32_t> order(offsets.back());
+        const std::size_t inside = offsets.back();
+        std::vector<std::uint32_t> order(inside);
+        std::vector<double> postX(inside), postY(inside);
         for (std::size_t k = 0; k < count; ++k) {
-            if (keys[k] != kOutside)
-                order[offsets[keys[k]]++] = static_cast<std::uint32_t>(k);
+            if (keys[k] == kOutside)
+                continue;
+            const std::uint32_t slot = offsets[keys[k]]++;
+            order[slot] = static_cast<std::uint32_t>(k);
+            toPost(start + k, postX[slot], postY[slot]);
         }
-        for (std::uint32_t k : order)
-            evaluate(start + k, keys[k]);
+        // offsets[b] now ends the slots of block b.
+        for (std::uint32_t b = 0; b < blockCount; ++b) {
+            for (std::size_t slot = b == 0 ? 0 : offsets[b - 1]; slot < offsets[b]; ++slot)
+                heights[start + order[slot]] = evaluate(postX[slot], postY[slot], b);
+        }
     }
 }
 

@@ -4,6 +4,7 @@
 #include <cstddef>
 #include <memory>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <kestrel/dem.h>
@@ -14,12 +15,35 @@ namespace kestrel {
 namespace dem {
 namespace detail {
 
+// Leaves new elements uninitialised: posts are always written before they are read, and
+// zeroing a block first would touch its memory twice.
+template <class T>
+struct UninitializedAllocator : std::allocator<T> {
+    template <class U>
+    struct rebind {
+        using other = UninitializedAllocator<U>;
+    };
+    UninitializedAllocator() = default;
+    template <class U>
+    UninitializedAllocator(const UninitializedAllocator<U>&) noexcept {}
+    template <class U>
+    void construct(U* p) noexcept {
+        ::new (static_cast<void*>(p)) U;
+    }
+    template <class U, class... A>
+    void construct(U* p, A&&... args) {
+        ::new (static_cast<void*>(p)) U(std::forward<A>(args)...);
+    }
+};
+
+using Heights = std::vector<float, UninitializedAllocator<float>>;
+
 // A rectangle of posts, row by row; NaN where a post has no height. Heights are final: any
 // offset and scale of the stored values are applied.
 struct PostBlock {
     unsigned int width = 0;
     unsigned int height = 0;
-    std::vector<float> heights;
+    Heights heights;
 };
 
 // Where the posts come from: the grid is cut into blocks of blockWidth x blockHeight posts

@@ -41,23 +41,62 @@ struct PostReading {
     std::string name;
 };
 
-// The heights of a window of posts; NaN where a post has none. The blocks GDAL read for it are
-// dropped from GDAL's own cache, so that the posts are held once, in the bounded cache.
+// Reads the file's own block (blockX, blockY) into heights as Float32, bypassing GDAL's block
+// cache: a read through the cache would copy each block twice and keep it in GDAL's memory too.
+CPLErr ReadOwnBlock(GDALRasterBand* band, int blockX, int blockY, int width, int height,
+                    detail::Heights& heights) {
+    int blockWidth = 0, blockHeight = 0;
+    band->GetBlockSize(&blockWidth, &blockHeight);
+    const GDALDataType type = band->GetRasterDataType();
+    const std::size_t full = static_cast<std::size_t>(blockWidth) * blockHeight;
+    if (type == GDT_Float32 && width == blockWidth) {
+        heights.resize(full);
+        const CPLErr result = band->ReadBlock(blockX, blockY, heights.data());
+        heights.resize(static_cast<std::size_t>(width) * height);
+        return result;
+    }
+    const int size = GDALGetDataTypeSizeBytes(type);
+    std::vector<std::uint8_t> raw(full * static_cast<std::size_t>(size));
+    const CPLErr result = band->ReadBlock(blockX, blockY, raw.data());
+    heights.resize(static_cast<std::size_t>(width) * height);
+    for (int j = 0; j < height; ++j) {
+        GDALCopyWords(raw.data() + static_cast<std::size_t>(j) * blockWidth * size, type, size,
+                      &heights[static_cast<std::size_t>(j) * width], GDT_Float32, sizeof(float),
+                      width);
+    }
+    return result;
+}
+
+// The heights of a window of posts; NaN where a post has none. ownBlock says that the window is
+// one of the file's own blocks; storage is memory to reuse for the heights.
 std::shared_ptr<detail::PostBlock> ReadPosts(const PostReading& r, int x0, int y0, int width,
-                                             int height) {
+                                             int height, bool ownBlock,
+                                             detail::Heights storage = {}) {
     auto block = std::make_shared<detail::PostBlock>();
+    block->heights = std::move(storage);
     block->width = static_cast<unsigned int>(width);
     block->height = static_cast<unsigned int>(height);
     const std::size_t count = static_cast<std::size_t>(width) * static_cast<std::size_t>(height);
+    gdalsupport::ErrorCapture errors;
+    CPLErr result = CE_None;
     try {
-        block->heights.resize(count);
+        if (ownBlock) {
+            int blockWidth = 0, blockHeight = 0;
+            r.band->GetBlockSize(&blockWidth, &blockHeight);
+            result = ReadOwnBlock(r.band, x0 / blockWidth, y0 / blockHeight, width, height,
+                                  block->heights);
+        } else {
+            block->heights.resize(count);
+            result = r.band->RasterIO(GF_Read, x0, y0, width, height, block->heights.data(), width,
+                                      height, GDT_Float32, 0, 0, nullptr);
+            // The posts are held once, in the bounded cache.
+            r.band->FlushCache(false);
+        }
     } catch (const std::bad_alloc&) {
         KESTREL_THROW(DataException, FormatString("%s: no memory for %d x %d posts", r.name.c_str(),
                                                   width, height));
     }
-    gdalsupport::ErrorCapture errors;
-    if (r.band->RasterIO(GF_Read, x0, y0, width, height, block->heights.data(), width, height,
-                         GDT_Float32, 0, 0, nullptr) != CE_None) {
+    if (result != CE_None) {
         KESTREL_THROW(
             DataException,
             FormatString("%s: cannot read the posts from (%d, %d) to (%d, %d): %s", r.name.c_str(),
@@ -76,17 +115,23 @@ std::shared_ptr<detail::PostBlock> ReadPosts(const PostReading& r, int x0, int y
         }
         r.mask->FlushCache(false);
     }
-    r.band->FlushCache(false);
 
-    const bool extra = !std::isnan(r.extraNoData);
-    const bool affine = r.offset != 0.0 || r.scale != 1.0;
-    for (std::size_t i = 0; i < count; ++i) {
-        float& v = block->heights[i];
-        if ((r.hasNoData && v == r.noData) || (extra && v == r.extraNoData) ||
-            (!valid.empty() && valid[i] == 0))
-            v = NAN;
-        else if (affine)
-            v = static_cast<float>(r.offset + r.scale * v);
+    float* v = block->heights.data();
+    if (r.hasNoData) {
+        const float noData = r.noData;
+        for (std::size_t i = 0; i < count; ++i)
+            v[i] = v[i] == noData ? NAN : v[i];
+    }
+    if (!std::isnan(r.extraNoData)) {
+        const float extra = r.extraNoData;
+        for (std::size_t i = 0; i < count; ++i)
+            v[i] = v[i] == extra ? NAN : v[i];
+    }
+    for (std::size_t i = 0; i < valid.size(); ++i)
+        v[i] = valid[i] == 0 ? NAN : v[i];
+    if (r.offset != 0.0 || r.scale != 1.0) {
+        for (std::size_t i = 0; i < count; ++i)
+            v[i] = static_cast<float>(r.offset + r.scale * v[i]);
     }
     return block;
 }
@@ -109,15 +154,15 @@ class CachedPosts final : public detail::PostSource {
             return block;
         const int x0 = static_cast<int>(blockX * blockWidth);
         const int y0 = static_cast<int>(blockY * blockHeight);
-        std::shared_ptr<const detail::PostBlock> block =
+        std::shared_ptr<detail::PostBlock> block =
             ReadPosts(reading_, x0, y0, static_cast<int>(std::min(blockWidth, width - x0)),
-                      static_cast<int>(std::min(blockHeight, height - y0)));
+                      static_cast<int>(std::min(blockHeight, height - y0)), ownBlocks, Spare());
         Insert(key, block);
         return block;
     }
 
   private:
-    using Entry = std::pair<std::uint64_t, std::shared_ptr<const detail::PostBlock>>;
+    using Entry = std::pair<std::uint64_t, std::shared_ptr<detail::PostBlock>>;
 
     std::shared_ptr<const detail::PostBlock> Find(std::uint64_t key) const {
         std::lock_guard<std::mutex> lock(cacheMutex_);
@@ -128,19 +173,37 @@ class CachedPosts final : public detail::PostSource {
         return it->second->second;
     }
 
-    // The new block is kept even when it alone exceeds the bound.
-    void Insert(std::uint64_t key, std::shared_ptr<const detail::PostBlock> block) const {
+    // Memory of an evicted block, so that a new block needs no fresh pages.
+    detail::Heights Spare() const {
+        std::lock_guard<std::mutex> lock(cacheMutex_);
+        if (spare_.empty())
+            return {};
+        detail::Heights storage = std::move(spare_.back());
+        spare_.pop_back();
+        return storage;
+    }
+
+    // The new block is kept even when it alone exceeds the bound. The memory of an evicted
+    // block that no query holds any more is kept for the next block read.
+    void Insert(std::uint64_t key, std::shared_ptr<detail::PostBlock> block) const {
         std::lock_guard<std::mutex> lock(cacheMutex_);
         held_ += block->heights.size() * sizeof(float);
         lru_.emplace_front(key, std::move(block));
         index_[key] = lru_.begin();
         while (held_ > capacity_ && lru_.size() > 1) {
-            held_ -= lru_.back().second->heights.size() * sizeof(float);
+            std::shared_ptr<detail::PostBlock>& evicted = lru_.back().second;
+            held_ -= evicted->heights.size() * sizeof(float);
+            if (evicted.use_count() == 1 && spare_.size() < 2)
+                spare_.push_back(std::move(evicted->heights));
             index_.erase(lru_.back().first);
             lru_.pop_back();
         }
     }
 
+  public:
+    bool ownBlocks = false;  // the cache's blocks are the file's own
+
+  private:
     DatasetPtr dataset_;
     PostReading reading_;
     std::size_t capacity_;
@@ -149,6 +212,7 @@ class CachedPosts final : public detail::PostSource {
     mutable std::list<Entry> lru_;
     mutable std::unordered_map<std::uint64_t, std::list<Entry>::iterator> index_;
     mutable std::size_t held_ = 0;
+    mutable std::vector<detail::Heights> spare_;
 };
 
 void CheckOptions(const std::string& path, const RasterDEMOptions& o) {
@@ -167,8 +231,8 @@ void CheckOptions(const std::string& path, const RasterDEMOptions& o) {
 }
 
 // The cache's blocks: the file's own blocks when they are of a useful size, otherwise squares of
-// 512 posts (rows of strips are read whole by GDAL anyway).
-void ChooseBlocks(GDALRasterBand* band, unsigned int& blockWidth, unsigned int& blockHeight) {
+// 512 posts (rows of strips are read whole by GDAL anyway). True for the file's own blocks.
+bool ChooseBlocks(GDALRasterBand* band, unsigned int& blockWidth, unsigned int& blockHeight) {
     int bw = 0, bh = 0;
     band->GetBlockSize(&bw, &bh);
     const long long area = static_cast<long long>(bw) * bh;
@@ -179,8 +243,10 @@ void ChooseBlocks(GDALRasterBand* band, unsigned int& blockWidth, unsigned int& 
         blockWidth = 512;
         blockHeight = 512;
     }
+    const bool own = static_cast<int>(blockWidth) == bw && static_cast<int>(blockHeight) == bh;
     blockWidth = std::min(blockWidth, static_cast<unsigned int>(band->GetXSize()));
     blockHeight = std::min(blockHeight, static_cast<unsigned int>(band->GetYSize()));
+    return own;
 }
 
 bool IsDirectory(const std::string& path) {
@@ -320,13 +386,14 @@ std::unique_ptr<IRasterDEM> MakeRasterDEM(DatasetPtr dataset, const std::string&
     const int width = reading.band->GetXSize(), height = reading.band->GetYSize();
     std::unique_ptr<detail::PostSource> posts;
     if (options.preload) {
-        posts = std::make_unique<detail::MemoryPosts>(ReadPosts(reading, 0, 0, width, height));
+        posts =
+            std::make_unique<detail::MemoryPosts>(ReadPosts(reading, 0, 0, width, height, false));
     } else {
         auto cached = std::make_unique<CachedPosts>(
             std::move(dataset), reading, static_cast<std::size_t>(options.cacheMegabytes) << 20);
         cached->width = static_cast<unsigned int>(width);
         cached->height = static_cast<unsigned int>(height);
-        ChooseBlocks(reading.band, cached->blockWidth, cached->blockHeight);
+        cached->ownBlocks = ChooseBlocks(reading.band, cached->blockWidth, cached->blockHeight);
         posts = std::move(cached);
     }
     return std::make_unique<detail::GridDEM>(std::move(posts), geocoding, std::move(crs),

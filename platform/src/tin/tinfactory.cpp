@@ -1,9 +1,9 @@
 // The TIN reader factory: the slot of the installed implementation and the built-in one.
 #include <kestrel/tin.h>
 
-#include <mutex>
 #include <utility>
 
+#include "../factoryslot.h"
 #include "tinreader.h"
 
 namespace kestrel {
@@ -23,14 +23,8 @@ class BuiltInFactory final : public TinReaderFactoryImpl {
     }
 };
 
-struct ImplSlot {
-    std::mutex mutex;
-    std::shared_ptr<TinReaderFactoryImpl> builtIn = std::make_shared<BuiltInFactory>();
-    std::shared_ptr<TinReaderFactoryImpl> current = builtIn;
-};
-
-ImplSlot& Slot() {
-    static ImplSlot slot;
+FactorySlot<TinReaderFactoryImpl>& Slot() {
+    static FactorySlot<TinReaderFactoryImpl> slot(std::make_shared<BuiltInFactory>());
     return slot;
 }
 
@@ -38,26 +32,16 @@ ImplSlot& Slot() {
 
 TinReader* TinReaderFactory::CreateTinReader(const char* path, int layer, double offset,
                                              double scale, ogc::cs::DatumType datum) {
-    std::shared_ptr<TinReaderFactoryImpl> impl;
-    {
-        std::lock_guard<std::mutex> lock(Slot().mutex);
-        impl = Slot().current;
-    }
-    return impl->CreateTinReader(path, layer, offset, scale, datum);
+    return Slot().Current()->CreateTinReader(path, layer, offset, scale, datum);
 }
 
 std::shared_ptr<TinReaderFactoryImpl> TinReaderFactory::GetDefaultImplementation() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().builtIn;
+    return Slot().BuiltIn();
 }
 
 std::shared_ptr<TinReaderFactoryImpl> TinReaderFactory::SetImplementation(
     std::shared_ptr<TinReaderFactoryImpl> impl) {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    if (!impl)
-        impl = Slot().builtIn;
-    std::swap(Slot().current, impl);
-    return impl;
+    return Slot().Install(std::move(impl));
 }
 
 ScopedTinReaderFactoryImpl::ScopedTinReaderFactoryImpl(std::shared_ptr<TinReaderFactoryImpl> impl)
