@@ -1,5 +1,6 @@
 // The true-ortho generator on synthetic scenes: the sample builder's RPC fit, hidden strips,
 // roof positions, agreement with gdalwarp on visible ground, cancellation and bad input.
+#include <kestrel/resampler.h>
 #include <kestrel/trueortho.h>
 #include <samplecity.h>
 
@@ -235,37 +236,43 @@ TEST_F(BoxFixture, VisibleGroundMatchesGdalwarpWithin1) {
     // Away from the surface model's edges, where gdalwarp's source windows miss parts of the
     // image (its RPC inversion fails off the DEM).
     UsePixel(0.4, 10.0);
-    const TorthoResult result = TorthoGenerator().Generate(Job());
-    ASSERT_TRUE(result.completed);
     const std::string reference = dir.File("gdalwarp.tif");
     const std::string command = FormatCommand(reference);
     ASSERT_EQ(std::system(command.c_str()), 0) << command;
-    const std::vector<double> visibility = ReadBand(dir.File("visibility.tif"));
-    for (int band = 1; band <= 3; ++band) {
-        const std::vector<double> ours = ReadBand(dir.File("ortho.tif"), band);
-        const std::vector<double> theirs = ReadBand(reference, band);
-        ASSERT_EQ(ours.size(), theirs.size());
-        size_t compared = 0, differing = 0;
-        for (unsigned int j = 3; j + 3 < size; ++j)
-            for (unsigned int i = 3; i + 3 < size; ++i) {
-                // Seen ground, away from the building and the hidden strip.
-                bool clear = true;
-                for (int dj = -3; dj <= 3 && clear; ++dj)
-                    for (int di = -3; di <= 3 && clear; ++di) {
-                        const size_t k = static_cast<size_t>(j + dj) * size + (i + di);
-                        double x, y;
-                        Ground(i + di, j + dj, x, y);
-                        clear =
-                            visibility[k] == 1 && dsm->HeightAt(x, y) < options.groundHeight + 0.01;
-                    }
-                if (!clear)
-                    continue;
-                const size_t k = static_cast<size_t>(j) * size + i;
-                ++compared;
-                differing += std::fabs(ours[k] - theirs[k]) > 1;
-            }
-        EXPECT_GT(compared, 60000u);
-        EXPECT_EQ(differing, 0u) << "band " << band;
+    // The generator's own kernel, and the platform's resampler given in the job.
+    const std::unique_ptr<kestrel::utils::IRasterResampler> bilinear(
+        kestrel::utils::ResamplerFactory().GetResampler("bilinear"));
+    for (const bool given : {false, true}) {
+        TorthoJob job = Job();
+        job.resampler = given ? bilinear.get() : nullptr;
+        ASSERT_TRUE(TorthoGenerator().Generate(job).completed);
+        const std::vector<double> visibility = ReadBand(dir.File("visibility.tif"));
+        for (int band = 1; band <= 3; ++band) {
+            const std::vector<double> ours = ReadBand(dir.File("ortho.tif"), band);
+            const std::vector<double> theirs = ReadBand(reference, band);
+            ASSERT_EQ(ours.size(), theirs.size());
+            size_t compared = 0, differing = 0;
+            for (unsigned int j = 3; j + 3 < size; ++j)
+                for (unsigned int i = 3; i + 3 < size; ++i) {
+                    // Seen ground, away from the building and the hidden strip.
+                    bool clear = true;
+                    for (int dj = -3; dj <= 3 && clear; ++dj)
+                        for (int di = -3; di <= 3 && clear; ++di) {
+                            const size_t k = static_cast<size_t>(j + dj) * size + (i + di);
+                            double x, y;
+                            Ground(i + di, j + dj, x, y);
+                            clear = visibility[k] == 1 &&
+                                    dsm->HeightAt(x, y) < options.groundHeight + 0.01;
+                        }
+                    if (!clear)
+                        continue;
+                    const size_t k = static_cast<size_t>(j) * size + i;
+                    ++compared;
+                    differing += std::fabs(ours[k] - theirs[k]) > 1;
+                }
+            EXPECT_GT(compared, 60000u);
+            EXPECT_EQ(differing, 0u) << "band " << band << (given ? ", resampler given" : "");
+        }
     }
 }
 

@@ -191,6 +191,22 @@ CityOptions BoxScene(double boxHeight, const std::vector<double>& azimuths, doub
     return o;
 }
 
+CityOptions BenchCity(unsigned int imageSize) {
+    CityOptions o;
+    o.sizeX = o.sizeY = std::ceil(imageSize * 0.5 * 1.2);
+    o.dsmPixel = 1.0;
+    o.slopeX = 0.004;
+    for (double y = 10; y + 40 < o.sizeY; y += 40)
+        for (double x = 10; x + 40 < o.sizeX; x += 40) {
+            const std::uint64_t key = static_cast<std::uint64_t>(x * 7919 + y);
+            const double w = 12 + std::floor(16 * Hash01(key)),
+                         d = 12 + std::floor(16 * Hash01(key + 1));
+            o.buildings.push_back({x, y, x + w, y + d, 6 + std::floor(34 * Hash01(key + 2))});
+        }
+    o.cameras.push_back({"oblique", 30.0, 20.0, 2500.0, imageSize, imageSize, 0.5});
+    return o;
+}
+
 // ---------------------------------------------------------------------------------------------
 // Surface
 
@@ -200,22 +216,36 @@ Dsm::Dsm(const CityOptions& options) : options_(options) {
     width_ = static_cast<unsigned int>(std::lround(options.sizeX / options.dsmPixel));
     height_ = static_cast<unsigned int>(std::lround(options.sizeY / options.dsmPixel));
     posts_.resize(static_cast<size_t>(width_) * height_);
-    minHeight_ = 1e300, maxHeight_ = -1e300;
-    for (unsigned int j = 0; j < height_; ++j) {
-        for (unsigned int i = 0; i < width_; ++i) {
-            const double lx = (i + 0.5) * options.dsmPixel;
-            const double ly = options.sizeY - (j + 0.5) * options.dsmPixel;
-            double h = options.groundHeight + options.slopeX * lx + options.slopeY * ly;
-            for (const Building& b : options.buildings)
-                if (lx > b.x0 && lx < b.x1 && ly > b.y0 && ly < b.y1)
-                    h = std::max(h, Ground(options.west + (b.x0 + b.x1) / 2,
-                                           options.south + (b.y0 + b.y1) / 2) +
-                                        b.height);
-            posts_[static_cast<size_t>(j) * width_ + i] = static_cast<float>(h);
-            minHeight_ = std::min(minHeight_, h);
-            maxHeight_ = std::max(maxHeight_, h);
-        }
+    buildingIds_.assign(posts_.size(), 0);
+    const double px = options.dsmPixel;
+    for (unsigned int j = 0; j < height_; ++j)
+        for (unsigned int i = 0; i < width_; ++i)
+            posts_[static_cast<size_t>(j) * width_ + i] = static_cast<float>(Ground(
+                options.west + (i + 0.5) * px, options.south + options.sizeY - (j + 0.5) * px));
+    // Each building over the posts whose centres lie inside it.
+    for (size_t k = 0; k < options.buildings.size(); ++k) {
+        const Building& b = options.buildings[k];
+        const double roof =
+            Ground(options.west + (b.x0 + b.x1) / 2, options.south + (b.y0 + b.y1) / 2) + b.height;
+        const int i0 = std::max(0, static_cast<int>(std::floor(b.x0 / px - 0.5)));
+        const int i1 =
+            std::min(static_cast<int>(width_) - 1, static_cast<int>(std::ceil(b.x1 / px)));
+        const int j0 = std::max(0, static_cast<int>(std::floor((options.sizeY - b.y1) / px - 0.5)));
+        const int j1 = std::min(static_cast<int>(height_) - 1,
+                                static_cast<int>(std::ceil((options.sizeY - b.y0) / px)));
+        for (int j = j0; j <= j1; ++j)
+            for (int i = i0; i <= i1; ++i) {
+                const double lx = (i + 0.5) * px, ly = options.sizeY - (j + 0.5) * px;
+                if (!(lx > b.x0 && lx < b.x1 && ly > b.y0 && ly < b.y1))
+                    continue;
+                const size_t at = static_cast<size_t>(j) * width_ + i;
+                if (roof > posts_[at])
+                    posts_[at] = static_cast<float>(roof),
+                    buildingIds_[at] = static_cast<int>(k) + 1;
+            }
     }
+    const auto range = std::minmax_element(posts_.begin(), posts_.end());
+    minHeight_ = *range.first, maxHeight_ = *range.second;
 }
 
 double Dsm::Ground(double x, double y) const {
@@ -242,13 +272,11 @@ double Dsm::HeightAt(double x, double y) const {
 }
 
 int Dsm::BuildingAt(double x, double y) const {
-    const double lx = x - options_.west, ly = y - options_.south;
-    for (size_t k = 0; k < options_.buildings.size(); ++k) {
-        const Building& b = options_.buildings[k];
-        if (lx >= b.x0 && lx <= b.x1 && ly >= b.y0 && ly <= b.y1)
-            return static_cast<int>(k) + 1;
-    }
-    return 0;
+    const double fx = (x - options_.west) / options_.dsmPixel;
+    const double fy = (options_.south + options_.sizeY - y) / options_.dsmPixel;
+    if (!(fx >= 0 && fy >= 0 && fx < width_ && fy < height_))
+        return 0;
+    return buildingIds_[static_cast<size_t>(fy) * width_ + static_cast<size_t>(fx)];
 }
 
 bool Dsm::Intersect(const Vec3& origin, const Vec3& dir, Vec3& hit) const {

@@ -9,6 +9,7 @@
 #include <kestrel/elevation.h>
 #include <kestrel/export.h>
 #include <kestrel/mathmodel.h>
+#include <kestrel/resampler.h>
 
 namespace kestrel {
 namespace processes {
@@ -100,6 +101,9 @@ struct KESTREL_API TorthoJob {
     dem::IElevationSource* surface = nullptr;
     // GDAL's names: "near", "bilinear", "cubic".
     std::string resampling = "bilinear";
+    // When given, this resampler (ResamplerFactory: every GDAL method it knows) is used instead
+    // of the method named by `resampling`. It is shared by the threads (const queries only).
+    const utils::IRasterResampler* resampler = nullptr;
     // The ortho's grid.
     const ogc::cs::ICRS* crs = nullptr;
     ogc::cs::GeocodingInfo geocoding;

@@ -2,6 +2,7 @@
 // is projected into the image, a z-buffer of the surface in image space tells seen from hidden,
 // and seen pixels take the resampled image value.
 #include <kestrel/exception.h>
+#include <kestrel/raster.h>
 #include <kestrel/trueortho.h>
 
 #include "../gdalsupport.h"
@@ -27,6 +28,22 @@ using trueortho::RunControl;
 
 namespace {
 
+struct Plan;
+struct Worker;
+
+// How far, in output pixels, the surface that can hide a tile's ground reaches beyond the tile
+// on each side: the line of sight's ground displacement per metre of height, largest over the
+// points added, times the surface's height range.
+struct Extension {
+    double left = 0, right = 0, up = 0, down = 0;
+    bool any = false;
+    // The line of sight at grid position (p, l); inImage tells whether the point is seen in the
+    // image's frame at all.
+    void Add(const Plan& plan, Worker& w, double p, double l, bool* inImage = nullptr);
+    void Apply(const Plan& plan, int& extendLeft, int& extendRight, int& extendUp,
+               int& extendDown) const;
+};
+
 // The output grid and everything each tile needs from it, fixed before the tiles run.
 struct Plan {
     const TorthoJob* job;
@@ -37,7 +54,8 @@ struct Plan {
     std::vector<float> noData;
     // Output pixels by which a tile's surface is extended on each side so that every surface
     // that can stand between the tile's ground and the sensor is projected.
-    int extendLeft = 0, extendRight = 0, extendUp = 0, extendDown = 0;
+    double heightRange = 0;  // metres between the lowest and the highest surface, plus 1
+    Extension global;        // for tiles whose corners have no line of sight
     const ogc::cs::CoordinateTransformation* toModel = nullptr;  // null: same CRS
 };
 
@@ -52,7 +70,54 @@ struct Worker {
     trueortho::ZBuffer zbuffer;
     trueortho::SourceWindow window;
     std::vector<float> ortho, visibility;
+    // Seen pixels waiting for a given resampler: tile offset and image position.
+    std::vector<size_t> pending;
+    std::vector<double> pendingCol, pendingRow, resampled;
 };
+
+void Extension::Add(const Plan& plan, Worker& w, double p, double l, bool* inImage) {
+    const TorthoJob& job = *plan.job;
+    // Ground at p, at p + 1 pixel and at l + 1 line, projected at two heights.
+    const double px[4] = {p, p + 1, p, p}, py[4] = {l, l, l + 1, l};
+    double gx[4], gy[4], gz[4], c[4], r[4];
+    bool ok[4];
+    for (int k = 0; k < 4; ++k)
+        job.geocoding.PixelToGround(px[k], py[k], gx[k], gy[k]);
+    double h;
+    if (!job.surface->GetHeight(gx[0], gy[0], h))
+        return;
+    for (int k = 0; k < 4; ++k)
+        gz[k] = k == 3 ? h + 1 : h;
+    if (w.toModel)
+        w.toModel->Transform(4, gx, gy);
+    job.model->GroundToImage(4, gx, gy, gz, c, r, ok);
+    if (!(ok[0] && ok[1] && ok[2] && ok[3]))
+        return;
+    if (inImage != nullptr)
+        *inImage = c[0] >= 0 && r[0] >= 0 && c[0] < plan.imageWidth && r[0] < plan.imageHeight;
+    // Image shift of one metre of height, expressed as ground pixels: J^-1 (d image).
+    const double j00 = c[1] - c[0], j01 = c[2] - c[0], j10 = r[1] - r[0], j11 = r[2] - r[0];
+    const double det = j00 * j11 - j01 * j10;
+    if (!(std::fabs(det) > 1e-12))
+        return;
+    const double dc = c[3] - c[0], dr = r[3] - r[0];
+    // Occluders of a point stand towards the sensor: against the image shift.
+    const double dp = -(j11 * dc - j01 * dr) / det, dl = -(-j10 * dc + j00 * dr) / det;
+    right = std::max(right, dp), left = std::max(left, -dp);
+    down = std::max(down, dl), up = std::max(up, -dl);
+    any = true;
+}
+
+void Extension::Apply(const Plan& plan, int& extendLeft, int& extendRight, int& extendUp,
+                      int& extendDown) const {
+    const Extension& e = any ? *this : plan.global;
+    // A tenth more and two pixels: the line of sight bends a little between the points.
+    auto pixels = [&](double perMetre) {
+        return static_cast<int>(std::min(std::ceil(1.1 * perMetre * plan.heightRange) + 2, 1e5));
+    };
+    extendLeft = pixels(e.left), extendRight = pixels(e.right);
+    extendUp = pixels(e.up), extendDown = pixels(e.down);
+}
 
 // Ground positions of output pixel centres in a window of the grid, their surface heights and
 // their image positions.
@@ -85,13 +150,58 @@ void ProjectWindow(const Plan& plan, Worker& w, int x0, int y0, int width, int h
             w.ok[k] = false;
 }
 
+// The seen pixels of a tile through the job's resampler, in one call: the source window (the
+// part inside the image) as a raster placed at its image position.
+void ResampleWithGiven(const Plan& plan, Worker& w, TorthoResult& counts) {
+    const trueortho::SourceWindow& src = w.window;
+    const int x0 = std::max(src.x0, 0), y0 = std::max(src.y0, 0);
+    const int x1 = std::min(src.x0 + src.width, plan.imageWidth);
+    const int y1 = std::min(src.y0 + src.height, plan.imageHeight);
+    const size_t tileSize = w.visibility.size(), n = w.pending.size();
+    gobs::Raster raster(static_cast<unsigned int>(x1 - x0), static_cast<unsigned int>(y1 - y0),
+                        static_cast<unsigned int>(src.bands), datasources::DataType::Float32);
+    raster.SetOrigin(static_cast<unsigned int>(x0), static_cast<unsigned int>(y0));
+    for (int b = 0; b < src.bands; ++b) {
+        float* plane = static_cast<float*>(raster.GetChannelData(static_cast<unsigned int>(b)));
+        for (int y = y0; y < y1; ++y)
+            for (int x = x0; x < x1; ++x)
+                *plane++ =
+                    src.values[(static_cast<size_t>(b) * src.height + (y - src.y0)) * src.width +
+                               (x - src.x0)];
+    }
+    std::vector<double> noData(src.bands);
+    for (int b = 0; b < src.bands; ++b)
+        noData[b] = src.hasNoData[b] ? src.noData[b] : std::numeric_limits<double>::quiet_NaN();
+    w.resampled.resize(n * src.bands);
+    plan.job->resampler->ResampleAll(raster, n, w.pendingCol.data(), w.pendingRow.data(),
+                                     w.resampled.data(), noData.data());
+    for (size_t k = 0; k < n; ++k) {
+        const size_t o = w.pending[k];
+        bool valid = true;
+        for (int b = 0; b < src.bands; ++b)
+            valid = valid && !std::isnan(w.resampled[b * n + k]);
+        if (!valid) {
+            w.visibility[o] = VISIBILITY_OUTSIDE, ++counts.outside;
+            continue;
+        }
+        ++counts.seen;
+        for (int b = 0; b < src.bands; ++b)
+            w.ortho[tileSize * b + o] = static_cast<float>(w.resampled[b * n + k]);
+    }
+}
+
 void ProcessTile(const Plan& plan, Worker& w, OutputRaster& ortho, OutputRaster& visibility, int tx,
                  int ty, int tw, int th, const RunControl& control, TorthoResult& counts) {
     const TorthoJob& job = *plan.job;
     // The tile with its surroundings, so that occluders outside the tile are projected too.
-    const int ex = tx - plan.extendLeft, ey = ty - plan.extendUp;
-    const int ew = tw + plan.extendLeft + plan.extendRight;
-    const int eh = th + plan.extendUp + plan.extendDown;
+    Extension reach;
+    for (const double p : {0.0, tw / 2.0, static_cast<double>(tw)})
+        for (const double l : {0.0, th / 2.0, static_cast<double>(th)})
+            reach.Add(plan, w, tx + p, ty + l);
+    int left, right, up, down;
+    reach.Apply(plan, left, right, up, down);
+    const int ex = tx - left, ey = ty - up;
+    const int ew = tw + left + right, eh = th + up + down;
     ProjectWindow(plan, w, ex, ey, ew, eh, control);
     if (control.Stopped())
         return;
@@ -149,7 +259,9 @@ void ProcessTile(const Plan& plan, Worker& w, OutputRaster& ortho, OutputRaster&
     src.imageWidth = plan.imageWidth, src.imageHeight = plan.imageHeight;
     src.bands = static_cast<int>(plan.bands.size());
     src.hasNoData = plan.hasNoData, src.noData = plan.noData;
-    const int radius = trueortho::KernelRadius(plan.kernel);
+    const int radius = job.resampler != nullptr
+                           ? std::max(1, static_cast<int>(job.resampler->GetRadius()))
+                           : trueortho::KernelRadius(plan.kernel);
     src.x0 = zx0 - radius, src.y0 = zy0 - radius;
     src.width = anyInside ? zx1 - zx0 + 2 * radius : 0;
     src.height = anyInside ? zy1 - zy0 + 2 * radius : 0;
@@ -163,6 +275,7 @@ void ProcessTile(const Plan& plan, Worker& w, OutputRaster& ortho, OutputRaster&
     w.ortho.assign(tileSize * src.bands, static_cast<float>(job.orthoNoData));
     w.visibility.assign(tileSize, static_cast<float>(VISIBILITY_OUTSIDE));
     std::vector<float> value(src.bands);
+    w.pending.clear(), w.pendingCol.clear(), w.pendingRow.clear();
     for (int j = ty; j < ty + th; ++j) {
         if ((j & 15) == 0 && control.Stopped())
             return;
@@ -181,6 +294,11 @@ void ProcessTile(const Plan& plan, Worker& w, OutputRaster& ortho, OutputRaster&
                 w.visibility[o] = VISIBILITY_HIDDEN, ++counts.hidden;
                 continue;
             }
+            if (job.resampler != nullptr) {
+                w.visibility[o] = VISIBILITY_SEEN;  // unless the resampler finds no value
+                w.pending.push_back(o), w.pendingCol.push_back(c), w.pendingRow.push_back(r);
+                continue;
+            }
             if (!trueortho::Sample(src, plan.kernel, c, r, value.data())) {
                 ++counts.outside;
                 continue;
@@ -190,6 +308,8 @@ void ProcessTile(const Plan& plan, Worker& w, OutputRaster& ortho, OutputRaster&
                 w.ortho[tileSize * b + o] = value[b];
         }
     }
+    if (!w.pending.empty())
+        ResampleWithGiven(plan, w, counts);
     ortho.Write(tx, ty, tw, th, w.ortho.data());
     visibility.Write(tx, ty, tw, th, w.visibility.data());
 }
@@ -227,7 +347,8 @@ Plan MakePlan(const TorthoJob& job, GDALDataset& source) {
 
     Plan plan;
     plan.job = &job;
-    plan.kernel = trueortho::KernelByName(job.resampling);
+    plan.kernel =
+        job.resampler != nullptr ? Kernel::Bilinear : trueortho::KernelByName(job.resampling);
     plan.imageWidth = source.GetRasterXSize();
     plan.imageHeight = source.GetRasterYSize();
     const int count = source.GetRasterCount();
@@ -319,54 +440,25 @@ void Survey(const TorthoJob& job, Plan& plan, Worker& w, const RunControl& contr
         KESTREL_THROW(DataException,
                       "True ortho: the surface model has no height anywhere on the output grid");
 
-    // Ground displacement of the line of sight per metre of height, in output pixels, on a
-    // 17 x 17 grid; the same grid tells whether any ground reaches the image.
+    plan.heightRange = highest - lowest + 1.0;
+
+    // The line of sight on a 17 x 17 lattice: the extension for tiles whose own corners tell
+    // nothing, and whether any ground reaches the image.
     const int n = 17;
     int inside = 0;
-    double left = 0, right = 0, up = 0, down = 0;
+    Extension global;
     for (int a = 0; a < n; ++a)
         for (int b = 0; b < n; ++b) {
-            const double p = job.pixels * (a + 0.5) / n, l = job.lines * (b + 0.5) / n;
-            // Ground at p, at p + 1 pixel and at l + 1 line, projected at two heights.
-            double px[4] = {p, p + 1, p, p}, py[4] = {l, l, l + 1, l};
-            double gx[4], gy[4], gz[4], c[4], r[4];
-            bool ok[4];
-            for (int k = 0; k < 4; ++k)
-                job.geocoding.PixelToGround(px[k], py[k], gx[k], gy[k]);
-            double h;
-            if (!job.surface->GetHeight(gx[0], gy[0], h))
-                continue;
-            for (int k = 0; k < 4; ++k)
-                gz[k] = k == 3 ? h + 1 : h;
-            if (w.toModel)
-                w.toModel->Transform(4, gx, gy);
-            job.model->GroundToImage(4, gx, gy, gz, c, r, ok);
-            if (!(ok[0] && ok[1] && ok[2] && ok[3]))
-                continue;
-            if (c[0] >= 0 && r[0] >= 0 && c[0] < plan.imageWidth && r[0] < plan.imageHeight)
-                ++inside;
-            // Image shift of one metre of height, expressed as ground pixels: J^-1 (d image).
-            const double j00 = c[1] - c[0], j01 = c[2] - c[0], j10 = r[1] - r[0], j11 = r[2] - r[0];
-            const double det = j00 * j11 - j01 * j10;
-            if (!(std::fabs(det) > 1e-12))
-                continue;
-            const double dc = c[3] - c[0], dr = r[3] - r[0];
-            // Occluders of a point stand towards the sensor: against the image shift.
-            const double dp = -(j11 * dc - j01 * dr) / det, dl = -(-j10 * dc + j00 * dr) / det;
-            right = std::max(right, dp), left = std::max(left, -dp);
-            down = std::max(down, dl), up = std::max(up, -dl);
+            bool inImage = false;
+            global.Add(plan, w, job.pixels * (a + 0.5) / n, job.lines * (b + 0.5) / n, &inImage);
+            inside += inImage;
         }
     if (inside == 0)
         KESTREL_THROW(DataException,
                       FormatString("True ortho: the math model projects the output grid outside "
                                    "the image %s (%d x %d): layout and image do not match",
                                    job.sourcePath.c_str(), plan.imageWidth, plan.imageHeight));
-    const double range = highest - lowest + 1.0;
-    auto pixels = [&](double perMetre) {
-        return static_cast<int>(std::min(std::ceil(perMetre * range) + 2, 1e5));
-    };
-    plan.extendLeft = pixels(left), plan.extendRight = pixels(right);
-    plan.extendUp = pixels(up), plan.extendDown = pixels(down);
+    plan.global = global;
 }
 
 }  // namespace

@@ -106,7 +106,10 @@ void OutputRaster::Write(int x, int y, int width, int height, const float* buffe
     const GSpacing pixel = sizeof(float), line = pixel * width, band = line * height;
     if (ds_->RasterIO(GF_Write, x, y, width, height, const_cast<float*>(buffer), width, height,
                       GDT_Float32, ds_->GetRasterCount(), nullptr, pixel, line, band,
-                      nullptr) != CE_None)
+                      nullptr) != CE_None ||
+        // Written blocks go to the file at once rather than waiting in GDAL's cache, so that
+        // memory stays that of the tiles in hand whatever the output's size.
+        (ds_->FlushCache(false), errors.Failed()))
         KESTREL_THROW(
             FileAccessException, path_, FileAccessException::WriteFailed,
             FormatString("Writing %s failed: %s", temporary_.c_str(), errors.Reason().c_str()));
