@@ -134,14 +134,14 @@ struct BoxFixture : ::testing::Test {
         return job;
     }
     // gdalwarp's ortho of the same image on the same grid, without occlusion handling.
-    std::string FormatCommand(const std::string& out) const {
+    std::string FormatCommand(const std::string& out, const std::string& method) const {
         std::ostringstream c;
         c.precision(12);
         c << "gdalwarp -q -overwrite -rpc -to RPC_DEM=" << sample.dsmPath
           << " -to RPC_DEMINTERPOLATION=bilinear -t_srs EPSG:32632 -tr " << pixel << ' ' << pixel
           << " -te " << options.west + inset << ' ' << options.south + inset << ' '
           << options.west + options.sizeX - inset << ' ' << options.south + options.sizeY - inset
-          << " -r bilinear -et 0 " << sample.images[0].path << ' ' << out;
+          << " -r " << method << " -et 0 " << sample.images[0].path << ' ' << out;
         return c.str();
     }
     void Ground(unsigned int i, unsigned int j, double& x, double& y) const {
@@ -237,43 +237,60 @@ TEST_F(BoxFixture, VisibleGroundMatchesGdalwarpWithin1) {
     // image (its RPC inversion fails off the DEM).
     UsePixel(0.4, 10.0);
     const std::string reference = dir.File("gdalwarp.tif");
-    const std::string command = FormatCommand(reference);
-    ASSERT_EQ(std::system(command.c_str()), 0) << command;
-    // The generator's own kernel, and the platform's resampler given in the job.
-    const std::unique_ptr<kestrel::utils::IRasterResampler> bilinear(
-        kestrel::utils::ResamplerFactory().GetResampler("bilinear"));
-    for (const bool given : {false, true}) {
-        TorthoJob job = Job();
-        job.resampler = given ? bilinear.get() : nullptr;
-        ASSERT_TRUE(TorthoGenerator().Generate(job).completed);
-        const std::vector<double> visibility = ReadBand(dir.File("visibility.tif"));
-        for (int band = 1; band <= 3; ++band) {
-            const std::vector<double> ours = ReadBand(dir.File("ortho.tif"), band);
-            const std::vector<double> theirs = ReadBand(reference, band);
-            ASSERT_EQ(ours.size(), theirs.size());
-            size_t compared = 0, differing = 0;
-            for (unsigned int j = 3; j + 3 < size; ++j)
-                for (unsigned int i = 3; i + 3 < size; ++i) {
-                    // Seen ground, away from the building and the hidden strip.
-                    bool clear = true;
-                    for (int dj = -3; dj <= 3 && clear; ++dj)
-                        for (int di = -3; di <= 3 && clear; ++di) {
-                            const size_t k = static_cast<size_t>(j + dj) * size + (i + di);
-                            double x, y;
-                            Ground(i + di, j + dj, x, y);
-                            clear = visibility[k] == 1 &&
-                                    dsm->HeightAt(x, y) < options.groundHeight + 0.01;
-                        }
-                    if (!clear)
-                        continue;
-                    const size_t k = static_cast<size_t>(j) * size + i;
-                    ++compared;
-                    differing += std::fabs(ours[k] - theirs[k]) > 1;
-                }
-            EXPECT_GT(compared, 60000u);
-            EXPECT_EQ(differing, 0u) << "band " << band << (given ? ", resampler given" : "");
+    for (const char* method : {"bilinear", "cubic"}) {
+        const std::string command = FormatCommand(reference, method);
+        ASSERT_EQ(std::system(command.c_str()), 0) << command;
+        // The generator's own kernel, and the platform's resampler given in the job.
+        const std::unique_ptr<kestrel::utils::IRasterResampler> resampler(
+            kestrel::utils::ResamplerFactory().GetResampler(method));
+        for (const bool given : {false, true}) {
+            TorthoJob job = Job();
+            job.resampling = method;
+            job.resampler = given ? resampler.get() : nullptr;
+            ASSERT_TRUE(TorthoGenerator().Generate(job).completed);
+            const std::vector<double> visibility = ReadBand(dir.File("visibility.tif"));
+            for (int band = 1; band <= 3; ++band) {
+                const std::vector<double> ours = ReadBand(dir.File("ortho.tif"), band);
+                const std::vector<double> theirs = ReadBand(reference, band);
+                ASSERT_EQ(ours.size(), theirs.size());
+                size_t compared = 0, differing = 0;
+                for (unsigned int j = 3; j + 3 < size; ++j)
+                    for (unsigned int i = 3; i + 3 < size; ++i) {
+                        // Seen ground, away from the building and the hidden strip.
+                        bool clear = true;
+                        for (int dj = -3; dj <= 3 && clear; ++dj)
+                            for (int di = -3; di <= 3 && clear; ++di) {
+                                const size_t k = static_cast<size_t>(j + dj) * size + (i + di);
+                                double x, y;
+                                Ground(i + di, j + dj, x, y);
+                                clear = visibility[k] == 1 &&
+                                        dsm->HeightAt(x, y) < options.groundHeight + 0.01;
+                            }
+                        if (!clear)
+                            continue;
+                        const size_t k = static_cast<size_t>(j) * size + i;
+                        ++compared;
+                        differing += std::fabs(ours[k] - theirs[k]) > 1;
+                    }
+                EXPECT_GT(compared, 60000u);
+                EXPECT_EQ(differing, 0u)
+                    << method << ", band " << band << (given ? ", resampler given" : "");
+            }
         }
     }
+}
+
+TEST_F(BoxFixture, TwoThreadsWriteWhatOneWrites) {
+    std::vector<std::vector<double>> outputs[2];
+    for (unsigned int threads : {1u, 2u}) {
+        kestrel::processes::GeneratorSettings settings;
+        settings.threadCount = threads;
+        ASSERT_TRUE(TorthoGenerator(settings).Generate(Job()).completed);
+        for (int band = 1; band <= 3; ++band)
+            outputs[threads - 1].push_back(ReadBand(dir.File("ortho.tif"), band));
+        outputs[threads - 1].push_back(ReadBand(dir.File("visibility.tif")));
+    }
+    EXPECT_TRUE(outputs[0] == outputs[1]);
 }
 
 // No output, final or partial, is left in the directory.

@@ -118,7 +118,8 @@ TEST(WorkflowCommand, BadMasterLinesNameFileAndLine) {
                                          "a.tif;1,2,3;0;;0;0;LOW;1;FILL\n"
                                          "\n"
                                          "b.tif;1,x;0;;0;0;HIGH;2;FILL\n"
-                                         "a.tif;1;0;;0;0;;0;PREP\n");
+                                         "a.tif;1;0;;0;0;;0;PREP\n"
+                                         "c.tif;1;0;;0;0;;0;FILL\n");
     const Result stop = Ortho({master, "--out", dir.File("out"), "--dem", "dsm.tif"}, dir);
     EXPECT_EQ(stop.status, 1);
     EXPECT_NE(stop.err.find("master.txt, line 4, column 1: \"x\" is not an integer"),
@@ -128,9 +129,9 @@ TEST(WorkflowCommand, BadMasterLinesNameFileAndLine) {
     // The derived files hold the master file's columns.
     EXPECT_EQ(ReadFile(dir.File("out/prep.txt")),
               "!MFILE created for VARNOK\na.tif;1,2,3;0;;0;0\nb.tif;1,x;0;;0;0\n"
-              "a.tif;1;0;;0;0\n");
+              "a.tif;1;0;;0;0\nc.tif;1;0;;0;0\n");
     EXPECT_EQ(ReadFile(dir.File("out/imgset.txt")),
-              "!IMGSET created for MELDRA\na.tif;LOW;1\nb.tif;HIGH;2\n");
+              "!IMGSET created for MELDRA\na.tif;LOW;1\nb.tif;HIGH;2\nc.tif;;0\n");
 
     const Result going =
         Ortho({master, "--out", dir.File("out"), "--dem", "dsm.tif", "--keep-going", "-q"}, dir);
@@ -141,6 +142,10 @@ TEST(WorkflowCommand, BadMasterLinesNameFileAndLine) {
     // The third line repeats the first one's name: its outputs would overwrite the first's.
     EXPECT_NE(summary.find("master.txt, line 5: the scene name \\\"a\\\" is already taken by "
                            "line 2"),
+              std::string::npos)
+        << summary;
+    // A missing image is named with the line that names it.
+    EXPECT_NE(summary.find("master.txt, line 6: " + dir.File("c.tif") + ": not found"),
               std::string::npos)
         << summary;
 }
@@ -222,14 +227,16 @@ TEST(Workflow, SampleCityEndToEnd) {
     const std::string summary = ReadFile(dir.File("out/summary.json"));
     EXPECT_NE(summary.find("\"status\": \"complete\""), std::string::npos) << summary;
 
-    std::unique_ptr<kestrel::processes::silvan::TOSceneParser> any;
+    // The scenes in the image set's order, in which the mosaic's source raster numbers them.
     std::vector<std::string> names;
-    for (const auto& entry : std::filesystem::directory_iterator(dir.Path() / "out")) {
-        if (entry.path().extension() == ".xml")
-            names.push_back(entry.path().stem().string());
+    std::unique_ptr<kestrel::processes::silvan::TOImgSetParser> set(
+        kestrel::processes::silvan::ParserFactory::CreateImgSetParser(dir.File("out/imgset.txt"),
+                                                                      RadioDifAny, 0));
+    for (unsigned int i = 0; i < set->GetMfileLines(); ++i) {
+        set->ParseLine(static_cast<int>(i));
+        names.push_back(std::filesystem::path(set->GetSceneId()).stem().string());
     }
     ASSERT_GE(names.size(), 3u);
-    std::sort(names.begin(), names.end());
 
     // One grid for all: same size and placement, whole blocks of 16, the CRS asked for.
     double geo[6] = {0}, first_geo[6] = {0};

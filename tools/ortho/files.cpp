@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <filesystem>
+#include <limits>
 #include <system_error>
 
 #ifdef _WIN32
@@ -50,11 +51,24 @@ double ModifiedTime(const std::string& path) {
     std::error_code ec;
     const auto time = fs::last_write_time(path, ec);
     if (ec)
-        return -1.0;
+        return -std::numeric_limits<double>::infinity();
     return std::chrono::duration<double>(time.time_since_epoch()).count();
 }
 
 std::string Explain(const std::exception& error) {
+    // A parameter's error names the value refused, and what was expected, when its message
+    // does not.
+    if (const auto* parameter = dynamic_cast<const kestrel::ParameterException*>(&error)) {
+        std::string message = parameter->GetErrorMessage();
+        const std::string& value = parameter->GetValue();
+        const std::string shown = value.empty() ? parameter->GetParameterName() : value;
+        if (!shown.empty() && message.find(shown) == std::string::npos)
+            message = shown + ": " + message;
+        if (!parameter->GetExpected().empty() &&
+            message.find(parameter->GetExpected()) == std::string::npos)
+            message += " (expected: " + parameter->GetExpected() + ")";
+        return message;
+    }
     const auto* file = dynamic_cast<const kestrel::FileException*>(&error);
     if (file == nullptr || file->GetFileName().empty())
         return error.what();

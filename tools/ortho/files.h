@@ -22,7 +22,8 @@ void Publish(const std::string& part, const std::string& path);
 bool FileExists(const std::string& path);
 void RemoveFile(const std::string& path);  // no error when absent
 
-// Seconds since the epoch of the last change; -1 when the file is absent.
+// Seconds of the last change on the file system's clock (whose epoch may lie in the future:
+// compare, do not read); minus infinity when the file is absent.
 double ModifiedTime(const std::string& path);
 
 // One line saying what went wrong, with the file name of file errors.

@@ -1,6 +1,8 @@
 // silvan-ortho: the true-ortho workflow of a master parameter file, end to end.
+#include "files.h"
 #include "options.h"
 #include "progress.h"
+#include "steps.h"
 #include "workflow.h"
 
 #include <cstdio>
@@ -38,6 +40,12 @@ int main(int argc, char** argv) {
     if (options.help) {
         std::fputs(ortho::UsageText().c_str(), stdout);
         return 0;
+    }
+    try {
+        ortho::CheckOptions(options);
+    } catch (const std::exception& e) {
+        std::fprintf(stderr, "silvan-ortho: %s\n", ortho::Explain(e).c_str());
+        return 2;
     }
     try {
         ortho::Progress progress(stderr, ortho::IsTerminal(stderr), options.quiet);

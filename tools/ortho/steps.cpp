@@ -8,6 +8,7 @@
 
 #include <kestrel/crs.h>
 #include <kestrel/exception.h>
+#include <kestrel/formats.h>
 
 #include <cpl_error.h>
 #include <gdal_priv.h>
@@ -16,6 +17,7 @@
 #include <algorithm>
 #include <cmath>
 #include <cstdio>
+#include <limits>
 #include <sstream>
 
 namespace ortho {
@@ -180,7 +182,50 @@ bool ReadGrid(const std::string& path, Grid& grid) {
     return true;
 }
 
-Grid SceneLayout(const Options&, const SceneInput&, const std::string&, double, Footprint*) {
+void CheckOptions(const Options& options) {
+    GetVertDatum(options.elevref);
+    double offset = 0.0, scale = 1.0;
+    GetElFactor(options.elfactor, offset, scale);
+    if (!options.elunits.empty())
+        GetElUnits(options.elunits, scale);
+    std::string method = options.resample;
+    std::unique_ptr<kestrel::utils::IRasterResampler> resampler(GetResampler(method));
+    kestrel::core::FType2FormatName(options.format);
+}
+
+std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
+    const Options& options, const kestrel::mathmodel::IMathModel* model) {
+    double offset = 0.0, scale = 1.0;
+    GetElFactor(options.elfactor, offset, scale);
+    if (!options.elunits.empty())
+        GetElUnits(options.elunits, scale);
+    kestrel::ogc::cs::DatumType datum = GetVertDatum(options.elevref);
+    const kestrel::ogc::cs::DatumType modelDatum = GetModelDatum(model);
+    if (!options.dem.empty()) {
+        // The first band; no-data as the raster declares it.
+        return std::unique_ptr<kestrel::dem::IElevationSource>(
+            GetDem(options.dem, 0, offset, scale, std::numeric_limits<float>::quiet_NaN(), datum,
+                   modelDatum));
+    }
+    // The first layer holding triangles or 3-D points.
+    std::unique_ptr<kestrel::dem::IElevationSource> tin(
+        GetDbm(options.tin, 0, offset, scale, datum, modelDatum));
+    if (!tin)
+        KESTREL_THROW(kestrel::FileNotFoundException, options.tin,
+                      "cannot be opened as a TIN: no layer of triangles or 3-D points");
+    return tin;
+}
+
+void CheckSource(const SceneInput& scene) {
+    std::unique_ptr<kestrel::datasources::IDataset> dataset(GetRasterDataset(scene.source));
+    std::vector<unsigned int> sourceChannels, orthoChannels;
+    GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
+    std::unique_ptr<kestrel::datasources::IRasterReader> reader(
+        GetRasterReader(dataset.get(), sourceChannels));
+}
+
+Grid SceneLayout(const Options&, const SceneInput& scene, const std::string&, double, Footprint*) {
+    CheckSource(scene);
     Unavailable("the ortho layout (GetOrthoParams)");
 }
 

@@ -4,6 +4,8 @@
 
 #include "options.h"
 
+#include <kestrel/elevation.h>
+#include <kestrel/mathmodel.h>
 #include <silvan/polygon.h>
 #include <silvan/toimgsetparser.h>
 
@@ -42,6 +44,20 @@ using Footprint = std::unique_ptr<kestrel::tin::Polygon<double>>;
 // Progress of one step: the fraction done. Returns false to stop.
 using StepProgress = std::function<bool(double fraction)>;
 
+// Checks the option values that the library interprets (-elevref, -elfactor, units, resampling
+// method, file type), so that a bad one stops the run before any work. Throws what the library
+// throws for it.
+void CheckOptions(const Options& options);
+
+// The surface model of the options (--dem or --tin) with the heights corrected and delivered in
+// the datum of the math model (null: the ellipsoid). The caller owns it.
+std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
+    const Options& options, const kestrel::mathmodel::IMathModel* model);
+
+// Opens the source raster and its channels as the generator will read them: throws when the
+// file is missing or unreadable, a channel does not exist, or the channels mix data types.
+void CheckSource(const SceneInput& scene);
+
 // The layout of a scene on its own: the grid in crs (empty: chosen for the scene) with the
 // pixel size (0: the source's resolution), and the scene's footprint when asked for.
 Grid SceneLayout(const Options& options, const SceneInput& scene, const std::string& crs,
@@ -70,7 +86,9 @@ void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>
 
 // One scene of the image set, as occlusion recovery takes it.
 struct RecoveryScene {
-    std::string id;  // the image set's scene identifier
+    std::string id;      // the image set's scene identifier
+    std::string source;  // the source image and its math-model segment, for viewing angles
+    int mmseg = 0;
     std::string ortho;
     std::string visibility;
     RadiometricDiff radioDif = RadioDifAny;

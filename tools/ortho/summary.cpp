@@ -76,6 +76,10 @@ std::string ToJson(const RunSummary& summary) {
     out << (summary.scenes.empty() ? "],\n" : "\n  ],\n");
     out << "  \"mosaic\": " << PathOrNull(summary.mosaic) << ",\n";
     out << "  \"mosaic_source\": " << PathOrNull(summary.mosaicSource) << ",\n";
+    out << "  \"mosaic_scenes\": [";
+    for (std::size_t i = 0; i < summary.mosaicScenes.size(); ++i)
+        out << (i ? ", " : "") << Json(summary.mosaicScenes[i]);
+    out << "],\n";
     out << "  \"footprints\": " << PathOrNull(summary.footprints) << ",\n";
     out << "  \"quicklooks\": [";
     for (std::size_t i = 0; i < summary.quicklooks.size(); ++i)

@@ -24,7 +24,8 @@ struct RunSummary {
     std::string status;  // "complete", "partial" (a slice), "failed"
     std::vector<SceneSummary> scenes;
     std::string mosaic;        // empty: not made by this run
-    std::string mosaicSource;  // which image each mosaic pixel came from
+    std::string mosaicSource;  // which image each mosaic pixel came from: 1 + its index in
+    std::vector<std::string> mosaicScenes;  // these scene names, 0 where none sees the pixel
     std::string footprints;
     std::vector<std::string> quicklooks;
     std::vector<std::string> errors;  // failures outside the scenes

@@ -43,6 +43,11 @@ std::string Join(const std::string& directory, const std::string& name) {
     return (fs::path(directory) / name).string();
 }
 
+// A message about a file, naming it once.
+std::string About(const std::string& path, const std::string& message) {
+    return message.find(path) != std::string::npos ? message : path + ": " + message;
+}
+
 // The line numbers (from 1) of the data lines of a parameter file: every line but header and
 // comment lines ("!" first) and blank ones, as the parameter-table reader counts them.
 std::vector<unsigned int> DataLineNumbers(const std::string& path) {
@@ -234,7 +239,7 @@ void Workflow::Prepare() {
         DeriveFile(prepFile_, [&](const std::string& part) { master->WriteMFilePrep(part); });
         DeriveFile(imgSetFile_, [&](const std::string& part) { master->WriteImgSet(part); });
     } catch (const kestrel::Exception& e) {
-        throw RunError(options_.master + ": " + Explain(e));
+        throw RunError(About(options_.master, Explain(e)));
     }
     const std::vector<unsigned int> masterLines = DataLineNumbers(options_.master);
 
@@ -249,9 +254,9 @@ void Workflow::Prepare() {
     } catch (const kestrel::ParameterException& e) {
         // Every line has a preparation role: there is nothing to recover.
         if (e.GetErrorMessage() != "Empty text file")
-            throw RunError(imgSetFile_ + ": " + Explain(e));
+            throw RunError(About(imgSetFile_, Explain(e)));
     } catch (const kestrel::Exception& e) {
-        throw RunError(imgSetFile_ + ": " + Explain(e));
+        throw RunError(About(imgSetFile_, Explain(e)));
     }
 
     std::vector<unsigned int> noChannels;  // a line without channels reads all of them
@@ -260,7 +265,7 @@ void Workflow::Prepare() {
     try {
         prep.reset(ParserFactory::CreateTPMFileParser(prepFile_, noChannels, 0, noWindow, "", 0));
     } catch (const kestrel::Exception& e) {
-        throw RunError(options_.master + ": " + Explain(e));
+        throw RunError(About(options_.master, Explain(e)));
     }
     const unsigned int count = prep->GetMfileLines();
     const fs::path masterDir = fs::absolute(options_.master, ec).parent_path();
@@ -478,8 +483,7 @@ void Workflow::RunScene(Scene& scene) {
         };
     };
     const std::vector<std::string> parts = {PartName(scene.ortho), PartName(scene.visibility),
-                                            PartName(scene.footprint), PartName(scene.quicklook),
-                                            PartName(scene.xml)};
+                                            PartName(scene.quicklook), PartName(scene.xml)};
     try {
         // Outputs of an earlier, unfinished attempt are made again from the start.
         for (const std::string& path :
@@ -504,19 +508,20 @@ void Workflow::RunScene(Scene& scene) {
         Publish(parts[1], scene.visibility);
         timed("scene ortho");
 
+        // The footprint layer is labelled with its file's name, so it is written in place; the
+        // scene description written after it says that it is whole.
         report(0.9, 0.95, "footprint")(0.0);
-        WriteFootprint(parts[2], *footprint);
-        Publish(parts[2], scene.footprint);
+        WriteFootprint(scene.footprint, *footprint);
         timed("scene footprint");
-        WriteQuicklook(scene.visibility, parts[3], Quicklook::Visibility);
-        Publish(parts[3], scene.quicklook);
+        WriteQuicklook(scene.visibility, parts[2], Quicklook::Visibility);
+        Publish(parts[2], scene.quicklook);
         timed("scene quicklook");
 
         // The scene description comes last: its presence says the scene is complete.
         report(0.95, 1.0, "scene")(0.0);
         {
             std::lock_guard<std::mutex> lock(SceneFileMutex());
-            std::unique_ptr<TOSceneParser> description(ParserFactory::CreateSceneParser(parts[4]));
+            std::unique_ptr<TOSceneParser> description(ParserFactory::CreateSceneParser(parts[3]));
             description->SetSceneFilename(scene.input.source);
             description->SetOrthoFilename(scene.ortho);
             description->SetVisIdxFilename(scene.visibility);
@@ -527,7 +532,7 @@ void Workflow::RunScene(Scene& scene) {
             description->SetSceneFootprint(footprint.get());
             description->Serialize(false);
         }
-        Publish(parts[4], scene.xml);
+        Publish(parts[3], scene.xml);
         timed("scene description");
         scene.status = "done";
     } catch (const std::exception& e) {
@@ -550,7 +555,7 @@ void Workflow::Recover() {
     std::vector<RecoveryScene> inputs;
     std::vector<FootprintLayer> layers;
     std::string inputsText;
-    double newest = -1.0;
+    double newest = -std::numeric_limits<double>::infinity();
     for (const Scene& scene : scenes_) {
         if (scene.status != "done" && scene.status != "complete")
             continue;
@@ -565,8 +570,9 @@ void Workflow::Recover() {
             std::lock_guard<std::mutex> lock(SceneFileMutex());
             description.reset(ParserFactory::CreateSceneParser(scene.xml));
         }
-        inputs.push_back({scene.id, description->GetOrthoFilename(),
-                          description->GetVisIdxFilename(), scene.radioDif, scene.dbmPxErr});
+        inputs.push_back({scene.id, scene.input.source, scene.input.mmseg,
+                          description->GetOrthoFilename(), description->GetVisIdxFilename(),
+                          scene.radioDif, scene.dbmPxErr});
     }
     if (layers.empty())
         return;
@@ -623,6 +629,10 @@ void Workflow::Recover() {
     if (!inputs.empty()) {
         summary_.mosaic = mosaic;
         summary_.mosaicSource = source;
+        for (const Scene& scene : scenes_) {
+            if (scene.inImageSet && (scene.status == "done" || scene.status == "complete"))
+                summary_.mosaicScenes.push_back(scene.name);
+        }
         summary_.quicklooks = quicklooks;
     }
 }
