@@ -280,6 +280,7 @@ void Gdalwarp(const std::string& method, int threads) {
 }
 
 int RunSelf(const std::string& self, const std::string& args) {
+    std::fflush(stdout);
     return std::system(("'" + self + "' " + args).c_str());
 }
 

@@ -78,7 +78,25 @@ struct AxisWeights {
     int first = 0;  // window index of the first tap
     int count = 0;
     std::vector<double> w;
+    std::vector<double> normalised;  // w divided by its sum
 };
+
+// Normalises the weights when every tap lies inside [0, size); false otherwise (the general
+// kernel then clips and renormalises).
+inline bool Normalise(AxisWeights& axis, int size, std::vector<double>& out) {
+    if (axis.first < 0 || axis.first + axis.count > size)
+        return false;
+    double sum = 0.0;
+    for (int i = 0; i < axis.count; ++i)
+        sum += axis.w[i];
+    if (sum == 0.0)
+        return false;
+    out.resize(static_cast<std::size_t>(axis.count));
+    const double inverse = 1.0 / sum;
+    for (int i = 0; i < axis.count; ++i)
+        out[i] = axis.w[i] * inverse;
+    return true;
+}
 
 class Resampler : public IRasterResampler {
   public:
@@ -140,23 +158,18 @@ class Resampler : public IRasterResampler {
         switch (method_) {
             case Method::Bilinear:
                 filterRadius_ = 1;
-                kernel_ = &kernels::Bilinear;
                 break;
             case Method::Cubic:
                 filterRadius_ = 2;
-                kernel_ = &kernels::Cubic;
                 break;
             case Method::CubicSpline:
                 filterRadius_ = 2;
-                kernel_ = &kernels::BSpline;
                 break;
             case Method::Lanczos:
                 filterRadius_ = 3;
-                kernel_ = &kernels::Lanczos;
                 break;
             default:
                 filterRadius_ = 0;
-                kernel_ = nullptr;
                 break;
         }
         scaleX_ = ScaleOfStep(stepX_);
@@ -177,9 +190,7 @@ class Resampler : public IRasterResampler {
         for (std::size_t i = 0; i < table_.size(); ++i)
             table_[i] = kernels::Lanczos(static_cast<double>(i) / kTableSteps);
     }
-    double Kernel(double v) const {
-        if (method_ != Method::Lanczos)
-            return kernel_(v);
+    double Lookup(double v) const {
         const double a = std::fabs(v) * kTableSteps;
         const std::size_t i = static_cast<std::size_t>(a);
         if (i + 1 >= table_.size())
@@ -188,14 +199,28 @@ class Resampler : public IRasterResampler {
         return table_[i] + (table_[i + 1] - table_[i]) * f;
     }
 
+    template <typename K>
+    static void Fill(AxisWeights& axis, int radius, double delta, double scale, K kernel) {
+        for (int i = 0; i < axis.count; ++i)
+            axis.w[i] = kernel((i + 1 - radius - delta) * scale);
+    }
+
     void Weights(double pos, int radius, double scale, AxisWeights& axis) const {
         const double base = std::floor(pos - 0.5);
         const double delta = pos - 0.5 - base;
         axis.first = static_cast<int>(base) + 1 - radius;
         axis.count = 2 * radius;
         axis.w.resize(static_cast<std::size_t>(axis.count));
-        for (int i = 0; i < axis.count; ++i)
-            axis.w[i] = Kernel((i + 1 - radius - delta) * scale);
+        switch (method_) {
+            case Method::Bilinear:
+                return Fill(axis, radius, delta, scale, kernels::Bilinear);
+            case Method::Cubic:
+                return Fill(axis, radius, delta, scale, kernels::Cubic);
+            case Method::CubicSpline:
+                return Fill(axis, radius, delta, scale, kernels::BSpline);
+            default:
+                return Fill(axis, radius, delta, scale, [this](double v) { return Lookup(v); });
+        }
     }
 
     void Run(const gobs::Raster& window, unsigned int first, unsigned int count, std::size_t n,
@@ -402,12 +427,31 @@ class Resampler : public IRasterResampler {
         return sum / weight;
     }
 
+    // The separable kernel over taps that all lie inside the window, with normalised weights.
+    template <typename T>
+    static double Interior(const Plane<T>& p, int x0, const std::vector<double>& wx, int y0,
+                           const std::vector<double>& wy) {
+        const std::size_t nx = wx.size();
+        const double* w = wx.data();
+        double sum = 0.0;
+        for (std::size_t j = 0; j < wy.size(); ++j) {
+            const T* row = p.data + static_cast<std::ptrdiff_t>(y0 + j) * p.width + x0;
+            double line = 0.0;
+            for (std::size_t i = 0; i < nx; ++i)
+                line += row[i] * w[i];
+            sum += line * wy[j];
+        }
+        return sum;
+    }
+
     template <typename T>
     void Interpolate(const std::vector<Plane<T>>& planes, const std::vector<Validity>& validity,
                      std::size_t n, const double* x, const double* y, double* values) const {
         const Plane<T>& p0 = planes.front();
         AxisWeights ax;
         AxisWeights ay;
+        std::vector<double>& nx = ax.normalised;
+        std::vector<double>& ny = ay.normalised;
         for (std::size_t i = 0; i < n; ++i) {
             int ix = 0;
             int iy = 0;
@@ -418,17 +462,22 @@ class Resampler : public IRasterResampler {
             }
             const double sx = x[i] - p0.x0;
             const double sy = y[i] - p0.y0;
+            // Inside the window, the weights are normalised once for every channel.
+            bool interior = false;
             if (!fourSamples_) {
                 Weights(sx, radiusX_, scaleX_, ax);
                 Weights(sy, radiusY_, scaleY_, ay);
+                interior = Normalise(ax, p0.width, nx) && Normalise(ay, p0.height, ny);
             }
             for (std::size_t c = 0; c < planes.size(); ++c) {
                 const Plane<T>& p = planes[c];
+                const bool mayMiss = validity[c].template Possible<T>();
                 // As in GDAL, a position on a missing pixel has no value, whatever its
                 // neighbours hold.
-                if (validity[c].template Possible<T>() &&
-                    !validity[c].IsValid(static_cast<double>(p.At(ix, iy)))) {
+                if (mayMiss && !validity[c].IsValid(static_cast<double>(p.At(ix, iy)))) {
                     values[c * n + i] = kNaN;
+                } else if (interior && !mayMiss) {
+                    values[c * n + i] = Interior(p, ax.first, nx, ay.first, ny);
                 } else if (!fourSamples_) {
                     values[c * n + i] = Separable(p, validity[c], ax, ay);
                 } else if (method_ == Method::Bilinear) {
@@ -544,7 +593,6 @@ class Resampler : public IRasterResampler {
     int radiusX_ = 0;
     int radiusY_ = 0;
     bool fourSamples_ = false;
-    double (*kernel_)(double) = nullptr;
     std::vector<double> table_;
 };
 
