@@ -328,6 +328,9 @@ TEST(DemErrors, EachNamesWhatIsWrong) {
     testsupport::WriteDem(bare, kGrid, "", Post, {}, false, 0, false);
     const std::string good = dir.File("good.tif");
     testsupport::WriteDem(good, kGrid, "", Post);
+    const std::string placed = dir.File("placed.tif");
+    testsupport::WriteDem(placed, kGrid, kCrs, Post);
+    const ICRS local("LOCAL_CS[\"site grid\",UNIT[\"metre\",1]]");
     const std::string empty = dir.File("empty");
     std::filesystem::create_directory(empty);
     const ICRS crs("EPSG:32632");
@@ -348,6 +351,7 @@ TEST(DemErrors, EachNamesWhatIsWrong) {
         {[&] { Open(good, 1, false, static_cast<DatumType>(7)); }, "vertical datum 7"},
         {[&] { Open(good)->SetOutputVerticalDatum(DatumEllipsoid); }, "has no coordinate system"},
         {[&] { Open(good)->SetOutputVerticalDatum(DatumMathModel); }, "math model"},
+        {[&] { Open(placed)->SetInputCRS(&local); }, "No transformation from \"site grid\""},
         {[&] {
              const double x = NAN, y = 0;
              double h;

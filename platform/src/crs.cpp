@@ -152,6 +152,8 @@ std::string SearchPaths() {
 std::string MissingGrids(const OGRSpatialReference& source, const OGRSpatialReference& target) {
     const ICRS from(source), to(target);
     PJ_CONTEXT* ctx = proj_context_create();
+    // PROJ would print its failures on standard error; the caller's exception tells them.
+    proj_log_level(ctx, PJ_LOG_NONE);
     const CPLStringList paths(OSRGetPROJSearchPaths());
     proj_context_set_search_paths(ctx, paths.size(), paths.List());
     PJ* src = proj_create(ctx, from.GetWKT().c_str());
