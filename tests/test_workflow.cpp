@@ -221,8 +221,6 @@ TEST(Workflow, SampleCityEndToEnd) {
                                            "CPU:1",
                                            "--quiet"};
     const Result first = Ortho(args, dir);
-    if (first.status != 0 && first.err.find("is not available in this build") != std::string::npos)
-        GTEST_SKIP() << first.err;
     ASSERT_EQ(first.status, 0) << first.err;
     const std::string summary = ReadFile(dir.File("out/summary.json"));
     EXPECT_NE(summary.find("\"status\": \"complete\""), std::string::npos) << summary;

@@ -1,8 +1,18 @@
 #!/usr/bin/env bash
-# Installs what is missing, builds the library and runs its example on the bundled sample.
+# The main job: installs what is missing, builds, makes the synthetic sample city and runs the
+# true-ortho workflow on it, printing where the outputs are and one line per scene.
 set -euo pipefail
 root=$(cd "$(dirname "$0")/.." && pwd)
+jobs=$(nproc 2>/dev/null || echo 2)
 bash "$root/tools/install-deps.sh"
 cmake -S "$root" -B "$root/build" -DCMAKE_BUILD_TYPE=RelWithDebInfo
-cmake --build "$root/build" -j "$(nproc 2>/dev/null || echo 2)" --target silvan-filelist
-"$root/build/tools/silvan-filelist" "$root/samples/filelist.txt"
+cmake --build "$root/build" -j "$jobs" --target silvan-make-sample silvan-ortho
+
+work="$root/build/example"
+if [[ ! -f "$work/sample/master.txt" ]]; then
+    "$root/build/tools/silvan-make-sample" "$work/sample" --image-size 256
+fi
+# The sample's heights are above the WGS 84 ellipsoid, as RPC heights are.
+"$root/build/tools/silvan-ortho" "$work/sample/master.txt" --out "$work/out" \
+    --dem "$work/sample/dsm.tif" --elevref ELLIPS --resample bilinear --jobs 2 --proc CPU:1
+echo "outputs in $work/out (open mosaic.png, mosaic_source.png and the *_vis.png quicklooks)"

@@ -2,6 +2,7 @@
 
 #include "files.h"
 
+#include <kestrel/trueortho.h>
 #include <silvan/parserfactory.h>
 #include <silvan/toppfbase.h>
 #include <silvan/utils.h>
@@ -71,11 +72,6 @@ OGRSpatialReference GridSrs(const Grid& grid) {
     if (srs.importFromWkt(grid.crs.c_str()) != OGRERR_NONE)
         KESTREL_THROW(kestrel::DataException, "the grid's CRS cannot be read: " + grid.crs);
     return srs;
-}
-
-// Not yet available in the library: says which step is missing instead of writing nothing.
-[[noreturn]] void Unavailable(const std::string& step) {
-    KESTREL_THROW(kestrel::DataException, step + " is not available in this build of the library");
 }
 
 }  // namespace
@@ -224,27 +220,190 @@ void CheckSource(const SceneInput& scene) {
         GetRasterReader(dataset.get(), sourceChannels));
 }
 
-Grid SceneLayout(const Options&, const SceneInput& scene, const std::string&, double, Footprint*) {
-    CheckSource(scene);
-    Unavailable("the ortho layout (GetOrthoParams)");
+Grid SceneLayout(const Options& options, const SceneInput& scene, const std::string& crs,
+                 double pixelSize, Footprint* footprint) {
+    std::unique_ptr<kestrel::datasources::IDataset> dataset(GetRasterDataset(scene.source));
+    std::vector<unsigned int> sourceChannels, orthoChannels;
+    GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
+    std::unique_ptr<kestrel::datasources::IRasterReader> reader(
+        GetRasterReader(dataset.get(), sourceChannels));
+    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetMathModel(scene.source, scene.mmseg));
+    const std::unique_ptr<kestrel::dem::IElevationSource> surface =
+        OpenSurface(options, model.get());
+
+    // The layout traces the image border onto a raster DEM; over a TIN it takes the flat
+    // height of the TIN's centre.
+    auto* dem = dynamic_cast<kestrel::dem::IRasterDEM*>(surface.get());
+    float flatHeight = 0.0f;
+    if (dem == nullptr) {
+        double minX, minY, maxX, maxY, height = 0.0;
+        surface->GetExtent(minX, minY, maxX, maxY);
+        surface->SetInputCRS(nullptr);
+        if (!surface->GetHeight((minX + maxX) / 2, (minY + maxY) / 2, height))
+            KESTREL_THROW(kestrel::DataException, options.tin +
+                                                      ": no height at the centre of the "
+                                                      "surface, for the layout");
+        flatHeight = static_cast<float>(height);
+    }
+    const std::vector<int> channels(sourceChannels.begin(), sourceChannels.end());
+    kestrel::ogc::cs::ICRS* crsOut = nullptr;
+    kestrel::ogc::cs::GeocodingInfo* geocodingOut = nullptr;
+    kestrel::tin::Polygon<double>* footprintOut = nullptr;
+    unsigned int pixels = 0, lines = 0;
+    try {
+        // Border rays every 16 pixels; grid corners on whole multiples of the pixel size, so
+        // that the scenes' grids share one lattice.
+        GetOrthoParams(0, "PIXEL", crs, pixelSize, pixelSize, dataset.get(), model.get(), channels,
+                       dem, flatHeight, crsOut, geocodingOut, pixels, lines, footprintOut);
+    } catch (...) {
+        delete crsOut;
+        delete geocodingOut;
+        throw;
+    }
+    const std::unique_ptr<kestrel::ogc::cs::ICRS> outCrs(crsOut);
+    const std::unique_ptr<kestrel::ogc::cs::GeocodingInfo> outGeocoding(geocodingOut);
+    Footprint outFootprint(footprintOut);
+    if (!outCrs || !outGeocoding)
+        KESTREL_THROW(kestrel::DataException, scene.source + ": the layout gave no grid");
+    Grid grid;
+    grid.crs = outCrs->GetWKT();
+    grid.geoTransform = outGeocoding->GetGeoTransform();
+    grid.pixels = pixels;
+    grid.lines = lines;
+    if (footprint != nullptr)
+        *footprint = std::move(outFootprint);
+    return grid;
 }
 
-OrthoResult MakeOrtho(const Options&, const SceneInput&, const Grid&, const std::string&,
-                      const std::string&, const StepProgress&) {
-    Unavailable("the true-ortho generator");
+namespace {
+
+// Generator progress, in GDAL's style, to a step's progress.
+bool ReportProgress(double fraction, const char*, void* data) {
+    const StepProgress& progress = *static_cast<const StepProgress*>(data);
+    return !progress || progress(fraction);
 }
 
-void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>&) {
+// The true-ortho process of one scene: its generator comes from the PROC text.
+class OrthoProcess : public kestrel::processes::silvan::TOPPFBase {
+  public:
+    OrthoProcess(const std::string& procText, const kestrel::processes::TorthoJob& job,
+                 const StepProgress& progress)
+        : job_(job), progress_(progress) {
+        SetProc(procText);
+    }
+    void Execute() override {
+        std::unique_ptr<kestrel::processes::TorthoGenerator> generator(CreateTorthoGenerator());
+        generator->SetCancelFlag(GetCancelFlag());
+        generator->SetProgress(ReportProgress, const_cast<StepProgress*>(&progress_));
+        result_ = generator->Generate(job_);
+    }
+    const kestrel::processes::TorthoResult& Result() const { return result_; }
+
+  private:
+    const kestrel::processes::TorthoJob& job_;
+    const StepProgress& progress_;
+    kestrel::processes::TorthoResult result_;
+};
+
+// The gap-filling process of an image set.
+class RecoveryProcess : public kestrel::processes::silvan::TOPPFBase {
+  public:
+    RecoveryProcess(const std::string& procText, const kestrel::processes::RecoveryJob& job,
+                    const StepProgress& progress)
+        : job_(job), progress_(progress) {
+        SetProc(procText);
+    }
+    void Execute() override {
+        std::unique_ptr<kestrel::processes::OcclusionRecovery> generator(CreateOcclusionRecovery());
+        generator->SetCancelFlag(GetCancelFlag());
+        generator->SetProgress(ReportProgress, const_cast<StepProgress*>(&progress_));
+        result_ = generator->Recover(job_);
+    }
+    const kestrel::processes::TorthoRecoveryResult& Result() const { return result_; }
+
+  private:
+    const kestrel::processes::RecoveryJob& job_;
+    const StepProgress& progress_;
+    kestrel::processes::TorthoRecoveryResult result_;
+};
+
+}  // namespace
+
+OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Grid& grid,
+                      const std::string& ortho, const std::string& visibility,
+                      const StepProgress& progress) {
+    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetMathModel(scene.source, scene.mmseg));
+    const std::unique_ptr<kestrel::dem::IElevationSource> surface =
+        OpenSurface(options, model.get());
+    std::string method = options.resample;
+    const std::unique_ptr<kestrel::utils::IRasterResampler> resampler(GetResampler(method));
+    const kestrel::ogc::cs::ICRS crs(grid.crs);
+
+    kestrel::processes::TorthoJob job;
+    job.sourcePath = scene.source;
+    job.channels = scene.channels;
+    job.model = model.get();
+    job.surface = surface.get();
+    job.resampling = resampler->GetMethod();
+    job.crs = &crs;
+    job.geocoding = kestrel::ogc::cs::GeocodingInfo(grid.geoTransform);
+    job.pixels = grid.pixels;
+    job.lines = grid.lines;
+    job.orthoPath = ortho;
+    job.visibilityPath = visibility;
+    job.format = kestrel::core::FType2FormatName(options.format);
+
+    OrthoProcess process(options.proc, job, progress);
+    process.Execute();
+    if (!process.Result().completed)
+        KESTREL_THROW(kestrel::DataException, scene.source + ": the ortho was cancelled");
+    OrthoResult result;
+    result.orthoNoData = job.orthoNoData;
+    double noData = 0.0;
+    if (!options.dem.empty()) {
+        std::unique_ptr<kestrel::datasources::IDataset> dem(GetRasterDataset(options.dem));
+        const auto* raster = dynamic_cast<const kestrel::datasources::IRasterDataset*>(dem.get());
+        if (raster != nullptr && raster->GetNoDataValue(1, noData))
+            result.elevationNoData = noData;
+    }
+    return result;
+}
+
+void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>& footprint) {
     {
         GdalErrors errors;
         CreateVector(path, errors);
     }
-    Unavailable("the footprint writer (WriteSceneFootprint)");
+    WriteSceneFootprint(path, &footprint);
 }
 
-void RecoverMosaic(const Options&, const std::vector<RecoveryScene>&, const Grid&,
-                   const std::string&, const std::string&, const StepProgress&) {
-    Unavailable("occlusion recovery");
+void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes, const Grid&,
+                   const std::string& mosaic, const std::string& source,
+                   const StepProgress& progress) {
+    std::vector<std::unique_ptr<kestrel::mathmodel::IMathModel>> models;
+    kestrel::processes::RecoveryJob job;
+    for (const RecoveryScene& scene : scenes) {
+        models.emplace_back(GetMathModel(scene.source, scene.mmseg));
+        kestrel::processes::RecoveryScene input;
+        input.orthoPath = scene.ortho;
+        input.visibilityPath = scene.visibility;
+        input.radiometricLevel = static_cast<int>(scene.radioDif);
+        input.dbmPixelError = scene.dbmPxErr;
+        input.model = models.back().get();
+        job.scenes.push_back(input);
+    }
+    // Heights for the viewing angles, in the models' datum.
+    const std::unique_ptr<kestrel::dem::IElevationSource> surface =
+        OpenSurface(options, models.empty() ? nullptr : models.front().get());
+    job.surface = surface.get();
+    job.mosaicPath = mosaic;
+    job.sourcePath = source;
+    job.format = kestrel::core::FType2FormatName(options.format);
+
+    RecoveryProcess process(options.proc, job, progress);
+    process.Execute();
+    if (!process.Result().completed)
+        KESTREL_THROW(kestrel::DataException, "occlusion recovery was cancelled");
 }
 
 void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid,
