@@ -51,6 +51,7 @@ int main(int argc, char** argv) {
         ortho::Progress progress(stderr, ortho::IsTerminal(stderr), options.quiet);
         ortho::Workflow workflow(options, progress);
         const int status = workflow.Run();
+        progress.Done();
         if (!options.quiet)
             PrintScenes(workflow.Summary(), workflow.SummaryPath());
         return status;

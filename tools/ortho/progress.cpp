@@ -84,6 +84,12 @@ void Progress::End(const std::string& scene, bool succeeded, double seconds,
         Draw(true);
 }
 
+void Progress::Done() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    Clear();
+    std::fflush(stream_);
+}
+
 void Progress::Info(const std::string& text) {
     std::lock_guard<std::mutex> lock(mutex_);
     if (quiet_)

@@ -28,6 +28,9 @@ class Progress {
     void End(const std::string& scene, bool succeeded, double seconds, const std::string& error);
 
     // A line of its own: informational (not shown when quiet) or an error (always shown).
+    // Takes the bar off the screen, before other output follows.
+    void Done();
+
     void Info(const std::string& text);
     void Error(const std::string& text);
 
