@@ -19,7 +19,8 @@ void Usage(std::FILE* out) {
                  "heights), oblique images with fitted RPCs (north.tif, east.tif, ...) and\n"
                  "master.txt, the master parameter file that names the images.\n"
                  "  --box           one box building seen from two opposite sides instead\n"
-                 "  --image-size N  image width and height in pixels (default 512)\n"
+                 "  --image-size N  image width and height in pixels (default 256; the images of\n"
+                 "                  larger ones see beyond the sample's ground model)\n"
                  "  --threads N     rendering threads (default: all cores)\n");
 }
 
@@ -40,7 +41,7 @@ unsigned int Number(const char* option, const char* text) {
 int main(int argc, char** argv) {
     std::string dir;
     bool box = false, quiet = false;
-    unsigned int size = 512, threads = 0;
+    unsigned int size = 256, threads = 0;
     for (int i = 1; i < argc; ++i) {
         const std::string a = argv[i];
         if (a == "--help" || a == "-h") {
