@@ -337,6 +337,50 @@ TEST_F(BoxFixture, CancelledRunStopsAfterTheTileAtHandAndLeavesNoOutput) {
     ExpectNoOutputs(dir);
 }
 
+TEST_F(BoxFixture, ReaderAndWritersGiveWhatPathsGive) {
+    using kestrel::datasources::BasicReader;
+    using kestrel::datasources::BasicWriter;
+    auto writersJob = [&](BasicReader& reader, std::unique_ptr<BasicWriter>& ortho,
+                          std::unique_ptr<BasicWriter>& visibility) {
+        ortho = std::make_unique<BasicWriter>(dir.File("w-ortho.tif"),
+                                              std::vector<unsigned int>{1, 2, 3}, "GTiff", "");
+        visibility = std::make_unique<BasicWriter>(dir.File("w-visibility.tif"),
+                                                   std::vector<unsigned int>{1}, "GTiff", "");
+        TorthoJob job = Job();
+        job.sourcePath.clear(), job.orthoPath.clear(), job.visibilityPath.clear();
+        job.source = &reader, job.orthoWriter = ortho.get(),
+        job.visibilityWriter = visibility.get();
+        return job;
+    };
+    kestrel::processes::GeneratorSettings settings;
+    settings.threadCount = 2;
+    BasicReader reader(sample.images[0].path);
+    {
+        // Cancelled after the first tile: the writers are left unclosed and leave nothing.
+        bool cancel = false;
+        Cancelling progress{&cancel, true};
+        TorthoGenerator generator(settings);
+        generator.SetCancelFlag(&cancel);
+        generator.SetProgress(&Cancelling::Progress, &progress);
+        std::unique_ptr<BasicWriter> ortho, visibility;
+        EXPECT_FALSE(generator.Generate(writersJob(reader, ortho, visibility)).completed);
+        EXPECT_FALSE(ortho->IsClosed());
+        ortho.reset(), visibility.reset();
+        ExpectNoOutputs(dir);
+    }
+    std::unique_ptr<BasicWriter> ortho, visibility;
+    ASSERT_TRUE(
+        TorthoGenerator(settings).Generate(writersJob(reader, ortho, visibility)).completed);
+    EXPECT_TRUE(ortho->IsClosed() && visibility->IsClosed());
+    ASSERT_TRUE(TorthoGenerator(settings).Generate(Job()).completed);
+    for (int band = 1; band <= 3; ++band) {
+        const std::vector<double> expected = ReadBand(dir.File("ortho.tif"), band);
+        ASSERT_FALSE(expected.empty());
+        EXPECT_TRUE(ReadBand(dir.File("w-ortho.tif"), band) == expected) << band;
+    }
+    EXPECT_TRUE(ReadBand(dir.File("w-visibility.tif")) == ReadBand(dir.File("visibility.tif")));
+}
+
 // The same height everywhere, with no edge.
 class FlatEverywhere : public kestrel::dem::IElevationSource {
   public:

@@ -9,6 +9,7 @@
 #include <kestrel/elevation.h>
 #include <kestrel/export.h>
 #include <kestrel/mathmodel.h>
+#include <kestrel/rasterio.h>
 #include <kestrel/resampler.h>
 
 namespace kestrel {
@@ -93,6 +94,9 @@ struct KESTREL_API TorthoJob {
     // every channel. All channels must share one data type, which the ortho takes.
     std::string sourcePath;
     std::vector<unsigned int> channels;
+    // When given, the source is read through this reader (its channels, its data type) instead
+    // of sourcePath and channels. Not owned; the generator's threads read it under a lock.
+    datasources::IRasterReader* source = nullptr;
     // The source's math model. Ground points reach it in its own CRS (x, y transformed from the
     // ortho's CRS); heights are passed as the surface gives them.
     const mathmodel::IMathModel* model = nullptr;
@@ -111,6 +115,12 @@ struct KESTREL_API TorthoJob {
     // Outputs, written under a temporary name beside the final one and renamed when complete.
     std::string orthoPath, visibilityPath;
     std::string format = "GTiff";  // a GDAL driver that can create files
+    // When given (both or neither), the outputs go to these writers instead of orthoPath and
+    // visibilityPath. Not owned. The generator describes and creates them and closes them only
+    // when the run completes; after a cancelled or failed run the caller deletes them unclosed,
+    // which leaves nothing under their final names.
+    datasources::IRasterWriter* orthoWriter = nullptr;
+    datasources::IRasterWriter* visibilityWriter = nullptr;
     // Value of ortho pixels that are not seen. The source's own no-data values are never used.
     double orthoNoData = 0.0;
     // Metres a ground point may lie below the surface that the sensor sees at its image position

@@ -16,7 +16,9 @@
 #include <algorithm>
 #include <array>
 #include <cmath>
+#include <cstring>
 #include <limits>
+#include <mutex>
 
 namespace kestrel {
 namespace processes {
@@ -50,6 +52,11 @@ struct Plan {
     Kernel kernel;
     std::vector<int> bands;
     int imageWidth, imageHeight;
+    std::string sourceName;  // for messages
+    GDALDataType dataType = GDT_Unknown;
+    // The job's reader and the lock its reads share; without one each thread opens the file.
+    datasources::IRasterReader* reader = nullptr;
+    std::mutex* readLock = nullptr;
     std::vector<char> hasNoData;
     std::vector<float> noData;
     // Output pixels by which a tile's surface is extended on each side so that every surface
@@ -57,6 +64,85 @@ struct Plan {
     double heightRange = 0;  // metres between the lowest and the highest surface, plus 1
     Extension global;        // for tiles whose corners have no line of sight
     const ogc::cs::CoordinateTransformation* toModel = nullptr;  // null: same CRS
+};
+
+// Reads a window of the source as Float32, band after band, like trueortho::ReadWindow: parts
+// outside the image are left as they are in the buffer.
+void ReadSource(const Plan& plan, GDALDataset* dataset, int x, int y, int width, int height,
+                float* buffer) {
+    if (plan.reader == nullptr) {
+        trueortho::ReadWindow(*dataset, plan.sourceName, plan.bands, x, y, width, height, buffer);
+        return;
+    }
+    const int x0 = std::max(x, 0), y0 = std::max(y, 0);
+    const int x1 = std::min(x + width, plan.imageWidth);
+    const int y1 = std::min(y + height, plan.imageHeight);
+    if (x1 <= x0 || y1 <= y0)
+        return;
+    std::unique_ptr<gobs::Raster> raster;
+    {
+        std::lock_guard<std::mutex> lock(*plan.readLock);
+        raster.reset(plan.reader->ReadWindow(
+            static_cast<unsigned int>(x0), static_cast<unsigned int>(y0),
+            static_cast<unsigned int>(x1 - x0), static_cast<unsigned int>(y1 - y0)));
+    }
+    const GDALDataType type = static_cast<GDALDataType>(raster->GetDataType());
+    const int size = static_cast<int>(raster->GetValueSize());
+    for (size_t b = 0; b < plan.bands.size(); ++b) {
+        const auto* plane =
+            static_cast<const unsigned char*>(raster->GetChannelData(static_cast<unsigned int>(b)));
+        for (int j = y0; j < y1; ++j)
+            GDALCopyWords64(plane + static_cast<size_t>(j - y0) * (x1 - x0) * size, type, size,
+                            buffer + (b * height + (j - y)) * static_cast<size_t>(width) + (x0 - x),
+                            GDT_Float32, sizeof(float), x1 - x0);
+    }
+}
+
+// An output of the run: a file of the generator's own, or a writer the caller gave.
+class TileOutput {
+  public:
+    TileOutput(const TorthoJob& job, datasources::IRasterWriter* writer, const std::string& path,
+               int bands, GDALDataType type, double noData)
+        : writer_(writer), bands_(static_cast<unsigned int>(bands)) {
+        if (writer_ == nullptr) {
+            file_ = std::make_unique<OutputRaster>(path, job.format, job.pixels, job.lines, bands,
+                                                   type, job.crs, job.geocoding, noData);
+            return;
+        }
+        writer_->SetSize(job.pixels, job.lines);
+        writer_->SetDataType(static_cast<datasources::DataType>(type));
+        writer_->SetChannelCount(bands_);
+        writer_->SetCRS(job.crs);
+        writer_->SetGeocoding(job.geocoding);
+        writer_->SetNoDataValue(noData);
+        writer_->Create();
+    }
+
+    // Writes a window of every band from a Float32 buffer (band after band); thread-safe.
+    void Write(int x, int y, int width, int height, const float* buffer) {
+        if (file_) {
+            file_->Write(x, y, width, height, buffer);
+            return;
+        }
+        gobs::Raster raster(static_cast<unsigned int>(width), static_cast<unsigned int>(height),
+                            bands_, datasources::DataType::Float32, gobs::Raster::Initial::Unset);
+        std::memcpy(raster.GetData(), buffer, raster.GetByteSize());
+        std::lock_guard<std::mutex> lock(mutex_);
+        writer_->WriteWindow(raster, static_cast<unsigned int>(x), static_cast<unsigned int>(y));
+    }
+
+    void Commit() {
+        if (file_)
+            file_->Commit();
+        else
+            writer_->Close();
+    }
+
+  private:
+    std::unique_ptr<OutputRaster> file_;
+    datasources::IRasterWriter* writer_;
+    unsigned int bands_;
+    std::mutex mutex_;
 };
 
 // Per-thread state: a source dataset of its own (GDAL datasets are not shared between
@@ -190,7 +276,7 @@ void ResampleWithGiven(const Plan& plan, Worker& w, TorthoResult& counts) {
     }
 }
 
-void ProcessTile(const Plan& plan, Worker& w, OutputRaster& ortho, OutputRaster& visibility, int tx,
+void ProcessTile(const Plan& plan, Worker& w, TileOutput& ortho, TileOutput& visibility, int tx,
                  int ty, int tw, int th, const RunControl& control, TorthoResult& counts) {
     const TorthoJob& job = *plan.job;
     // The tile with its surroundings, so that occluders outside the tile are projected too.
@@ -267,8 +353,7 @@ void ProcessTile(const Plan& plan, Worker& w, OutputRaster& ortho, OutputRaster&
     src.height = anyInside ? zy1 - zy0 + 2 * radius : 0;
     src.values.assign(static_cast<size_t>(src.width) * src.height * src.bands, 0.0f);
     if (anyInside)
-        trueortho::ReadWindow(*w.source, job.sourcePath, plan.bands, src.x0, src.y0, src.width,
-                              src.height, src.values.data());
+        ReadSource(plan, w.source.get(), src.x0, src.y0, src.width, src.height, src.values.data());
 
     // Each output pixel: seen, hidden, outside, or without height.
     const size_t tileSize = static_cast<size_t>(tw) * th;
@@ -319,8 +404,11 @@ void Require(bool condition, const std::string& message, const SourceLocation& w
         KESTREL_THROW_AT(where, DataException, message);
 }
 
+void ReadFileSource(const TorthoJob& job, GDALDataset& source, Plan& plan,
+                    const SourceLocation& where);
+
 // Checks the job and opens what the tiles share; throws DataException saying what is wrong.
-Plan MakePlan(const TorthoJob& job, GDALDataset& source) {
+Plan MakePlan(const TorthoJob& job, GDALDataset* source) {
     const SourceLocation where = KESTREL_HERE;
     Require(job.model != nullptr, "True ortho: no math model given", where);
     Require(job.surface != nullptr, "True ortho: no surface model given", where);
@@ -334,10 +422,17 @@ Plan MakePlan(const TorthoJob& job, GDALDataset& source) {
             FormatString("True ortho: output layout of %u x %u pixels is too large", job.pixels,
                          job.lines),
             where);
-    Require(!job.orthoPath.empty() && !job.visibilityPath.empty() &&
-                job.orthoPath != job.visibilityPath,
-            "True ortho: the ortho and the visibility index need two different output paths",
+    Require((job.orthoWriter == nullptr) == (job.visibilityWriter == nullptr),
+            "True ortho: give writers for both the ortho and the visibility index, or for neither",
             where);
+    if (job.orthoWriter != nullptr)
+        Require(job.orthoWriter != job.visibilityWriter,
+                "True ortho: the ortho and the visibility index need two different writers", where);
+    else
+        Require(!job.orthoPath.empty() && !job.visibilityPath.empty() &&
+                    job.orthoPath != job.visibilityPath,
+                "True ortho: the ortho and the visibility index need two different output paths",
+                where);
     Require(job.tileSize >= 16 && job.tileSize <= 8192,
             FormatString("True ortho: tile size %u is outside 16 to 8192", job.tileSize), where);
     Require(std::isfinite(job.heightTolerance) && job.heightTolerance >= 0,
@@ -349,6 +444,37 @@ Plan MakePlan(const TorthoJob& job, GDALDataset& source) {
     plan.job = &job;
     plan.kernel =
         job.resampler != nullptr ? Kernel::Bilinear : trueortho::KernelByName(job.resampling);
+    if (job.source != nullptr) {
+        datasources::IRasterReader& reader = *job.source;
+        plan.reader = &reader;
+        plan.sourceName = reader.GetPath();
+        plan.imageWidth = static_cast<int>(reader.GetWidth());
+        plan.imageHeight = static_cast<int>(reader.GetHeight());
+        plan.dataType = static_cast<GDALDataType>(reader.GetDataType());
+        for (unsigned int c = 0; c < reader.GetChannelCount(); ++c) {
+            plan.bands.push_back(static_cast<int>(c + 1));
+            double nd = 0;
+            const bool has = reader.GetNoDataValue(c, nd);
+            plan.hasNoData.push_back(has ? 1 : 0);
+            plan.noData.push_back(static_cast<float>(nd));
+        }
+        Require(!plan.bands.empty(), "True ortho: the source reader has no channels", where);
+    } else {
+        ReadFileSource(job, *source, plan, where);
+    }
+    Require(job.model->GetImageWidth() == static_cast<unsigned int>(plan.imageWidth) &&
+                job.model->GetImageHeight() == static_cast<unsigned int>(plan.imageHeight),
+            FormatString("True ortho: the math model is for a %u x %u image, but %s is %d x %d",
+                         job.model->GetImageWidth(), job.model->GetImageHeight(),
+                         plan.sourceName.c_str(), plan.imageWidth, plan.imageHeight),
+            where);
+    return plan;
+}
+
+// The plan's source from the file at job.sourcePath: its size, channels and no-data values.
+void ReadFileSource(const TorthoJob& job, GDALDataset& source, Plan& plan,
+                    const SourceLocation& where) {
+    plan.sourceName = job.sourcePath;
     plan.imageWidth = source.GetRasterXSize();
     plan.imageHeight = source.GetRasterYSize();
     const int count = source.GetRasterCount();
@@ -377,13 +503,7 @@ Plan MakePlan(const TorthoJob& job, GDALDataset& source) {
         plan.hasNoData.push_back(has ? 1 : 0);
         plan.noData.push_back(static_cast<float>(nd));
     }
-    Require(job.model->GetImageWidth() == static_cast<unsigned int>(plan.imageWidth) &&
-                job.model->GetImageHeight() == static_cast<unsigned int>(plan.imageHeight),
-            FormatString("True ortho: the math model is for a %u x %u image, but %s is %d x %d",
-                         job.model->GetImageWidth(), job.model->GetImageHeight(),
-                         job.sourcePath.c_str(), plan.imageWidth, plan.imageHeight),
-            where);
-    return plan;
+    plan.dataType = type;
 }
 
 // The surface must cover the output grid: a grid partly without heights is a wrong input
@@ -457,7 +577,7 @@ void Survey(const TorthoJob& job, Plan& plan, Worker& w, const RunControl& contr
         KESTREL_THROW(DataException,
                       FormatString("True ortho: the math model projects the output grid outside "
                                    "the image %s (%d x %d): layout and image do not match",
-                                   job.sourcePath.c_str(), plan.imageWidth, plan.imageHeight));
+                                   plan.sourceName.c_str(), plan.imageWidth, plan.imageHeight));
     plan.global = global;
 }
 
@@ -465,8 +585,12 @@ void Survey(const TorthoJob& job, Plan& plan, Worker& w, const RunControl& contr
 
 TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
     RunControl control(CancelFlag(), Progress(), ProgressData());
-    DatasetPtr source = trueortho::OpenRaster(job.sourcePath, "source image");
-    Plan plan = MakePlan(job, *source);
+    DatasetPtr source;
+    if (job.source == nullptr)
+        source = trueortho::OpenRaster(job.sourcePath, "source image");
+    std::mutex readLock;
+    Plan plan = MakePlan(job, source.get());
+    plan.readLock = &readLock;
     job.surface->SetInputCRS(job.crs);
     CheckSurfaceCovers(job);
     std::unique_ptr<ogc::cs::CoordinateTransformation> toModel;
@@ -483,12 +607,10 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
     if (control.Stopped())
         return result;
 
-    const GDALDataType type = source->GetRasterBand(plan.bands[0])->GetRasterDataType();
-    OutputRaster ortho(job.orthoPath, job.format, job.pixels, job.lines,
-                       static_cast<int>(plan.bands.size()), type, job.crs, job.geocoding,
-                       job.orthoNoData);
-    OutputRaster visibility(job.visibilityPath, job.format, job.pixels, job.lines, 1, GDT_Byte,
-                            job.crs, job.geocoding, VISIBILITY_NODATA);
+    TileOutput ortho(job, job.orthoWriter, job.orthoPath, static_cast<int>(plan.bands.size()),
+                     plan.dataType, job.orthoNoData);
+    TileOutput visibility(job, job.visibilityWriter, job.visibilityPath, 1, GDT_Byte,
+                          VISIBILITY_NODATA);
 
     const unsigned int tile = job.tileSize;
     const unsigned int tilesX = (job.pixels + tile - 1) / tile,
@@ -501,7 +623,8 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
             std::unique_ptr<Worker>& w = workers[thread];
             if (!w) {
                 w = std::make_unique<Worker>();
-                w->source = trueortho::OpenRaster(job.sourcePath, "source image");
+                if (plan.reader == nullptr)
+                    w->source = trueortho::OpenRaster(job.sourcePath, "source image");
                 if (toModel)
                     w->toModel = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel);
             }
@@ -512,7 +635,7 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
             ProcessTile(plan, *w, ortho, visibility, tx, ty, tw, th, control, counts[thread]);
         });
     if (control.Stopped())
-        return result;  // the outputs discard themselves
+        return result;  // the outputs discard themselves; writers are left unclosed
     ortho.Commit();
     visibility.Commit();
     for (const TorthoResult& c : counts) {
