@@ -2,8 +2,9 @@
 
 #include <kestrel/exception.h>
 
+#include "../factoryslot.h"
+
 #include <algorithm>
-#include <mutex>
 #include <thread>
 #include <utility>
 
@@ -75,22 +76,13 @@ class BuiltInFactory final : public TrueOrthoFactoryImpl {
     }
 };
 
-struct ImplSlot {
-    std::mutex mutex;
-    std::shared_ptr<TrueOrthoFactoryImpl> builtIn = std::make_shared<BuiltInFactory>();
-    std::shared_ptr<TrueOrthoFactoryImpl> current = builtIn;
-};
-
-ImplSlot& Slot() {
-    static ImplSlot slot;
+FactorySlot<TrueOrthoFactoryImpl>& Slot() {
+    static FactorySlot<TrueOrthoFactoryImpl> slot(std::make_shared<BuiltInFactory>());
     return slot;
 }
 
-// The installed implementation, held for the duration of one call even if it is replaced
-// meanwhile.
 std::shared_ptr<TrueOrthoFactoryImpl> Current() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().current;
+    return Slot().Current();
 }
 
 }  // namespace
@@ -117,17 +109,12 @@ ITrueOrtho* TrueOrthoFactory::CreateCudaGenerator(GeneratorType type, unsigned i
 }
 
 std::shared_ptr<TrueOrthoFactoryImpl> TrueOrthoFactory::GetDefaultImplementation() {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    return Slot().builtIn;
+    return Slot().BuiltIn();
 }
 
 std::shared_ptr<TrueOrthoFactoryImpl> TrueOrthoFactory::SetImplementation(
     std::shared_ptr<TrueOrthoFactoryImpl> impl) {
-    std::lock_guard<std::mutex> lock(Slot().mutex);
-    if (!impl)
-        impl = Slot().builtIn;
-    std::swap(Slot().current, impl);
-    return impl;
+    return Slot().Install(std::move(impl));
 }
 
 ScopedTrueOrthoFactoryImpl::ScopedTrueOrthoFactoryImpl(std::shared_ptr<TrueOrthoFactoryImpl> impl)
