@@ -4,6 +4,7 @@
 #include <kestrel/trueortho.h>
 #include <samplecity.h>
 
+#include "rasterread.h"
 #include "support.h"
 
 #include <gdal_priv.h>
@@ -77,19 +78,7 @@ TEST(SampleCity, RpcsAgreeWithTheCameraThroughGdalsTransformer) {
     }
 }
 
-// A raster band read whole, as doubles.
-std::vector<double> ReadBand(const std::string& path, int band = 1) {
-    std::unique_ptr<GDALDataset> ds(
-        GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
-    if (!ds)
-        return {};
-    const int w = ds->GetRasterXSize(), h = ds->GetRasterYSize();
-    std::vector<double> v(static_cast<size_t>(w) * h);
-    if (ds->GetRasterBand(band)->RasterIO(GF_Read, 0, 0, w, h, v.data(), w, h, GDT_Float64, 0, 0,
-                                          nullptr) != CE_None)
-        return {};
-    return v;
-}
+using testsupport::ReadBand;
 
 // A box building 20 m high on flat ground, seen from the north at 30 degrees off nadir, with its
 // ortho grid at 0.5 m over the whole surface model.

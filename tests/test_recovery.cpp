@@ -3,6 +3,7 @@
 #include <kestrel/trueortho.h>
 #include <samplecity.h>
 
+#include "rasterread.h"
 #include "support.h"
 
 #include <gdal_priv.h>
@@ -13,20 +14,8 @@
 namespace {
 
 using namespace kestrel::processes;
+using testsupport::ReadBand;
 using testsupport::TempDir;
-
-std::vector<double> ReadBand(const std::string& path, int band = 1) {
-    std::unique_ptr<GDALDataset> ds(
-        GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
-    if (!ds)
-        return {};
-    const int w = ds->GetRasterXSize(), h = ds->GetRasterYSize();
-    std::vector<double> v(static_cast<size_t>(w) * h);
-    if (ds->GetRasterBand(band)->RasterIO(GF_Read, 0, 0, w, h, v.data(), w, h, GDT_Float64, 0, 0,
-                                          nullptr) != CE_None)
-        return {};
-    return v;
-}
 
 // Two orthos of one box building, from the north (scene 1) and the south (scene 2), made once
 // for all tests.
