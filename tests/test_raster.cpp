@@ -1,4 +1,5 @@
 // Raster datasets, readers and writers on GDAL, and the utility functions that make them.
+#include <algorithm>
 #include <cstdlib>
 #include <memory>
 #include <string>
@@ -120,6 +121,24 @@ std::string RunCommand(const std::string& command) {
 }
 
 }  // namespace
+
+// ---------------------------------------------------------------------------------------------
+// Rasters in memory
+
+// A new raster is zero-filled even where its memory held other values before (the allocator
+// hands back freed blocks as they were).
+TEST(Raster, NewRastersAreZeroWhateverTheMemoryHeldBefore) {
+    for (int round = 0; round < 4; ++round) {
+        {
+            volatile std::vector<double> previous(8192, -1.5);  // freed just before
+        }
+        const Raster raster(64, 64, 2, DataType::Float32);
+        const float* values = static_cast<const float*>(raster.GetData());
+        ASSERT_TRUE(std::all_of(values, values + raster.GetPlaneSize() * 2, [](float v) {
+            return v == 0.0f;
+        })) << round;
+    }
+}
 
 // ---------------------------------------------------------------------------------------------
 // Datasets
