@@ -1,5 +1,7 @@
 #include "files.h"
 
+#include <kestrel/rasterio.h>
+
 #include <chrono>
 #include <filesystem>
 #include <limits>
@@ -30,11 +32,7 @@ std::string UniquePartName(const std::string& path) {
 }
 
 void Publish(const std::string& part, const std::string& path) {
-    std::error_code ec;
-    fs::rename(part, path, ec);
-    if (ec)
-        KESTREL_THROW(kestrel::FileAccessException, path, kestrel::FileAccessException::WriteFailed,
-                      "cannot be renamed from " + part + ": " + ec.message());
+    kestrel::datasources::PublishDataset(part, path);
 }
 
 bool FileExists(const std::string& path) {
