@@ -17,10 +17,7 @@
 
 #include "support.h"
 
-#if defined(_WIN32)
-#define popen _popen
-#define pclose _pclose
-#else
+#if !defined(_WIN32)
 #include <sys/resource.h>
 #include <csignal>
 #endif
@@ -107,19 +104,6 @@ std::string MakeImage(const TempDir& dir, const std::string& name, const ImageSp
     xml += "</VRTDataset>\n";
     testsupport::WriteFile(vrt, xml);
     return vrt;
-}
-
-std::string RunCommand(const std::string& command) {
-    std::string output;
-    FILE* pipe = popen(command.c_str(), "r");
-    if (pipe == nullptr)
-        return output;
-    char buffer[4096];
-    std::size_t n = 0;
-    while ((n = fread(buffer, 1, sizeof buffer, pipe)) > 0)
-        output.append(buffer, n);
-    pclose(pipe);
-    return output;
 }
 
 }  // namespace
@@ -358,10 +342,9 @@ TEST(RasterWriter, EveryFileTypeRoundTripsWithItsGeoreferencing) {
             EXPECT_EQ(refused.count(type), 0u) << "not refused";
         } catch (const kestrel::Exception& e) {
             const auto reason = refused.find(type);
-            EXPECT_TRUE(reason != refused.end()) << e.what();
-            if (reason != refused.end())
-                EXPECT_NE(std::string(e.what()).find(reason->second), std::string::npos)
-                    << e.what();
+            EXPECT_TRUE(reason != refused.end() &&
+                        std::string(e.what()).find(reason->second) != std::string::npos)
+                << e.what();
             continue;
         }
         std::unique_ptr<GDALDataset> ds(
