@@ -1,5 +1,6 @@
 // The command line of silvan-ortho: options and inputs checked before any work, --version, and
-// images given instead of a master file, run as a user runs them.
+// images given instead of a master file, run as a user runs them; and the error messages of the
+// other commands.
 #include "program.h"
 
 #include <gdal_priv.h>
@@ -166,3 +167,27 @@ TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
 }
 
 }  // namespace
+
+// The other commands print the message and the file it is about, never where in the code the
+// error was raised.
+TEST(CommandMessages, NameTheFileWithoutCodeLocations) {
+    TempDir dir;
+    const std::string tools = SILVAN_TOOLS_DIR;
+    const std::string absent = dir.File("absent.tif");
+    const struct {
+        std::string program;
+        std::vector<std::string> args;
+    } cases[] = {
+        {"silvan-filelist", {absent}},
+        {"silvan-layout", {absent, "--dem", absent}},
+        {"silvan-height", {absent}},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.program);
+        const ProgramResult r = RunProgram(tools + "/" + c.program, c.args, dir);
+        EXPECT_EQ(r.status, 1);
+        EXPECT_EQ(r.err.rfind(c.program + ": ", 0), 0u) << r.err;
+        EXPECT_NE(r.err.find(absent), std::string::npos) << r.err;
+        EXPECT_EQ(r.err.find("(in "), std::string::npos) << r.err;
+    }
+}
