@@ -160,6 +160,16 @@ TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
     EXPECT_NE(summary.find("\"status\": \"complete\""), std::string::npos) << summary;
     EXPECT_TRUE(fs::exists(dir.File("out/mosaic.tif")));
 
+    // A master file whose line names a text file: said plainly.
+    const std::string wrong =
+        WriteFile(dir.File("wrong.txt"), dir.File("sample/master.txt") + ";;0;;;0;;0;ORTHO\n");
+    const ProgramResult text =
+        Ortho({wrong, "--out", dir.File("wrong"), "--dem", dir.File("sample/dsm.tif")}, dir);
+    EXPECT_EQ(text.status, 1);
+    EXPECT_NE(text.err.find(dir.File("sample/master.txt") + ": not a raster that GDAL can read"),
+              std::string::npos)
+        << text.err;
+
     const auto madeAt = fs::last_write_time(written);
     const ProgramResult second = Ortho(args, dir);
     EXPECT_EQ(second.status, 0) << second.err;

@@ -5,6 +5,7 @@
 #include <kestrel/exception.h>
 
 #include <exception>
+#include <filesystem>
 #include <string>
 
 namespace tools {
@@ -27,10 +28,15 @@ inline std::string UserMessage(const std::exception& error) {
     if (file == nullptr || file->GetFileName().empty())
         return error.what();
     std::string message = file->GetErrorMessage();
-    if (message.empty())
-        message = dynamic_cast<const kestrel::FileNotFoundException*>(&error) != nullptr
-                      ? "not found or not readable"
-                      : "cannot be used";
+    if (message.empty() && dynamic_cast<const kestrel::FileNotFoundException*>(&error) != nullptr) {
+        // Said without a message only by the raster opening, which cannot tell the two apart.
+        std::error_code ec;
+        message = std::filesystem::exists(file->GetFileName(), ec)
+                      ? "not a raster that GDAL can read"
+                      : "not found";
+    } else if (message.empty()) {
+        message = "cannot be used";
+    }
     if (message.find(file->GetFileName()) != std::string::npos)
         return message;
     return file->GetFileName() + ": " + message;
