@@ -18,6 +18,10 @@ bool IElevationSource::GetHeight(double x, double y, double& height) const {
     height = h;
     return true;
 }
+
+bool IElevationSource::GetHeightRange(double, double, double, double, double&, double&) const {
+    return false;
+}
 }  // namespace dem
 
 namespace mathmodel {

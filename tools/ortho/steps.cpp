@@ -187,16 +187,52 @@ void CheckOptions(const Options& options) {
     std::string method = options.resample;
     std::unique_ptr<kestrel::utils::IRasterResampler> resampler(GetResampler(method));
     kestrel::core::FType2FormatName(options.format);
+    CheckSurface(options);
+}
+
+namespace {
+
+// The datum and unit to open the surface with, from its file and the options.
+kestrel::dem::SurfaceHeights ResolveSurface(const Options& options) {
+    kestrel::ogc::cs::DatumType declared = kestrel::ogc::cs::DatumMSL;
+    if (!options.elevref.empty())
+        declared = GetVertDatum(options.elevref);
+    const std::string& path = options.dem.empty() ? options.tin : options.dem;
+    try {
+        return kestrel::dem::ResolveSurfaceHeights(path,
+                                                   options.elevref.empty() ? nullptr : &declared,
+                                                   options.elunits, "--elevref", "--elunits");
+    } catch (const kestrel::DataException& e) {
+        KESTREL_THROW(kestrel::DataException,
+                      (options.dem.empty() ? "--tin " : "--dem ") + std::string(e.what()));
+    }
+}
+
+}  // namespace
+
+void CheckSurface(const Options& options) {
+    if (!options.dem.empty() || !options.tin.empty())
+        ResolveSurface(options);
 }
 
 std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
     const Options& options, const kestrel::mathmodel::IMathModel* model) {
+    const kestrel::dem::SurfaceHeights heights = ResolveSurface(options);
     double offset = 0.0, scale = 1.0;
     GetElFactor(options.elfactor, offset, scale);
-    if (!options.elunits.empty())
-        GetElUnits(options.elunits, scale);
-    kestrel::ogc::cs::DatumType datum = GetVertDatum(options.elevref);
+    // The unit once: the declared one where the file says none (the source applies the file's).
+    scale *= heights.unitScale;
+    kestrel::ogc::cs::DatumType datum = heights.datum;
     const kestrel::ogc::cs::DatumType modelDatum = GetModelDatum(model);
+    if (heights.file.known && !options.elevref.empty() &&
+        GetVertDatum(options.elevref) == kestrel::ogc::cs::DatumMathModel &&
+        modelDatum != heights.file.datum) {
+        KESTREL_THROW(kestrel::DataException,
+                      (options.dem.empty() ? "--tin " + options.tin : "--dem " + options.dem) +
+                          ": its CRS says the heights are \"" + heights.file.name +
+                          "\", which is not the math model's vertical datum, as --elevref "
+                          "MATHMODEL declares: leave --elevref out to follow the file");
+    }
     if (!options.dem.empty()) {
         // The first band; no-data as the raster declares it.
         return std::unique_ptr<kestrel::dem::IElevationSource>(

@@ -49,8 +49,16 @@ using StepProgress = std::function<bool(double fraction)>;
 // throws for it.
 void CheckOptions(const Options& options);
 
+// Checks what the surface model's file says of its heights (vertical datum and unit) against
+// --elevref and --elunits, without reading the heights: a contradiction throws, naming the file
+// and the option. Where the file says nothing, the options hold (MSL and metres by default).
+// Throws FileNotFoundException for a missing file.
+void CheckSurface(const Options& options);
+
 // The surface model of the options (--dem or --tin) with the heights corrected and delivered in
-// the datum of the math model (null: the ellipsoid). The caller owns it.
+// the datum of the math model (null: the ellipsoid), after CheckSurface's checks and, for
+// --elevref MATHMODEL over a file that says its datum, the check that the model's datum is that
+// one. The caller owns it.
 std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
     const Options& options, const kestrel::mathmodel::IMathModel* model);
 

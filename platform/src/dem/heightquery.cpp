@@ -138,6 +138,11 @@ void QueryFrame::SetOutputDatum(DatumType datum) {
     }
     const ICRS msl = MeanSeaLevelCRS(*crs_);
     const ICRS ellipsoidal = EllipsoidalCRS(*crs_);
+    // Heights are held in metres; PROJ takes and gives them in the units of the two systems.
+    const double mslUnit = ogc::utils::GetVerticalReference(&msl).metresPerUnit;
+    const double ellipsoidalUnit = ogc::utils::GetVerticalReference(&ellipsoidal).metresPerUnit;
+    fromUnit_ = datum == ogc::cs::DatumEllipsoid ? mslUnit : ellipsoidalUnit;
+    toUnit_ = datum == ogc::cs::DatumEllipsoid ? ellipsoidalUnit : mslUnit;
     try {
         vertical_ = datum == ogc::cs::DatumEllipsoid
                         ? std::make_unique<TransformPool>(msl, ellipsoidal)
@@ -196,12 +201,12 @@ void QueryFrame::ConvertHeights(std::size_t n, const double* x, const double* y,
                 continue;
             cx.push_back(x[i]);
             cy.push_back(y[i]);
-            cz.push_back(heights[i]);
+            cz.push_back(heights[i] / fromUnit_);
             index.push_back(i);
         }
         vertical_->Transform(index.size(), cx.data(), cy.data(), cz.data());
         for (std::size_t k = 0; k < index.size(); ++k)
-            heights[index[k]] = cz[k];
+            heights[index[k]] = cz[k] * toUnit_;
     }
 }
 

@@ -89,6 +89,7 @@ class QueryFrame {
     std::string name_;
     std::unique_ptr<TransformPool> input_;
     std::unique_ptr<TransformPool> vertical_;
+    double fromUnit_ = 1.0, toUnit_ = 1.0;  // metres per unit of the heights PROJ takes and gives
 };
 
 // The name of a datum in messages: "MSL", "ELLIPS" or "MATHMODEL", or its number.

@@ -165,7 +165,11 @@ std::string Collect(const OGRGeometry& g, SurfaceData& out) {
     if (type == wkbPoint) {
         if (!g.Is3D())
             return "a point without a height";
-        out.points.addGeometry(&g);
+        // A point without a finite position or height is no-data.
+        const auto& point = static_cast<const OGRPoint&>(g);
+        if (std::isfinite(point.getX()) && std::isfinite(point.getY()) &&
+            std::isfinite(point.getZ()))
+            out.points.addGeometry(&g);
         return "";
     }
     if (type == wkbPolygon || type == wkbTriangle) {
@@ -181,7 +185,8 @@ std::string Collect(const OGRGeometry& g, SurfaceData& out) {
         }
         const double area =
             (t.x[1] - t.x[0]) * (t.y[2] - t.y[0]) - (t.x[2] - t.x[0]) * (t.y[1] - t.y[0]);
-        if (area != 0.0 && std::isfinite(area))
+        // A flat or non-finite triangle, or one with a non-finite height, holds no height.
+        if (area != 0.0 && std::isfinite(area) && std::isfinite(t.z[0] + t.z[1] + t.z[2]))
             out.triangles.push_back(t);
         return "";
     }
@@ -301,14 +306,16 @@ std::unique_ptr<TinReader> OpenTinReader(const std::string& path, int layerNumbe
             triangles = Triangulate(data.points, path);
         if (triangles.empty())
             continue;
-        if (offset != 0.0 || scale != 1.0) {
-            for (auto& t : triangles)
-                for (double& z : t.z)
-                    z = offset + scale * z;
-        }
         std::unique_ptr<ogc::cs::ICRS> crs;
         if (const OGRSpatialReference* srs = layer->GetSpatialRef())
             crs = std::make_unique<ogc::cs::ICRS>(*srs);
+        // Heights in metres, as for a raster DEM.
+        const double unitScale = scale * ogc::utils::GetVerticalReference(crs.get()).metresPerUnit;
+        if (offset != 0.0 || unitScale != 1.0) {
+            for (auto& t : triangles)
+                for (double& z : t.z)
+                    z = offset + unitScale * z;
+        }
         return std::make_unique<OgrTinReader>(TriangleIndex(std::move(triangles)), std::move(crs),
                                               datum, path);
     }
