@@ -53,6 +53,107 @@ void GridDEM::GetHeights(std::size_t n, const double* x, const double* y, double
         !postsConverted_);
 }
 
+void GridDEM::ForgetSummaries() {
+    std::lock_guard<std::mutex> lock(summaryMutex_);
+    summaries_.clear();
+}
+
+const GridDEM::BlockSummary& GridDEM::Summary(unsigned int blockX, unsigned int blockY) const {
+    const PostSource& posts = *posts_;
+    const unsigned int blocksX = (posts.width + posts.blockWidth - 1) / posts.blockWidth;
+    const unsigned int blocksY = (posts.height + posts.blockHeight - 1) / posts.blockHeight;
+    const std::size_t key = static_cast<std::size_t>(blockY) * blocksX + blockX;
+    {
+        std::lock_guard<std::mutex> lock(summaryMutex_);
+        if (summaries_.empty())
+            summaries_.resize(static_cast<std::size_t>(blocksX) * blocksY);
+        if (summaries_[key])
+            return *summaries_[key];
+    }
+    const std::shared_ptr<const PostBlock> block = posts.GetBlock(blockX, blockY);
+    auto summary = std::make_unique<BlockSummary>();
+    summary->columns = (block->width + kCell - 1) / kCell;
+    const unsigned int rows = (block->height + kCell - 1) / kCell;
+    summary->low.assign(static_cast<std::size_t>(summary->columns) * rows, NAN);
+    summary->high = summary->low;
+    for (unsigned int j = 0; j < block->height; ++j) {
+        for (unsigned int i = 0; i < block->width; ++i) {
+            const float v = block->heights[static_cast<std::size_t>(j) * block->width + i];
+            if (std::isnan(v))
+                continue;
+            const std::size_t c =
+                static_cast<std::size_t>(j / kCell) * summary->columns + i / kCell;
+            // NaN compares false: the first height of a cell replaces it.
+            if (!(summary->low[c] <= v))
+                summary->low[c] = v;
+            if (!(summary->high[c] >= v))
+                summary->high[c] = v;
+        }
+    }
+    std::lock_guard<std::mutex> lock(summaryMutex_);
+    if (!summaries_[key])
+        summaries_[key] = std::move(summary);
+    return *summaries_[key];
+}
+
+bool GridDEM::GetHeightRange(double minX, double minY, double maxX, double maxY, double& lowest,
+                             double& highest) const {
+    if (!frame_.OwnRectangle(minX, minY, maxX, maxY))
+        return false;
+    // The pixel rectangle of the own rectangle, within the area that has heights.
+    double left = INFINITY, top = INFINITY, right = -INFINITY, bottom = -INFINITY;
+    for (double x : {minX, maxX}) {
+        for (double y : {minY, maxY}) {
+            double pixel, line;
+            geocoding_.GroundToPixel(x, y, pixel, line);
+            left = std::min(left, pixel), right = std::max(right, pixel);
+            top = std::min(top, line), bottom = std::max(bottom, line);
+        }
+    }
+    left = std::max(left, area_.left), right = std::min(right, area_.right);
+    top = std::max(top, area_.top), bottom = std::min(bottom, area_.bottom);
+    if (!(left <= right && top <= bottom))
+        return false;
+    // The posts that a bilinear height in it weighs: those around each point.
+    const PostSource& posts = *posts_;
+    const auto clampPost = [](double v, unsigned int size) {
+        return static_cast<unsigned int>(std::clamp(v, 0.0, static_cast<double>(size) - 1.0));
+    };
+    const unsigned int i0 = clampPost(std::floor(left - 0.5), posts.width);
+    const unsigned int i1 = clampPost(std::floor(right - 0.5) + 1.0, posts.width);
+    const unsigned int j0 = clampPost(std::floor(top - 0.5), posts.height);
+    const unsigned int j1 = clampPost(std::floor(bottom - 0.5) + 1.0, posts.height);
+    const unsigned int bw = posts.blockWidth, bh = posts.blockHeight;
+    double low = INFINITY, high = -INFINITY;
+    for (unsigned int by = j0 / bh; by <= j1 / bh; ++by) {
+        for (unsigned int bx = i0 / bw; bx <= i1 / bw; ++bx) {
+            const BlockSummary& summary = Summary(bx, by);
+            const unsigned int ci0 = (std::max(i0, bx * bw) - bx * bw) / kCell;
+            const unsigned int ci1 = (std::min(i1, bx * bw + bw - 1) - bx * bw) / kCell;
+            const unsigned int cj0 = (std::max(j0, by * bh) - by * bh) / kCell;
+            const unsigned int cj1 = (std::min(j1, by * bh + bh - 1) - by * bh) / kCell;
+            for (unsigned int cj = cj0; cj <= cj1; ++cj) {
+                for (unsigned int ci = ci0; ci <= ci1; ++ci) {
+                    const std::size_t c = static_cast<std::size_t>(cj) * summary.columns + ci;
+                    if (std::isnan(summary.low[c]))
+                        continue;
+                    low = std::min(low, static_cast<double>(summary.low[c]));
+                    high = std::max(high, static_cast<double>(summary.high[c]));
+                }
+            }
+        }
+    }
+    if (!(low <= high))
+        return false;
+    if (!postsConverted_)
+        frame_.WidenToOutput(minX, minY, maxX, maxY, low, high);
+    if (!(low <= high))
+        return false;
+    lowest = low;
+    highest = high;
+    return true;
+}
+
 namespace {
 
 constexpr std::uint32_t kOutside = std::numeric_limits<std::uint32_t>::max();
