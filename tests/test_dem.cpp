@@ -180,6 +180,14 @@ TEST(DemNoData, HolesAreNeverAveragedIn) {
         {grid.X(2.5), grid.Y(3), 5 + 2 * 102.0},  // beside it: its neighbour only
         {grid.X(0.5), grid.Y(3), 5 + 2 * 101.0},
     };
+    // Four posts without a height: the hole, the extra no-data value and the infinite ones.
+    std::size_t posts = 0, holes = 0;
+    ASSERT_TRUE(dem->CountPosts(0, 0, 40, 40, posts, holes));
+    EXPECT_EQ(posts, 16u);
+    EXPECT_EQ(holes, 4u);
+    ASSERT_TRUE(dem->CountPosts(grid.X(0.9), grid.Y(3.5), grid.X(3), grid.Y(2.1), posts, holes));
+    EXPECT_EQ(posts, 3u);  // (1, 3), (2, 3), (3, 3)
+    EXPECT_EQ(holes, 1u);
     for (const auto& c : cases) {
         double h = NAN;
         dem->GetHeights(1, &c.x, &c.y, &h);

@@ -237,18 +237,24 @@ TEST(HeightDatums, AgreeWithGdallocationinfoPlusCs2cs) {
         }
     }
 
-    // What contradicts the file is refused, naming the option; never applied on top of it.
+    // What contradicts the file is refused, naming the option, by silvan-height and by
+    // silvan-ortho before any work; never applied on top of it.
+    const std::string ortho = std::string(SILVAN_TOOLS_DIR) + "/silvan-ortho '" +
+                              dir.File("master.txt") + "' --out '" + dir.File("out") + "' --dem ";
     const std::pair<std::string, std::string> refused[] = {
         {"msl.tif --elevref ELLIPS", "not ELLIPS as --elevref says"},
         {"ft.vrt --elunits METER", "not in METER as --elunits says"},
         {"navd88ftus.tif --elunits FOOT", "not in FOOT as --elunits says"},
     };
     for (const auto& r : refused) {
-        const std::string output = RunCommand("'" + kTool + "' " + dir.Path().string() + "/" +
-                                              r.first + " </dev/null 2>&1; echo rc=$?");
-        EXPECT_NE(output.find(r.second), std::string::npos) << r.first << ": " << output;
-        EXPECT_NE(output.find("rc=2"), std::string::npos) << r.first << ": " << output;
+        for (const std::string& tool : {"'" + kTool + "' ", ortho}) {
+            const std::string output = RunCommand(tool + dir.Path().string() + "/" + r.first +
+                                                  " </dev/null 2>&1; echo rc=$?");
+            EXPECT_NE(output.find(r.second), std::string::npos) << r.first << ": " << output;
+            EXPECT_NE(output.find("rc=2"), std::string::npos) << r.first << ": " << output;
+        }
     }
+    EXPECT_FALSE(std::filesystem::exists(dir.File("out")));
 }
 
 TEST_F(Height, BadArgumentsAndLinesAreNamed) {

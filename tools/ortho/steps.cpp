@@ -202,9 +202,13 @@ kestrel::dem::SurfaceHeights ResolveSurface(const Options& options) {
         return kestrel::dem::ResolveSurfaceHeights(path,
                                                    options.elevref.empty() ? nullptr : &declared,
                                                    options.elunits, "--elevref", "--elunits");
-    } catch (const kestrel::DataException& e) {
+    } catch (const kestrel::Exception& e) {
+        // The platform's messages begin with the path: name the option too.
+        std::string message = e.what();
+        if (message.compare(0, path.size(), path) != 0)
+            message = path + ": " + message;
         KESTREL_THROW(kestrel::DataException,
-                      (options.dem.empty() ? "--tin " : "--dem ") + std::string(e.what()));
+                      (options.dem.empty() ? "--tin " : "--dem ") + message);
     }
 }
 
@@ -246,6 +250,33 @@ std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
         KESTREL_THROW(kestrel::FileNotFoundException, options.tin,
                       "cannot be opened as a TIN: no layer of triangles or 3-D points");
     return tin;
+}
+
+std::string SurfaceHoles(const Options& options, const Grid& grid) {
+    if (options.dem.empty())
+        return "";
+    const std::unique_ptr<kestrel::dem::IElevationSource> surface = OpenSurface(options, nullptr);
+    const auto* dem = dynamic_cast<const kestrel::dem::IRasterDEM*>(surface.get());
+    const kestrel::ogc::cs::ICRS crs(grid.crs);
+    surface->SetInputCRS(&crs);
+    const auto& g = grid.geoTransform;
+    double minX = INFINITY, minY = INFINITY, maxX = -INFINITY, maxY = -INFINITY;
+    for (double pixel : {0.0, static_cast<double>(grid.pixels)}) {
+        for (double line : {0.0, static_cast<double>(grid.lines)}) {
+            const double x = g[0] + pixel * g[1] + line * g[2];
+            const double y = g[3] + pixel * g[4] + line * g[5];
+            minX = std::min(minX, x), maxX = std::max(maxX, x);
+            minY = std::min(minY, y), maxY = std::max(maxY, y);
+        }
+    }
+    std::size_t posts = 0, holes = 0;
+    if (dem == nullptr || !dem->CountPosts(minX, minY, maxX, maxY, posts, holes))
+        return "";
+    char text[160];
+    std::snprintf(text, sizeof text,
+                  ": %zu of %zu posts under the output grid (%.2f %%) have no height", holes, posts,
+                  posts > 0 ? 100.0 * holes / posts : 0.0);
+    return "--dem " + options.dem + text;
 }
 
 void CheckSource(const SceneInput& scene) {

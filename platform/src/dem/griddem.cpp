@@ -96,11 +96,10 @@ const GridDEM::BlockSummary& GridDEM::Summary(unsigned int blockX, unsigned int 
     return *summaries_[key];
 }
 
-bool GridDEM::GetHeightRange(double minX, double minY, double maxX, double maxY, double& lowest,
-                             double& highest) const {
+bool GridDEM::PixelWindow(double minX, double minY, double maxX, double maxY,
+                          PixelArea& window) const {
     if (!frame_.OwnRectangle(minX, minY, maxX, maxY))
         return false;
-    // The pixel rectangle of the own rectangle, within the area that has heights.
     double left = INFINITY, top = INFINITY, right = -INFINITY, bottom = -INFINITY;
     for (double x : {minX, maxX}) {
         for (double y : {minY, maxY}) {
@@ -110,19 +109,64 @@ bool GridDEM::GetHeightRange(double minX, double minY, double maxX, double maxY,
             top = std::min(top, line), bottom = std::max(bottom, line);
         }
     }
-    left = std::max(left, area_.left), right = std::min(right, area_.right);
-    top = std::max(top, area_.top), bottom = std::min(bottom, area_.bottom);
-    if (!(left <= right && top <= bottom))
+    window.left = std::max(left, area_.left), window.right = std::min(right, area_.right);
+    window.top = std::max(top, area_.top), window.bottom = std::min(bottom, area_.bottom);
+    return window.left <= window.right && window.top <= window.bottom;
+}
+
+namespace {
+
+unsigned int ClampPost(double v, unsigned int size) {
+    return static_cast<unsigned int>(std::clamp(v, 0.0, static_cast<double>(size) - 1.0));
+}
+
+}  // namespace
+
+bool GridDEM::CountPosts(double minX, double minY, double maxX, double maxY, std::size_t& posts,
+                         std::size_t& holes) const {
+    PixelArea window;
+    if (!PixelWindow(minX, minY, maxX, maxY, window))
         return false;
-    // The posts that a bilinear height in it weighs: those around each point.
+    // Posts whose centres (i + 0.5, j + 0.5) lie in the window.
+    const PostSource& source = *posts_;
+    const double i0 = std::ceil(window.left - 0.5), i1 = std::floor(window.right - 0.5);
+    const double j0 = std::ceil(window.top - 0.5), j1 = std::floor(window.bottom - 0.5);
+    posts = holes = 0;
+    if (!(i0 <= i1 && j0 <= j1) || i1 < 0 || j1 < 0 || i0 >= source.width || j0 >= source.height)
+        return true;
+    const unsigned int a0 = ClampPost(i0, source.width), a1 = ClampPost(i1, source.width);
+    const unsigned int b0 = ClampPost(j0, source.height), b1 = ClampPost(j1, source.height);
+    const unsigned int bw = source.blockWidth, bh = source.blockHeight;
+    for (unsigned int by = b0 / bh; by <= b1 / bh; ++by) {
+        for (unsigned int bx = a0 / bw; bx <= a1 / bw; ++bx) {
+            const std::shared_ptr<const PostBlock> block = source.GetBlock(bx, by);
+            for (unsigned int j = std::max(b0, by * bh); j <= std::min(b1, by * bh + bh - 1); ++j) {
+                for (unsigned int i = std::max(a0, bx * bw); i <= std::min(a1, bx * bw + bw - 1);
+                     ++i) {
+                    ++posts;
+                    holes += std::isnan(
+                        block->heights[static_cast<std::size_t>(j - by * bh) * block->width +
+                                       (i - bx * bw)]);
+                }
+            }
+        }
+    }
+    return true;
+}
+
+bool GridDEM::GetHeightRange(double minX, double minY, double maxX, double maxY, double& lowest,
+                             double& highest) const {
+    PixelArea window;
+    if (!PixelWindow(minX, minY, maxX, maxY, window))
+        return false;
+    if (!frame_.OwnRectangle(minX, minY, maxX, maxY))
+        return false;
+    // The posts that a bilinear height in the window weighs: those around each point.
     const PostSource& posts = *posts_;
-    const auto clampPost = [](double v, unsigned int size) {
-        return static_cast<unsigned int>(std::clamp(v, 0.0, static_cast<double>(size) - 1.0));
-    };
-    const unsigned int i0 = clampPost(std::floor(left - 0.5), posts.width);
-    const unsigned int i1 = clampPost(std::floor(right - 0.5) + 1.0, posts.width);
-    const unsigned int j0 = clampPost(std::floor(top - 0.5), posts.height);
-    const unsigned int j1 = clampPost(std::floor(bottom - 0.5) + 1.0, posts.height);
+    const unsigned int i0 = ClampPost(std::floor(window.left - 0.5), posts.width);
+    const unsigned int i1 = ClampPost(std::floor(window.right - 0.5) + 1.0, posts.width);
+    const unsigned int j0 = ClampPost(std::floor(window.top - 0.5), posts.height);
+    const unsigned int j1 = ClampPost(std::floor(window.bottom - 0.5) + 1.0, posts.height);
     const unsigned int bw = posts.blockWidth, bh = posts.blockHeight;
     double low = INFINITY, high = -INFINITY;
     for (unsigned int by = j0 / bh; by <= j1 / bh; ++by) {

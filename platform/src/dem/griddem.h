@@ -91,6 +91,8 @@ class GridDEM : public IRasterDEM {
                     double* heights) const override;
     bool GetHeightRange(double minX, double minY, double maxX, double maxY, double& lowest,
                         double& highest) const override;
+    bool CountPosts(double minX, double minY, double maxX, double maxY, std::size_t& posts,
+                    std::size_t& holes) const override;
 
     unsigned int GetWidth() const override { return posts_->width; }
     unsigned int GetHeight() const override { return posts_->height; }
@@ -119,6 +121,9 @@ class GridDEM : public IRasterDEM {
         std::vector<float> low, high;
     };
     const BlockSummary& Summary(unsigned int blockX, unsigned int blockY) const;
+    // The pixel rectangle of a rectangle of input coordinates, within the area with heights;
+    // false when they do not meet.
+    bool PixelWindow(double minX, double minY, double maxX, double maxY, PixelArea& window) const;
 
     mutable std::mutex summaryMutex_;
     mutable std::vector<std::unique_ptr<BlockSummary>> summaries_;

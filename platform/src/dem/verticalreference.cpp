@@ -40,18 +40,17 @@ VerticalReference ReadVerticalReference(const std::string& path) {
     gdalsupport::EnsureRegistered();
     VSIStatBufL stat;
     if (path.empty() || VSIStatL(path.c_str(), &stat) != 0)
-        KESTREL_THROW(FileNotFoundException, path,
-                      FormatString("The surface model %s is not found", path.c_str()));
+        KESTREL_THROW(FileNotFoundException, path, FormatString("%s: not found", path.c_str()));
     if (IsDirectory(path))
         return ReadVerticalReference(RastersIn(path).front());
     if (IsTileIndex(path))
         return TileIndexVerticalReference(path);
     gdalsupport::ErrorCapture errors;
-    GDALDatasetUniquePtr dataset(
-        GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_VECTOR | GDAL_OF_READONLY));
+    GDALDatasetUniquePtr dataset(GDALDataset::Open(
+        path.c_str(), GDAL_OF_RASTER | GDAL_OF_VECTOR | GDAL_OF_READONLY | GDAL_OF_VERBOSE_ERROR));
     if (!dataset) {
         KESTREL_THROW(FileAccessException, path, FileAccessException::OpenFailed,
-                      FormatString("GDAL cannot open the surface model %s: %s", path.c_str(),
+                      FormatString("%s: GDAL cannot open it as a surface model: %s", path.c_str(),
                                    errors.Reason().c_str()));
     }
     if (dataset->GetRasterCount() > 0)
