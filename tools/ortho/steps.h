@@ -44,15 +44,17 @@ using Footprint = std::unique_ptr<kestrel::tin::Polygon<double>>;
 // Progress of one step: the fraction done. Returns false to stop.
 using StepProgress = std::function<bool(double fraction)>;
 
-// Checks the option values that the library interprets (-elevref, -elfactor, units, resampling
-// method, file type), so that a bad one stops the run before any work. Throws what the library
-// throws for it.
-void CheckOptions(const Options& options);
+// Checks every option value before any work: the surface model exists, the values the library
+// interprets (-elevref, -elfactor, units, output CRS, PROC text, resampling method, file type)
+// are accepted and the file type can be written. Throws UsageError naming the option. Puts the
+// resampling method in the spelling --help lists. Returns lines worth telling the user, such as
+// a generator that falls back to the central processor.
+std::vector<std::string> CheckOptions(Options& options);
 
 // Checks what the surface model's file says of its heights (vertical datum and unit) against
 // --elevref and --elunits, without reading the heights: a contradiction throws, naming the file
 // and the option. Where the file says nothing, the options hold (MSL and metres by default).
-// Throws FileNotFoundException for a missing file.
+// Throws UsageError.
 void CheckSurface(const Options& options);
 
 // The surface model of the options (--dem or --tin) with the heights corrected and delivered in
