@@ -286,13 +286,13 @@ std::vector<std::string> CheckOptions(Options& options) {
     CheckOption("--srs", [&] { CheckOutputCrs(options.srs); });
     CheckOption("--resample", [&] { options.resample = CheckResampling(options.resample); });
     CheckOption("--of", [&] { CheckFileType(options.format); });
-    CheckSurface(options);
     std::vector<std::string> notes;
     CheckOption("--proc", [&] {
         const std::string note = CheckGenerator(options.proc);
         if (!note.empty())
             notes.push_back(note);
     });
+    CheckSurface(options);
     return notes;
 }
 
@@ -308,6 +308,8 @@ kestrel::dem::SurfaceHeights ResolveSurface(const Options& options) {
         return kestrel::dem::ResolveSurfaceHeights(path,
                                                    options.elevref.empty() ? nullptr : &declared,
                                                    options.elunits, "--elevref", "--elunits");
+    } catch (const kestrel::FileException&) {
+        throw;
     } catch (const kestrel::Exception& e) {
         // The platform's messages begin with the path: name the option too.
         std::string message = e.what();
@@ -325,6 +327,8 @@ void CheckSurface(const Options& options) {
         return;
     try {
         ResolveSurface(options);
+    } catch (const kestrel::FileException&) {
+        // A file that cannot be read fails where the surface is opened, naming it.
     } catch (const kestrel::Exception& e) {
         throw UsageError(e.what());
     }

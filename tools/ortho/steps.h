@@ -54,7 +54,7 @@ std::vector<std::string> CheckOptions(Options& options);
 // Checks what the surface model's file says of its heights (vertical datum and unit) against
 // --elevref and --elunits, without reading the heights: a contradiction throws, naming the file
 // and the option. Where the file says nothing, the options hold (MSL and metres by default).
-// Throws UsageError.
+// Throws UsageError; a file that cannot be read is left to OpenSurface.
 void CheckSurface(const Options& options);
 
 // The surface model of the options (--dem or --tin) with the heights corrected and delivered in
