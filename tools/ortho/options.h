@@ -38,6 +38,7 @@ struct Options {
 
     bool keepGoing = false;
     bool quiet = false;
+    bool overwrite = false;  // make every output again
     bool help = false;
 };
 
