@@ -163,10 +163,11 @@ std::vector<std::string> DatasetFiles(const std::string& path) {
     return files;
 }
 
-void Manifest::Set(const std::string& what, const std::string& value, const std::string& note) {
+void Manifest::Set(const std::string& what, const std::string& value, const std::string& note,
+                   bool showValue) {
     if (entries_.find(what) == entries_.end())
         order_.push_back(what);
-    entries_[what] = {value, note};
+    entries_[what] = {value, note, showValue};
 }
 
 void Manifest::SetFile(const std::string& role, const std::string& path,
@@ -220,11 +221,12 @@ std::vector<std::string> Manifest::ChangesSince(const Manifest& earlier) const {
     std::vector<std::string> changes;
     for (const std::string& what : order_) {
         const auto before = earlier.entries_.find(what);
-        const std::string& now = entries_.at(what).value;
+        const Entry& now = entries_.at(what);
         if (before == earlier.entries_.end())
             changes.push_back(what + " is new");
-        else if (before->second.value != now)
-            changes.push_back(what + " changed: " + before->second.value + " -> " + now);
+        else if (before->second.value != now.value)
+            changes.push_back(what + " changed" +
+                              (now.shown ? ": " + before->second.value + " -> " + now.value : ""));
     }
     for (const std::string& what : earlier.order_) {
         if (entries_.find(what) == entries_.end())

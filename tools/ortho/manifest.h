@@ -46,7 +46,9 @@ std::vector<std::string> DatasetFiles(const std::string& path);
 class Manifest {
   public:
     // An input or option; `note` is recorded but not compared (a file's modification time).
-    void Set(const std::string& what, const std::string& value, const std::string& note = "");
+    // A change of a value that says nothing to people (a hash) is reported without it.
+    void Set(const std::string& what, const std::string& value, const std::string& note = "",
+             bool showValue = true);
     void SetFile(const std::string& role, const std::string& path, const FileIdentity& identity);
 
     std::string ToJson(const std::string& output) const;
@@ -63,6 +65,7 @@ class Manifest {
     struct Entry {
         std::string value;
         std::string note;
+        bool shown = true;
     };
     std::vector<std::string> order_;
     std::map<std::string, Entry> entries_;

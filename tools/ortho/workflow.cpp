@@ -598,6 +598,20 @@ std::string Workflow::WhyMake(const Scene& scene) const {
         if (!FileExists(output))
             return output + " is missing";
     }
+    // A description that names other files (the directory was moved) is made again.
+    try {
+        std::unique_ptr<TOSceneParser> description;
+        {
+            std::lock_guard<std::mutex> lock(SceneFileMutex());
+            description.reset(ParserFactory::CreateSceneParser(scene.xml));
+        }
+        if (description->GetOrthoFilename() != scene.ortho ||
+            description->GetVisIdxFilename() != scene.visibility ||
+            description->GetSceneFilename() != scene.input.source)
+            return scene.xml + " names other files";
+    } catch (const std::exception& e) {
+        return scene.xml + " cannot be read: " + Explain(e);
+    }
     Grid ortho, visibility;
     if (!ReadGrid(scene.ortho, ortho) || !ortho.SameAs(grid_))
         return scene.ortho + " is not whole on the common grid";
@@ -746,7 +760,8 @@ void Workflow::RunScene(Scene& scene) {
             Fail(scene, Where(scene) + ": " + Explain(e));
     }
     scene.seconds = SecondsSince(start);
-    progress_.End(label, scene.status == "done", scene.seconds, scene.error);
+    progress_.End(label, scene.status == "done", scene.seconds,
+                  scene.status == "cancelled" ? "cancelled" : scene.error);
 }
 
 void Workflow::Recover() {
@@ -770,11 +785,11 @@ void Workflow::Recover() {
             continue;
         layers.push_back({scene.name, scene.footprint, scene.input.source});
         made.Set("scene " + scene.name,
-                 (scene.inImageSet ? "fill, radiometric difference " +
-                                         std::to_string(static_cast<int>(scene.radioDif)) +
-                                         ", DBM pixel error " + std::to_string(scene.dbmPxErr)
-                                   : std::string("preparation only")) +
-                     ", made from " + scene.madeFrom.Fingerprint());
+                 scene.inImageSet ? "fill, radiometric difference " +
+                                        std::to_string(static_cast<int>(scene.radioDif)) +
+                                        ", DBM pixel error " + std::to_string(scene.dbmPxErr)
+                                  : std::string("preparation only"));
+        made.Set("outputs of " + scene.name, scene.madeFrom.Fingerprint(), "", false);
         if (!scene.inImageSet)
             continue;
         inputs.push_back({scene.id, scene.input.source, scene.input.mmseg, scene.ortho,
