@@ -153,6 +153,16 @@ struct Output {
     std::string what;
 };
 
+// The quicklook of the raster dir/stem.FORMAT: dir/stem.png, or dir/stem_quicklook.png when the
+// rasters are PNG files themselves, so that it does not replace the raster.
+std::string QuicklookName(const std::string& dir, const std::string& stem,
+                          const std::string& format) {
+    std::string lower = format;
+    std::transform(lower.begin(), lower.end(), lower.begin(),
+                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+    return Join(dir, stem + (lower == "png" ? "_quicklook.png" : ".png"));
+}
+
 // The outputs of a scene named `name`, in the order of Scene's fields.
 std::vector<Output> SceneOutputs(const std::string& dir, const std::string& name,
                                  const std::string& format) {
@@ -160,7 +170,7 @@ std::vector<Output> SceneOutputs(const std::string& dir, const std::string& name
             {Join(dir, name + "_vis." + format), "the visibility index"},
             {Join(dir, name + ".xml"), "the scene description"},
             {Join(dir, name + "_footprint.gpkg"), "the footprint"},
-            {Join(dir, name + "_vis.png"), "the visibility quicklook"},
+            {QuicklookName(dir, name + "_vis", format), "the visibility quicklook"},
             {Join(dir, name + "_manifest.json"), "the record of inputs"}};
 }
 
@@ -456,8 +466,8 @@ std::vector<std::pair<std::string, std::string>> Workflow::RunOutputs() const {
             {Join(outDir_, "footprints.gpkg"), "the footprints"},
             {Join(outDir_, "mosaic." + f), "the mosaic"},
             {Join(outDir_, "mosaic_source." + f), "the mosaic's source raster"},
-            {Join(outDir_, "mosaic.png"), "the mosaic's quicklook"},
-            {Join(outDir_, "mosaic_source.png"), "the source raster's quicklook"},
+            {QuicklookName(outDir_, "mosaic", f), "the mosaic's quicklook"},
+            {QuicklookName(outDir_, "mosaic_source", f), "the source raster's quicklook"},
             {Join(outDir_, "mosaic_manifest.json"), "the mosaic's record of inputs"}};
     if (options_.hasLines)
         outputs.emplace_back(Join(outDir_, SummaryName()), "the slice's summary");
@@ -769,8 +779,9 @@ void Workflow::Recover() {
     const std::string source = Join(outDir_, "mosaic_source." + options_.format);
     const std::string footprints = Join(outDir_, "footprints.gpkg");
     const std::string record = Join(outDir_, "mosaic_manifest.json");
-    const std::vector<std::string> quicklooks = {Join(outDir_, "mosaic.png"),
-                                                 Join(outDir_, "mosaic_source.png")};
+    const std::vector<std::string> quicklooks = {
+        QuicklookName(outDir_, "mosaic", options_.format),
+        QuicklookName(outDir_, "mosaic_source", options_.format)};
 
     // The mosaic is made from the scenes' outputs, so from what made them, and from the
     // image set's values and the options.
