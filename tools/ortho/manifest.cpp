@@ -70,9 +70,9 @@ std::string UtcTime(const fs::file_time_type& time) {
     return text;
 }
 
-constexpr std::uint64_t kWholeFileLimit = 16u << 20;
+constexpr std::uint64_t kWholeFileLimit = 1u << 20;
 constexpr std::uint64_t kSampleBlock = 64u << 10;
-constexpr std::uint64_t kSampleBlocks = 64;
+constexpr std::uint64_t kSampleBlocks = 16;
 
 }  // namespace
 

@@ -24,10 +24,11 @@ struct PixelOption {
 };
 const std::vector<PixelOption>& PixelOptions();
 
-// A file's identity: its size, its content hash, its last change. Files up to 16 MiB are
-// hashed whole and compared by size and content; larger ones by their size, a hash of 64
-// blocks of 64 KiB spread evenly over them (the first and last included) and their
-// modification time, since the sampled hash alone could miss a change between the blocks.
+// A file's identity: its size, its content hash, its last change. Files up to 1 MiB are hashed
+// whole and compared by size and content; larger ones by their size, a hash of 16 blocks of
+// 64 KiB spread evenly over them (the first and last included) and their modification time,
+// since the sampled hash alone could miss a change between the blocks. Every slice of a run
+// identifies every source, so no file costs more than 1 MiB of reading.
 struct FileIdentity {
     std::uint64_t size = 0;
     std::string hash;      // 16 hex digits; "absent" when the file cannot be read
