@@ -487,6 +487,31 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
     }
 }
 
+// Images of 4 pixels: one scene's footprint has 3 corners. It fails on its own, saying so, and
+// the footprints of the others are merged.
+TEST(Workflow, FootprintWithTooFewCornersFailsItsSceneAlone) {
+    TempDir dir;
+    const Result made = RunProgram(SILVAN_MAKE_SAMPLE_EXE,
+                                   {dir.File("sample"), "--image-size", "4", "--quiet"}, dir);
+    ASSERT_EQ(made.status, 0) << made.err;
+    const Result r = Ortho({dir.File("sample/master.txt"), "--out", dir.File("out"), "--dem",
+                            dir.File("sample/dsm.tif"), "--elevref", "ELLIPS", "--srs",
+                            "EPSG:32632", "--proc", "CPU:1", "--keep-going", "--quiet"},
+                           dir);
+    EXPECT_EQ(r.status, 1);
+    EXPECT_NE(r.err.find("east.tif: the footprint has 3 corner(s); a scene's footprint needs at "
+                         "least 4"),
+              std::string::npos)
+        << r.err;
+    const auto states = SceneStates(dir);
+    EXPECT_EQ(states.at("east").first, "failed");
+    EXPECT_EQ(states.at("south").first, "done");
+    Dataset footprints = Open(dir.File("out/footprints.gpkg"), GDAL_OF_VECTOR);
+    ASSERT_TRUE(footprints);
+    EXPECT_NE(footprints->GetLayerByName("south"), nullptr);
+    EXPECT_EQ(footprints->GetLayerByName("east"), nullptr);
+}
+
 #ifndef _WIN32
 // A run in the background, its output in files of dir.
 pid_t Start(const std::vector<std::string>& args, const TempDir& dir) {

@@ -717,13 +717,12 @@ void Workflow::RunScene(Scene& scene) {
         report(0.0, 0.05, "layout")(0.0);
         Footprint footprint;
         SceneLayout(options_, scene.input, grid_.crs, grid_.PixelSize(), &footprint);
-        // A polygon closes on its first point: fewer than 4 points enclose no ground.
+        // The footprint file and the merge take polygons of at least 4 corners.
         if (!footprint || footprint->numPoints < 4)
             KESTREL_THROW(kestrel::DataException,
                           scene.input.source + ": the footprint has " +
                               std::to_string(footprint ? footprint->numPoints : 0) +
-                              " point(s), too few for a polygon: the image hardly covers the "
-                              "surface model");
+                              " corner(s); a scene's footprint needs at least 4");
         timed("scene layout");
 
         const OrthoResult result =
