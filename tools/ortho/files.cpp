@@ -5,7 +5,9 @@
 #include <system_error>
 
 #ifdef _WIN32
+#ifndef NOMINMAX
 #define NOMINMAX
+#endif
 #include <process.h>
 #include <windows.h>
 #else
