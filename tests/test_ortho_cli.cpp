@@ -1,5 +1,6 @@
 // The command line of silvan-ortho: options and inputs checked before any work, --version, and
-// images given instead of a master file, run as a user runs them.
+// images given instead of a master file, run as a user runs them; and the error messages of the
+// other commands.
 #include "program.h"
 
 #include <gdal_priv.h>
@@ -159,6 +160,16 @@ TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
     EXPECT_NE(summary.find("\"status\": \"complete\""), std::string::npos) << summary;
     EXPECT_TRUE(fs::exists(dir.File("out/mosaic.tif")));
 
+    // A master file whose line names a text file: said plainly.
+    const std::string wrong =
+        WriteFile(dir.File("wrong.txt"), dir.File("sample/master.txt") + ";;0;;;0;;0;ORTHO\n");
+    const ProgramResult text =
+        Ortho({wrong, "--out", dir.File("wrong"), "--dem", dir.File("sample/dsm.tif")}, dir);
+    EXPECT_EQ(text.status, 1);
+    EXPECT_NE(text.err.find(dir.File("sample/master.txt") + ": not a raster that GDAL can read"),
+              std::string::npos)
+        << text.err;
+
     const auto madeAt = fs::last_write_time(written);
     const ProgramResult second = Ortho(args, dir);
     EXPECT_EQ(second.status, 0) << second.err;
@@ -166,3 +177,27 @@ TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
 }
 
 }  // namespace
+
+// The other commands print the message and the file it is about, never where in the code the
+// error was raised.
+TEST(CommandMessages, NameTheFileWithoutCodeLocations) {
+    TempDir dir;
+    const std::string tools = SILVAN_TOOLS_DIR;
+    const std::string absent = dir.File("absent.tif");
+    const struct {
+        std::string program;
+        std::vector<std::string> args;
+    } cases[] = {
+        {"silvan-filelist", {absent}},
+        {"silvan-layout", {absent, "--dem", absent}},
+        {"silvan-height", {absent}},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.program);
+        const ProgramResult r = RunProgram(tools + "/" + c.program, c.args, dir);
+        EXPECT_EQ(r.status, 1);
+        EXPECT_EQ(r.err.rfind(c.program + ": ", 0), 0u) << r.err;
+        EXPECT_NE(r.err.find(absent), std::string::npos) << r.err;
+        EXPECT_EQ(r.err.find("(in "), std::string::npos) << r.err;
+    }
+}
