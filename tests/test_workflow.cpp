@@ -229,8 +229,9 @@ TEST(WorkflowCommand, OutputsNeverReplaceInputs) {
         EXPECT_EQ(ReadFile(master), text);
         EXPECT_EQ(ReadFile(dir.File(c.dem)), "surface");
         EXPECT_NE(ReadFile(dir.File("out/b.tif.aux.xml")).find("PAMDataset"), std::string::npos);
-        if (c.masterName != "out/prep.txt")
+        if (c.masterName != "out/prep.txt") {
             EXPECT_FALSE(std::filesystem::exists(dir.File("out/prep.txt")));
+        }
     }
 }
 
@@ -482,8 +483,9 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
         const std::string mosaicReason = summary.GetRoot().GetString("mosaic_reason");
         EXPECT_EQ(!mosaicReason.empty(), step.mosaic) << mosaicReason;
-        if (step.madeAgain.empty() && step.mosaic)
+        if (step.madeAgain.empty() && step.mosaic) {
             EXPECT_NE(mosaicReason.find(step.reason), std::string::npos) << mosaicReason;
+        }
     }
 }
 
