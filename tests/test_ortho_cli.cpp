@@ -9,6 +9,8 @@
 #include <string>
 #include <vector>
 
+// The commands are built with the tools (SILVAN_BUILD_TOOLS).
+#ifdef SILVAN_ORTHO_EXE
 namespace {
 
 namespace fs = std::filesystem;
@@ -201,3 +203,4 @@ TEST(CommandMessages, NameTheFileWithoutCodeLocations) {
         EXPECT_EQ(r.err.find("(in "), std::string::npos) << r.err;
     }
 }
+#endif  // SILVAN_ORTHO_EXE
