@@ -65,6 +65,8 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--proc", "GPU:1,1"}, "--proc: Cannot read PROC option \"GPU:1,1\""},
         {{master}, {"--of", "nonsense"}, "--of: Unknown output file type \"nonsense\""},
         {{master}, {"--of", "mem"}, "--of: mem: GDAL's MEM driver keeps no pixels"},
+        {{master}, {"--of", "xyz"}, "--of: xyz: GDAL's XYZ text holds no coordinate system"},
+        {{master}, {"--of", "hdr"}, "--of: hdr names the ENVI header"},
         {{master}, {"--resample", "gauss"}, "--resample: unknown method \"gauss\""},
         {{master}, {"--resample", "nearest"}, "--resample: unknown method \"nearest\""},
         {{master}, {"--dem", absent}, "--dem: " + absent + ": not found"},
