@@ -322,7 +322,13 @@ void Workflow::Prepare() {
         lock_ = std::make_unique<RunLock>(
             outDir_, options_.hasLines,
             "process " + std::to_string(ProcessId()) +
-                (options_.hasLines ? " (" + SummaryName() + ")" : std::string()));
+                (options_.hasLines
+                     ? " (--lines " + std::to_string(options_.firstLine) + ":" +
+                           (options_.endLine == std::numeric_limits<unsigned int>::max()
+                                ? std::string()
+                                : std::to_string(options_.endLine)) +
+                           ")"
+                     : std::string()));
     } catch (const std::runtime_error& e) {
         refused_ = true;
         throw RunError(e.what());
