@@ -198,6 +198,14 @@ std::string SameFileKey(const std::string& path) {
     return text;
 }
 
+// The program and the libraries that made an output: a new version may make other pixels.
+std::string ProgramVersion() {
+    std::string text = VersionText();
+    while (!text.empty() && (text.back() == '\n' || text.back() == '\r'))
+        text.pop_back();
+    return text;
+}
+
 std::string SurfacePath(const Options& options) {
     return options.dem.empty() ? options.tin : options.dem;
 }
@@ -533,6 +541,7 @@ Manifest Workflow::GridInputs() {
     // The scenes' layouts depend on the surface, the options that move footprints and every
     // line's source and columns, including those of other slices.
     Manifest inputs;
+    inputs.Set("program", ProgramVersion());
     for (const PixelOption& option : PixelOptions()) {
         if (option.movesFootprints)
             inputs.Set(option.name, option.value(options_));
@@ -590,6 +599,7 @@ void Workflow::MakeGrid() {
 void Workflow::RecordInputs(Scene& scene) {
     Manifest& made = scene.madeFrom;
     made.Set("master line", scene.columns);
+    made.Set("program", ProgramVersion());
     for (const PixelOption& option : PixelOptions())
         made.Set(option.name, option.value(options_));
     made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
@@ -793,6 +803,7 @@ void Workflow::Recover() {
     std::vector<RecoveryScene> inputs;
     std::vector<FootprintLayer> layers;
     Manifest made;
+    made.Set("program", ProgramVersion());
     for (const PixelOption& option : PixelOptions())
         made.Set(option.name, option.value(options_));
     made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
