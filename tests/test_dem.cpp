@@ -434,6 +434,10 @@ TEST(ConstantDem, ConstantInItsDatumFollowingTheGeoidInTheOther) {
     // Between posts, within 1 mm of PROJ's answer (162.513403, see above).
     ASSERT_TRUE(dem->GetHeight(515000, 5034000, h));
     EXPECT_NEAR(h, 162.513403, 1e-3);
+    // The range follows the converted posts (cells of 16 posts: the geoid over a kilometre).
+    double low = NAN, high = NAN;
+    ASSERT_TRUE(dem->GetHeightRange(514900, 5033900, 515100, 5034100, low, high));
+    EXPECT_TRUE(low <= h && h <= high && high - low < 0.5) << low << " " << high;
 }
 
 TEST(DemErrors, EachNamesWhatIsWrong) {
