@@ -1,6 +1,7 @@
 // Raster DEMs: bilinear heights between posts and no-data left out, files, directories and tile
 // indexes alike, the block cache under threads, constant DEMs, vertical datum conversion against
-// PROJ's own answers, and the errors for inputs that cannot be used.
+// PROJ's own answers, height ranges and holes of a window, and the errors for inputs that
+// cannot be used (remote tiles included).
 #include <kestrel/dem.h>
 
 #include "demdata.h"
