@@ -274,7 +274,7 @@ TEST_F(Dem, TileIndexNamesOnlyLocalFiles) {
             std::unique_ptr<OGRFeature> second(first->Clone());
             second->SetFID(2);
             second->SetField("location", location);
-            if (layer->GetFeature(2) == nullptr)
+            if (!std::unique_ptr<OGRFeature>(layer->GetFeature(2)))
                 ASSERT_EQ(layer->CreateFeature(second.get()), OGRERR_NONE);
             else
                 ASSERT_EQ(layer->SetFeature(second.get()), OGRERR_NONE);
