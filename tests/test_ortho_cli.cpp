@@ -9,6 +9,8 @@
 #include <string>
 #include <vector>
 
+// The commands are built with the tools (SILVAN_BUILD_TOOLS).
+#ifdef SILVAN_ORTHO_EXE
 namespace {
 
 namespace fs = std::filesystem;
@@ -63,6 +65,8 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--proc", "GPU:1,1"}, "--proc: Cannot read PROC option \"GPU:1,1\""},
         {{master}, {"--of", "nonsense"}, "--of: Unknown output file type \"nonsense\""},
         {{master}, {"--of", "mem"}, "--of: mem: GDAL's MEM driver keeps no pixels"},
+        {{master}, {"--of", "xyz"}, "--of: xyz: GDAL's XYZ text holds no coordinate system"},
+        {{master}, {"--of", "hdr"}, "--of: hdr names the ENVI header"},
         {{master}, {"--resample", "gauss"}, "--resample: unknown method \"gauss\""},
         {{master}, {"--resample", "nearest"}, "--resample: unknown method \"nearest\""},
         {{master}, {"--dem", absent}, "--dem: " + absent + ": not found"},
@@ -200,4 +204,12 @@ TEST(CommandMessages, NameTheFileWithoutCodeLocations) {
         EXPECT_NE(r.err.find(absent), std::string::npos) << r.err;
         EXPECT_EQ(r.err.find("(in "), std::string::npos) << r.err;
     }
+    // An image where a parameter file is expected.
+    const ProgramResult image =
+        RunProgram(tools + "/silvan-filelist", {WriteImage(dir.File("a.tif"))}, dir);
+    EXPECT_EQ(image.status, 1);
+    EXPECT_NE(image.err.find("(a binary file, such as an image, is no parameter file)"),
+              std::string::npos)
+        << image.err;
 }
+#endif  // SILVAN_ORTHO_EXE
