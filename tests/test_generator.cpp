@@ -78,6 +78,55 @@ TEST(SampleCity, RpcsAgreeWithTheCameraThroughGdalsTransformer) {
     }
 }
 
+// The grid-to-image projection interpolated on its lattice stays within its bound of the exact
+// one, on an oblique RPC image from 400 m (strong perspective) over buildings, at the surface's
+// heights and at heights spread over its whole range in every pixel.
+TEST(GridProjection, InterpolationStaysWithinItsBoundOfTheExactProjection) {
+    TempDir dir;
+    samplecity::CityOptions options = samplecity::SmallCity();
+    options.cameras = {{"oblique", 20.0, 30.0, 400.0, 512, 512, 0.5}};
+    const samplecity::Sample sample = samplecity::MakeSample(dir.Path().string(), options, 2);
+    const samplecity::RpcModel model(sample.images[0].path);
+    samplecity::GridSurface surface(sample.dsmPath);
+    const kestrel::ogc::cs::ICRS utm(options.crs);
+    const kestrel::ogc::cs::CoordinateTransformation toModel(utm, *model.GetCRS());
+    const auto grid = kestrel::ogc::cs::GeocodingInfo::NorthUp(
+        options.west, options.south + options.sizeY, 0.5, 0.5);
+    const int x0 = 40, y0 = 60, width = 300, height = 280;
+    const size_t n = static_cast<size_t>(width) * height;
+    std::vector<double> x(n), y(n), onSurface(n), spread(n);
+    for (int j = 0; j < height; ++j)
+        for (int i = 0; i < width; ++i)
+            grid.PixelToGround(x0 + i + 0.5, y0 + j + 0.5, x[j * width + i], y[j * width + i]);
+    surface.GetHeights(n, x.data(), y.data(), onSurface.data());
+    for (size_t k = 0; k < n; ++k)
+        spread[k] = 250.0 + 35.0 * ((k * 7919) % 1000) / 999.0;
+    for (const std::vector<double>* heights : {&onSurface, &spread}) {
+        std::vector<double> col(n), row(n), exactCol(n), exactRow(n);
+        std::unique_ptr<bool[]> ok(new bool[n]), exactOk(new bool[n]);
+        kestrel::processes::GridProjection exact(grid, model, &toModel, 0.0);
+        exact.Project(x0, y0, width, height, heights->data(), exactCol.data(), exactRow.data(),
+                      exactOk.get());
+        EXPECT_EQ(exact.LastStep(), 0);
+        for (const double bound : {0.05, 0.01}) {
+            SCOPED_TRACE(bound);
+            kestrel::processes::GridProjection fast(grid, model, &toModel, bound);
+            fast.Project(x0, y0, width, height, heights->data(), col.data(), row.data(),
+                         ok.get());
+            EXPECT_GE(fast.LastStep(), 4);  // interpolated, not exact in disguise
+            double largest = 0;
+            for (size_t k = 0; k < n; ++k) {
+                ASSERT_EQ(ok[k], exactOk[k]) << k;
+                if (ok[k])
+                    largest = std::max(largest, std::hypot(col[k] - exactCol[k],
+                                                           row[k] - exactRow[k]));
+            }
+            EXPECT_LE(largest, bound);
+            EXPECT_GT(largest, 0.0);
+        }
+    }
+}
+
 using testsupport::ReadBand;
 
 // A box building 20 m high on flat ground, seen from the north at 30 degrees off nadir, with its
