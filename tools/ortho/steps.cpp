@@ -327,6 +327,35 @@ class RecoveryProcess : public kestrel::processes::silvan::TOPPFBase {
     kestrel::processes::TorthoRecoveryResult result_;
 };
 
+// Source pixels per output pixel, along the grid's pixels and lines, at the grid's centre on
+// the surface: the footprint of the area methods (average, mode) and the widening of the other
+// kernels where the ortho is coarser than the image, as in gdalwarp. Left as it is where the
+// centre has no height or no image position.
+void SetSourceStep(kestrel::utils::IRasterResampler& resampler,
+                   const kestrel::mathmodel::IMathModel& model,
+                   kestrel::dem::IElevationSource& surface, const Grid& grid,
+                   const kestrel::ogc::cs::ICRS& crs) {
+    const kestrel::ogc::cs::GeocodingInfo geocoding(grid.geoTransform);
+    const double p = grid.pixels / 2.0, l = grid.lines / 2.0;
+    double x[3], y[3], z[3], col[3], row[3];
+    bool ok[3];
+    geocoding.PixelToGround(p, l, x[0], y[0]);
+    geocoding.PixelToGround(p + 1, l, x[1], y[1]);
+    geocoding.PixelToGround(p, l + 1, x[2], y[2]);
+    surface.SetInputCRS(&crs);
+    if (!surface.GetHeight(x[0], y[0], z[0]) || !std::isfinite(z[0]))
+        return;
+    z[1] = z[2] = z[0];
+    if (model.GetCRS() != nullptr && !model.GetCRS()->IsSame(crs))
+        kestrel::ogc::cs::CoordinateTransformation(crs, *model.GetCRS()).Transform(3, x, y);
+    model.GroundToImage(3, x, y, z, col, row, ok);
+    const double stepX = std::hypot(col[1] - col[0], row[1] - row[0]);
+    const double stepY = std::hypot(col[2] - col[0], row[2] - row[0]);
+    if (ok[0] && ok[1] && ok[2] && stepX > 1e-3 && stepY > 1e-3 && stepX <= 1000 &&
+        stepY <= 1000)
+        resampler.SetSourceStep(stepX, stepY);
+}
+
 }  // namespace
 
 OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Grid& grid,
@@ -340,6 +369,13 @@ OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Gri
     const kestrel::ogc::cs::ICRS crs(grid.crs);
 
     kestrel::processes::TorthoJob job;
+    // The generator's own kernels for the methods it has; the platform's resampler, with the
+    // source step of this grid, for the others.
+    const std::string name = resampler->GetMethod();
+    if (name != "near" && name != "bilinear" && name != "cubic") {
+        SetSourceStep(*resampler, *model, *surface, grid, crs);
+        job.resampler = resampler.get();
+    }
     job.sourcePath = scene.source;
     job.channels = scene.channels;
     job.model = model.get();
