@@ -382,11 +382,6 @@ void ProcessTile(const Plan& plan, Worker& w, TileOutput& ortho, TileOutput& vis
                         continue;
                     const double cols[3] = {w.col[a], w.col[b], w.col[c]};
                     const double rows[3] = {w.row[a], w.row[b], w.row[c]};
-                    if (std::max({cols[0], cols[1], cols[2]}) < zx0 ||
-                        std::min({cols[0], cols[1], cols[2]}) > zx1 ||
-                        std::max({rows[0], rows[1], rows[2]}) < zy0 ||
-                        std::min({rows[0], rows[1], rows[2]}) > zy1)
-                        continue;
                     const double heights[3] = {w.h[a], w.h[b], w.h[c]};
                     w.zbuffer.AddTriangle(cols, rows, heights);
                 }
@@ -399,6 +394,7 @@ void ProcessTile(const Plan& plan, Worker& w, TileOutput& ortho, TileOutput& vis
     src.imageWidth = plan.imageWidth, src.imageHeight = plan.imageHeight;
     src.bands = static_cast<int>(plan.bands.size());
     src.hasNoData = plan.hasNoData, src.noData = plan.noData;
+    src.anyNoData = std::find(src.hasNoData.begin(), src.hasNoData.end(), 1) != src.hasNoData.end();
     const int radius = job.resampler != nullptr
                            ? std::max(1, static_cast<int>(job.resampler->GetRadius()))
                            : trueortho::KernelRadius(plan.kernel);
