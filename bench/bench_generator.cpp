@@ -294,7 +294,8 @@ void Compare(const std::string& self, const std::string& scene, unsigned int siz
                 Measure m;
                 const std::string out =
                     Timed(ortho + " " + dir + "/master.txt --out " + dir + "/workflow --dem " +
-                              dir + "/dsm.tif --pixel-size 0.5 --srs " + options.crs +
+                              dir + "/dsm.tif --elevref ELLIPS --pixel-size 0.5 --srs " +
+                              options.crs +
                               " --quiet --proc CPU:" + std::to_string(threads),
                           m);
                 if (!std::filesystem::exists(dir + "/workflow/oblique_ortho.tif"))

@@ -13,6 +13,7 @@
 #include <cstdio>
 #include <filesystem>
 #include <functional>
+#include <limits>
 #include <memory>
 #include <sstream>
 
@@ -322,17 +323,66 @@ TEST_F(BoxFixture, VisibleGroundMatchesGdalwarpWithin1) {
     }
 }
 
-TEST_F(BoxFixture, TwoThreadsWriteWhatOneWrites) {
-    std::vector<std::vector<double>> outputs[2];
-    for (unsigned int threads : {1u, 2u}) {
+// A surface with one spot (half a metre around a ground point) whose heights are replaced.
+class SpikedSurface : public samplecity::GridSurface {
+  public:
+    SpikedSurface(const std::string& path, double x, double y, double value)
+        : GridSurface(path), x_(x), y_(y), value_(value) {}
+    void GetHeights(std::size_t n, const double* x, const double* y,
+                    double* heights) const override {
+        GridSurface::GetHeights(n, x, y, heights);
+        for (std::size_t k = 0; k < n; ++k)
+            if (std::fabs(x[k] - x_) < 0.5 && std::fabs(y[k] - y_) < 0.5)
+                heights[k] = value_;
+    }
+
+  private:
+    double x_, y_, value_;
+};
+
+// Two threads, more threads than tiles (capped before anything is made for them) and an
+// infinite post (no height there, and no tile widened by it) write what one thread writes on
+// clean data, but for the spot without height.
+TEST_F(BoxFixture, ThreadCountsAndAnInfinitePostChangeNothingElse) {
+    auto run = [&](unsigned int threads, const kestrel::dem::IElevationSource* spiked) {
         kestrel::processes::GeneratorSettings settings;
         settings.threadCount = threads;
-        ASSERT_TRUE(TorthoGenerator(settings).Generate(Job()).completed);
+        TorthoJob job = Job();
+        if (spiked != nullptr)
+            job.surface = const_cast<kestrel::dem::IElevationSource*>(spiked);
+        EXPECT_TRUE(TorthoGenerator(settings).Generate(job).completed);
+        std::vector<std::vector<double>> out;
         for (int band = 1; band <= 3; ++band)
-            outputs[threads - 1].push_back(ReadBand(dir.File("ortho.tif"), band));
-        outputs[threads - 1].push_back(ReadBand(dir.File("visibility.tif")));
+            out.push_back(ReadBand(dir.File("ortho.tif"), band));
+        out.push_back(ReadBand(dir.File("visibility.tif")));
+        return out;
+    };
+    const std::vector<std::vector<double>> clean = run(1, nullptr);
+    const SpikedSurface infinite(sample.dsmPath, options.west + 30.3, options.south + 30.3,
+                                 std::numeric_limits<double>::infinity());
+    const struct {
+        const char* name;
+        unsigned int threads;
+        const SpikedSurface* surface;
+    } cases[] = {{"two threads", 2, nullptr},
+                 {"more threads than tiles", std::numeric_limits<unsigned int>::max(), nullptr},
+                 {"an infinite post", 1, &infinite}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.name);
+        const std::vector<std::vector<double>> out = run(c.threads, c.surface);
+        ASSERT_EQ(out.size(), clean.size());
+        size_t noHeight = 0, differing = 0;
+        for (size_t k = 0; k < out[3].size(); ++k) {
+            if (out[3][k] == kestrel::processes::VISIBILITY_NODATA) {
+                ++noHeight;
+                continue;
+            }
+            for (const size_t b : {0, 1, 2, 3})
+                differing += out[b][k] != clean[b][k];
+        }
+        EXPECT_EQ(differing, 0u);
+        EXPECT_EQ(noHeight, c.surface != nullptr ? 4u : 0u);
     }
-    EXPECT_TRUE(outputs[0] == outputs[1]);
 }
 
 // No output, final or partial, is left in the directory.

@@ -78,9 +78,11 @@ void ZBuffer::AddTriangle(const double* col, const double* row, const double* he
             const double w0 = w0Line + w0dc * i, w1 = w1Line + w1dc * i;
             const double w2 = 1.0 - w0 - w1;
             const float value = static_cast<float>(zLine + dzdc * i);
-            const bool inside = w0 >= eps && w1 >= eps && w2 >= eps && value > z[i];
-            z[i] = inside ? value : z[i];
-            s[i] = inside ? slope : s[i];
+            // Selected and stored unconditionally, so that the loop has no branch.
+            const float kept = z[i], keptSlope = s[i];
+            const bool higher = (w0 >= eps) & (w1 >= eps) & (w2 >= eps) & (value > kept);
+            z[i] = higher ? value : kept;
+            s[i] = higher ? slope : keptSlope;
         }
     }
 }
