@@ -67,6 +67,10 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--of", "mem"}, "--of: mem: GDAL's MEM driver keeps no pixels"},
         {{master}, {"--of", "xyz"}, "--of: xyz: GDAL's XYZ text holds no coordinate system"},
         {{master}, {"--of", "hdr"}, "--of: hdr names the ENVI header"},
+        {{master}, {"--co", "FOO=BAR"}, "--co: Creation option \"FOO=BAR\" of GDAL's COG driver"},
+        {{master}, {"--co", "COMPRESS=ZIP"}, "COMPRESS=ZIP\" of GDAL's COG driver"},
+        {{master}, {"--co", "COMPRESS"}, "is written NAME=VALUE"},
+        {{master}, {"--of", "png", "--co", "BLOCKSIZE=64"}, "of GDAL's PNG driver"},
         {{master}, {"--resample", "gauss"}, "--resample: unknown method \"gauss\""},
         {{master}, {"--resample", "nearest"}, "--resample: unknown method \"nearest\""},
         {{master}, {"--dem", absent}, "--dem: " + absent + ": not found"},
@@ -111,6 +115,7 @@ TEST(OrthoCommandLine, ValuesThatHelpListsAreAccepted) {
         {"--of", "cog"},           {"--of", "png"},               {"--of", "jpg"},
         {"--of", "img"},           {"--of", "gpkg"},              {"--srs", "EPSG:32632"},
         {"--srs", "EPSG:4326"},    {"--proc", "CPU:2"},           {"--elunits", "FOOT"},
+        {"--co", "COMPRESS=JPEG"}, {"--co", "QUALITY=90"},        {"--co", "BLOCKSIZE=256"},
     };
     for (const auto& option : accepted) {
         SCOPED_TRACE(option[0] + " " + option[1]);

@@ -376,6 +376,94 @@ TEST(RasterWriter, EveryFileTypeRoundTripsWithItsGeoreferencing) {
             << entry.path();
 }
 
+// A COG: tiles of 512 (or as asked), lossless DEFLATE with a predictor unless a lossy method
+// is asked for, averaged overviews, and the empty pixels in a mask rather than a no-data colour.
+// Creation options the driver does not take are refused, naming them, before any file exists.
+TEST(RasterWriter, CogIsTiledCompressedWithAveragedOverviewsAndAMask) {
+    TempDir dir;
+    const struct {
+        std::string options;
+        int block;
+        std::string compression;
+        bool predictor;
+        bool overviews;
+    } cases[] = {{"", 512, "DEFLATE", true, false},
+                 {"BLOCKSIZE=128", 128, "DEFLATE", true, true},
+                 {"BLOCKSIZE=128 COMPRESS=JPEG QUALITY=90", 128, "JPEG", false, true}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.options);
+        const std::string path = dir.File("mosaic.tif");
+        {
+            BasicWriter writer(path, {1, 2, 3}, "COG", c.options);
+            writer.SetSize(300, 200);
+            writer.SetDataType(DataType::Byte);
+            writer.SetNoDataValue(0);
+            writer.SetNoDataAsMask();
+            Raster raster(300, 200, 3, DataType::Byte, Raster::Initial::Zeros);
+            for (unsigned int b = 0; b < 3; ++b)
+                for (int y = 0; y < 200; ++y)
+                    for (int x = 16; x < 300; ++x)  // the first 16 columns are empty
+                        raster.SetValue(b, x, y, 1 + Pattern(x, y, b + 1));
+            writer.Write(raster);
+            writer.Close();
+        }
+        std::unique_ptr<GDALDataset> ds(
+            GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
+        ASSERT_TRUE(ds != nullptr);
+        const char* layout = ds->GetMetadataItem("LAYOUT", "IMAGE_STRUCTURE");
+        const char* compression = ds->GetMetadataItem("COMPRESSION", "IMAGE_STRUCTURE");
+        EXPECT_STREQ(layout, "COG");
+        EXPECT_NE(std::string(compression ? compression : "").find(c.compression),
+                  std::string::npos);
+        EXPECT_EQ(ds->GetMetadataItem("PREDICTOR", "IMAGE_STRUCTURE") != nullptr, c.predictor);
+        GDALRasterBand* band = ds->GetRasterBand(1);
+        int w = 0, h = 0, hasNoData = 0;
+        band->GetBlockSize(&w, &h);
+        EXPECT_EQ(w, c.block);
+        band->GetNoDataValue(&hasNoData);
+        EXPECT_FALSE(hasNoData);
+        EXPECT_EQ(band->GetMaskFlags(), GMF_PER_DATASET);
+        GByte mask[2] = {};
+        band->GetMaskBand()->RasterIO(GF_Read, 15, 10, 2, 1, mask, 2, 1, GDT_Byte, 0, 0, nullptr);
+        EXPECT_EQ(mask[0], 0);
+        EXPECT_EQ(mask[1], 255);
+        EXPECT_EQ(band->GetOverviewCount() > 0, c.overviews);
+        if (c.overviews && c.compression == "DEFLATE") {
+            // Averaged: the overview pixel is the mean of the four it covers (none of them).
+            GByte reduced = 0;
+            band->GetOverview(0)->RasterIO(GF_Read, 12, 5, 1, 1, &reduced, 1, 1, GDT_Byte, 0, 0,
+                                           nullptr);
+            double sum = 0;
+            for (int y = 10; y < 12; ++y)
+                for (int x = 24; x < 26; ++x)
+                    sum += 1 + Pattern(x, y, 1);
+            EXPECT_NEAR(reduced, sum / 4, 0.51);
+        }
+    }
+
+    const struct {
+        std::string format;
+        std::string option;
+        std::string message;
+    } refused[] = {{"COG", "FOO=BAR", "does not support creation option FOO"},
+                   {"COG", "COMPRESS=ZIP", "ZIP"},
+                   {"COG", "QUALITY", "NAME=VALUE"},
+                   {"GTiff", "BLOCKSIZE=128", "does not support creation option BLOCKSIZE"},
+                   {"COG", "BLOCKSIZE=16", "should be >= 128"}};
+    for (const auto& r : refused) {
+        SCOPED_TRACE(r.option);
+        try {
+            BasicWriter writer(dir.File("refused.tif"), {1}, r.format, "BIGTIFF=IF_SAFER " + r.option);
+            ADD_FAILURE() << "accepted";
+        } catch (const kestrel::ParameterException& e) {
+            EXPECT_EQ(e.GetValue(), r.option);
+            EXPECT_NE(std::string(e.what()).find(r.message), std::string::npos) << e.what();
+            EXPECT_NE(std::string(e.what()).find(r.format + " driver"), std::string::npos);
+        }
+        EXPECT_FALSE(std::filesystem::exists(dir.File("refused.tif")));
+    }
+}
+
 TEST(RasterWriter, WithoutCloseTheFinalNameIsUntouched) {
     TempDir dir;
     const std::string path = dir.File("ortho.tif");
@@ -579,6 +667,11 @@ TEST(RasterUtils, FileTypesNameGdalFormats) {
         {"mem", "MEM"},   {"GTiff", "GTiff"}, {"netcdf", "netCDF"}, {"SAGA", "SAGA"}};
     for (const auto& [type, format] : table)
         EXPECT_EQ(kestrel::core::FType2FormatName(type), format) << type;
+    const std::vector<std::pair<std::string, std::string>> extensions = {
+        {"GTiff", "tif"}, {"COG", "tif"}, {"HFA", "img"}, {"GPKG", "gpkg"},
+        {"PNG", "png"},   {"JPEG", "jpg"}, {"MEM", ""}};
+    for (const auto& [format, extension] : extensions)
+        EXPECT_EQ(kestrel::core::FileExtension(format), extension) << format;
     for (const std::string& type :
          std::vector<std::string>{"", "tiff2", "ESRI Shapefile", std::string("tif\0x", 5)}) {
         try {

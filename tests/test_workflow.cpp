@@ -288,7 +288,8 @@ std::vector<std::string> MakeSample(const TempDir& dir) {
 TEST(Workflow, SampleCityEndToEnd) {
     TempDir dir;
     std::vector<std::string> args = MakeSample(dir);
-    args.insert(args.end(), {"--jobs", "2"});
+    // Blocks small enough for the sample's mosaic to have overviews.
+    args.insert(args.end(), {"--jobs", "2", "--co", "BLOCKSIZE=128"});
     const Result first = Ortho(args, dir);
     ASSERT_EQ(first.status, 0) << first.err;
     const std::string summary = ReadFile(dir.File("out/summary.json"));
@@ -365,6 +366,13 @@ TEST(Workflow, SampleCityEndToEnd) {
     EXPECT_EQ(unfilled, 0u);
     EXPECT_EQ(wrong, 0u);
     EXPECT_TRUE(Open(dir.File("out/mosaic.png")));
+    // A deliverable: a Cloud Optimized GeoTIFF, compressed, with overviews and a mask where no
+    // image sees the ground rather than a no-data colour.
+    const Result info = RunProgram("gdalinfo", {dir.File("out/mosaic.tif")}, dir);
+    for (const char* shown : {"LAYOUT=COG", "COMPRESSION=DEFLATE", "Block=128x128", "Overviews: ",
+                              "Mask Flags: PER_DATASET"})
+        EXPECT_NE(info.out.find(shown), std::string::npos) << shown << "\n" << info.out;
+    EXPECT_EQ(info.out.find("NoData Value"), std::string::npos) << info.out;
 
     // The footprints: one layer per scene, named after it, one polygon each.
     Dataset footprints = Open(dir.File("out/footprints.gpkg"), GDAL_OF_VECTOR);

@@ -88,6 +88,13 @@ const std::vector<PixelOption>& PixelOptions() {
         {"--resample", false, [](const Options& o) { return o.resample; }},
         {"--proc", false, [](const Options& o) { return o.proc; }},
         {"--of", false, [](const Options& o) { return o.format; }},
+        {"--co", false,
+         [](const Options& o) {
+             std::string text;
+             for (const std::string& option : o.creationOptions)
+                 text += (text.empty() ? "" : " ") + option;
+             return text;
+         }},
     };
     return options;
 }

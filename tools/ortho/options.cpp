@@ -134,6 +134,8 @@ Options ParseOptions(const std::vector<std::string>& args) {
             options.proc = take();
         } else if (name == "--of") {
             options.format = take();
+        } else if (name == "--co") {
+            options.creationOptions.push_back(take());
         } else if (name == "--jobs" || name == "-j") {
             const std::string text = take();
             options.jobs = ParseCount(name, text);
@@ -207,7 +209,10 @@ Output:
   --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
   --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
   --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, jpg, ...
-                      or a GDAL raster driver that creates files
+                      or a GDAL raster driver that creates files; the mosaic of tif or cog
+                      is a Cloud Optimized GeoTIFF
+  --co NAME=VALUE     a GDAL creation option of the mosaic (repeatable), as gdalwarp's -co:
+                      COMPRESS=JPEG, COMPRESS=WEBP, QUALITY=85, BLOCKSIZE=256, ...
 
 Running:
   --jobs N, -j N      scenes run at the same time (default 1)

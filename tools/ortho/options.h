@@ -33,6 +33,7 @@ struct Options {
     std::string resample = "bilinear";
     std::string proc;            // PROC text of the generator
     std::string format = "tif";  // file type of the ortho and visibility rasters
+    std::vector<std::string> creationOptions;  // --co NAME=VALUE, for the mosaic's GDAL driver
 
     unsigned int jobs = 1;  // scenes run at the same time
     // Slice of the preparation file's lines, [firstLine, endLine) counted from 0.

@@ -286,6 +286,11 @@ std::string CheckGenerator(const std::string& procText) {
 
 }  // namespace
 
+std::string MosaicFormat(const Options& options) {
+    const std::string format = kestrel::core::FType2FormatName(options.format);
+    return format == "GTiff" ? "COG" : format;
+}
+
 std::vector<std::string> CheckOptions(Options& options) {
     CheckSurfaceFile("--dem", options.dem);
     CheckSurfaceFile("--tin", options.tin);
@@ -297,6 +302,9 @@ std::vector<std::string> CheckOptions(Options& options) {
     CheckOption("--srs", [&] { CheckOutputCrs(options.srs); });
     CheckOption("--resample", [&] { options.resample = CheckResampling(options.resample); });
     CheckOption("--of", [&] { CheckFileType(options.format); });
+    CheckOption("--co", [&] {
+        kestrel::core::CheckCreationOptions(MosaicFormat(options), options.creationOptions);
+    });
     std::vector<std::string> notes;
     CheckOption("--proc", [&] {
         const std::string note = CheckGenerator(options.proc);
@@ -636,7 +644,9 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
     job.surface = surface.get();
     job.mosaicPath = mosaic;
     job.sourcePath = source;
-    job.format = kestrel::core::FType2FormatName(options.format);
+    job.format = MosaicFormat(options);
+    for (const std::string& option : options.creationOptions)
+        job.mosaicOptions += "\"" + option + "\" ";
 
     RecoveryProcess process(options.proc, job, progress);
     process.Execute();

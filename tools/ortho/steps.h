@@ -110,6 +110,10 @@ struct RecoveryScene {
     int dbmPxErr = 0;
 };
 
+// The GDAL format of the mosaic: a Cloud Optimized GeoTIFF when --of is a GeoTIFF type, the
+// format of --of otherwise. --co is checked against it.
+std::string MosaicFormat(const Options& options);
+
 // Fills the hidden ground of each scene from the others into the mosaic, and records in
 // source which scene each mosaic pixel came from.
 void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes,

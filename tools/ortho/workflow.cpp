@@ -10,6 +10,7 @@
 #include <silvan/tpmfileparser.h>
 
 #include <kestrel/file.h>
+#include <kestrel/formats.h>
 
 #include <algorithm>
 #include <cctype>
@@ -154,11 +155,24 @@ struct Output {
     std::string what;
 };
 
-// The quicklook of the raster dir/stem.FORMAT: dir/stem.png, or dir/stem_quicklook.png when the
+// The extension of the rasters of a file type: its GDAL driver's (tif for tif and cog), or the
+// type itself when the driver names none.
+std::string RasterExtension(const std::string& type) {
+    try {
+        const std::string ext = kestrel::core::FileExtension(kestrel::core::FType2FormatName(type));
+        if (!ext.empty())
+            return ext;
+    } catch (const std::exception&) {
+        // An unknown type is refused by the option checks; its name stays as given.
+    }
+    return type;
+}
+
+// The quicklook of the raster dir/stem.EXT: dir/stem.png, or dir/stem_quicklook.png when the
 // rasters are PNG files themselves, so that it does not replace the raster.
 std::string QuicklookName(const std::string& dir, const std::string& stem,
-                          const std::string& format) {
-    std::string lower = format;
+                          const std::string& ext) {
+    std::string lower = ext;
     std::transform(lower.begin(), lower.end(), lower.begin(),
                    [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
     return Join(dir, stem + (lower == "png" ? "_quicklook.png" : ".png"));
@@ -166,7 +180,8 @@ std::string QuicklookName(const std::string& dir, const std::string& stem,
 
 // The outputs of a scene named `name`, in the order of Scene's fields.
 std::vector<Output> SceneOutputs(const std::string& dir, const std::string& name,
-                                 const std::string& format) {
+                                 const std::string& type) {
+    const std::string format = RasterExtension(type);
     return {{Join(dir, name + "_ortho." + format), "the ortho"},
             {Join(dir, name + "_vis." + format), "the visibility index"},
             {Join(dir, name + ".xml"), "the scene description"},
@@ -473,7 +488,7 @@ void Workflow::Prepare() {
 
 
 std::vector<std::pair<std::string, std::string>> Workflow::RunOutputs() const {
-    const std::string f = options_.format;
+    const std::string f = RasterExtension(options_.format);
     std::vector<std::pair<std::string, std::string>> outputs = {
             {prepFile_, "the preparation file"},
             {imgSetFile_, "the image-set file"},
@@ -794,13 +809,13 @@ void Workflow::RunScene(Scene& scene) {
 }
 
 void Workflow::Recover() {
-    const std::string mosaic = Join(outDir_, "mosaic." + options_.format);
-    const std::string source = Join(outDir_, "mosaic_source." + options_.format);
+    const std::string ext = RasterExtension(options_.format);
+    const std::string mosaic = Join(outDir_, "mosaic." + ext);
+    const std::string source = Join(outDir_, "mosaic_source." + ext);
     const std::string footprints = Join(outDir_, "footprints.gpkg");
     const std::string record = Join(outDir_, "mosaic_manifest.json");
-    const std::vector<std::string> quicklooks = {
-        QuicklookName(outDir_, "mosaic", options_.format),
-        QuicklookName(outDir_, "mosaic_source", options_.format)};
+    const std::vector<std::string> quicklooks = {QuicklookName(outDir_, "mosaic", ext),
+                                                 QuicklookName(outDir_, "mosaic_source", ext)};
 
     // The mosaic is made from the scenes' outputs, so from what made them, and from the
     // image set's values and the options.

@@ -24,5 +24,16 @@ KESTREL_API std::vector<std::string> KnownFileTypes();
 // missing or not a known file type.
 KESTREL_API std::string FormatNameOfPath(const std::string& path);
 
+// The usual extension of files of a GDAL format, without the dot: "tif" for GTiff and COG,
+// the driver's own (GDAL_DMD_EXTENSION) for the others; empty when the driver names none.
+KESTREL_API std::string FileExtension(const std::string& format);
+
+// Checks GDAL creation options "NAME=VALUE" against the creation option list of the format's
+// driver, as gdal_translate's -co does: an option the driver does not know, or a value it does
+// not allow, throws ParameterException type 1 whose parameter name is "creation option" and whose
+// value is the option, with GDAL's reason.
+KESTREL_API void CheckCreationOptions(const std::string& format,
+                                      const std::vector<std::string>& options);
+
 }  // namespace core
 }  // namespace kestrel

@@ -234,8 +234,10 @@ class KESTREL_API BasicWriter : public IRasterWriter {
     // channels' numbers in the file's order; any list of the right length will do).
     // `options` are GDAL creation options "NAME=VALUE" separated by commas or blanks, added to
     // and overriding the defaults (GeoTIFF: tiled 256 x 256, DEFLATE compressed, BigTIFF when
-    // needed); empty for the defaults. Throws ParameterException (type 1) naming the format
-    // when GDAL has no such raster driver or it can neither create nor copy.
+    // needed; COG: tiles of 512, DEFLATE with a predictor, overviews averaged); empty for the
+    // defaults. Throws ParameterException (type 1) naming the format when GDAL has no such
+    // raster driver or it can neither create nor copy, and naming the option when the driver
+    // does not take it (core::CheckCreationOptions).
     BasicWriter(const std::string& path, const std::vector<unsigned int>& channels,
                 const std::string& format, const std::string& options);
     // Without Close, removes the temporary and leaves the final name as it was.
@@ -282,6 +284,10 @@ class KESTREL_API BasicWriter : public IRasterWriter {
 
     // The GDAL driver the file is written with.
     std::string GetFormatName() const;
+    // Pixels at the no-data value in every channel are marked in a mask band instead, and the
+    // channels have no no-data value (GeoTIFF and COG, whose internal mask every reader
+    // follows); other formats keep the no-data value. Before the file is created.
+    void SetNoDataAsMask();
 
     struct Impl;
 

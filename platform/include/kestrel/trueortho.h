@@ -206,7 +206,10 @@ struct KESTREL_API RecoveryJob {
     // Heights for the viewing angles (may be null: angles unknown), in the models' datum.
     dem::IElevationSource* surface = nullptr;
     std::string mosaicPath, sourcePath;  // the mosaic and the raster of source scenes
+    // A GDAL driver. A COG mosaic marks the pixels no scene fills in a mask, not by a colour;
+    // the source raster's overviews take the nearest value.
     std::string format = "GTiff";
+    std::string mosaicOptions;  // the mosaic's creation options (BasicWriter's `options`)
     unsigned int tileSize = 256;
 };
 

@@ -4,6 +4,7 @@
 #include <cctype>
 #include <utility>
 
+#include <cpl_string.h>
 #include <gdal.h>
 
 #include <kestrel/exception.h>
@@ -95,6 +96,45 @@ std::string FormatNameOfPath(const std::string& path) {
             return entry.second;
     }
     return "";
+}
+
+std::string FileExtension(const std::string& format) {
+    if (EQUAL(format.c_str(), "GTiff") || EQUAL(format.c_str(), "COG"))
+        return "tif";
+    gdalsupport::EnsureRegistered();
+    GDALDriverH driver = GDALGetDriverByName(format.c_str());
+    const char* extension =
+        driver != nullptr ? GDALGetMetadataItem(driver, GDAL_DMD_EXTENSION, nullptr) : nullptr;
+    return extension != nullptr ? Lower(extension) : "";
+}
+
+void CheckCreationOptions(const std::string& format, const std::vector<std::string>& options) {
+    gdalsupport::EnsureRegistered();
+    GDALDriverH driver = GDALGetDriverByName(format.c_str());
+    if (driver == nullptr)
+        FType2FormatName(format);  // throws, naming the format
+    for (const std::string& option : options) {
+        const std::size_t equals = option.find('=');
+        std::string reason;
+        if (equals == std::string::npos || equals == 0) {
+            reason = "a creation option is written NAME=VALUE";
+        } else {
+            const char* list[] = {option.c_str(), nullptr};
+            gdalsupport::ErrorCapture errors;
+            if (!GDALValidateCreationOptions(driver, const_cast<char**>(list)))
+                reason = errors.Reason();
+        }
+        if (!reason.empty()) {
+            const std::string name = GDALGetDriverShortName(driver);
+            const std::string known =
+                "the creation options that gdalinfo --format " + name + " lists";
+            KESTREL_THROW(ParameterException, "creation option", ParameterException::Unsupported,
+                          option, known,
+                          FormatString("Creation option \"%s\" of GDAL's %s driver: %s (see %s)",
+                                       option.c_str(), name.c_str(), reason.c_str(),
+                                       known.c_str()));
+        }
+    }
 }
 
 }  // namespace core

@@ -95,7 +95,14 @@ bool ReplaceFile(const std::string& from, const std::string& to) {
 
 CPLStringList DefaultCreationOptions(const std::string& format, DataType type) {
     CPLStringList options;
-    if (format == "GTiff") {
+    if (format == "COG") {
+        // Deliverable: 512-pixel tiles, lossless compression, overviews averaged.
+        options.SetNameValue("BLOCKSIZE", "512");
+        options.SetNameValue("COMPRESS", "DEFLATE");
+        options.SetNameValue("PREDICTOR", "YES");
+        options.SetNameValue("OVERVIEW_RESAMPLING", "AVERAGE");
+        options.SetNameValue("BIGTIFF", "IF_SAFER");
+    } else if (format == "GTiff") {
         options.SetNameValue("TILED", "YES");
         options.SetNameValue("BLOCKXSIZE", "256");
         options.SetNameValue("BLOCKYSIZE", "256");
@@ -108,16 +115,34 @@ CPLStringList DefaultCreationOptions(const std::string& format, DataType type) {
 }
 
 // Options "NAME=VALUE" separated by commas, semicolons or blanks.
-void AddOptions(CPLStringList& options, const std::string& text) {
+std::vector<std::string> SplitOptions(const std::string& text) {
+    std::vector<std::string> options;
     char** tokens = CSLTokenizeString2(text.c_str(), ",; \t", CSLT_HONOURSTRINGS);
-    for (char** token = tokens; token != nullptr && *token != nullptr; ++token) {
+    for (char** token = tokens; token != nullptr && *token != nullptr; ++token)
+        options.emplace_back(*token);
+    CSLDestroy(tokens);
+    return options;
+}
+
+// The options of text added to (and overriding) the defaults. A compression given without a
+// predictor drops the default predictor unless it is one that takes it.
+void AddOptions(CPLStringList& options, const std::string& text) {
+    bool compress = false;
+    bool predictor = false;
+    for (const std::string& option : SplitOptions(text)) {
         char* key = nullptr;
-        const char* value = CPLParseNameValue(*token, &key);
-        if (key != nullptr && value != nullptr)
+        const char* value = CPLParseNameValue(option.c_str(), &key);
+        if (key != nullptr && value != nullptr) {
             options.SetNameValue(key, value);
+            compress = compress || EQUAL(key, "COMPRESS");
+            predictor = predictor || EQUAL(key, "PREDICTOR");
+        }
         CPLFree(key);
     }
-    CSLDestroy(tokens);
+    const char* method = options.FetchNameValue("COMPRESS");
+    if (compress && !predictor && method != nullptr && !EQUAL(method, "DEFLATE") &&
+        !EQUAL(method, "LZW") && !EQUAL(method, "ZSTD"))
+        options.SetNameValue("PREDICTOR", nullptr);
 }
 
 bool IsDirectory(const std::string& path) {
@@ -175,6 +200,7 @@ struct BasicWriter::Impl {
     DataType type = DataType::Unknown;
     Tiling tiling;
     bool tileSizeSet = false;
+    bool noDataAsMask = false;  // the no-data pixels go to a mask band where the format has one
     std::unique_ptr<ogc::cs::ICRS> crs;
     std::unique_ptr<ogc::cs::GeocodingInfo> geocoding;
     std::vector<std::optional<double>> noData;
@@ -315,6 +341,7 @@ BasicWriter::BasicWriter(const std::string& path, const std::vector<unsigned int
     impl_->options = options;
     impl_->driver = RasterDriver(format, path, KESTREL_HERE);
     impl_->format = impl_->driver->GetDescription();
+    core::CheckCreationOptions(impl_->format, SplitOptions(options));
     impl_->copyOnClose = impl_->driver->GetMetadataItem(GDAL_DCAP_CREATE) == nullptr;
     if (channels.empty()) {
         KESTREL_THROW(
@@ -407,6 +434,11 @@ void BasicWriter::SetChannelDescription(unsigned int c, const std::string& text)
     impl_->descriptions.resize(impl_->channelCount);
     impl_->descriptions[c] = text;
     impl_->RefreshInfos();
+}
+
+void BasicWriter::SetNoDataAsMask() {
+    RequireNotCreated(*impl_, "mask", KESTREL_HERE);
+    impl_->noDataAsMask = true;
 }
 
 void BasicWriter::SetMetadataItem(const std::string& name, const std::string& value,
@@ -611,6 +643,54 @@ std::string LostGeoreferencing(const BasicWriter::Impl& impl, const std::string&
     return "";
 }
 
+// Whether a value is the no-data value (NaN included).
+bool IsNoData(double value, const std::optional<double>& noData) {
+    return noData.has_value() && (value == *noData || (std::isnan(value) && std::isnan(*noData)));
+}
+
+// Puts the pixels that are no data in every channel into the GeoTIFF's internal mask, and drops
+// the channels' no-data values, so that readers see the mask rather than a colour.
+void NoDataToMask(BasicWriter::Impl& impl, GDALDataset& ds) {
+    if (std::none_of(impl.noData.begin(), impl.noData.end(),
+                     [](const std::optional<double>& v) { return v.has_value(); }))
+        return;
+    CPLConfigOptionSetter internal("GDAL_TIFF_INTERNAL_MASK", "YES", true);
+    if (ds.CreateMaskBand(GMF_PER_DATASET) != CE_None)
+        return;
+    GDALRasterBand* mask = ds.GetRasterBand(1)->GetMaskBand();
+    const int width = ds.GetRasterXSize();
+    const int height = ds.GetRasterYSize();
+    const int bands = static_cast<int>(impl.channelCount);
+    const int step = 512;
+    std::vector<double> values;
+    std::vector<GByte> valid;
+    for (int y = 0; y < height; y += step) {
+        for (int x = 0; x < width; x += step) {
+            const int w = std::min(step, width - x);
+            const int h = std::min(step, height - y);
+            const std::size_t count = static_cast<std::size_t>(w) * h;
+            values.resize(count * bands);
+            valid.assign(count, 0);
+            if (ds.RasterIO(GF_Read, x, y, w, h, values.data(), w, h, GDT_Float64, bands, nullptr,
+                            0, 0, 0, nullptr) != CE_None)
+                return;
+            for (int b = 0; b < bands; ++b) {
+                const std::optional<double> noData =
+                    b < static_cast<int>(impl.noData.size()) ? impl.noData[b] : std::nullopt;
+                const double* band = values.data() + count * b;
+                for (std::size_t i = 0; i < count; ++i)
+                    if (!IsNoData(band[i], noData))
+                        valid[i] = 255;
+            }
+            if (mask->RasterIO(GF_Write, x, y, w, h, valid.data(), w, h, GDT_Byte, 0, 0,
+                               nullptr) != CE_None)
+                return;
+        }
+    }
+    for (int b = 1; b <= bands; ++b)
+        ds.GetRasterBand(b)->DeleteNoDataValue();
+}
+
 }  // namespace
 
 void BasicWriter::Close() {
@@ -643,6 +723,9 @@ void BasicWriter::Close() {
     {
         gdalsupport::ErrorCapture errors;
         impl.dataset->FlushCache(false);
+        if (impl.noDataAsMask && EQUAL(impl.dataset->GetDriverName(), "GTiff") &&
+            !errors.Failed())
+            NoDataToMask(impl, *impl.dataset);
         if (impl.copyOnClose && !errors.Failed()) {
             CPLStringList options = DefaultCreationOptions(impl.format, impl.type);
             AddOptions(options, impl.options);

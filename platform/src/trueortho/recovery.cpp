@@ -380,13 +380,14 @@ void ProcessTile(const RecoveryJob& job, const Grid& grid, Worker& w,
 
 // A writer of one of the outputs on the common grid.
 std::unique_ptr<datasources::BasicWriter> OutputWriter(const std::string& path,
-                                                       const std::string& format, const Grid& grid,
+                                                       const std::string& format,
+                                                       const std::string& options, const Grid& grid,
                                                        int bands, GDALDataType type,
                                                        double noData) {
     std::vector<unsigned int> channels(bands);
     for (int b = 0; b < bands; ++b)
         channels[b] = b + 1;
-    auto writer = std::make_unique<datasources::BasicWriter>(path, channels, format, "");
+    auto writer = std::make_unique<datasources::BasicWriter>(path, channels, format, options);
     writer->SetSize(grid.pixels, grid.lines);
     writer->SetDataType(datasources::FromGDAL(type));
     writer->SetCRS(grid.crs.get());
@@ -415,10 +416,13 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
         return result;
 
     const SceneInfo& first = grid.scenes[0];
-    auto mosaic = OutputWriter(job.mosaicPath, job.format, grid, grid.bands, grid.type,
-                               first.hasNoData ? first.noData : 0.0);
-    auto source = OutputWriter(job.sourcePath, job.format, grid, 1,
-                               job.scenes.size() < 255 ? GDT_Byte : GDT_UInt16, 0.0);
+    const bool cog = job.format == "COG";
+    auto mosaic = OutputWriter(job.mosaicPath, job.format, job.mosaicOptions, grid, grid.bands,
+                               grid.type, first.hasNoData ? first.noData : 0.0);
+    if (cog)
+        mosaic->SetNoDataAsMask();
+    auto source = OutputWriter(job.sourcePath, job.format, cog ? "OVERVIEW_RESAMPLING=NEAREST" : "",
+                               grid, 1, job.scenes.size() < 255 ? GDT_Byte : GDT_UInt16, 0.0);
 
     // Each tile reads the visibility with a border of the pixel error: tiles of at least twice
     // that (up to 1024) keep the border's share of the reading bounded.
