@@ -373,6 +373,28 @@ TEST(Workflow, SampleCityEndToEnd) {
                               "Mask Flags: PER_DATASET"})
         EXPECT_NE(info.out.find(shown), std::string::npos) << shown << "\n" << info.out;
     EXPECT_EQ(info.out.find("NoData Value"), std::string::npos) << info.out;
+    // Quicklooks lie where their rasters do (world files); the source raster's has a legend,
+    // beside it and in the summary, whose value k names scene k.
+    double mosaicGeo[6] = {0}, pictureGeo[6] = {0};
+    Dataset picture = Open(dir.File("out/mosaic_source.png"));
+    ASSERT_TRUE(picture);
+    ASSERT_EQ(mosaic->GetGeoTransform(mosaicGeo), CE_None);
+    ASSERT_EQ(picture->GetGeoTransform(pictureGeo), CE_None);
+    EXPECT_DOUBLE_EQ(pictureGeo[0], mosaicGeo[0]);
+    EXPECT_DOUBLE_EQ(pictureGeo[3], mosaicGeo[3]);
+    EXPECT_NEAR(pictureGeo[1] * picture->GetRasterXSize(), mosaicGeo[1] * width, 1e-6);
+    CPLJSONDocument legendFile, summaryFile;
+    ASSERT_TRUE(legendFile.Load(dir.File("out/mosaic_source_legend.json")));
+    ASSERT_TRUE(summaryFile.Load(dir.File("out/summary.json")));
+    const CPLJSONArray legend = legendFile.GetRoot().ToArray();
+    EXPECT_EQ(summaryFile.GetRoot().GetArray("mosaic_legend").Format(CPLJSONObject::PrettyFormat::Plain),
+              legend.Format(CPLJSONObject::PrettyFormat::Plain));
+    ASSERT_EQ(legend.Size(), static_cast<int>(names.size()) + 1);
+    for (int k = 1; k < legend.Size(); ++k) {
+        EXPECT_EQ(legend[k].GetInteger("value"), k);
+        EXPECT_EQ(legend[k].GetString("scene"), names[k - 1]);
+        EXPECT_EQ(legend[k].GetString("colour").size(), 7u);
+    }
 
     // The footprints: one layer per scene, named after it, one polygon each.
     Dataset footprints = Open(dir.File("out/footprints.gpkg"), GDAL_OF_VECTOR);

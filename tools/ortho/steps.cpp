@@ -690,6 +690,23 @@ void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid
         FailFile(path, "cannot be written", errors);
 }
 
+namespace {
+
+// Classes and image numbers as distinct colours.
+const unsigned char kPalette[][3] = {{40, 40, 40},   {80, 200, 80},  {220, 60, 60},
+                                     {60, 120, 230}, {240, 200, 40}, {200, 80, 220},
+                                     {60, 210, 210}, {250, 140, 40}, {150, 150, 150}};
+constexpr int kColours = sizeof kPalette / sizeof kPalette[0];
+
+}  // namespace
+
+std::string SourceColour(unsigned int value) {
+    const unsigned char* rgb = kPalette[value % kColours];
+    char text[8];
+    std::snprintf(text, sizeof text, "#%02x%02x%02x", rgb[0], rgb[1], rgb[2]);
+    return text;
+}
+
 void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook kind) {
     GdalErrors errors;
     DatasetPtr source(
@@ -714,13 +731,18 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     if (source->RasterIO(GF_Read, 0, 0, width, height, all.data(), outWidth, outHeight,
                          GDT_Float64, bands, bandList.data(), 0, 0, 0, nullptr) != CE_None)
         FailFile(raster, "cannot be read", errors);
+    // Empty where a band's mask says so: its no-data value, or the file's mask band.
     std::vector<bool> empty(count, false);
+    std::vector<GByte> mask(count);
     for (int b = 0; b < bands; ++b) {
         GDALRasterBand* band = source->GetRasterBand(b + 1);
-        int hasNoData = 0;
-        const double noData = band->GetNoDataValue(&hasNoData);
+        const bool masked = band->GetMaskFlags() != GMF_ALL_VALID;
+        if (masked && band->GetMaskBand()->RasterIO(GF_Read, 0, 0, width, height, mask.data(),
+                                                    outWidth, outHeight, GDT_Byte, 0, 0,
+                                                    nullptr) != CE_None)
+            FailFile(raster, "cannot be read", errors);
         for (std::size_t i = 0; i < count; ++i) {
-            if (std::isnan(values[b][i]) || (hasNoData && values[b][i] == noData))
+            if (std::isnan(values[b][i]) || (masked && mask[i] == 0))
                 empty[i] = true;
         }
     }
@@ -728,25 +750,28 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     // Red, green, blue, alpha.
     std::vector<std::vector<unsigned char>> rgba(4, std::vector<unsigned char>(count, 0));
     if (kind == Quicklook::Image) {
+        // One stretch for all bands, so that colours keep their balance: between the 2nd and
+        // 98th percentiles of the values of the pixels with data (selected, not sorted: the
+        // quicklook has millions of them).
+        std::vector<double> data;
+        data.reserve(count * static_cast<std::size_t>(bands));
         for (int b = 0; b < bands; ++b) {
-            // Stretch between the 2nd and 98th percentiles of the pixels with data (selected,
-            // not sorted: the quicklook has millions of them).
-            std::vector<double> data;
-            data.reserve(count);
             for (std::size_t i = 0; i < count; ++i) {
                 if (!empty[i])
                     data.push_back(values[b][i]);
             }
-            auto percentile = [&data](std::size_t share, double none) {
-                if (data.empty())
-                    return none;
-                const auto at = data.begin() + static_cast<std::ptrdiff_t>(data.size() * share / 100);
-                std::nth_element(data.begin(), at, data.end());
-                return *at;
-            };
-            const double low = percentile(2, 0.0);
-            const double high = percentile(98, 1.0);
-            const double scale = high > low ? 254.0 / (high - low) : 0.0;
+        }
+        auto percentile = [&data](std::size_t share, double none) {
+            if (data.empty())
+                return none;
+            const auto at = data.begin() + static_cast<std::ptrdiff_t>(data.size() * share / 100);
+            std::nth_element(data.begin(), at, data.end());
+            return *at;
+        };
+        const double low = percentile(2, 0.0);
+        const double high = percentile(98, 1.0);
+        const double scale = high > low ? 254.0 / (high - low) : 0.0;
+        for (int b = 0; b < bands; ++b) {
             for (std::size_t i = 0; i < count; ++i) {
                 const double v = 1.0 + (values[b][i] - low) * scale;
                 const auto byte = static_cast<unsigned char>(std::clamp(v, 1.0, 255.0));
@@ -755,16 +780,11 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
             }
         }
     } else {
-        // Classes and image numbers as distinct colours.
-        static const unsigned char palette[][3] = {{40, 40, 40},   {80, 200, 80},  {220, 60, 60},
-                                                   {60, 120, 230}, {240, 200, 40}, {200, 80, 220},
-                                                   {60, 210, 210}, {250, 140, 40}, {150, 150, 150}};
-        constexpr int kColours = sizeof palette / sizeof palette[0];
         for (std::size_t i = 0; i < count; ++i) {
             const auto v = static_cast<long long>(std::llround(values[0][i]));
             const int index = static_cast<int>(((v % kColours) + kColours) % kColours);
             for (int c = 0; c < 3; ++c)
-                rgba[c][i] = palette[index][c];
+                rgba[c][i] = kPalette[index][c];
         }
     }
     for (std::size_t i = 0; i < count; ++i)
@@ -780,6 +800,15 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
             FailFile(png, "cannot be drawn", errors);
     }
     picture->GetRasterBand(4)->SetColorInterpretation(GCI_AlphaBand);
+    // A world file places the picture where the raster lies, at its own pixel size.
+    double geo[6] = {};
+    const bool placed = source->GetGeoTransform(geo) == CE_None;
+    if (placed) {
+        const double sx = static_cast<double>(width) / outWidth;
+        const double sy = static_cast<double>(height) / outHeight;
+        geo[1] *= sx, geo[4] *= sx, geo[2] *= sy, geo[5] *= sy;
+        picture->SetGeoTransform(geo);
+    }
     RemoveFile(png);
     // The fastest deflate level: a quicklook is looked at, not archived.
     const char* const fast[] = {"ZLEVEL=1", nullptr};
@@ -789,6 +818,9 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
         FailFile(png, "cannot be written", errors);
     written.reset();
     RemoveFile(png + ".aux.xml");
+    // NAME.pgw, which no raster format but PNG reads (a .wld would be a JPEG raster's too).
+    if (placed && !GDALWriteWorldFile(png.c_str(), "pgw", geo))
+        FailFile(png, "cannot have its world file written", errors);
 }
 
 }  // namespace ortho

@@ -131,6 +131,9 @@ void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid
 
 // A PNG picture of a raster for people to look at, at most 2048 pixels wide.
 enum class Quicklook { Image, Visibility, SourceIndex };
+// Each quicklook has a world file beside it (NAME.pgw); an image's bands share one stretch.
 void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook kind);
+// The colour of a value of the source raster in its quicklook, "#rrggbb".
+std::string SourceColour(unsigned int value);
 
 }  // namespace ortho

@@ -160,6 +160,18 @@ bool ReadJsonString(const std::string& text, std::size_t& at, std::string& value
     return false;
 }
 
+std::string LegendJson(const std::vector<std::string>& scenes,
+                       const std::vector<std::string>& colours) {
+    std::ostringstream out;
+    out << "[";
+    for (std::size_t k = 0; k < colours.size() && k <= scenes.size(); ++k)
+        out << (k ? ", " : "") << "{\"value\": " << k
+            << ", \"scene\": " << (k == 0 ? "null" : JsonString(scenes[k - 1]))
+            << ", \"colour\": " << JsonString(colours[k]) << "}";
+    out << "]";
+    return out.str();
+}
+
 std::string ToJson(const RunSummary& summary) {
     std::ostringstream out;
     out << "{\n  \"master\": " << JsonString(summary.master)
@@ -187,6 +199,8 @@ std::string ToJson(const RunSummary& summary) {
     for (std::size_t i = 0; i < summary.mosaicScenes.size(); ++i)
         out << (i ? ", " : "") << JsonString(summary.mosaicScenes[i]);
     out << "],\n";
+    out << "  \"mosaic_legend\": " << LegendJson(summary.mosaicScenes, summary.mosaicColours)
+        << ",\n";
     out << "  \"footprints\": " << PathOrNull(summary.footprints) << ",\n";
     out << "  \"quicklooks\": [";
     for (std::size_t i = 0; i < summary.quicklooks.size(); ++i)

@@ -29,6 +29,8 @@ struct RunSummary {
     std::string mosaic;        // empty: not made by this run
     std::string mosaicSource;  // which image each mosaic pixel came from: 1 + its index in
     std::vector<std::string> mosaicScenes;  // these scene names, 0 where none sees the pixel
+    // The colour of each value in the source raster's quicklook: [0] for 0, [k] for value k.
+    std::vector<std::string> mosaicColours;
     std::string mosaicReason;  // why the mosaic was made in this run; empty: kept
     std::string footprints;
     std::vector<std::string> quicklooks;
@@ -38,6 +40,11 @@ struct RunSummary {
 };
 
 std::string ToJson(const RunSummary& summary);
+
+// The legend of the source raster's quicklook, a JSON array: {"value": 0, "scene": null,
+// "colour": "#282828"}, then {"value": k, "scene": scenes[k-1], "colour": colours[k]}.
+std::string LegendJson(const std::vector<std::string>& scenes,
+                       const std::vector<std::string>& colours);
 
 // A JSON string of any bytes, valid UTF-8: control characters escaped, and each byte that is
 // not part of valid UTF-8 written as the lone surrogate \udcXX (Python's "surrogateescape"),

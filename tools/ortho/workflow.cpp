@@ -501,6 +501,7 @@ std::vector<std::pair<std::string, std::string>> Workflow::RunOutputs() const {
             {Join(outDir_, "mosaic_source." + f), "the mosaic's source raster"},
             {QuicklookName(outDir_, "mosaic", f), "the mosaic's quicklook"},
             {QuicklookName(outDir_, "mosaic_source", f), "the source raster's quicklook"},
+            {Join(outDir_, "mosaic_source_legend.json"), "the source quicklook's legend"},
             {Join(outDir_, "mosaic_manifest.json"), "the mosaic's record of inputs"}};
     if (options_.hasLines)
         outputs.emplace_back(Join(outDir_, SummaryName()), "the slice's summary");
@@ -816,10 +817,12 @@ void Workflow::Recover() {
     const std::string record = Join(outDir_, "mosaic_manifest.json");
     const std::vector<std::string> quicklooks = {QuicklookName(outDir_, "mosaic", ext),
                                                  QuicklookName(outDir_, "mosaic_source", ext)};
+    const std::string legend = Join(outDir_, "mosaic_source_legend.json");
 
     // The mosaic is made from the scenes' outputs, so from what made them, and from the
     // image set's values and the options.
     std::vector<RecoveryScene> inputs;
+    std::vector<std::string> mosaicScenes;
     std::vector<FootprintLayer> layers;
     Manifest made;
     made.Set("program", ProgramVersion());
@@ -840,13 +843,18 @@ void Workflow::Recover() {
             continue;
         inputs.push_back({scene.id, scene.input.source, scene.input.mmseg, scene.ortho,
                           scene.visibility, scene.radioDif, scene.dbmPxErr});
+        mosaicScenes.push_back(scene.name);
     }
+    // The source quicklook's colours: value k stands for mosaicScenes[k-1].
+    std::vector<std::string> colours;
+    for (unsigned int k = 0; k <= mosaicScenes.size(); ++k)
+        colours.push_back(SourceColour(k));
     if (layers.empty())
         return;
 
     std::vector<std::string> outputs = {footprints};
     if (!inputs.empty())
-        outputs.insert(outputs.end(), {mosaic, source, quicklooks[0], quicklooks[1]});
+        outputs.insert(outputs.end(), {mosaic, source, quicklooks[0], quicklooks[1], legend});
     std::string reason;
     Manifest earlier;
     if (options_.overwrite)
@@ -891,6 +899,7 @@ void Workflow::Recover() {
                 Publish(PartName(quicklooks[0]), quicklooks[0]);
                 WriteQuicklook(source, PartName(quicklooks[1]), Quicklook::SourceIndex);
                 Publish(PartName(quicklooks[1]), quicklooks[1]);
+                WriteFileAtomically(legend, LegendJson(mosaicScenes, colours) + "\n");
                 AddStep("mosaic quicklooks", SecondsSince(step));
                 ThrowIfInterrupted();
             } catch (const std::exception& e) {
@@ -908,10 +917,8 @@ void Workflow::Recover() {
     if (!inputs.empty()) {
         summary_.mosaic = mosaic;
         summary_.mosaicSource = source;
-        for (const Scene& scene : scenes_) {
-            if (scene.inImageSet && (scene.status == "done" || scene.status == "complete"))
-                summary_.mosaicScenes.push_back(scene.name);
-        }
+        summary_.mosaicScenes = mosaicScenes;
+        summary_.mosaicColours = colours;
         summary_.quicklooks = quicklooks;
     }
 }
