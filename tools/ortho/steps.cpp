@@ -178,6 +178,18 @@ bool ReadGrid(const std::string& path, Grid& grid) {
     return true;
 }
 
+std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
+                                                          const std::string& source, int mmseg) {
+    if (!options.cameras.empty())
+        return kestrel::mathmodel::OpenCameraModel(source, options.cameras, options.camerasSrs);
+    return std::unique_ptr<kestrel::mathmodel::IMathModel>(GetMathModel(source, mmseg));
+}
+
+std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
+                                                          const SceneInput& scene) {
+    return OpenModel(options, scene.source, scene.mmseg);
+}
+
 void CheckOptions(const Options& options) {
     GetVertDatum(options.elevref);
     double offset = 0.0, scale = 1.0;
@@ -227,7 +239,7 @@ Grid SceneLayout(const Options& options, const SceneInput& scene, const std::str
     GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
     std::unique_ptr<kestrel::datasources::IRasterReader> reader(
         GetRasterReader(dataset.get(), sourceChannels));
-    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetMathModel(scene.source, scene.mmseg));
+    const std::unique_ptr<kestrel::mathmodel::IMathModel> model = OpenModel(options, scene);
     const std::unique_ptr<kestrel::dem::IElevationSource> surface =
         OpenSurface(options, model.get());
 
@@ -332,7 +344,7 @@ class RecoveryProcess : public kestrel::processes::silvan::TOPPFBase {
 OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Grid& grid,
                       const std::string& ortho, const std::string& visibility,
                       const StepProgress& progress) {
-    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetMathModel(scene.source, scene.mmseg));
+    const std::unique_ptr<kestrel::mathmodel::IMathModel> model = OpenModel(options, scene);
     const std::unique_ptr<kestrel::dem::IElevationSource> surface =
         OpenSurface(options, model.get());
     std::string method = options.resample;
@@ -383,7 +395,7 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
     std::vector<std::unique_ptr<kestrel::mathmodel::IMathModel>> models;
     kestrel::processes::RecoveryJob job;
     for (const RecoveryScene& scene : scenes) {
-        models.emplace_back(GetMathModel(scene.source, scene.mmseg));
+        models.push_back(OpenModel(options, scene.source, scene.mmseg));
         kestrel::processes::RecoveryScene input;
         input.orthoPath = scene.ortho;
         input.visibilityPath = scene.visibility;

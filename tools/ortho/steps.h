@@ -49,6 +49,13 @@ using StepProgress = std::function<bool(double fraction)>;
 // throws for it.
 void CheckOptions(const Options& options);
 
+// The math model of a source: the camera of --cameras when given, else the source's own model
+// of segment mmseg.
+std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
+                                                          const std::string& source, int mmseg);
+std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
+                                                          const SceneInput& scene);
+
 // The surface model of the options (--dem or --tin) with the heights corrected and delivered in
 // the datum of the math model (null: the ellipsoid). The caller owns it.
 std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(

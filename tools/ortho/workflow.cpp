@@ -348,7 +348,8 @@ void Workflow::MakeGrid() {
     // The grid depends on the surface, the output options and every line's source.
     std::string inputs = options_.dem + "|" + options_.tin + "|" + options_.elevref + "|" +
                          FactorsText(options_.elfactor) + "|" + options_.elunits + "|" +
-                         options_.srs + "|" + std::to_string(options_.pixelSize) + "|";
+                         options_.srs + "|" + std::to_string(options_.pixelSize) + "|" +
+                         options_.cameras + "|" + options_.camerasSrs + "|";
     for (const Scene& scene : scenes_) {
         if (!scene.error.empty())
             continue;
@@ -400,6 +401,12 @@ bool Workflow::IsComplete(const Scene& scene) const {
     const double made = ModifiedTime(scene.xml);
     if (made < ModifiedTime(scene.input.source) ||
         made < ModifiedTime(options_.dem.empty() ? options_.tin : options_.dem))
+        return false;
+    // So does the file of its camera.
+    const std::string camera = options_.cameras.empty()
+                                   ? kestrel::mathmodel::CameraSideFile(scene.input.source)
+                                   : options_.cameras;
+    if (FileExists(camera) && made < ModifiedTime(camera))
         return false;
     try {
         std::unique_ptr<TOSceneParser> description;

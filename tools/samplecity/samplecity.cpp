@@ -9,6 +9,7 @@
 #include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <thread>
 
@@ -638,6 +639,23 @@ Sample MakeSample(const std::string& directory, const CityOptions& options, unsi
         kestrel::mathmodel::WriteCameraFile(image.cameraPath, image.camera->Intrinsics(),
                                             image.camera->Pose());
         sample.images.push_back(std::move(image));
+    }
+    // The same cameras as an exterior-orientation table, each row naming its image's side file
+    // as its interior orientation.
+    {
+        std::string table = "# image X Y Z omega phi kappa camera (" + options.crs + ")\n";
+        for (const SampleImage& image : sample.images) {
+            const auto& c = image.camera->Pose().centre;
+            const auto opk = kestrel::mathmodel::OpkFromRotation(image.camera->Pose().rotation);
+            table += FormatString("%s %.6f %.6f %.6f %.12f %.12f %.12f %s\n",
+                                  std::filesystem::path(image.path).filename().string().c_str(),
+                                  c[0], c[1], c[2], opk[0], opk[1], opk[2],
+                                  std::filesystem::path(image.cameraPath).filename().string().c_str());
+        }
+        std::ofstream out(directory + "/cameras.txt", std::ios::binary);
+        if (!(out << table).flush())
+            KESTREL_THROW(DataException, FormatString("%s/cameras.txt: cannot write the table",
+                                                      directory.c_str()));
     }
     // The master parameter file: fili; dbic; mmseg; dbiw; srcBgd; edgeClip; radioDif; dbmPxErr;
     // role. The radiometric levels differ so that the fill order shows.

@@ -94,6 +94,8 @@ KESTREL_API std::unique_ptr<IMathModel> MakeFrameCameraModel(const CameraIntrins
 // R2(p) = [cos p 0 -sin p; 0 1 0; sin p 0 cos p], R3(k) = [cos k sin k 0; -sin k cos k 0; 0 0 1];
 // R = diag(1, -1, -1) M.
 KESTREL_API std::array<double, 9> RotationFromOpk(double omega, double phi, double kappa);
+// Omega, phi, kappa in degrees of such an R (phi within [-90, 90]).
+KESTREL_API std::array<double, 3> OpkFromRotation(const std::array<double, 9>& rotation);
 // R of a rotation vector (axis times angle in radians), as OpenCV's Rodrigues.
 KESTREL_API std::array<double, 9> RotationFromAxisAngle(const std::array<double, 3>& vector);
 

@@ -283,7 +283,7 @@ std::unique_ptr<IMathModel> FromReconstruction(const CPLJSONObject& root, const 
                                                           where.c_str(), id.c_str()));
             }
             const CameraIntrinsics intrinsics =
-                FromOpenSfm(camera, FormatString("%s, camera \"%s\"", file.c_str(), id.c_str()));
+                FromOpenSfm(camera, FormatString("%s, camera \"%s\"", where.c_str(), id.c_str()));
             CheckSize(intrinsics, width, height, where, image);
             const CPLJSONObject lla = reconstruction.GetObj("reference_lla");
             const std::string origin = FormatString("%s, reference_lla", file.c_str());

@@ -401,6 +401,14 @@ std::array<double, 9> RotationFromOpk(double omega, double phi, double kappa) {
     return Multiply(flip, Multiply(r3, Multiply(r2, r1)));
 }
 
+std::array<double, 3> OpkFromRotation(const std::array<double, 9>& r) {
+    // M = diag(1, -1, -1) R: M[2][0] = sin phi, M[2][1] = -cos phi sin omega,
+    // M[2][2] = cos phi cos omega, M[1][0] = -sin kappa cos phi, M[0][0] = cos kappa cos phi.
+    const double m00 = r[0], m10 = -r[3], m20 = -r[6], m21 = -r[7], m22 = -r[8];
+    const double phi = std::asin(std::clamp(m20, -1.0, 1.0));
+    return {std::atan2(-m21, m22) * 180 / kPi, phi * 180 / kPi, std::atan2(-m10, m00) * 180 / kPi};
+}
+
 std::array<double, 9> RotationFromAxisAngle(const std::array<double, 3>& v) {
     const double angle = std::sqrt(v[0] * v[0] + v[1] * v[1] + v[2] * v[2]);
     if (angle < 1e-300)
