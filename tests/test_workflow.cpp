@@ -1,7 +1,7 @@
 // The workflow command, run as a user runs it: command line, derived files, errors that name
 // the master line, summary. With the sample builder and the whole chain, the workflow end to end
 // on a reduced sample city, and the rerun that does nothing.
-#include "support.h"
+#include "program.h"
 
 #include <gdal_priv.h>
 #include <ogrsf_frmts.h>
@@ -17,44 +17,14 @@
 #include <memory>
 #include <string>
 
-#ifndef _WIN32
-#include <sys/wait.h>
-#endif
-
 namespace {
 
 using testsupport::ReadFile;
 using testsupport::TempDir;
 using testsupport::WriteFile;
 
-struct Result {
-    int status = -1;
-    std::string out;
-    std::string err;
-};
-
-// Runs a program with arguments (each quoted) and collects its exit status and output.
-Result RunProgram(const std::string& program, const std::vector<std::string>& args,
-                  const TempDir& dir) {
-    std::string command = "\"" + program + "\"";
-    for (const std::string& arg : args)
-        command += " \"" + arg + "\"";
-    const std::string out = dir.File("stdout.txt"), err = dir.File("stderr.txt");
-    command += " > \"" + out + "\" 2> \"" + err + "\"";
-#ifdef _WIN32
-    command = "\"" + command + "\"";  // cmd.exe strips the outer quotes
-#endif
-    Result result;
-    const int raw = std::system(command.c_str());
-#ifdef _WIN32
-    result.status = raw;
-#else
-    result.status = WIFEXITED(raw) ? WEXITSTATUS(raw) : -1;
-#endif
-    result.out = ReadFile(out);
-    result.err = ReadFile(err);
-    return result;
-}
+using Result = testsupport::ProgramResult;
+using testsupport::RunProgram;
 
 #ifdef SILVAN_ORTHO_EXE
 const std::string kOrtho = SILVAN_ORTHO_EXE;
@@ -100,8 +70,8 @@ TEST(WorkflowCommand, RefusesBadCommandLinesWithStatus2) {
 
 TEST(WorkflowCommand, MissingMasterFileStopsNamingIt) {
     TempDir dir;
-    const Result r =
-        Ortho({dir.File("absent.txt"), "--out", dir.File("out"), "--dem", "d.tif"}, dir);
+    const std::string dem = WriteFile(dir.File("d.tif"), "");
+    const Result r = Ortho({dir.File("absent.txt"), "--out", dir.File("out"), "--dem", dem}, dir);
     EXPECT_EQ(r.status, 1);
     EXPECT_NE(r.err.find("absent.txt"), std::string::npos) << r.err;
     EXPECT_NE(r.err.find("Invalid MFILE"), std::string::npos) << r.err;
@@ -121,7 +91,8 @@ TEST(WorkflowCommand, BadMasterLinesNameFileAndLine) {
                                          "b.tif;1,x;0;;0;0;HIGH;2;FILL\n"
                                          "a.tif;1;0;;0;0;;0;PREP\n"
                                          "c.tif;1;0;;0;0;;0;FILL\n");
-    const Result stop = Ortho({master, "--out", dir.File("out"), "--dem", "dsm.tif"}, dir);
+    const std::string dem = WriteFile(dir.File("dsm.tif"), "");
+    const Result stop = Ortho({master, "--out", dir.File("out"), "--dem", dem}, dir);
     EXPECT_EQ(stop.status, 1);
     EXPECT_NE(stop.err.find("master.txt, line 4, column 1: \"x\" is not an integer"),
               std::string::npos)
@@ -135,7 +106,7 @@ TEST(WorkflowCommand, BadMasterLinesNameFileAndLine) {
               "!IMGSET created for MELDRA\na.tif;LOW;1\nb.tif;HIGH;2\nc.tif;;0\n");
 
     const Result going =
-        Ortho({master, "--out", dir.File("out"), "--dem", "dsm.tif", "--keep-going", "-q"}, dir);
+        Ortho({master, "--out", dir.File("out"), "--dem", dem, "--keep-going", "-q"}, dir);
     EXPECT_EQ(going.status, 1);
     const std::string summary = ReadFile(dir.File("out/summary.json"));
     EXPECT_NE(summary.find("\"line\": 1, \"source\": \"b.tif\""), std::string::npos) << summary;
@@ -154,8 +125,8 @@ TEST(WorkflowCommand, BadMasterLinesNameFileAndLine) {
 TEST(WorkflowCommand, SliceBeyondTheLastLineDoesNothing) {
     TempDir dir;
     const std::string master = WriteFile(dir.File("master.txt"), "a.tif;1;0;;0;0;;0;FILL\n");
-    const Result r =
-        Ortho({master, "--out", dir.File("out"), "--dem", "dsm.tif", "--lines", "4:8"}, dir);
+    const std::string dem = WriteFile(dir.File("dsm.tif"), "");
+    const Result r = Ortho({master, "--out", dir.File("out"), "--dem", dem, "--lines", "4:8"}, dir);
     EXPECT_EQ(r.status, 0) << r.err;
     const std::string summary = ReadFile(dir.File("out/summary-4-8.json"));
     EXPECT_NE(summary.find("\"scenes\": []"), std::string::npos) << summary;

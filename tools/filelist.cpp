@@ -1,4 +1,6 @@
 // Prints the file names of a file list, one per line.
+#include "message.h"
+
 #include <silvan/silvan.h>
 
 #include <iostream>
@@ -15,7 +17,7 @@ int main(int argc, char** argv) {
             std::cout << files.GetFili() << '\n';
         }
     } catch (const kestrel::Exception& e) {
-        std::cerr << "silvan-filelist: " << e.Describe() << '\n';
+        std::cerr << "silvan-filelist: " << tools::UserMessage(e) << '\n';
         return 1;
     }
     return 0;

@@ -1,4 +1,6 @@
 // Prints the heights of a DEM, tiled DEM or TIN at the ground points read from standard input.
+#include "message.h"
+
 #include <silvan/silvan.h>
 
 #include <cerrno>
@@ -137,11 +139,8 @@ int main(int argc, char** argv) {
             std::cout << std::flush;
             Fail(bad);
         }
-    } catch (const kestrel::FileException& e) {
-        std::cerr << "silvan-height: " << e.GetFileName() << ": " << e.Describe() << '\n';
-        return 1;
     } catch (const kestrel::Exception& e) {
-        std::cerr << "silvan-height: " << e.Describe() << '\n';
+        std::cerr << "silvan-height: " << tools::UserMessage(e) << '\n';
         return 1;
     }
     return 0;

@@ -1,4 +1,6 @@
 // Prints the ortho layout of a source image over a DEM: CRS, geotransform, size and footprint.
+#include "message.h"
+
 #include <silvan/silvan.h>
 
 #include <cmath>
@@ -137,7 +139,7 @@ int main(int argc, char** argv) {
         }
         std::printf("))\n");
     } catch (const kestrel::Exception& e) {
-        std::cerr << "silvan-layout: " << e.Describe() << '\n';
+        std::cerr << "silvan-layout: " << tools::UserMessage(e) << '\n';
         return 1;
     }
     return 0;

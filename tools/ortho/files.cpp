@@ -1,5 +1,7 @@
 #include "files.h"
 
+#include "../message.h"
+
 #include <chrono>
 #include <filesystem>
 #include <limits>
@@ -56,31 +58,7 @@ double ModifiedTime(const std::string& path) {
 }
 
 std::string Explain(const std::exception& error) {
-    // A parameter's error names the value refused, and what was expected, when its message
-    // does not.
-    if (const auto* parameter = dynamic_cast<const kestrel::ParameterException*>(&error)) {
-        std::string message = parameter->GetErrorMessage();
-        const std::string& value = parameter->GetValue();
-        const std::string shown = value.empty() ? parameter->GetParameterName() : value;
-        if (!shown.empty() && message.find(shown) == std::string::npos)
-            message = shown + ": " + message;
-        if (!parameter->GetExpected().empty() &&
-            message.find(parameter->GetExpected()) == std::string::npos)
-            message += " (expected: " + parameter->GetExpected() + ")";
-        return message;
-    }
-    const auto* file = dynamic_cast<const kestrel::FileException*>(&error);
-    if (file == nullptr || file->GetFileName().empty())
-        return error.what();
-    std::string message = file->GetErrorMessage();
-    if (message.empty())
-        message = dynamic_cast<const kestrel::FileNotFoundException*>(&error) != nullptr
-                      ? "not found or not readable"
-                      : "cannot be used";
-    // Some messages name the file already.
-    if (message.find(file->GetFileName()) != std::string::npos)
-        return message;
-    return file->GetFileName() + ": " + message;
+    return tools::UserMessage(error);
 }
 
 }  // namespace ortho

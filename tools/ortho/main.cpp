@@ -1,5 +1,6 @@
 // silvan-ortho: the true-ortho workflow of a master parameter file, end to end.
 #include "files.h"
+#include "inputs.h"
 #include "options.h"
 #include "progress.h"
 #include "steps.h"
@@ -27,28 +28,49 @@ void PrintScenes(const ortho::RunSummary& summary, const std::string& summaryPat
     std::printf("summary    %s\n", summaryPath.c_str());
 }
 
+// Parses and checks the command line before any work: the options, what the named files are,
+// the values the library interprets. Prints what is wrong and returns 2 (1 when the master
+// file for images cannot be written), or 0 to go on (with
+// the lines worth telling the user in notes). --help and --version print and return -1.
+int ReadCommandLine(int argc, char** argv, ortho::Options& options,
+                    std::vector<std::string>& notes) {
+    try {
+        options = ortho::ParseOptions(std::vector<std::string>(argv + 1, argv + argc));
+        if (options.help) {
+            std::fputs(ortho::UsageText().c_str(), stdout);
+            return -1;
+        }
+        if (options.version) {
+            std::fputs(ortho::VersionText().c_str(), stdout);
+            return -1;
+        }
+        ortho::ResolveInputs(options);
+        notes = ortho::CheckOptions(options);
+        if (!options.images.empty())
+            ortho::WriteImageMaster(options);
+        return 0;
+    } catch (const ortho::UsageError& e) {
+        std::fprintf(stderr, "silvan-ortho: %s\n(silvan-ortho --help shows the usage)\n", e.what());
+    } catch (const std::exception& e) {
+        // Not the command line: the master file for the images cannot be written.
+        std::fprintf(stderr, "silvan-ortho: %s\n", ortho::Explain(e).c_str());
+        return 1;
+    }
+    return 2;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
     ortho::Options options;
-    try {
-        options = ortho::ParseOptions(std::vector<std::string>(argv + 1, argv + argc));
-    } catch (const ortho::UsageError& e) {
-        std::fprintf(stderr, "silvan-ortho: %s\n(silvan-ortho --help shows the usage)\n", e.what());
-        return 2;
-    }
-    if (options.help) {
-        std::fputs(ortho::UsageText().c_str(), stdout);
-        return 0;
-    }
-    try {
-        ortho::CheckOptions(options);
-    } catch (const std::exception& e) {
-        std::fprintf(stderr, "silvan-ortho: %s\n", ortho::Explain(e).c_str());
-        return 2;
-    }
+    std::vector<std::string> notes;
+    const int read = ReadCommandLine(argc, argv, options, notes);
+    if (read != 0)
+        return read < 0 ? 0 : read;
     try {
         ortho::Progress progress(stderr, ortho::IsTerminal(stderr), options.quiet);
+        for (const std::string& note : notes)
+            progress.Info(note);
         ortho::Workflow workflow(options, progress);
         const int status = workflow.Run();
         progress.Done();
@@ -56,7 +78,7 @@ int main(int argc, char** argv) {
             PrintScenes(workflow.Summary(), workflow.SummaryPath());
         return status;
     } catch (const std::exception& e) {
-        std::fprintf(stderr, "silvan-ortho: %s\n", e.what());
+        std::fprintf(stderr, "silvan-ortho: %s\n", ortho::Explain(e).c_str());
         return 1;
     }
 }

@@ -1,5 +1,8 @@
 #include "options.h"
 
+#include <gdal.h>
+#include <ogr_srs_api.h>
+
 #include <cerrno>
 #include <cmath>
 #include <cstdlib>
@@ -103,6 +106,9 @@ Options ParseOptions(const std::vector<std::string>& args) {
         if (name == "-h" || name == "--help") {
             flag();
             options.help = true;
+        } else if (name == "--version") {
+            flag();
+            options.version = true;
         } else if (name == "--out" || name == "-o") {
             options.outDir = take();
         } else if (name == "--dem") {
@@ -149,13 +155,11 @@ Options ParseOptions(const std::vector<std::string>& args) {
             throw UsageError("unknown option " + Quoted(name) + " (see --help)");
         }
     }
-    if (options.help)
+    if (options.help || options.version)
         return options;
-    if (positional.size() != 1)
-        throw UsageError(positional.empty() ? "the master parameter file is missing"
-                                            : "one master parameter file is expected, not " +
-                                                  std::to_string(positional.size()));
-    options.master = positional[0];
+    if (positional.empty())
+        throw UsageError("the master parameter file is missing (or give the images)");
+    options.inputs = positional;
     if (options.outDir.empty())
         throw UsageError("--out DIR is missing");
     if (options.dem.empty() == options.tin.empty())
@@ -169,14 +173,27 @@ Options ParseOptions(const std::vector<std::string>& args) {
     return options;
 }
 
+std::string VersionText() {
+    int major = 0, minor = 0, patch = 0;
+    OSRGetPROJVersion(&major, &minor, &patch);
+    return std::string("silvan-ortho ") + SILVAN_VERSION + " (GDAL " +
+           GDALVersionInfo("RELEASE_NAME") + ", PROJ " + std::to_string(major) + "." +
+           std::to_string(minor) + "." + std::to_string(patch) + ")\n";
+}
+
 std::string UsageText() {
     return R"(usage: silvan-ortho MASTER --out DIR (--dem DSM | --tin TIN) [options]
+       silvan-ortho IMAGE [IMAGE...] --out DIR (--dem DSM | --tin TIN) [options]
 
 Runs the true-ortho workflow of a master parameter file: derives the preparation and image-set
 files, makes the ortho, visibility index, scene description and footprint of every scene on one
 common grid, then fills the hidden ground of each image from the others (occlusion recovery)
 into a true-ortho mosaic, with PNG quicklooks. A run that was stopped does only what is missing
 when started again.
+
+Images may be given instead of the master file (told apart by their content, not their names):
+they run with the master file's default columns (all channels, segment 0, every image in the
+mosaic), and the master file used is written to DIR/master.txt.
 
 Surface model (the terrain with its buildings):
   --dem PATH          raster DSM: a file GDAL reads, a directory of tiles or a VRT mosaic
@@ -193,13 +210,13 @@ Cameras (instead of each source's own model, docs/cameras.md):
 
 Output:
   --out DIR           output directory (created when missing)
-  --srs CRS           output coordinate system (EPSG:32632, WKT, PROJ string; default: the
-                      UTM zone of the scene)
+  --srs CRS           output coordinate system, projected or geographic (EPSG:32632, WKT,
+                      PROJ string; default: the UTM zone of the scene)
   --pixel-size SIZE   output pixel size in CRS units (default: the source's resolution)
   --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
   --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
-  --of TYPE           file type of the ortho and visibility rasters: tif (default), cog, img,
-                      gpkg, ...
+  --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, jpg, ...
+                      or a GDAL raster driver that creates files
 
 Running:
   --jobs N, -j N      scenes run at the same time (default 1)
@@ -209,8 +226,9 @@ Running:
   --keep-going, -k    go on after a scene fails; the failures are listed in the summary
   --quiet, -q         print errors only
   --help, -h          this text
+  --version           the version of silvan-ortho, GDAL and PROJ
 
-Outputs in DIR: prep.txt and imgset.txt (derived parameter files), per scene NAME_ortho.tif,
+Outputs in DIR: master.txt (when images were given), prep.txt and imgset.txt (derived parameter files), per scene NAME_ortho.tif,
 NAME_vis.tif, NAME.xml (scene description, with TOSceneDesc_Document.dtd) and
 NAME_footprint.gpkg; footprints.gpkg (one layer per scene), mosaic.tif, mosaic_source.tif,
 mosaic.png, NAME_vis.png, and summary.json (summary-A-B.json for a slice).

@@ -14,8 +14,12 @@ class UsageError : public std::runtime_error {
 };
 
 struct Options {
-    std::string master;  // the master parameter file
-    std::string outDir;  // --out
+    // The files named on the command line: one master parameter file, or images. Which of the
+    // two they are is told from their content (see inputs.h), which sets master or images.
+    std::vector<std::string> inputs;
+    std::string master;               // the master parameter file the workflow runs
+    std::vector<std::string> images;  // images given instead of a master file
+    std::string outDir;               // --out
 
     // Surface model: a raster DSM (--dem) or a TIN (--tin), exactly one of them.
     std::string dem;
@@ -44,6 +48,7 @@ struct Options {
     bool keepGoing = false;
     bool quiet = false;
     bool help = false;
+    bool version = false;
 };
 
 // Parses the arguments after the program name. Throws UsageError.
@@ -51,5 +56,8 @@ Options ParseOptions(const std::vector<std::string>& args);
 
 // The text of --help.
 std::string UsageText();
+
+// The text of --version: the project's version, with GDAL's and PROJ's.
+std::string VersionText();
 
 }  // namespace ortho

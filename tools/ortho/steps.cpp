@@ -10,12 +10,15 @@
 #include <kestrel/crs.h>
 #include <kestrel/exception.h>
 #include <kestrel/formats.h>
+#include <kestrel/processparams.h>
 
 #include <cpl_error.h>
 #include <gdal_priv.h>
 #include <ogrsf_frmts.h>
 
 #include <algorithm>
+#include <cctype>
+#include <filesystem>
 #include <cmath>
 #include <cstdio>
 #include <limits>
@@ -190,15 +193,123 @@ std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options
     return OpenModel(options, scene.source, scene.mmseg);
 }
 
-void CheckOptions(const Options& options) {
-    GetVertDatum(options.elevref);
+namespace {
+
+// Runs a check of one option; what it throws becomes a UsageError naming the option.
+template <typename Check>
+void CheckOption(const std::string& option, Check check) {
+    try {
+        check();
+    } catch (const UsageError&) {
+        throw;
+    } catch (const std::exception& e) {
+        throw UsageError(option + ": " + Explain(e));
+    }
+}
+
+void CheckSurfaceFile(const std::string& option, const std::string& path) {
+    std::error_code ec;
+    if (!path.empty() && !std::filesystem::exists(path, ec))
+        throw UsageError(option + ": " + path + ": not found");
+}
+
+void CheckOutputCrs(const std::string& text) {
+    if (text.empty())
+        return;
+    const kestrel::ogc::cs::ICRS crs(text);
+    if (!crs.IsProjected() && !crs.IsGeographic())
+        throw UsageError("--srs: \"" + text + "\" (" + crs.GetName() +
+                         ") is neither a projected nor a geographic coordinate system");
+}
+
+// The methods --help lists, in GDAL's spelling; compared without regard to case, as GDAL does.
+std::string CheckResampling(const std::string& method) {
+    static const char* const kMethods[] = {"near",    "bilinear", "cubic", "cubicspline",
+                                           "lanczos", "average",  "mode"};
+    std::string lower = method;
+    std::transform(lower.begin(), lower.end(), lower.begin(),
+                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+    std::string known;
+    for (const char* name : kMethods) {
+        if (lower == name) {
+            std::string accepted = lower;
+            std::unique_ptr<kestrel::utils::IRasterResampler> resampler(GetResampler(accepted));
+            return lower;
+        }
+        known += (known.empty() ? "" : ", ") + std::string(name);
+    }
+    throw UsageError("--resample: unknown method \"" + method + "\"; use one of " + known);
+}
+
+// A file type whose GDAL driver is in this build and writes files, directly or by copy.
+void CheckFileType(const std::string& type) {
+    const std::string format = kestrel::core::FType2FormatName(type);
+    GdalErrors errors;
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName(format.c_str());
+    if (driver == nullptr)
+        throw UsageError("--of: " + type + ": GDAL's " + format +
+                         " driver is not in this build of GDAL");
+    if (format == "MEM" || format == "VRT")
+        throw UsageError("--of: " + type + ": GDAL's " + format +
+                         " driver keeps no pixels in a file of its own");
+    if (driver->GetMetadataItem(GDAL_DCAP_CREATE) == nullptr &&
+        driver->GetMetadataItem(GDAL_DCAP_CREATECOPY) == nullptr)
+        throw UsageError("--of: " + type + ": GDAL's " + format + " driver cannot write files");
+}
+
+// A process that only makes its generator, to see what the PROC text gives.
+class GeneratorProbe : public kestrel::processes::silvan::TOPPFBase {
+  public:
+    explicit GeneratorProbe(const std::string& procText) { SetProc(procText); }
+    void Execute() override {}
+};
+
+// Makes the generator of the PROC text as a scene will; the line to tell the user when a
+// graphics processor was asked for and the central processor will run instead.
+std::string CheckGenerator(const std::string& procText) {
+    ProcessStrategy strategy = PROCESS_STRATEGY_AUTO;
+    int first = 0, second = 0, third = 0;
+    std::vector<int> list;
+    GetProcessParameters(procText, strategy, first, second, third, list);
+    GeneratorProbe probe(procText);
+    const std::unique_ptr<kestrel::processes::TorthoGenerator> generator(
+        probe.CreateTorthoGenerator());
+    if (strategy != PROCESS_STRATEGY_GPU ||
+        generator->GetProcessor() != kestrel::processes::ProcessorKind::Central)
+        return "";
+    const unsigned int threads = generator->GetThreadCount();
+    return "--proc " + procText +
+           ": no graphics processor can be used; the central-processor generator runs instead (" +
+           (threads == 0 ? std::string("threads chosen by the generator")
+                         : std::to_string(threads) + " threads") +
+           ")";
+}
+
+}  // namespace
+
+std::vector<std::string> CheckOptions(Options& options) {
+    CheckSurfaceFile("--dem", options.dem);
+    CheckSurfaceFile("--tin", options.tin);
+    CheckSurfaceFile("--cameras", options.cameras);
+    CheckOption("--cameras-srs", [&] {
+        if (!options.camerasSrs.empty())
+            kestrel::ogc::cs::ICRS{options.camerasSrs};
+    });
+    CheckOption("--elevref", [&] { GetVertDatum(options.elevref); });
     double offset = 0.0, scale = 1.0;
-    GetElFactor(options.elfactor, offset, scale);
+    CheckOption("--elfactor", [&] { GetElFactor(options.elfactor, offset, scale); });
     if (!options.elunits.empty())
-        GetElUnits(options.elunits, scale);
-    std::string method = options.resample;
-    std::unique_ptr<kestrel::utils::IRasterResampler> resampler(GetResampler(method));
-    kestrel::core::FType2FormatName(options.format);
+        CheckOption("--elunits", [&] { GetElUnits(options.elunits, scale); });
+    CheckOption("--srs", [&] { CheckOutputCrs(options.srs); });
+    CheckOption("--resample", [&] { options.resample = CheckResampling(options.resample); });
+    CheckOption("--of", [&] { CheckFileType(options.format); });
+    std::vector<std::string> notes;
+    CheckOption("--proc", [&] {
+        const std::string note = CheckGenerator(options.proc);
+        if (!note.empty())
+            notes.push_back(note);
+    });
+    return notes;
 }
 
 std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(

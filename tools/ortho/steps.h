@@ -44,10 +44,12 @@ using Footprint = std::unique_ptr<kestrel::tin::Polygon<double>>;
 // Progress of one step: the fraction done. Returns false to stop.
 using StepProgress = std::function<bool(double fraction)>;
 
-// Checks the option values that the library interprets (-elevref, -elfactor, units, resampling
-// method, file type), so that a bad one stops the run before any work. Throws what the library
-// throws for it.
-void CheckOptions(const Options& options);
+// Checks every option value before any work: the surface model exists, the values the library
+// interprets (-elevref, -elfactor, units, output CRS, PROC text, resampling method, file type)
+// are accepted and the file type can be written. Throws UsageError naming the option. Puts the
+// resampling method in the spelling --help lists. Returns lines worth telling the user, such as
+// a generator that falls back to the central processor.
+std::vector<std::string> CheckOptions(Options& options);
 
 // The math model of a source: the camera of --cameras when given, else the source's own model
 // of segment mmseg.

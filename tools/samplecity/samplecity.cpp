@@ -663,8 +663,11 @@ Sample MakeSample(const std::string& directory, const CityOptions& options, unsi
     std::ofstream master(sample.masterPath, std::ios::binary);
     master << "!MFILE sample city: fili;dbic;mmseg;dbiw;srcBgd;edgeClip;radioDif;dbmPxErr;role\n";
     const char* levels[] = {"LOW", "LOW", "MODERATE", "HIGH"};
+    // The images lie beside the master file: their names alone, so that the directory can be
+    // moved and read from any working directory.
     for (size_t i = 0; i < sample.images.size(); ++i)
-        master << sample.images[i].path << ";1,2,3;0;;0;0;" << levels[i % 4] << ";1;ORTHO\n";
+        master << options.cameras[i].name << ".tif;1,2,3;0;;0;0;" << levels[i % 4]
+               << ";1;ORTHO\n";
     if (!master.flush())
         KESTREL_THROW(DataException,
                       FormatString("%s: cannot write the master file", sample.masterPath.c_str()));

@@ -1,0 +1,203 @@
+// The command line of silvan-ortho: options and inputs checked before any work, --version, and
+// images given instead of a master file, run as a user runs them; and the error messages of the
+// other commands.
+#include "program.h"
+
+#include <gdal_priv.h>
+
+#include <filesystem>
+#include <string>
+#include <vector>
+
+namespace {
+
+namespace fs = std::filesystem;
+using testsupport::ProgramResult;
+using testsupport::ReadFile;
+using testsupport::RunProgram;
+using testsupport::TempDir;
+using testsupport::WriteFile;
+
+ProgramResult Ortho(const std::vector<std::string>& args, const TempDir& dir) {
+    return RunProgram(SILVAN_ORTHO_EXE, args, dir);
+}
+
+// A small single-band GeoTIFF: enough to be told apart from a master file.
+std::string WriteImage(const std::string& path) {
+    GDALAllRegister();
+    GDALDriver* gtiff = GetGDALDriverManager()->GetDriverByName("GTiff");
+    GDALClose(gtiff->Create(path.c_str(), 4, 4, 1, GDT_Byte, nullptr));
+    return path;
+}
+
+std::vector<std::string> Joined(std::vector<std::string> first,
+                                const std::vector<std::string>& second) {
+    first.insert(first.end(), second.begin(), second.end());
+    return first;
+}
+
+struct CommandLine {
+    std::vector<std::string> inputs;
+    std::vector<std::string> options;  // after --out OUT --dem DEM, which they may override
+    std::string message;
+};
+
+// Every option and input refused before any work: status 2, a message that names the option or
+// file and shows no C++ signature, and no output directory.
+TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
+    TempDir dir;
+    const std::string master = WriteFile(dir.File("master.txt"), "a.tif;1;0;;0;0;;0;FILL\n");
+    const std::string dem = WriteFile(dir.File("dsm.tif"), "");
+    const std::string image = WriteImage(dir.File("b.tif"));
+    const std::string binary = WriteFile(dir.File("c.tif"), std::string("II*\0garbage", 11));
+    const std::string semicolon = WriteImage(dir.File("d;e.tif"));
+    const std::string absent = dir.File("absent.tif");
+    fs::create_directories(dir.File("taken"));
+    WriteFile(dir.File("taken/master.txt"), "mine.tif\n");
+    const std::string out = dir.File("out");
+    const std::string textNotImage = ": a text file (a master parameter file?), not an image";
+    const CommandLine cases[] = {
+        {{master}, {"--srs", "EPSG:99999"}, "--srs: \"EPSG:99999\" names no coordinate system"},
+        {{master}, {"--srs", "EPSG:4978"}, "neither a projected nor a geographic"},
+        {{master}, {"--proc", "FPGA"}, "--proc: Cannot read PROC option \"FPGA\""},
+        {{master}, {"--proc", "GPU:1,1"}, "--proc: Cannot read PROC option \"GPU:1,1\""},
+        {{master}, {"--of", "nonsense"}, "--of: Unknown output file type \"nonsense\""},
+        {{master}, {"--of", "mem"}, "--of: mem: GDAL's MEM driver keeps no pixels"},
+        {{master}, {"--resample", "gauss"}, "--resample: unknown method \"gauss\""},
+        {{master}, {"--resample", "nearest"}, "--resample: unknown method \"nearest\""},
+        {{master}, {"--dem", absent}, "--dem: " + absent + ": not found"},
+        {{master}, {"--tin", absent}, "--tin: " + absent + ": not found"},
+        {{master}, {"--elevref", "XX"}, "--elevref: Unrecognized value"},
+        {{master}, {"--elunits", "parsec"}, "--elunits: Unknown elevation unit"},
+        {{master}, {"--elfactor", "1,0"}, "--elfactor: Invalid -elfactor argument"},
+        // A master file where images are expected, and the reverse, said plainly.
+        {{image, master}, {}, master + textNotImage},
+        {{master, master}, {}, "give either one master parameter file or images"},
+        {{image, absent}, {}, absent + ": not found"},
+        {{binary}, {}, "neither an image that GDAL can read nor a master parameter file"},
+        {{dir.Path().string()}, {}, "a directory"},
+        {{semicolon}, {}, "cannot hold this path"},
+        {{image}, {"--out", dir.File("taken")}, "exists and was not written by silvan-ortho"},
+    };
+    for (const CommandLine& c : cases) {
+        SCOPED_TRACE(c.message);
+        std::vector<std::string> args = Joined(c.inputs, {"--out", out});
+        if (c.options.empty() || (c.options[0] != "--tin" && c.options[0] != "--dem"))
+            args = Joined(args, {"--dem", dem});
+        const ProgramResult r = Ortho(Joined(args, c.options), dir);
+        EXPECT_EQ(r.status, 2);
+        EXPECT_NE(r.err.find(c.message), std::string::npos) << r.err;
+        EXPECT_EQ(r.err.find("kestrel::"), std::string::npos) << r.err;
+        EXPECT_EQ(r.err.find("(in "), std::string::npos) << r.err;
+        EXPECT_FALSE(fs::exists(out));
+    }
+    EXPECT_EQ(ReadFile(dir.File("taken/master.txt")), "mine.tif\n");
+}
+
+// Every value --help offers passes the checks: a slice beyond the master file's one line runs
+// them and then has nothing to do.
+TEST(OrthoCommandLine, ValuesThatHelpListsAreAccepted) {
+    TempDir dir;
+    const std::string master = WriteFile(dir.File("master.txt"), "a.tif;1;0;;0;0;;0;FILL\n");
+    const std::string dem = WriteFile(dir.File("dsm.tif"), "");
+    const std::vector<std::vector<std::string>> accepted = {
+        {"--resample", "near"},    {"--resample", "bilinear"},    {"--resample", "cubic"},
+        {"--resample", "lanczos"}, {"--resample", "cubicspline"}, {"--resample", "average"},
+        {"--resample", "mode"},    {"--resample", "CUBIC"},       {"--of", "tif"},
+        {"--of", "cog"},           {"--of", "png"},               {"--of", "jpg"},
+        {"--of", "img"},           {"--of", "gpkg"},              {"--srs", "EPSG:32632"},
+        {"--srs", "EPSG:4326"},    {"--proc", "CPU:2"},           {"--elunits", "FOOT"},
+    };
+    for (const auto& option : accepted) {
+        SCOPED_TRACE(option[0] + " " + option[1]);
+        const ProgramResult r = Ortho(
+            Joined({master, "--out", dir.File("out"), "--dem", dem, "--lines", "5:6"}, option),
+            dir);
+        EXPECT_EQ(r.status, 0) << r.err;
+    }
+
+    // A graphics processor asked for: one line says that the central processor runs instead.
+    const ProgramResult gpu = Ortho(
+        {master, "--out", dir.File("out"), "--dem", dem, "--lines", "5:6", "--proc", "GPU"}, dir);
+    EXPECT_EQ(gpu.status, 0) << gpu.err;
+    EXPECT_NE(gpu.err.find("--proc GPU: no graphics processor can be used; the "
+                           "central-processor generator runs instead"),
+              std::string::npos)
+        << gpu.err;
+
+    const ProgramResult version = Ortho({"--version"}, dir);
+    EXPECT_EQ(version.status, 0);
+    EXPECT_EQ(version.out.rfind("silvan-ortho " SILVAN_VERSION " (GDAL ", 0), 0u) << version.out;
+    const ProgramResult help = Ortho({"--help"}, dir);
+    EXPECT_NE(help.out.find("silvan-ortho IMAGE [IMAGE...] --out DIR"), std::string::npos);
+}
+
+// Images instead of a master file: the sample city's images run with the default columns, the
+// master file used is written to DIR/master.txt with paths relative to it, and a second run
+// leaves it as it is. The sample's own master file names its images relative to itself.
+TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
+    TempDir dir;
+    const ProgramResult made =
+        RunProgram(SILVAN_MAKE_SAMPLE_EXE,
+                   {dir.File("sample"), "--box", "--image-size", "64", "--quiet"}, dir);
+    ASSERT_EQ(made.status, 0) << made.err;
+    const std::string sampleMaster = ReadFile(dir.File("sample/master.txt"));
+    EXPECT_NE(sampleMaster.find("\nview000.tif;1,2,3;0;"), std::string::npos) << sampleMaster;
+    EXPECT_NE(sampleMaster.find("\nview180.tif;1,2,3;0;"), std::string::npos) << sampleMaster;
+
+    const std::vector<std::string> args = {
+        dir.File("sample/view000.tif"), dir.File("sample/view180.tif"), "--out", dir.File("out"),
+        "--dem", dir.File("sample/dsm.tif"), "--elevref", "ELLIPS", "--quiet"};
+    const ProgramResult first = Ortho(args, dir);
+    ASSERT_EQ(first.status, 0) << first.err;
+    const std::string written = dir.File("out/master.txt");
+    EXPECT_EQ(ReadFile(written),
+              "!MFILE written by silvan-ortho for the images on its command line\n"
+              "!fili;dbic;mmseg;dbiw;srcBgd;edgeClip;radioDif;dbmPxErr;role\n"
+              "../sample/view000.tif;;0;;;0;ANY;0;ORTHO\n"
+              "../sample/view180.tif;;0;;;0;ANY;0;ORTHO\n");
+    const std::string summary = ReadFile(dir.File("out/summary.json"));
+    EXPECT_NE(summary.find("\"status\": \"complete\""), std::string::npos) << summary;
+    EXPECT_TRUE(fs::exists(dir.File("out/mosaic.tif")));
+
+    // A master file whose line names a text file: said plainly.
+    const std::string wrong =
+        WriteFile(dir.File("wrong.txt"), dir.File("sample/master.txt") + ";;0;;;0;;0;ORTHO\n");
+    const ProgramResult text =
+        Ortho({wrong, "--out", dir.File("wrong"), "--dem", dir.File("sample/dsm.tif")}, dir);
+    EXPECT_EQ(text.status, 1);
+    EXPECT_NE(text.err.find(dir.File("sample/master.txt") + ": not a raster that GDAL can read"),
+              std::string::npos)
+        << text.err;
+
+    const auto madeAt = fs::last_write_time(written);
+    const ProgramResult second = Ortho(args, dir);
+    EXPECT_EQ(second.status, 0) << second.err;
+    EXPECT_EQ(fs::last_write_time(written), madeAt);
+}
+
+}  // namespace
+
+// The other commands print the message and the file it is about, never where in the code the
+// error was raised.
+TEST(CommandMessages, NameTheFileWithoutCodeLocations) {
+    TempDir dir;
+    const std::string tools = SILVAN_TOOLS_DIR;
+    const std::string absent = dir.File("absent.tif");
+    const struct {
+        std::string program;
+        std::vector<std::string> args;
+    } cases[] = {
+        {"silvan-filelist", {absent}},
+        {"silvan-layout", {absent, "--dem", absent}},
+        {"silvan-height", {absent}},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.program);
+        const ProgramResult r = RunProgram(tools + "/" + c.program, c.args, dir);
+        EXPECT_EQ(r.status, 1);
+        EXPECT_EQ(r.err.rfind(c.program + ": ", 0), 0u) << r.err;
+        EXPECT_NE(r.err.find(absent), std::string::npos) << r.err;
+        EXPECT_EQ(r.err.find("(in "), std::string::npos) << r.err;
+    }
+}
