@@ -1,5 +1,6 @@
 // Occlusion recovery on two orthos of a box building seen from opposite sides: each fills the
-// other's hidden strip, the source raster names the scene of each pixel, and the choice rules.
+// other's hidden strip, the source raster names the scene of each pixel, and the choice rules;
+// then on synthetic visibility indexes, the rules at every pixel and the cost of many scenes.
 #include <kestrel/trueortho.h>
 #include <samplecity.h>
 
@@ -8,8 +9,15 @@
 
 #include <gdal_priv.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <memory>
+#include <random>
+#include <tuple>
+
+#if !defined(_WIN32)
+#include <sys/resource.h>
+#endif
 
 namespace {
 
@@ -178,6 +186,153 @@ TEST_F(OppositeViews, CancelledOrRefusedRunsLeaveNoOutput) {
     for (const char* name :
          {"mosaic.tif", "source.tif", "mosaic.tif.partial", "source.tif.partial"})
         EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
+}
+
+// ---------------------------------------------------------------------------------------------
+// Synthetic scenes: visibility indexes drawn at random, orthos of one value per scene.
+
+namespace synthetic {
+
+constexpr int kWidth = 70, kHeight = 50;
+
+// Writes a one-band Byte GeoTIFF on the common grid.
+void WriteBand(const std::string& path, const std::vector<unsigned char>& values) {
+    GDALAllRegister();
+    GDALDriver* gtiff = GetGDALDriverManager()->GetDriverByName("GTiff");
+    std::unique_ptr<GDALDataset> ds(
+        gtiff->Create(path.c_str(), kWidth, kHeight, 1, GDT_Byte, nullptr));
+    const double gt[6] = {500000, 0.5, 0, 4100000, 0, -0.5};
+    ds->SetGeoTransform(const_cast<double*>(gt));
+    ds->GetRasterBand(1)->SetNoDataValue(0);
+    ASSERT_EQ(ds->GetRasterBand(1)->RasterIO(GF_Write, 0, 0, kWidth, kHeight,
+                                             const_cast<unsigned char*>(values.data()), kWidth,
+                                             kHeight, GDT_Byte, 0, 0, nullptr),
+              CE_None);
+}
+
+// Scene s: ortho value 10 * (s + 1); visibility seen, hidden (with probability `hidden`) or
+// outside (with probability 0.1).
+RecoveryJob MakeScenes(const TempDir& dir, int count, double hidden, unsigned seed,
+                       std::vector<std::vector<unsigned char>>& visibility) {
+    std::mt19937 random(seed);
+    std::uniform_real_distribution<double> draw(0.0, 1.0);
+    RecoveryJob job;
+    visibility.clear();
+    for (int s = 0; s < count; ++s) {
+        const std::string name = "scene" + std::to_string(s);
+        std::vector<unsigned char> vis(kWidth * kHeight);
+        for (auto& v : vis) {
+            const double d = draw(random);
+            v = d < hidden         ? VISIBILITY_HIDDEN
+                : d < hidden + 0.1 ? VISIBILITY_OUTSIDE
+                                   : VISIBILITY_SEEN;
+        }
+        WriteBand(dir.File(name + "_vis.tif"), vis);
+        WriteBand(dir.File(name + "_ortho.tif"),
+                  std::vector<unsigned char>(vis.size(), static_cast<unsigned char>(10 * (s + 1))));
+        RecoveryScene scene;
+        scene.orthoPath = dir.File(name + "_ortho.tif");
+        scene.visibilityPath = dir.File(name + "_vis.tif");
+        scene.radiometricLevel = s % 2;
+        job.scenes.push_back(scene);
+        visibility.push_back(vis);
+    }
+    job.mosaicPath = dir.File("mosaic.tif");
+    job.sourcePath = dir.File("source.tif");
+    job.tileSize = 16;
+    return job;
+}
+
+// The choice rules pixel by pixel, without models: seen clearly, then level, then order.
+std::vector<double> ExpectedSource(const RecoveryJob& job,
+                                   const std::vector<std::vector<unsigned char>>& visibility) {
+    std::vector<double> source(kWidth * kHeight, 0);
+    for (int y = 0; y < kHeight; ++y)
+        for (int x = 0; x < kWidth; ++x) {
+            std::tuple<int, int, size_t> best{2, 0, 0};
+            for (size_t s = 0; s < job.scenes.size(); ++s) {
+                const auto& vis = visibility[s];
+                if (vis[y * kWidth + x] != VISIBILITY_SEEN)
+                    continue;
+                const int e = job.scenes[s].dbmPixelError;
+                int unclear = 0;
+                for (int j = std::max(0, y - e); j <= std::min(kHeight - 1, y + e); ++j)
+                    for (int i = std::max(0, x - e); i <= std::min(kWidth - 1, x + e); ++i)
+                        unclear |= vis[j * kWidth + i] == VISIBILITY_HIDDEN;
+                best = std::min(best, std::make_tuple(unclear, job.scenes[s].radiometricLevel, s));
+            }
+            if (std::get<0>(best) < 2)
+                source[y * kWidth + x] = static_cast<double>(std::get<2>(best) + 1);
+        }
+    return source;
+}
+
+}  // namespace synthetic
+
+// The pixel-error neighbourhood, across tile borders, for errors from none to far beyond the
+// grid (whose cost per pixel once grew with the square of the error), and scenes whose errors
+// differ.
+TEST(RecoveryChoice, PixelErrorNeighbourhoodMatchesTheRuleAtEveryPixel) {
+    const struct {
+        std::vector<int> errors;
+        double hidden;
+    } cases[] = {{{0, 0, 0}, 0.05},
+                 {{1, 1, 1}, 0.02},
+                 {{3, 0, 2}, 0.01},
+                 {{17, 5, 40}, 0.002},
+                 {{1000, 1000}, 0.0005}};
+    unsigned seed = 1;
+    for (const auto& c : cases) {
+        SCOPED_TRACE(::testing::Message() << "errors " << c.errors[0] << ", hidden " << c.hidden);
+        TempDir dir;
+        std::vector<std::vector<unsigned char>> visibility;
+        RecoveryJob job = synthetic::MakeScenes(dir, static_cast<int>(c.errors.size()), c.hidden,
+                                                seed++, visibility);
+        for (size_t s = 0; s < job.scenes.size(); ++s)
+            job.scenes[s].dbmPixelError = c.errors[s];
+        const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
+        ASSERT_TRUE(result.completed);
+        const auto expected = synthetic::ExpectedSource(job, visibility);
+        const auto source = ReadBand(job.sourcePath);
+        const auto mosaic = ReadBand(job.mosaicPath);
+        ASSERT_EQ(source.size(), expected.size());
+        unsigned long long filled = 0;
+        for (size_t k = 0; k < source.size(); ++k) {
+            ASSERT_EQ(source[k], expected[k])
+                << "pixel " << k % synthetic::kWidth << ", line " << k / synthetic::kWidth;
+            ASSERT_EQ(mosaic[k], 10 * source[k]) << k;
+            filled += source[k] > 0;
+        }
+        EXPECT_EQ(result.filled, filled);
+        EXPECT_EQ(result.filled + result.unfilled, source.size());
+    }
+}
+
+// Many scenes on many threads under a small limit of open files, and a thread count far beyond
+// the work: each scene's rasters are opened once, and threads are capped by the tiles.
+TEST(RecoveryChoice, ThreadsShareEachScenesFilesAndAreCappedByTheWork) {
+    TempDir dir;
+    std::vector<std::vector<unsigned char>> visibility;
+    const RecoveryJob job = synthetic::MakeScenes(dir, 40, 0.01, 7, visibility);
+    const auto expected = synthetic::ExpectedSource(job, visibility);
+#if !defined(_WIN32)
+    rlimit saved{};
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &saved), 0);
+    rlimit limited = saved;
+    limited.rlim_cur = std::min<rlim_t>(saved.rlim_cur, 1024);
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &limited), 0);
+#endif
+    for (const unsigned int threads : {16u, 4000000000u}) {
+        SCOPED_TRACE(threads);
+        GeneratorSettings settings;
+        settings.threadCount = threads;
+        std::filesystem::remove(job.sourcePath);
+        EXPECT_TRUE(OcclusionRecovery(settings).Recover(job).completed);
+        EXPECT_EQ(ReadBand(job.sourcePath), expected);
+    }
+#if !defined(_WIN32)
+    setrlimit(RLIMIT_NOFILE, &saved);
+#endif
 }
 
 }  // namespace

@@ -2,6 +2,8 @@
 
 #include "../message.h"
 
+#include <kestrel/rasterio.h>
+
 #include <chrono>
 #include <filesystem>
 #include <limits>
@@ -32,11 +34,7 @@ std::string UniquePartName(const std::string& path) {
 }
 
 void Publish(const std::string& part, const std::string& path) {
-    std::error_code ec;
-    fs::rename(part, path, ec);
-    if (ec)
-        KESTREL_THROW(kestrel::FileAccessException, path, kestrel::FileAccessException::WriteFailed,
-                      "cannot be renamed from " + part + ": " + ec.message());
+    kestrel::datasources::PublishDataset(part, path);
 }
 
 bool FileExists(const std::string& path) {

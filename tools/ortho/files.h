@@ -16,7 +16,8 @@ std::string PartName(const std::string& path);
 // one run) may write at the same time.
 std::string UniquePartName(const std::string& path);
 
-// Renames a finished part over its final name. Throws FileAccessException naming both.
+// Renames a finished part over its final name, with the side files of a raster or vector
+// dataset (kestrel::datasources::PublishDataset). Throws FileAccessException naming both.
 void Publish(const std::string& part, const std::string& path);
 
 bool FileExists(const std::string& path);

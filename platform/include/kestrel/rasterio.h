@@ -289,6 +289,16 @@ class KESTREL_API BasicWriter : public IRasterWriter {
     std::unique_ptr<Impl> impl_;
 };
 
+// Puts a finished dataset under its final name with all its files: every file GDAL lists for
+// the dataset at `temporary` (side files such as .aux.xml, .hdr, .wld, .ovr; the path alone
+// when GDAL does not open it) is renamed to `final` with the same ending. The side files go
+// first and the main file last; the files of an older dataset under the final names step aside
+// first and are removed at the end (the older main file first: its name never shows it with
+// new side files). A single file replaces a single file in one step. When a rename fails, the
+// older dataset is put back, the temporaries are removed, and FileAccessException names the
+// final path and the rename that failed.
+KESTREL_API void PublishDataset(const std::string& temporary, const std::string& final);
+
 // What the raster components were asked to do, for tests that must see the arguments a caller
 // passes. Nothing is observed unless an observer is installed; observers are told after the
 // fact and change nothing. Notifications may come from any thread.

@@ -15,9 +15,12 @@ namespace {
 
 std::unique_ptr<std::max_align_t[]> Allocate(std::size_t bytes, bool zeros) {
     const std::size_t units = (bytes + sizeof(std::max_align_t) - 1) / sizeof(std::max_align_t);
+    std::unique_ptr<std::max_align_t[]> data(new std::max_align_t[units]);
+    // Value-initialising the array is not enough: max_align_t holds a long double whose padding
+    // bytes the compiler leaves as they were.
     if (zeros)
-        return std::unique_ptr<std::max_align_t[]>(new std::max_align_t[units]());
-    return std::unique_ptr<std::max_align_t[]>(new std::max_align_t[units]);
+        std::memset(data.get(), 0, units * sizeof(std::max_align_t));
+    return data;
 }
 
 template <typename T>

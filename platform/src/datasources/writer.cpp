@@ -1,5 +1,7 @@
+#include <algorithm>
 #include <array>
 #include <cerrno>
+#include <cmath>
 #include <mutex>
 #include <optional>
 #include <random>
@@ -118,6 +120,47 @@ void AddOptions(CPLStringList& options, const std::string& text) {
     CSLDestroy(tokens);
 }
 
+bool IsDirectory(const std::string& path) {
+    VSIStatBufL stat;
+    return VSIStatL(path.c_str(), &stat) == 0 && VSI_ISDIR(stat.st_mode);
+}
+
+// The path without the extension of its file name.
+std::string Stem(const std::string& path) {
+    const PathParts parts = Split(path);
+    return parts.dir + parts.stem;
+}
+
+// The files of a dataset: GDAL's list when GDAL opens it (a raster or vector dataset with its
+// side files), the path alone otherwise. Only files named after the dataset count: a VRT's
+// sources, say, belong to other datasets.
+std::vector<std::string> DatasetFiles(const std::string& path) {
+    std::vector<std::string> files{path};
+    gdalsupport::ErrorCapture errors;
+    GDALDatasetPtr ds(
+        GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_VECTOR | GDAL_OF_READONLY));
+    if (ds == nullptr)
+        return files;
+    const std::string stem = Stem(path);
+    char** list = ds->GetFileList();
+    for (char** f = list; f != nullptr && *f != nullptr; ++f) {
+        const std::string file = *f;
+        if (file != path && file.compare(0, stem.size(), stem) == 0 && !IsDirectory(file))
+            files.push_back(file);
+    }
+    CSLDestroy(list);
+    return files;
+}
+
+// A file's name after publishing: the temporary name's part replaced by the final name's.
+std::string PublishedName(const std::string& file, const std::string& temporary,
+                          const std::string& final) {
+    if (file.compare(0, temporary.size(), temporary) == 0)
+        return final + file.substr(temporary.size());
+    const std::string stem = Stem(temporary);
+    return Stem(final) + file.substr(stem.size());
+}
+
 }  // namespace
 
 struct BasicWriter::Impl {
@@ -195,6 +238,21 @@ GDALDriver* RasterDriver(const std::string& format, const std::string& path,
                          FormatString("GDAL cannot write %s in the format \"%s\"", path.c_str(),
                                       format.c_str()));
     }
+    // Formats whose file is not where the pixels go.
+    const std::string name = driver->GetDescription();
+    if (name == "VRT")
+        KESTREL_THROW_AT(where, ParameterException, "format", ParameterException::Unsupported,
+                         format, "a format that holds pixels",
+                         FormatString("%s: a VRT file only references other rasters; write the "
+                                      "pixels in a format that holds them (tif, gpkg, ...)",
+                                      path.c_str()));
+    if (name == "ENVI" && EQUAL(Split(path).ext.c_str(), ".hdr"))
+        KESTREL_THROW_AT(where, ParameterException, "format", ParameterException::Unsupported,
+                         format, "the ENVI data file's name",
+                         FormatString("%s names an ENVI header, which the writer makes beside "
+                                      "the data file: give the data file's name (.img, .bin, "
+                                      ".dat, ...)",
+                                      path.c_str()));
     return driver;
 }
 
@@ -416,6 +474,16 @@ void CreateLocked(BasicWriter::Impl& impl, const SourceLocation& where) {
     } else {
         options = DefaultCreationOptions(workFormat, impl.type);
         AddOptions(options, impl.options);
+        // NITF takes a CRS only when told its kind at creation: UTM or geographic.
+        if (workFormat == "NITF" && impl.crs != nullptr &&
+            options.FetchNameValue("ICORDS") == nullptr) {
+            const OGRSpatialReference& srs = impl.crs->GetSpatialReference();
+            int north = 0;
+            if (srs.GetUTMZone(&north) != 0)
+                options.SetNameValue("ICORDS", north ? "N" : "S");
+            else if (srs.IsGeographic())
+                options.SetNameValue("ICORDS", "G");
+        }
     }
     gdalsupport::ErrorCapture errors;
     impl.dataset.reset(driver->Create(impl.tempPath.c_str(), static_cast<int>(impl.tiling.width),
@@ -494,6 +562,50 @@ gobs::Raster* BasicWriter::ReadWindow(unsigned int x, unsigned int y, unsigned i
     return raster.release();
 }
 
+namespace {
+
+bool SameCRS(const OGRSpatialReference& a, const OGRSpatialReference& b) {
+    if (a.IsSame(&b))
+        return true;
+    // Equivalent definitions that name things differently.
+    char* pa = nullptr;
+    char* pb = nullptr;
+    const bool same = a.exportToProj4(&pa) == OGRERR_NONE && b.exportToProj4(&pb) == OGRERR_NONE &&
+                      std::string(pa) == pb;
+    CPLFree(pa);
+    CPLFree(pb);
+    return same;
+}
+
+// What of the georeferencing set on the writer the finished file does not give back (empty
+// when all of it): some formats store it coarsely (NITF in whole metres) or not at all.
+std::string LostGeoreferencing(const BasicWriter::Impl& impl, const std::string& finished) {
+    if (impl.crs == nullptr && impl.geocoding == nullptr)
+        return "";
+    gdalsupport::ErrorCapture errors;
+    GDALDatasetPtr ds(GDALDataset::Open(finished.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
+    if (ds == nullptr)
+        return "pixels (GDAL cannot open the file it wrote: " + errors.Reason() + ")";
+    if (impl.geocoding != nullptr) {
+        const std::array<double, 6> want = impl.geocoding->GetGeoTransform();
+        std::array<double, 6> got{};
+        const double pixel = std::max(std::fabs(want[1]) + std::fabs(want[2]), 1e-12);
+        bool same = ds->GetGeoTransform(got.data()) == CE_None;
+        for (int k = 0; k < 6 && same; ++k)
+            same = std::fabs(got[k] - want[k]) <= 1e-6 * pixel;
+        if (!same)
+            return "geotransform";
+    }
+    if (impl.crs != nullptr) {
+        const OGRSpatialReference* srs = ds->GetSpatialRef();
+        if (srs == nullptr || !SameCRS(*srs, impl.crs->GetSpatialReference()))
+            return "coordinate system";
+    }
+    return "";
+}
+
+}  // namespace
+
 void BasicWriter::Close() {
     std::lock_guard<std::mutex> lock(impl_->mutex);
     Impl& impl = *impl_;
@@ -546,34 +658,89 @@ void BasicWriter::Close() {
         impl.closed = true;
         return;
     }
-    // Files of an older dataset under the final name that the new one does not replace (side
-    // files such as .aux.xml) would describe the new file wrongly: remove them after the move.
-    std::vector<std::string> stale;
-    if (Exists(impl.path)) {
-        gdalsupport::ErrorCapture errors;
-        GDALDatasetPtr old(GDALDataset::Open(impl.path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
-        if (old != nullptr) {
-            char** files = old->GetFileList();
-            for (char** f = files; f != nullptr && *f != nullptr; ++f)
-                stale.emplace_back(*f);
-            CSLDestroy(files);
-        }
+    const std::string finished = parts.dir + impl.tempStem + parts.ext;
+    const std::string lost = LostGeoreferencing(impl, finished);
+    if (!lost.empty())
+        fail("write",
+             FormatString("the %s format does not keep its %s; write it as tif, gpkg or img",
+                          impl.format.c_str(), lost.c_str()));
+    try {
+        PublishDataset(finished, impl.path);
+    } catch (...) {
+        impl.RemoveTemporaries();
+        impl.closed = true;
+        throw;
     }
-    std::vector<std::string> moved;
-    for (const std::string& name : FilesWithPrefix(parts.dir, impl.tempStem)) {
-        const std::string target = parts.dir + parts.stem + name.substr(impl.tempStem.size());
-        if (!ReplaceFile(parts.dir + name, target))
-            fail("move the finished file into place as", VSIStrerror(errno));
-        moved.push_back(target);
-    }
-    for (const std::string& file : stale) {
-        bool replaced = false;
-        for (const std::string& m : moved)
-            replaced = replaced || m == file;
-        if (!replaced)
-            VSIUnlink(file.c_str());
-    }
+    impl.RemoveTemporaries();
     impl.closed = true;
+}
+
+void PublishDataset(const std::string& temporary, const std::string& final) {
+    gdalsupport::EnsureRegistered();
+    // The new files, the main one last, so that the final name shows the new dataset only
+    // once its side files are in place.
+    std::vector<std::pair<std::string, std::string>> moves;
+    for (const std::string& file : DatasetFiles(temporary))
+        if (file != temporary)
+            moves.emplace_back(file, PublishedName(file, temporary, final));
+    moves.emplace_back(temporary, final);
+    // The files an older dataset has under the final names, the main one first.
+    std::vector<std::string> old;
+    if (Exists(final) && !IsDirectory(final))
+        old = DatasetFiles(final);
+    for (const auto& move : moves)
+        if (Exists(move.second) && !IsDirectory(move.second) &&
+            std::find(old.begin(), old.end(), move.second) == old.end())
+            old.push_back(move.second);
+
+    auto removeNew = [&] {
+        for (const auto& move : moves)
+            VSIUnlink(move.first.c_str());
+    };
+    auto fail = [&](const std::string& from, const std::string& to) {
+        const std::string reason = VSIStrerror(errno);
+        removeNew();
+        KESTREL_THROW(FileAccessException, final, FileAccessException::WriteFailed,
+                      FormatString("Could not publish %s: renaming %s to %s failed: %s",
+                                   final.c_str(), from.c_str(), to.c_str(), reason.c_str()));
+    };
+    // A single file replaces a single file in one step.
+    if (moves.size() == 1 && old.size() <= 1) {
+        if (!ReplaceFile(temporary, final))
+            fail(temporary, final);
+        return;
+    }
+    // Otherwise the older files step aside first (the main one first, so that its name never
+    // shows it with new side files), and come back if the new ones cannot all be put in place.
+    const std::string tag = ".old-" + RandomTag();
+    std::vector<std::string> asideDone;
+    auto restore = [&] {
+        for (auto it = asideDone.rbegin(); it != asideDone.rend(); ++it)
+            VSIRename((*it + tag).c_str(), it->c_str());
+    };
+    for (const std::string& file : old) {
+        if (VSIRename(file.c_str(), (file + tag).c_str()) != 0) {
+            const int error = errno;
+            restore();
+            errno = error;
+            fail(file, file + tag);
+        }
+        asideDone.push_back(file);
+    }
+    std::vector<std::string> placed;
+    for (const auto& move : moves) {
+        if (VSIRename(move.first.c_str(), move.second.c_str()) != 0) {
+            const int error = errno;
+            for (const std::string& file : placed)
+                VSIUnlink(file.c_str());
+            restore();
+            errno = error;
+            fail(move.first, move.second);
+        }
+        placed.push_back(move.second);
+    }
+    for (const std::string& file : asideDone)
+        VSIUnlink((file + tag).c_str());
 }
 
 bool BasicWriter::IsClosed() const {

@@ -1,8 +1,11 @@
 // Occlusion recovery: the true-ortho mosaic of several orthos on one grid, each pixel taken
 // from the scene that sees it best.
 #include <kestrel/exception.h>
+#include <kestrel/raster.h>
+#include <kestrel/rasterio.h>
 #include <kestrel/trueortho.h>
 
+#include "../datasources/gdaldataset.h"
 #include "../gdalsupport.h"
 #include "rasterfiles.h"
 #include "runcontrol.h"
@@ -13,12 +16,12 @@
 #include <array>
 #include <cmath>
 #include <limits>
+#include <mutex>
 
 namespace kestrel {
 namespace processes {
 
 using trueortho::DatasetPtr;
-using trueortho::OutputRaster;
 using trueortho::RunControl;
 
 namespace {
@@ -33,6 +36,14 @@ struct SceneInfo {
     double noData = 0;
 };
 
+// A scene's rasters, opened once for the whole run and shared by the threads. GDAL datasets
+// serve one thread at a time, hence the lock; threads start on different scenes so that they
+// seldom wait for each other.
+struct SceneFiles {
+    DatasetPtr ortho, visibility;
+    std::mutex mutex;
+};
+
 struct Grid {
     unsigned int pixels = 0, lines = 0;
     int bands = 0;
@@ -40,14 +51,44 @@ struct Grid {
     std::array<double, 6> geoTransform{};
     std::unique_ptr<ogc::cs::ICRS> crs;
     std::vector<SceneInfo> scenes;
+    std::vector<std::unique_ptr<SceneFiles>> files;
     int halo = 0;  // the largest pixel error
 };
 
+// The choice for one pixel among the scenes that see it. Lower ranks first:
+//   1. seen clearly: no hidden pixel of the scene within its DBM pixel error (the visibility
+//      test's tolerance), so an error of the surface model cannot have put the pixel on the
+//      wrong side of an occlusion edge;
+//   2. the lower radiometric difference level;
+//   3. the line of sight nearer the vertical (a known angle before an unknown one);
+//   4. the scene listed first.
+struct Rank {
+    static constexpr size_t kNone = std::numeric_limits<size_t>::max();
+    int unclear = 0, level = 0;
+    float angle = kUnknownAngle;
+    size_t index = kNone;
+    bool operator<(const Rank& o) const {
+        if (o.index == kNone || index == kNone)
+            return o.index == kNone && index != kNone;
+        if (unclear != o.unclear)
+            return unclear < o.unclear;
+        if (level != o.level)
+            return level < o.level;
+        if (angle != o.angle)
+            return angle < o.angle;
+        return index < o.index;
+    }
+};
+
+// One thread's buffers, reused from tile to tile; they hold one scene at a time, so a thread's
+// memory does not grow with the number of scenes.
 struct Worker {
-    std::vector<DatasetPtr> orthos, visibilities;
-    std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;
-    std::vector<std::vector<float>> values, visibility, angle;
-    std::vector<float> mosaic, source;
+    std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;  // made when needed
+    std::vector<float> visibility, values, angle;
+    std::vector<int> nearHidden;
+    std::vector<unsigned char> unclear;
+    std::vector<Rank> best;
+    std::vector<size_t> taken;
 };
 
 bool SameGeoTransform(const std::array<double, 6>& a, const std::array<double, 6>& b) {
@@ -61,7 +102,8 @@ bool SameGeoTransform(const std::array<double, 6>& a, const std::array<double, 6
     return true;
 }
 
-// Opens every scene once and checks that they share one grid, data type and channel count.
+// Opens every scene (for the whole run) and checks that they share one grid, data type and channel
+// count.
 Grid Inspect(const RecoveryJob& job) {
     if (job.scenes.empty())
         KESTREL_THROW(DataException, "Occlusion recovery: no scenes given");
@@ -82,8 +124,11 @@ Grid Inspect(const RecoveryJob& job) {
                                        "%d; expected 0 to 1000",
                                        s + 1, scene.orthoPath.c_str(), scene.dbmPixelError));
         grid.halo = std::max(grid.halo, scene.dbmPixelError);
-        DatasetPtr ortho = trueortho::OpenRaster(scene.orthoPath, "ortho");
-        DatasetPtr visibility = trueortho::OpenRaster(scene.visibilityPath, "visibility index");
+        grid.files.push_back(std::make_unique<SceneFiles>());
+        DatasetPtr& ortho = grid.files.back()->ortho;
+        DatasetPtr& visibility = grid.files.back()->visibility;
+        ortho = trueortho::OpenRaster(scene.orthoPath, "ortho");
+        visibility = trueortho::OpenRaster(scene.visibilityPath, "visibility index");
         std::array<double, 6> gt{};
         const bool georeferenced = ortho->GetGeoTransform(gt.data()) == CE_None;
         GDALRasterBand* first = ortho->GetRasterBand(1);
@@ -203,89 +248,151 @@ void Angles(const RecoveryJob& job, const Grid& grid, const RecoveryScene& scene
     }
 }
 
-// The choice for one pixel among the scenes that see it. Lower ranks first:
-//   1. seen clearly: no hidden pixel of the scene within its DBM pixel error (the visibility
-//      test's tolerance), so an error of the surface model cannot have put the pixel on the
-//      wrong side of an occlusion edge;
-//   2. the lower radiometric difference level;
-//   3. the line of sight nearer the vertical (a known angle before an unknown one);
-//   4. the scene listed first.
-struct Rank {
-    int unclear, level;
-    float angle;
-    size_t index;
-    bool operator<(const Rank& o) const {
-        if (unclear != o.unclear)
-            return unclear < o.unclear;
-        if (level != o.level)
-            return level < o.level;
-        if (angle != o.angle)
-            return angle < o.angle;
-        return index < o.index;
+// Marks the tile's pixels that have a hidden pixel within e pixels (a square neighbourhood).
+// `vis` is the tile with a border of e pixels (vw x vh). Counts of hidden pixels slide along
+// each row and then down each column, so the cost per pixel does not depend on e.
+void MarkNearHidden(const std::vector<float>& vis, int vw, int vh, int tw, int th, int e,
+                    std::vector<int>& rowCounts, std::vector<unsigned char>& unclear) {
+    const int span = 2 * e + 1;
+    auto hidden = [](float v) { return v == VISIBILITY_HIDDEN ? 1 : 0; };
+    // rowCounts[r * tw + i]: hidden pixels of border row r in columns i to i + 2e.
+    rowCounts.assign(static_cast<size_t>(vh) * tw, 0);
+    for (int r = 0; r < vh; ++r) {
+        const float* line = vis.data() + static_cast<size_t>(r) * vw;
+        int* counts = rowCounts.data() + static_cast<size_t>(r) * tw;
+        int count = 0;
+        for (int c = 0; c < span - 1; ++c)
+            count += hidden(line[c]);
+        for (int i = 0; i < tw; ++i) {
+            count += hidden(line[i + span - 1]);
+            counts[i] = count;
+            count -= hidden(line[i]);
+        }
     }
+    // Then over rows j to j + 2e of those counts.
+    std::vector<int> column(tw, 0);
+    for (int r = 0; r < span - 1; ++r)
+        for (int i = 0; i < tw; ++i)
+            column[i] += rowCounts[static_cast<size_t>(r) * tw + i];
+    unclear.assign(static_cast<size_t>(tw) * th, 0);
+    for (int j = 0; j < th; ++j) {
+        const int* entering = rowCounts.data() + static_cast<size_t>(j + span - 1) * tw;
+        const int* leaving = rowCounts.data() + static_cast<size_t>(j) * tw;
+        unsigned char* out = unclear.data() + static_cast<size_t>(j) * tw;
+        for (int i = 0; i < tw; ++i) {
+            column[i] += entering[i];
+            out[i] = column[i] > 0;
+            column[i] -= leaving[i];
+        }
+    }
+}
+
+struct Tile {
+    int x, y, width, height;
+    size_t Size() const { return static_cast<size_t>(width) * height; }
 };
 
-void ProcessTile(const RecoveryJob& job, const Grid& grid, Worker& w, OutputRaster& mosaic,
-                 OutputRaster& source, int tx, int ty, int tw, int th, const RunControl& control,
-                 TorthoRecoveryResult& counts) {
-    const size_t scenes = job.scenes.size();
-    const int halo = grid.halo;
-    // Visibility with a border of the largest pixel error around the tile.
-    const int vx = tx - halo, vy = ty - halo, vw = tw + 2 * halo, vh = th + 2 * halo;
-    const size_t tileSize = static_cast<size_t>(tw) * th;
-    w.values.resize(scenes), w.visibility.resize(scenes), w.angle.resize(scenes);
+// Offers scene s for the tile's pixels: where it sees a pixel and ranks before the best so far,
+// it becomes the pixel's source and its values go into the mosaic.
+void OfferScene(const RecoveryJob& job, const Grid& grid, size_t s, Worker& w, const Tile& t,
+                const ogc::cs::CoordinateTransformation* toModel, gobs::Raster& mosaic,
+                gobs::Raster& source) {
+    const RecoveryScene& scene = job.scenes[s];
+    SceneFiles& files = *grid.files[s];
+    const int e = scene.dbmPixelError;
+    const int vw = t.width + 2 * e, vh = t.height + 2 * e;
+    w.visibility.assign(static_cast<size_t>(vw) * vh, VISIBILITY_OUTSIDE);
+    {
+        std::lock_guard<std::mutex> lock(files.mutex);
+        trueortho::ReadWindow(*files.visibility, scene.visibilityPath, {1}, t.x - e, t.y - e, vw,
+                              vh, w.visibility.data());
+    }
+    auto seen = [&](int i, int j) {
+        return w.visibility[static_cast<size_t>(j + e) * vw + i + e] == VISIBILITY_SEEN;
+    };
+    bool seesAny = false;
+    for (int j = 0; j < t.height && !seesAny; ++j)
+        for (int i = 0; i < t.width && !seesAny; ++i)
+            seesAny = seen(i, j);
+    if (!seesAny)
+        return;
+    MarkNearHidden(w.visibility, vw, vh, t.width, t.height, e, w.nearHidden, w.unclear);
+    Angles(job, grid, scene, toModel, t.x, t.y, t.width, t.height, w.angle);
+
+    w.taken.clear();
+    for (int j = 0; j < t.height; ++j)
+        for (int i = 0; i < t.width; ++i) {
+            const size_t o = static_cast<size_t>(j) * t.width + i;
+            if (!seen(i, j))
+                continue;
+            const Rank rank{w.unclear[o], scene.radiometricLevel, w.angle[o], s};
+            if (rank < w.best[o])
+                w.best[o] = rank, w.taken.push_back(o);
+        }
+    if (w.taken.empty())
+        return;
     std::vector<int> allBands(grid.bands);
     for (int b = 0; b < grid.bands; ++b)
         allBands[b] = b + 1;
-    for (size_t s = 0; s < scenes; ++s) {
+    const size_t size = t.Size();
+    w.values.assign(size * grid.bands, 0.0f);
+    {
+        std::lock_guard<std::mutex> lock(files.mutex);
+        trueortho::ReadWindow(*files.ortho, scene.orthoPath, allBands, t.x, t.y, t.width, t.height,
+                              w.values.data());
+    }
+    float* out = static_cast<float*>(mosaic.GetData());
+    float* from = static_cast<float*>(source.GetData());
+    for (const size_t o : w.taken) {
+        from[o] = static_cast<float>(s + 1);
+        for (int b = 0; b < grid.bands; ++b)
+            out[size * b + o] = w.values[size * b + o];
+    }
+}
+
+void ProcessTile(const RecoveryJob& job, const Grid& grid, Worker& w,
+                 const std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>>& toModel,
+                 datasources::BasicWriter& mosaicOut, datasources::BasicWriter& sourceOut,
+                 const Tile& t, size_t tileIndex, const RunControl& control,
+                 TorthoRecoveryResult& counts) {
+    const size_t scenes = job.scenes.size();
+    const SceneInfo& first = grid.scenes[0];
+    gobs::Raster mosaic(t.width, t.height, grid.bands, datasources::DataType::Float32,
+                        gobs::Raster::Initial::Unset);
+    gobs::Raster source(t.width, t.height, 1, datasources::DataType::Float32);
+    std::fill_n(static_cast<float*>(mosaic.GetData()), mosaic.GetPlaneSize() * grid.bands,
+                static_cast<float>(first.hasNoData ? first.noData : 0));
+    w.best.assign(t.Size(), Rank());
+    w.toModel.resize(scenes);
+    for (size_t k = 0; k < scenes; ++k) {
         if (control.Stopped())
             return;
-        w.visibility[s].assign(static_cast<size_t>(vw) * vh, VISIBILITY_OUTSIDE);
-        trueortho::ReadWindow(*w.visibilities[s], job.scenes[s].visibilityPath, {1}, vx, vy, vw, vh,
-                              w.visibility[s].data());
-        w.values[s].assign(tileSize * grid.bands, 0.0f);
-        trueortho::ReadWindow(*w.orthos[s], job.scenes[s].orthoPath, allBands, tx, ty, tw, th,
-                              w.values[s].data());
-        Angles(job, grid, job.scenes[s], w.toModel[s].get(), tx, ty, tw, th, w.angle[s]);
+        const size_t s = (tileIndex + k) % scenes;
+        if (toModel[s] && !w.toModel[s])
+            w.toModel[s] = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel[s]);
+        OfferScene(job, grid, s, w, t, w.toModel[s].get(), mosaic, source);
     }
-    const SceneInfo& first = grid.scenes[0];
-    w.mosaic.assign(tileSize * grid.bands, static_cast<float>(first.hasNoData ? first.noData : 0));
-    w.source.assign(tileSize, 0.0f);
-    for (int j = 0; j < th; ++j) {
-        if ((j & 15) == 0 && control.Stopped())
-            return;
-        for (int i = 0; i < tw; ++i) {
-            const size_t o = static_cast<size_t>(j) * tw + i;
-            bool found = false;
-            Rank best{};
-            for (size_t s = 0; s < scenes; ++s) {
-                const std::vector<float>& vis = w.visibility[s];
-                auto visAt = [&](int di, int dj) {
-                    return vis[static_cast<size_t>(j + halo + dj) * vw + (i + halo + di)];
-                };
-                if (visAt(0, 0) != VISIBILITY_SEEN)
-                    continue;
-                const int e = job.scenes[s].dbmPixelError;
-                int unclear = 0;
-                for (int dj = -e; dj <= e && !unclear; ++dj)
-                    for (int di = -e; di <= e && !unclear; ++di)
-                        unclear = visAt(di, dj) == VISIBILITY_HIDDEN;
-                const Rank rank{unclear, job.scenes[s].radiometricLevel, w.angle[s][o], s};
-                if (!found || rank < best)
-                    best = rank, found = true;
-            }
-            if (!found) {
-                ++counts.unfilled;
-                continue;
-            }
-            ++counts.filled;
-            w.source[o] = static_cast<float>(best.index + 1);
-            for (int b = 0; b < grid.bands; ++b)
-                w.mosaic[tileSize * b + o] = w.values[best.index][tileSize * b + o];
-        }
-    }
-    mosaic.Write(tx, ty, tw, th, w.mosaic.data());
-    source.Write(tx, ty, tw, th, w.source.data());
+    for (const Rank& rank : w.best)
+        ++(rank.index == Rank::kNone ? counts.unfilled : counts.filled);
+    mosaicOut.WriteWindow(mosaic, t.x, t.y);
+    sourceOut.WriteWindow(source, t.x, t.y);
+}
+
+// A writer of one of the outputs on the common grid.
+std::unique_ptr<datasources::BasicWriter> OutputWriter(const std::string& path,
+                                                       const std::string& format, const Grid& grid,
+                                                       int bands, GDALDataType type,
+                                                       double noData) {
+    std::vector<unsigned int> channels(bands);
+    for (int b = 0; b < bands; ++b)
+        channels[b] = b + 1;
+    auto writer = std::make_unique<datasources::BasicWriter>(path, channels, format, "");
+    writer->SetSize(grid.pixels, grid.lines);
+    writer->SetDataType(datasources::FromGDAL(type));
+    writer->SetCRS(grid.crs.get());
+    writer->SetGeocoding(ogc::cs::GeocodingInfo(grid.geoTransform));
+    writer->SetNoDataValue(noData);
+    return writer;
 }
 
 }  // namespace
@@ -307,45 +414,34 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     if (control.Stopped())
         return result;
 
-    const ogc::cs::GeocodingInfo geocoding(grid.geoTransform);
     const SceneInfo& first = grid.scenes[0];
-    OutputRaster mosaic(job.mosaicPath, job.format, grid.pixels, grid.lines, grid.bands, grid.type,
-                        grid.crs.get(), geocoding, first.hasNoData ? first.noData : 0.0);
-    OutputRaster source(job.sourcePath, job.format, grid.pixels, grid.lines, 1,
-                        job.scenes.size() < 255 ? GDT_Byte : GDT_UInt16, grid.crs.get(), geocoding,
-                        0.0);
+    auto mosaic = OutputWriter(job.mosaicPath, job.format, grid, grid.bands, grid.type,
+                               first.hasNoData ? first.noData : 0.0);
+    auto source = OutputWriter(job.sourcePath, job.format, grid, 1,
+                               job.scenes.size() < 255 ? GDT_Byte : GDT_UInt16, 0.0);
 
-    const unsigned int tile = job.tileSize;
+    // Each tile reads the visibility with a border of the pixel error: tiles of at least twice
+    // that (up to 1024) keep the border's share of the reading bounded.
+    const unsigned int tile =
+        std::max(job.tileSize, std::min(2u * static_cast<unsigned int>(grid.halo), 1024u));
     const unsigned int tilesX = (grid.pixels + tile - 1) / tile;
     const unsigned int tilesY = (grid.lines + tile - 1) / tile;
-    std::vector<TorthoRecoveryResult> counts(ThreadsToUse());
-    std::vector<std::unique_ptr<Worker>> workers(counts.size());
-    control.RunTiles(
-        static_cast<size_t>(tilesX) * tilesY, static_cast<unsigned int>(counts.size()),
-        "Occlusion recovery", [&](unsigned int thread, size_t index) {
-            std::unique_ptr<Worker>& w = workers[thread];
-            if (!w) {
-                w = std::make_unique<Worker>();
-                for (size_t s = 0; s < job.scenes.size(); ++s) {
-                    w->orthos.push_back(trueortho::OpenRaster(job.scenes[s].orthoPath, "ortho"));
-                    w->visibilities.push_back(
-                        trueortho::OpenRaster(job.scenes[s].visibilityPath, "visibility index"));
-                    w->toModel.push_back(
-                        toModel[s]
-                            ? std::make_unique<ogc::cs::CoordinateTransformation>(*toModel[s])
-                            : nullptr);
-                }
-            }
-            const int tx = static_cast<int>((index % tilesX) * tile);
-            const int ty = static_cast<int>((index / tilesX) * tile);
-            const int tw = static_cast<int>(std::min(tile, grid.pixels - tx));
-            const int th = static_cast<int>(std::min(tile, grid.lines - ty));
-            ProcessTile(job, grid, *w, mosaic, source, tx, ty, tw, th, control, counts[thread]);
-        });
+    const size_t tiles = static_cast<size_t>(tilesX) * tilesY;
+    const unsigned int threads = static_cast<unsigned int>(std::min<size_t>(ThreadsToUse(), tiles));
+    std::vector<TorthoRecoveryResult> counts(threads);
+    std::vector<Worker> workers(threads);
+    control.RunTiles(tiles, threads, "Occlusion recovery", [&](unsigned int thread, size_t index) {
+        const int tx = static_cast<int>((index % tilesX) * tile);
+        const int ty = static_cast<int>((index / tilesX) * tile);
+        const Tile t{tx, ty, static_cast<int>(std::min(tile, grid.pixels - tx)),
+                     static_cast<int>(std::min(tile, grid.lines - ty))};
+        ProcessTile(job, grid, workers[thread], toModel, *mosaic, *source, t, index, control,
+                    counts[thread]);
+    });
     if (control.Stopped())
         return result;
-    mosaic.Commit();
-    source.Commit();
+    mosaic->Close();
+    source->Close();
     for (const auto& c : counts)
         result.filled += c.filled, result.unfilled += c.unfilled;
     result.completed = true;
