@@ -151,11 +151,16 @@ TEST(DemNoData, HolesAreNeverAveragedIn) {
     testsupport::TempDir dir;
     const Grid grid{0, 40, 10, 4, 4};
     const std::string path = dir.File("holes.tif");
-    // Post (1, 1) is a hole; post (2, 2) holds the extra no-data value 7.
+    // Post (1, 1) is a hole; post (2, 2) holds the extra no-data value 7; posts (3, 3) and
+    // (0, 3) are infinite.
     testsupport::WriteDem(
         path, grid, "EPSG:32632",
         [](int i, int j) {
-            return i == 1 && j == 1 ? -32768.0f : i == 2 && j == 2 ? 7.0f : 100.0f + i;
+            return i == 1 && j == 1   ? -32768.0f
+                   : i == 2 && j == 2 ? 7.0f
+                   : i == 3 && j == 3 ? INFINITY
+                   : i == 0 && j == 3 ? -INFINITY
+                                      : 100.0f + i;
         },
         {}, true);
     std::unique_ptr<IRasterDEM> dem(
@@ -169,9 +174,20 @@ TEST(DemNoData, HolesAreNeverAveragedIn) {
         {grid.X(1.5), grid.Y(0), 5 + 2 * 101.5},  // between two posts with heights
         {grid.X(0.25), grid.Y(0.25),
          5 + 2 * (100 * 0.75 * 0.75 + 101 * 0.25 * 0.75 + 100 * 0.75 * 0.25) / (1 - 0.0625)},
-        {-1, 20, NAN},           // outside
-        {0, 40, 5 + 2 * 100.0},  // the raster's corner
+        {-1, 20, NAN},                            // outside
+        {0, 40, 5 + 2 * 100.0},                   // the raster's corner
+        {grid.X(3), grid.Y(3), NAN},              // on an infinite post: no-data
+        {grid.X(2.5), grid.Y(3), 5 + 2 * 102.0},  // beside it: its neighbour only
+        {grid.X(0.5), grid.Y(3), 5 + 2 * 101.0},
     };
+    // Four posts without a height: the hole, the extra no-data value and the infinite ones.
+    std::size_t posts = 0, holes = 0;
+    ASSERT_TRUE(dem->CountPosts(0, 0, 40, 40, posts, holes));
+    EXPECT_EQ(posts, 16u);
+    EXPECT_EQ(holes, 4u);
+    ASSERT_TRUE(dem->CountPosts(grid.X(0.9), grid.Y(3.5), grid.X(3), grid.Y(2.1), posts, holes));
+    EXPECT_EQ(posts, 3u);  // (1, 3), (2, 3), (3, 3)
+    EXPECT_EQ(holes, 1u);
     for (const auto& c : cases) {
         double h = NAN;
         dem->GetHeights(1, &c.x, &c.y, &h);
@@ -235,6 +251,105 @@ TEST_F(Dem, TileIndexCarriesItsOwnDatum) {
                                                                           : DatumMSL;
         EXPECT_EQ(dem->GetVerticalDatum(), expected) << keyword;
         EXPECT_EQ(dem->GetOutputVerticalDatum(), expected) << keyword;
+    }
+}
+
+TEST_F(Dem, TileIndexNamesOnlyLocalFiles) {
+    const std::string index = dir.File("index.gpkg");
+    testsupport::RunCommand("cd '" + dir.Path().string() +
+                            "' && gdaltindex -f GPKG index.gpkg dem.tif >/dev/null");
+    const char* const remote[] = {"/vsicurl/http://example.com/dem.tif",
+                                  "https://example.com/t.tif", "/vsizip/tiles.zip/dem.tif",
+                                  "missing.tif"};
+    for (const char* location : remote) {
+        {
+            GDALDatasetUniquePtr ds(
+                GDALDataset::Open(index.c_str(), GDAL_OF_VECTOR | GDAL_OF_UPDATE));
+            ASSERT_TRUE(ds);
+            OGRLayer* layer = ds->GetLayer(0);
+            layer->ResetReading();
+            std::unique_ptr<OGRFeature> first(layer->GetNextFeature());
+            ASSERT_TRUE(first);
+            std::unique_ptr<OGRFeature> second(first->Clone());
+            second->SetFID(2);
+            second->SetField("location", location);
+            if (layer->GetFeature(2) == nullptr)
+                ASSERT_EQ(layer->CreateFeature(second.get()), OGRERR_NONE);
+            else
+                ASSERT_EQ(layer->SetFeature(second.get()), OGRERR_NONE);
+        }
+        try {
+            std::unique_ptr<IRasterDEM> dem(DEMFactory::CreateTileRasterDEM(index));
+            ADD_FAILURE() << location << " was opened";
+        } catch (const kestrel::DataException& e) {
+            const std::string message = e.what();
+            for (const std::string& part : {index, std::string("feature 2"), std::string(location),
+                                            std::string("not a local file")})
+                EXPECT_NE(message.find(part), std::string::npos) << message;
+        }
+    }
+}
+
+// The height range of a window holds every height in it, in any input CRS and output datum,
+// and is that of the window's own posts: a far outlier or an infinite post elsewhere does not
+// widen it.
+TEST_F(Dem, HeightRangeOfAWindow) {
+    const std::string outliers = dir.File("outliers.tif");
+    testsupport::WriteDem(
+        outliers, kGrid, kCrs,
+        [](int i, int j) {
+            return i == 290 && j == 250 ? 1e6f : i == 20 && j == 20 ? INFINITY : Post(i, j);
+        },
+        kTiled);
+    const ICRS webMercator("EPSG:3857");
+    const struct {
+        bool mercator;          // the window in EPSG:3857, else the DEM's own CRS
+        DatumType output;       // the datum of the heights
+        double i0, j0, i1, j1;  // the window, in post coordinates
+        bool holdsOutlier;
+    } cases[] = {
+        {false, DatumMSL, 10, 10, 30, 25, false},
+        {false, DatumMSL, 100.3, 50.2, 104.8, 53.9, false},
+        {true, DatumEllipsoid, 150, 120, 170, 140, false},
+        {false, DatumEllipsoid, 280, 240, 299, 259, true},
+    };
+    for (bool preload : {false, true}) {
+        auto dem = Open(outliers, 1, preload);
+        for (const auto& c : cases) {
+            SCOPED_TRACE(c.i0);
+            dem->SetOutputVerticalDatum(c.output);
+            dem->SetInputCRS(c.mercator ? &webMercator : nullptr);
+            // Dense points of the window, in the input CRS.
+            std::vector<double> x, y;
+            for (int b = 0; b <= 20; ++b)
+                for (int a = 0; a <= 20; ++a)
+                    x.push_back(kGrid.X(c.i0 + (c.i1 - c.i0) * a / 20)),
+                        y.push_back(kGrid.Y(c.j0 + (c.j1 - c.j0) * b / 20));
+            if (c.mercator)
+                CoordinateTransformation(ICRS(kCrs), webMercator)
+                    .Transform(x.size(), x.data(), y.data());
+            std::vector<double> h(x.size());
+            dem->GetHeights(x.size(), x.data(), y.data(), h.data());
+            const auto [x0, x1] = std::minmax_element(x.begin(), x.end());
+            const auto [y0, y1] = std::minmax_element(y.begin(), y.end());
+            double low = NAN, high = NAN;
+            ASSERT_TRUE(dem->GetHeightRange(*x0, *y0, *x1, *y1, low, high));
+            for (double v : h) {
+                if (!std::isnan(v))
+                    EXPECT_TRUE(low <= v && v <= high) << low << " " << v << " " << high;
+            }
+            if (c.holdsOutlier) {
+                EXPECT_GE(high, 1e6);
+            } else {
+                // Cells of 16 posts: a little wider than the window's own heights.
+                const auto [hl, hh] = std::minmax_element(h.begin(), h.end());
+                EXPECT_GT(low, *hl - 30);
+                EXPECT_LT(high, *hh + 30);
+            }
+        }
+        dem->SetInputCRS(nullptr);
+        double low, high;
+        EXPECT_FALSE(dem->GetHeightRange(0, 0, 10, 10, low, high));  // far outside
     }
 }
 

@@ -97,12 +97,164 @@ TEST_F(Height, AgreesWithGdallocationinfoAtPosts) {
     }
 }
 
-TEST_F(Height, ConvertsOnRequest) {
-    // printf "514015 5034995 201\n" | cs2cs -d 6 EPSG:32632+5773 EPSG:4979 -> 243.586745
-    input = testsupport::WriteFile(dir.File("one.txt"), "514015 5034995\n");
-    EXPECT_EQ(Tool("'" + dir.File("dem.tif") + "'"), "201\n");
-    const std::string converted = Tool("'" + dir.File("dem.tif") + "' --to ellips");
-    EXPECT_NEAR(std::stod(converted), 243.586745, 1e-3) << converted;
+namespace {
+
+std::string Wkt(const OGRSpatialReference& srs) {
+    char* wkt = nullptr;
+    const char* options[] = {"FORMAT=WKT2_2019", "MULTILINE=NO", nullptr};
+    srs.exportToWkt(&wkt, options);
+    std::string text = wkt;
+    CPLFree(wkt);
+    return text;
+}
+
+// Compound systems whose heights are above EGM96 in feet: EPSG has no code for them.
+std::string Egm96InFeet(const char* unit, double metres) {
+    OGRSpatialReference utm, vertical, compound;
+    utm.importFromEPSG(32632);
+    vertical.importFromEPSG(5773);
+    vertical.SetLinearUnits(unit, metres);
+    compound.SetCompoundCS("UTM 32N + EGM96 height in feet", &utm, &vertical);
+    return Wkt(compound);
+}
+
+// EPSG:32632 with ellipsoidal heights.
+std::string Utm3D() {
+    OGRSpatialReference utm;
+    utm.importFromEPSG(32632);
+    utm.PromoteTo3D(nullptr);
+    return Wkt(utm);
+}
+
+}  // namespace
+
+// silvan-height against gdallocationinfo (the stored value) plus cs2cs (the unit and datum that
+// the file, or else the options, give the value) at posts, asked in UTM or Web Mercator.
+TEST(HeightDatums, AgreeWithGdallocationinfoPlusCs2cs) {
+    if (!std::filesystem::exists(kTool))
+        GTEST_SKIP() << "silvan-height is not built";
+    testsupport::TempDir dir;
+    const std::string feet = Egm96InFeet("foot", 0.3048);
+    const std::string usFeet = Egm96InFeet("US survey foot", 1200.0 / 3937.0);
+    const std::string utm3d = Utm3D();
+    const Grid utm{514000, 5035000, 10, 12, 9};
+    const Grid ny{585000, 4511000, 10, 12, 9};
+    const auto value = [](int i, int j) { return static_cast<float>(300 + 3 * i - 0.37 * j); };
+    const auto write = [&](const std::string& name, const Grid& grid, const std::string& crs) {
+        const std::string path = dir.File(name);
+        if (name.size() > 4 && name.substr(name.size() - 4) == ".vrt") {
+            // GeoTIFF cannot keep a vertical unit without an EPSG code; a VRT keeps any CRS.
+            testsupport::WriteDem(path + ".tif", grid, "", value);
+            testsupport::WriteFile(path + ".wkt", crs);
+            RunCommand("gdal_translate -q -of VRT -a_srs '" + path + ".wkt' '" + path + ".tif' '" +
+                       path + "'");
+        } else {
+            testsupport::WriteDem(path, grid, crs, value);
+        }
+        return path;
+    };
+    write("msl.tif", utm, "EPSG:32632+5773");
+    write("none.tif", utm, "EPSG:32632");
+    write("ft.vrt", utm, feet);
+    write("navd88ftus.tif", ny, "EPSG:26918+6360");
+
+    struct Case {
+        const char* file;
+        const char* options;    // silvan-height's
+        const char* pointsCrs;  // of the points given; empty: the file's
+        std::string from, to;   // cs2cs: what the stored value means, what is printed
+    };
+    const Case cases[] = {
+        // A vertical CRS in metres: converted only when another datum is asked for.
+        {"msl.tif", "", "", "EPSG:32632+5773", "EPSG:32632+5773"},
+        {"msl.tif", "--to ELLIPS", "", "EPSG:32632+5773", "EPSG:4979"},
+        {"msl.tif", "--to ELLIPS", "EPSG:3857", "EPSG:32632+5773", "EPSG:4979"},
+        {"msl.tif", "--elevref MSL --elunits METRE --to ELLIPS", "", "EPSG:32632+5773",
+         "EPSG:4979"},
+        // In feet: metres in any case, with or without a datum shift; --elunits naming the
+        // file's own unit converts once.
+        {"ft.vrt", "", "", feet, "EPSG:32632+5773"},
+        {"ft.vrt", "--to ELLIPS", "", feet, "EPSG:4979"},
+        {"ft.vrt", "--elunits FOOT --to ELLIPS", "EPSG:3857", feet, "EPSG:4979"},
+        {"navd88ftus.tif", "", "", "EPSG:26918+6360", "EPSG:26918+5703"},
+        {"navd88ftus.tif", "--elunits US_FOOT", "EPSG:3857", "EPSG:26918+6360", "EPSG:26918+5703"},
+        // No vertical CRS: --elevref and --elunits say what the values are.
+        {"none.tif", "", "", "EPSG:32632+5773", "EPSG:32632+5773"},
+        {"none.tif", "--to ELLIPS", "EPSG:3857", "EPSG:32632+5773", "EPSG:4979"},
+        {"none.tif", "--elevref ELLIPS", "", utm3d, "EPSG:4979"},
+        {"none.tif", "--elevref ELLIPS --to MSL", "", utm3d, "EPSG:32632+5773"},
+        {"none.tif", "--elunits US_FOOT --to ELLIPS", "", usFeet, "EPSG:4979"},
+        {"none.tif", "--elunits FT --elevref MSL", "EPSG:3857", feet, "EPSG:32632+5773"},
+    };
+    for (const Case& c : cases) {
+        const std::string file = dir.File(c.file);
+        const Grid& grid = std::string(c.file) == "navd88ftus.tif" ? ny : utm;
+        const std::string fileCrs =
+            std::string(c.file) == "navd88ftus.tif" ? "EPSG:26918" : "EPSG:32632";
+        std::string posts;
+        for (int k = 0; k < 6; ++k)
+            posts += std::to_string(grid.X(2 * k % 11)) + " " + std::to_string(grid.Y(k)) + "\n";
+        std::string points = posts;
+        if (*c.pointsCrs != '\0') {
+            points = RunCommand("printf '" + posts + "' | cs2cs -f %.9f " + fileCrs + " " +
+                                c.pointsCrs + " | cut -f1,2 | tr '\\t' ' '");
+            // cs2cs writes "x<tab>y z": keep x and y.
+            std::string clean;
+            for (const auto& line : Lines(points)) {
+                std::istringstream in(line);
+                double x, y;
+                in >> x >> y;
+                char text[80];
+                std::snprintf(text, sizeof text, "%.9f %.9f\n", x, y);
+                clean += text;
+            }
+            points = clean;
+        }
+        const std::string input = testsupport::WriteFile(dir.File("points.txt"), points);
+        const std::string srs =
+            *c.pointsCrs != '\0' ? std::string(" -l_srs ") + c.pointsCrs : " -geoloc";
+        const auto stored = Lines(
+            RunCommand("gdallocationinfo -valonly" + srs + " '" + file + "' < '" + input + "'"));
+        ASSERT_EQ(stored.size(), 6u) << c.file;
+        std::string triples;
+        const auto postLines = Lines(posts);
+        for (int k = 0; k < 6; ++k)
+            triples += postLines[k] + " " + stored[k] + "\n";
+        const auto expected = Lines(
+            RunCommand("printf '" + triples + "' | cs2cs -f %.6f '" + c.from + "' '" + c.to + "'"));
+        const std::string options =
+            std::string(c.options) +
+            (*c.pointsCrs != '\0' ? std::string(" --srs ") + c.pointsCrs : "");
+        const auto got = Lines(
+            RunCommand("'" + kTool + "' '" + file + "' " + options + " < '" + input + "' 2>&1"));
+        ASSERT_EQ(expected.size(), 6u) << c.file << " " << options;
+        ASSERT_EQ(got.size(), 6u) << c.file << " " << options << ": " << got[0];
+        for (int k = 0; k < 6; ++k) {
+            std::istringstream in(expected[k]);
+            double a, b, h;
+            in >> a >> b >> h;
+            EXPECT_NEAR(std::stod(got[k]), h, 1e-3) << c.file << " " << options << " point " << k;
+        }
+    }
+
+    // What contradicts the file is refused, naming the option, by silvan-height and by
+    // silvan-ortho before any work; never applied on top of it.
+    const std::string ortho = std::string(SILVAN_TOOLS_DIR) + "/silvan-ortho '" +
+                              dir.File("master.txt") + "' --out '" + dir.File("out") + "' --dem ";
+    const std::pair<std::string, std::string> refused[] = {
+        {"msl.tif --elevref ELLIPS", "not ELLIPS as --elevref says"},
+        {"ft.vrt --elunits METER", "not in METER as --elunits says"},
+        {"navd88ftus.tif --elunits FOOT", "not in FOOT as --elunits says"},
+    };
+    for (const auto& r : refused) {
+        for (const std::string& tool : {"'" + kTool + "' ", ortho}) {
+            const std::string output = RunCommand(tool + dir.Path().string() + "/" + r.first +
+                                                  " </dev/null 2>&1; echo rc=$?");
+            EXPECT_NE(output.find(r.second), std::string::npos) << r.first << ": " << output;
+            EXPECT_NE(output.find("rc=2"), std::string::npos) << r.first << ": " << output;
+        }
+    }
+    EXPECT_FALSE(std::filesystem::exists(dir.File("out")));
 }
 
 TEST_F(Height, BadArgumentsAndLinesAreNamed) {

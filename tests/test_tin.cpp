@@ -3,6 +3,7 @@
 // surface give null, and a named layer that holds something else an error.
 #include <kestrel/tin.h>
 
+#include "../platform/src/tin/tinreader.h"
 #include "demdata.h"
 #include "support.h"
 
@@ -49,6 +50,16 @@ std::vector<std::unique_ptr<OGRGeometry>> Posts() {
     return points;
 }
 
+std::unique_ptr<OGRGeometry> TrianglePolygon(const std::array<OGRPoint, 3>& corners) {
+    OGRLinearRing ring;
+    for (const auto& p : corners)
+        ring.addPoint(&p);
+    ring.closeRings();
+    auto polygon = std::make_unique<OGRPolygon>();
+    polygon->addRing(&ring);
+    return polygon;
+}
+
 // Two triangles a cell of posts.
 std::vector<std::unique_ptr<OGRGeometry>> Triangles() {
     std::vector<std::unique_ptr<OGRGeometry>> triangles;
@@ -58,15 +69,8 @@ std::vector<std::unique_ptr<OGRGeometry>> Triangles() {
             for (const auto& c :
                  {std::array<OGRPoint, 3>{corner(i, j), corner(i + 1, j), corner(i, j + 1)},
                   std::array<OGRPoint, 3>{corner(i + 1, j), corner(i + 1, j + 1),
-                                          corner(i, j + 1)}}) {
-                OGRLinearRing ring;
-                for (const auto& p : c)
-                    ring.addPoint(&p);
-                ring.closeRings();
-                auto polygon = std::make_unique<OGRPolygon>();
-                polygon->addRing(&ring);
-                triangles.push_back(std::move(polygon));
-            }
+                                          corner(i, j + 1)}})
+                triangles.push_back(TrianglePolygon(c));
         }
     }
     return triangles;
@@ -131,6 +135,78 @@ TEST(Tin, OffsetScaleAndOutputDatum) {
     tin->SetOutputVerticalDatum(DatumEllipsoid);
     ASSERT_TRUE(tin->GetHeight(515000, 5034000, h));
     EXPECT_NEAR(h, 162.513403, 1e-3);
+
+    // Heights in US survey feet (NAVD88): in metres, the unit applied before the scale.
+    WriteLayer(dir.File("feet.gpkg"), "GPKG", wkbPoint25D, points, "EPSG:32618+6360");
+    tin.reset(
+        TinReaderFactory::CreateTinReader(dir.File("feet.gpkg").c_str(), 1, 1.0, 2.0, DatumMSL));
+    ASSERT_TRUE(tin);
+    ASSERT_TRUE(tin->GetHeight(515000, 5034000, h));
+    EXPECT_NEAR(h, 1.0 + 2.0 * 60.0 * 1200.0 / 3937.0, 1e-9);
+}
+
+// One far outlier point, a point with an infinite height, or long sliver triangles leave the
+// index small (a lookup tests few triangles) and the heights and height ranges right.
+TEST(Tin, IndexStaysSmallWithOutliersAndSlivers) {
+    testsupport::TempDir dir;
+    const auto plane = [](double x, double y) { return 0.5 * (x - 514000) + 2.0 * (y - 5034000); };
+    std::vector<std::unique_ptr<OGRGeometry>> outlier;
+    for (int j = 0; j < 40; ++j)
+        for (int i = 0; i < 40; ++i)
+            outlier.push_back(
+                std::make_unique<OGRPoint>(514000 + 10.0 * i, 5034000 + 10.0 * j,
+                                           plane(514000 + 10.0 * i, 5034000 + 10.0 * j)));
+    outlier.push_back(std::make_unique<OGRPoint>(514000 + 1e7, 5034200, 5000.0));
+    outlier.push_back(std::make_unique<OGRPoint>(514005, 5034005, INFINITY));
+    WriteLayer(dir.File("outlier.gpkg"), "GPKG", wkbPoint25D, outlier);
+
+    // Slivers: a long sheared strip cut into triangles one metre wide.
+    std::vector<std::unique_ptr<OGRGeometry>> slivers;
+    const auto corner = [&](double x, double y) { return OGRPoint(x, y, plane(x, y)); };
+    for (int i = 0; i < 600; ++i) {
+        const double b = 514000 + i, s = 600;
+        for (const auto& c :
+             {std::array<OGRPoint, 3>{corner(b, 5034000), corner(b + 1, 5034000),
+                                      corner(b + s, 5034000 + s)},
+              std::array<OGRPoint, 3>{corner(b + 1, 5034000), corner(b + 1 + s, 5034000 + s),
+                                      corner(b + s, 5034000 + s)}})
+            slivers.push_back(TrianglePolygon(c));
+    }
+    WriteLayer(dir.File("slivers.gpkg"), "GPKG", wkbPolygon25D, slivers);
+
+    const struct {
+        const char* file;
+        std::size_t largestCell;  // a bounding-box grid lists 500 to 3000; the fan of triangles
+                                  // to the outlier (39) meets one border cell
+        double x0, y0, x1, y1;    // a window, well inside
+        double ceiling;           // the range is of whole triangles: long ones reach high
+    } cases[] = {
+        {"outlier.gpkg", 48, 514100, 5034100, 514150, 5034130, 1000},
+        {"slivers.gpkg", 160, 514500, 5034200, 514530, 5034220, 2000},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.file);
+        auto tin = Open(dir.File(c.file));
+        ASSERT_TRUE(tin);
+        EXPECT_LE(LargestIndexCell(*tin), c.largestCell);
+        // The plane at random points of the window, and a range that holds them but not the
+        // outlier.
+        std::vector<double> x, y, h;
+        for (int k = 0; k < 200; ++k) {
+            x.push_back(c.x0 + (c.x1 - c.x0) * ((k * 37) % 101) / 100.0);
+            y.push_back(c.y0 + (c.y1 - c.y0) * ((k * 59) % 103) / 102.0);
+        }
+        h.resize(x.size());
+        tin->GetHeights(x.size(), x.data(), y.data(), h.data());
+        double low = NAN, high = NAN;
+        ASSERT_TRUE(tin->GetHeightRange(c.x0, c.y0, c.x1, c.y1, low, high));
+        EXPECT_LT(high, c.ceiling);
+        for (std::size_t k = 0; k < x.size(); ++k) {
+            ASSERT_NEAR(h[k], plane(x[k], y[k]), 1e-6) << x[k] << " " << y[k];
+            EXPECT_LE(low, h[k]);
+            EXPECT_GE(high, h[k]);
+        }
+    }
 }
 
 TEST(Tin, NoSurfaceGivesNullOrNamesTheFeature) {

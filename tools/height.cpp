@@ -15,19 +15,23 @@
 namespace {
 
 const char* const kUsage =
-    "usage: silvan-height DEM [--elevref MSL|ELLIPS] [--to MSL|ELLIPS] [--srs CRS]\n"
+    "usage: silvan-height DEM [--elevref MSL|ELLIPS] [--elunits UNIT] [--to MSL|ELLIPS]\n"
+    "                     [--srs CRS]\n"
     "\n"
     "Reads \"x y\" lines from standard input and prints one height a line, an empty line\n"
     "where there is none.\n"
     "  DEM        a raster GDAL reads, a directory of rasters, a tile index made by\n"
     "             gdaltindex, or a TIN (a vector file of triangles or 3-D points)\n"
-    "  --elevref  the datum of the DEM's heights (default MSL; a tile index has its own)\n"
+    "  --elevref  the datum of the DEM's heights where its CRS says none (default MSL);\n"
+    "             one that contradicts the CRS is refused\n"
+    "  --elunits  the unit of the DEM's heights where its CRS says none (default METER)\n"
     "  --to       the datum of the printed heights (default: the DEM's)\n"
     "  --srs      the coordinate system of the points (default: the DEM's), e.g. EPSG:4326\n";
 
 struct Options {
     std::string dem;
     std::string elevref;
+    std::string elunits;
     std::string to;
     std::string srs;
 };
@@ -45,10 +49,11 @@ Options ParseArguments(int argc, char** argv) {
             std::cout << kUsage;
             std::exit(0);
         }
-        std::string* value = a == "--elevref" ? &options.elevref
-                             : a == "--to"    ? &options.to
-                             : a == "--srs"   ? &options.srs
-                                              : nullptr;
+        std::string* value = a == "--elevref"   ? &options.elevref
+                             : a == "--elunits" ? &options.elunits
+                             : a == "--to"      ? &options.to
+                             : a == "--srs"     ? &options.srs
+                                                : nullptr;
         if (value != nullptr) {
             if (i + 1 >= argc)
                 Fail("option " + a + " needs a value");
@@ -79,15 +84,27 @@ bool ParsePoint(const std::string& line, double& x, double& y) {
     return end != p && errno == 0 && std::isfinite(x) && std::isfinite(y);
 }
 
-// A TIN when the path is no raster DEM: GDAL opens it as a vector only.
+// A TIN when the path is no raster DEM: GDAL opens it as a vector only. own gets the datum of
+// its heights: its CRS's, or else --elevref's.
 std::unique_ptr<kestrel::dem::IElevationSource> Open(const Options& o,
-                                                     kestrel::ogc::cs::DatumType datum,
                                                      kestrel::ogc::cs::DatumType& own) {
-    own = datum;
-    if (std::unique_ptr<kestrel::tin::TinReader> tin{GetDbm(o.dem, 0, 0.0, 1.0, datum, datum)})
+    kestrel::dem::SurfaceHeights heights;
+    try {
+        kestrel::ogc::cs::DatumType declared = kestrel::ogc::cs::DatumMSL;
+        if (!o.elevref.empty())
+            declared = GetVertDatum(o.elevref);
+        heights = kestrel::dem::ResolveSurfaceHeights(
+            o.dem, o.elevref.empty() ? nullptr : &declared, o.elunits, "--elevref", "--elunits");
+    } catch (const kestrel::DataException& e) {
+        // An option that is no datum or unit, or that contradicts the DEM's CRS.
+        Fail(e.what());
+    }
+    own = heights.datum;
+    const double scale = heights.unitScale;
+    if (std::unique_ptr<kestrel::tin::TinReader> tin{GetDbm(o.dem, 0, 0.0, scale, own, own)})
         return tin;
     return std::unique_ptr<kestrel::dem::IElevationSource>(
-        GetDem(o.dem, 1, 0.0, 1.0, NAN, own, own));
+        GetDem(o.dem, 1, 0.0, scale, NAN, own, own));
 }
 
 }  // namespace
@@ -96,8 +113,7 @@ int main(int argc, char** argv) {
     const Options options = ParseArguments(argc, argv);
     try {
         kestrel::ogc::cs::DatumType own = kestrel::ogc::cs::DatumMSL;
-        const kestrel::ogc::cs::DatumType given = GetVertDatum(options.elevref);
-        auto source = Open(options, given, own);
+        auto source = Open(options, own);
         source->SetOutputVerticalDatum(options.to.empty() ? own : GetVertDatum(options.to));
         if (!options.srs.empty()) {
             const kestrel::ogc::cs::ICRS crs(options.srs);

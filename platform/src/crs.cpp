@@ -273,6 +273,37 @@ cs::DatumType GetVerticalDatumType(const cs::ICRS* crs) {
     return cs::DatumEllipsoid;
 }
 
+VerticalReference GetVerticalReference(const cs::ICRS* crs) {
+    VerticalReference reference;
+    if (crs == nullptr)
+        return reference;
+    const OGRSpatialReference& srs = crs->GetSpatialReference();
+    if (!srs.IsVertical() && !srs.IsCompound() && srs.GetAxesCount() != 3)
+        return reference;
+    reference.known = true;
+    reference.datum = srs.IsVertical() || srs.IsCompound() ? cs::DatumMSL : cs::DatumEllipsoid;
+    const char* unit = nullptr;
+    double factor = 0.0;
+    if (srs.IsVertical() || srs.IsCompound()) {
+        factor = srs.GetTargetLinearUnits("VERT_CS", &unit);
+        const char* name = srs.GetAttrValue("VERT_CS");
+        reference.name = name != nullptr ? name : crs->GetName();
+    } else {
+        // The third axis of a geographic or projected 3-D system: the ellipsoidal height.
+        OGRAxisOrientation orientation;
+        srs.GetAxis(nullptr, 2, &orientation, &factor);
+        reference.name = crs->GetName();
+    }
+    reference.metresPerUnit = factor > 0.0 && std::isfinite(factor) ? factor : 1.0;
+    if (unit != nullptr && *unit != '\0' && !EQUAL(unit, "unknown"))
+        reference.unit = unit;
+    else
+        reference.unit = reference.metresPerUnit == 1.0
+                             ? "metre"
+                             : FormatString("unit of %.10g m", reference.metresPerUnit);
+    return reference;
+}
+
 cs::ICRS* MapunitsToCRS(const std::string& text) {
     return new cs::ICRS(text);
 }

@@ -2,6 +2,7 @@
 #include <cmath>
 
 #include <kestrel/datasources.h>
+#include <kestrel/dem.h>
 #include <kestrel/elevation.h>
 #include <kestrel/mathmodel.h>
 
@@ -17,6 +18,14 @@ bool IElevationSource::GetHeight(double x, double y, double& height) const {
         return false;
     height = h;
     return true;
+}
+
+bool IElevationSource::GetHeightRange(double, double, double, double, double&, double&) const {
+    return false;
+}
+
+bool IRasterDEM::CountPosts(double, double, double, double, std::size_t&, std::size_t&) const {
+    return false;
 }
 }  // namespace dem
 

@@ -18,9 +18,9 @@
 
 #include <algorithm>
 #include <cctype>
-#include <filesystem>
 #include <cmath>
 #include <cstdio>
+#include <filesystem>
 #include <limits>
 #include <sstream>
 
@@ -309,17 +309,66 @@ std::vector<std::string> CheckOptions(Options& options) {
         if (!note.empty())
             notes.push_back(note);
     });
+    CheckSurface(options);
     return notes;
+}
+
+namespace {
+
+// The datum and unit to open the surface with, from its file and the options.
+kestrel::dem::SurfaceHeights ResolveSurface(const Options& options) {
+    kestrel::ogc::cs::DatumType declared = kestrel::ogc::cs::DatumMSL;
+    if (!options.elevref.empty())
+        declared = GetVertDatum(options.elevref);
+    const std::string& path = options.dem.empty() ? options.tin : options.dem;
+    try {
+        return kestrel::dem::ResolveSurfaceHeights(path,
+                                                   options.elevref.empty() ? nullptr : &declared,
+                                                   options.elunits, "--elevref", "--elunits");
+    } catch (const kestrel::FileException&) {
+        throw;
+    } catch (const kestrel::Exception& e) {
+        // The platform's messages begin with the path: name the option too.
+        std::string message = e.what();
+        if (message.compare(0, path.size(), path) != 0)
+            message = path + ": " + message;
+        KESTREL_THROW(kestrel::DataException,
+                      (options.dem.empty() ? "--tin " : "--dem ") + message);
+    }
+}
+
+}  // namespace
+
+void CheckSurface(const Options& options) {
+    if (options.dem.empty() && options.tin.empty())
+        return;
+    try {
+        ResolveSurface(options);
+    } catch (const kestrel::FileException&) {
+        // A file that cannot be read fails where the surface is opened, naming it.
+    } catch (const kestrel::Exception& e) {
+        throw UsageError(e.what());
+    }
 }
 
 std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
     const Options& options, const kestrel::mathmodel::IMathModel* model) {
+    const kestrel::dem::SurfaceHeights heights = ResolveSurface(options);
     double offset = 0.0, scale = 1.0;
     GetElFactor(options.elfactor, offset, scale);
-    if (!options.elunits.empty())
-        GetElUnits(options.elunits, scale);
-    kestrel::ogc::cs::DatumType datum = GetVertDatum(options.elevref);
+    // The unit once: the declared one where the file says none (the source applies the file's).
+    scale *= heights.unitScale;
+    kestrel::ogc::cs::DatumType datum = heights.datum;
     const kestrel::ogc::cs::DatumType modelDatum = GetModelDatum(model);
+    if (heights.file.known && !options.elevref.empty() &&
+        GetVertDatum(options.elevref) == kestrel::ogc::cs::DatumMathModel &&
+        modelDatum != heights.file.datum) {
+        KESTREL_THROW(kestrel::DataException,
+                      (options.dem.empty() ? "--tin " + options.tin : "--dem " + options.dem) +
+                          ": its CRS says the heights are \"" + heights.file.name +
+                          "\", which is not the math model's vertical datum, as --elevref "
+                          "MATHMODEL declares: leave --elevref out to follow the file");
+    }
     if (!options.dem.empty()) {
         // The first band; no-data as the raster declares it.
         return std::unique_ptr<kestrel::dem::IElevationSource>(
@@ -333,6 +382,33 @@ std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
         KESTREL_THROW(kestrel::FileNotFoundException, options.tin,
                       "cannot be opened as a TIN: no layer of triangles or 3-D points");
     return tin;
+}
+
+std::string SurfaceHoles(const Options& options, const Grid& grid) {
+    if (options.dem.empty())
+        return "";
+    const std::unique_ptr<kestrel::dem::IElevationSource> surface = OpenSurface(options, nullptr);
+    const auto* dem = dynamic_cast<const kestrel::dem::IRasterDEM*>(surface.get());
+    const kestrel::ogc::cs::ICRS crs(grid.crs);
+    surface->SetInputCRS(&crs);
+    const auto& g = grid.geoTransform;
+    double minX = INFINITY, minY = INFINITY, maxX = -INFINITY, maxY = -INFINITY;
+    for (double pixel : {0.0, static_cast<double>(grid.pixels)}) {
+        for (double line : {0.0, static_cast<double>(grid.lines)}) {
+            const double x = g[0] + pixel * g[1] + line * g[2];
+            const double y = g[3] + pixel * g[4] + line * g[5];
+            minX = std::min(minX, x), maxX = std::max(maxX, x);
+            minY = std::min(minY, y), maxY = std::max(maxY, y);
+        }
+    }
+    std::size_t posts = 0, holes = 0;
+    if (dem == nullptr || !dem->CountPosts(minX, minY, maxX, maxY, posts, holes))
+        return "";
+    char text[160];
+    std::snprintf(text, sizeof text,
+                  ": %zu of %zu posts under the output grid (%.2f %%) have no height", holes, posts,
+                  posts > 0 ? 100.0 * holes / posts : 0.0);
+    return "--dem " + options.dem + text;
 }
 
 void CheckSource(const SceneInput& scene) {

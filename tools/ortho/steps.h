@@ -58,10 +58,23 @@ std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options
 std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
                                                           const SceneInput& scene);
 
+// Checks what the surface model's file says of its heights (vertical datum and unit) against
+// --elevref and --elunits, without reading the heights: a contradiction throws, naming the file
+// and the option. Where the file says nothing, the options hold (MSL and metres by default).
+// Throws UsageError; a file that cannot be read is left to OpenSurface.
+void CheckSurface(const Options& options);
+
 // The surface model of the options (--dem or --tin) with the heights corrected and delivered in
-// the datum of the math model (null: the ellipsoid). The caller owns it.
+// the datum of the math model (null: the ellipsoid), after CheckSurface's checks and, for
+// --elevref MATHMODEL over a file that says its datum, the check that the model's datum is that
+// one. The caller owns it.
 std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
     const Options& options, const kestrel::mathmodel::IMathModel* model);
+
+// One line for the log: how many posts of the raster surface model under the grid have no
+// height, e.g. "--dem dsm.tif: 120 of 40000 posts under the output grid (0.30 %) have no
+// height"; empty for a TIN.
+std::string SurfaceHoles(const Options& options, const Grid& grid);
 
 // Opens the source raster and its channels as the generator will read them: throws when the
 // file is missing or unreadable, a channel does not exist, or the channels mix data types.

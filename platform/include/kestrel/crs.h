@@ -111,6 +111,21 @@ namespace utils {
 // DatumEllipsoid, as a missing math model does. A null CRS gives DatumEllipsoid.
 KESTREL_API cs::DatumType GetVerticalDatumType(const cs::ICRS* crs);
 
+// What a coordinate system says about the heights given with it.
+struct VerticalReference {
+    // It has a vertical axis: a compound or vertical CRS, or a three-axis one.
+    bool known = false;
+    // When known: DatumMSL for a gravity-related height, DatumEllipsoid for an ellipsoidal one.
+    cs::DatumType datum = cs::DatumEllipsoid;
+    // Metres in one unit of its heights ("US survey foot": 1200/3937); 1 when not known.
+    double metresPerUnit = 1.0;
+    std::string unit;  // the unit's name, empty when not known
+    std::string name;  // the name of its vertical part (or of the CRS), for messages
+};
+
+// The vertical reference of a coordinate system; a null or two-axis one gives known = false.
+KESTREL_API VerticalReference GetVerticalReference(const cs::ICRS* crs);
+
 // A new coordinate system from a map-units text (see ICRS(const std::string&)).
 KESTREL_API cs::ICRS* MapunitsToCRS(const std::string& text);
 

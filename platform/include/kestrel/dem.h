@@ -1,6 +1,7 @@
 // The DEM library: raster digital elevation models and the factory that opens them.
 #pragma once
 
+#include <cstddef>
 #include <memory>
 #include <string>
 
@@ -30,6 +31,12 @@ class KESTREL_API IRasterDEM : public IElevationSource {
     virtual const ogc::cs::GeocodingInfo* GetGeocoding() const = 0;
     // The datum of the heights the DEM holds; the output datum until one is set.
     virtual ogc::cs::DatumType GetVerticalDatum() const = 0;
+
+    // The posts that stand in the rectangle (minX, minY)-(maxX, maxY) of input CRS coordinates
+    // (in the DEM's own CRS, the rectangle that holds it), and how many of them have no height
+    // (no-data, masked, not finite). False when the DEM cannot tell (the default).
+    virtual bool CountPosts(double minX, double minY, double maxX, double maxY, std::size_t& posts,
+                            std::size_t& holes) const;
 
   protected:
     IRasterDEM() = default;

@@ -43,6 +43,7 @@ class ConstantDEM final : public detail::GridDEM {
         block->height = rows;
         block->heights.assign(h.begin(), h.end());
         static_cast<detail::MemoryPosts&>(*posts_).Replace(std::move(block));
+        ForgetSummaries();
     }
 
   private:

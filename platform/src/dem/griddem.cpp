@@ -53,6 +53,151 @@ void GridDEM::GetHeights(std::size_t n, const double* x, const double* y, double
         !postsConverted_);
 }
 
+void GridDEM::ForgetSummaries() {
+    std::lock_guard<std::mutex> lock(summaryMutex_);
+    summaries_.clear();
+}
+
+const GridDEM::BlockSummary& GridDEM::Summary(unsigned int blockX, unsigned int blockY) const {
+    const PostSource& posts = *posts_;
+    const unsigned int blocksX = (posts.width + posts.blockWidth - 1) / posts.blockWidth;
+    const unsigned int blocksY = (posts.height + posts.blockHeight - 1) / posts.blockHeight;
+    const std::size_t key = static_cast<std::size_t>(blockY) * blocksX + blockX;
+    {
+        std::lock_guard<std::mutex> lock(summaryMutex_);
+        if (summaries_.empty())
+            summaries_.resize(static_cast<std::size_t>(blocksX) * blocksY);
+        if (summaries_[key])
+            return *summaries_[key];
+    }
+    const std::shared_ptr<const PostBlock> block = posts.GetBlock(blockX, blockY);
+    auto summary = std::make_unique<BlockSummary>();
+    summary->columns = (block->width + kCell - 1) / kCell;
+    const unsigned int rows = (block->height + kCell - 1) / kCell;
+    summary->low.assign(static_cast<std::size_t>(summary->columns) * rows, NAN);
+    summary->high = summary->low;
+    for (unsigned int j = 0; j < block->height; ++j) {
+        for (unsigned int i = 0; i < block->width; ++i) {
+            const float v = block->heights[static_cast<std::size_t>(j) * block->width + i];
+            if (std::isnan(v))
+                continue;
+            const std::size_t c =
+                static_cast<std::size_t>(j / kCell) * summary->columns + i / kCell;
+            // NaN compares false: the first height of a cell replaces it.
+            if (!(summary->low[c] <= v))
+                summary->low[c] = v;
+            if (!(summary->high[c] >= v))
+                summary->high[c] = v;
+        }
+    }
+    std::lock_guard<std::mutex> lock(summaryMutex_);
+    if (!summaries_[key])
+        summaries_[key] = std::move(summary);
+    return *summaries_[key];
+}
+
+bool GridDEM::PixelWindow(double minX, double minY, double maxX, double maxY,
+                          PixelArea& window) const {
+    if (!frame_.OwnRectangle(minX, minY, maxX, maxY))
+        return false;
+    double left = INFINITY, top = INFINITY, right = -INFINITY, bottom = -INFINITY;
+    for (double x : {minX, maxX}) {
+        for (double y : {minY, maxY}) {
+            double pixel, line;
+            geocoding_.GroundToPixel(x, y, pixel, line);
+            left = std::min(left, pixel), right = std::max(right, pixel);
+            top = std::min(top, line), bottom = std::max(bottom, line);
+        }
+    }
+    window.left = std::max(left, area_.left), window.right = std::min(right, area_.right);
+    window.top = std::max(top, area_.top), window.bottom = std::min(bottom, area_.bottom);
+    return window.left <= window.right && window.top <= window.bottom;
+}
+
+namespace {
+
+unsigned int ClampPost(double v, unsigned int size) {
+    return static_cast<unsigned int>(std::clamp(v, 0.0, static_cast<double>(size) - 1.0));
+}
+
+}  // namespace
+
+bool GridDEM::CountPosts(double minX, double minY, double maxX, double maxY, std::size_t& posts,
+                         std::size_t& holes) const {
+    PixelArea window;
+    if (!PixelWindow(minX, minY, maxX, maxY, window))
+        return false;
+    // Posts whose centres (i + 0.5, j + 0.5) lie in the window.
+    const PostSource& source = *posts_;
+    const double i0 = std::ceil(window.left - 0.5), i1 = std::floor(window.right - 0.5);
+    const double j0 = std::ceil(window.top - 0.5), j1 = std::floor(window.bottom - 0.5);
+    posts = holes = 0;
+    if (!(i0 <= i1 && j0 <= j1) || i1 < 0 || j1 < 0 || i0 >= source.width || j0 >= source.height)
+        return true;
+    const unsigned int a0 = ClampPost(i0, source.width), a1 = ClampPost(i1, source.width);
+    const unsigned int b0 = ClampPost(j0, source.height), b1 = ClampPost(j1, source.height);
+    const unsigned int bw = source.blockWidth, bh = source.blockHeight;
+    for (unsigned int by = b0 / bh; by <= b1 / bh; ++by) {
+        for (unsigned int bx = a0 / bw; bx <= a1 / bw; ++bx) {
+            const std::shared_ptr<const PostBlock> block = source.GetBlock(bx, by);
+            for (unsigned int j = std::max(b0, by * bh); j <= std::min(b1, by * bh + bh - 1); ++j) {
+                for (unsigned int i = std::max(a0, bx * bw); i <= std::min(a1, bx * bw + bw - 1);
+                     ++i) {
+                    ++posts;
+                    holes += std::isnan(
+                        block->heights[static_cast<std::size_t>(j - by * bh) * block->width +
+                                       (i - bx * bw)]);
+                }
+            }
+        }
+    }
+    return true;
+}
+
+bool GridDEM::GetHeightRange(double minX, double minY, double maxX, double maxY, double& lowest,
+                             double& highest) const {
+    PixelArea window;
+    if (!PixelWindow(minX, minY, maxX, maxY, window))
+        return false;
+    if (!frame_.OwnRectangle(minX, minY, maxX, maxY))
+        return false;
+    // The posts that a bilinear height in the window weighs: those around each point.
+    const PostSource& posts = *posts_;
+    const unsigned int i0 = ClampPost(std::floor(window.left - 0.5), posts.width);
+    const unsigned int i1 = ClampPost(std::floor(window.right - 0.5) + 1.0, posts.width);
+    const unsigned int j0 = ClampPost(std::floor(window.top - 0.5), posts.height);
+    const unsigned int j1 = ClampPost(std::floor(window.bottom - 0.5) + 1.0, posts.height);
+    const unsigned int bw = posts.blockWidth, bh = posts.blockHeight;
+    double low = INFINITY, high = -INFINITY;
+    for (unsigned int by = j0 / bh; by <= j1 / bh; ++by) {
+        for (unsigned int bx = i0 / bw; bx <= i1 / bw; ++bx) {
+            const BlockSummary& summary = Summary(bx, by);
+            const unsigned int ci0 = (std::max(i0, bx * bw) - bx * bw) / kCell;
+            const unsigned int ci1 = (std::min(i1, bx * bw + bw - 1) - bx * bw) / kCell;
+            const unsigned int cj0 = (std::max(j0, by * bh) - by * bh) / kCell;
+            const unsigned int cj1 = (std::min(j1, by * bh + bh - 1) - by * bh) / kCell;
+            for (unsigned int cj = cj0; cj <= cj1; ++cj) {
+                for (unsigned int ci = ci0; ci <= ci1; ++ci) {
+                    const std::size_t c = static_cast<std::size_t>(cj) * summary.columns + ci;
+                    if (std::isnan(summary.low[c]))
+                        continue;
+                    low = std::min(low, static_cast<double>(summary.low[c]));
+                    high = std::max(high, static_cast<double>(summary.high[c]));
+                }
+            }
+        }
+    }
+    if (!(low <= high))
+        return false;
+    if (!postsConverted_)
+        frame_.WidenToOutput(minX, minY, maxX, maxY, low, high);
+    if (!(low <= high))
+        return false;
+    lowest = low;
+    highest = high;
+    return true;
+}
+
 namespace {
 
 constexpr std::uint32_t kOutside = std::numeric_limits<std::uint32_t>::max();

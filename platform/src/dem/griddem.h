@@ -3,6 +3,7 @@
 
 #include <cstddef>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -88,6 +89,10 @@ class GridDEM : public IRasterDEM {
     void SetInputCRS(const ogc::cs::ICRS* crs) override { frame_.SetInputCRS(crs); }
     void GetHeights(std::size_t n, const double* x, const double* y,
                     double* heights) const override;
+    bool GetHeightRange(double minX, double minY, double maxX, double maxY, double& lowest,
+                        double& highest) const override;
+    bool CountPosts(double minX, double minY, double maxX, double maxY, std::size_t& posts,
+                    std::size_t& holes) const override;
 
     unsigned int GetWidth() const override { return posts_->width; }
     unsigned int GetHeight() const override { return posts_->height; }
@@ -97,12 +102,31 @@ class GridDEM : public IRasterDEM {
     // Bilinear heights at points in the grid's own coordinates, in the datum the posts hold.
     void Sample(std::size_t n, const double* x, const double* y, double* heights) const;
 
+    // After the posts changed: the summaries of their heights are made again.
+    void ForgetSummaries();
+
     std::unique_ptr<PostSource> posts_;
     ogc::cs::GeocodingInfo geocoding_;
     QueryFrame frame_;
     PixelArea area_;
     // The posts hold heights in the output datum already.
     bool postsConverted_ = false;
+
+  private:
+    // The lowest and highest post of each cell of kCell x kCell posts of a block, row by row
+    // (NaN for a cell without a height), made the first time a range needs the block.
+    static constexpr unsigned int kCell = 16;
+    struct BlockSummary {
+        unsigned int columns = 0;
+        std::vector<float> low, high;
+    };
+    const BlockSummary& Summary(unsigned int blockX, unsigned int blockY) const;
+    // The pixel rectangle of a rectangle of input coordinates, within the area with heights;
+    // false when they do not meet.
+    bool PixelWindow(double minX, double minY, double maxX, double maxY, PixelArea& window) const;
+
+    mutable std::mutex summaryMutex_;
+    mutable std::vector<std::unique_ptr<BlockSummary>> summaries_;
 };
 
 }  // namespace detail

@@ -138,6 +138,11 @@ void QueryFrame::SetOutputDatum(DatumType datum) {
     }
     const ICRS msl = MeanSeaLevelCRS(*crs_);
     const ICRS ellipsoidal = EllipsoidalCRS(*crs_);
+    // Heights are held in metres; PROJ takes and gives them in the units of the two systems.
+    const double mslUnit = ogc::utils::GetVerticalReference(&msl).metresPerUnit;
+    const double ellipsoidalUnit = ogc::utils::GetVerticalReference(&ellipsoidal).metresPerUnit;
+    fromUnit_ = datum == ogc::cs::DatumEllipsoid ? mslUnit : ellipsoidalUnit;
+    toUnit_ = datum == ogc::cs::DatumEllipsoid ? ellipsoidalUnit : mslUnit;
     try {
         vertical_ = datum == ogc::cs::DatumEllipsoid
                         ? std::make_unique<TransformPool>(msl, ellipsoidal)
@@ -196,13 +201,72 @@ void QueryFrame::ConvertHeights(std::size_t n, const double* x, const double* y,
                 continue;
             cx.push_back(x[i]);
             cy.push_back(y[i]);
-            cz.push_back(heights[i]);
+            cz.push_back(heights[i] / fromUnit_);
             index.push_back(i);
         }
         vertical_->Transform(index.size(), cx.data(), cy.data(), cz.data());
         for (std::size_t k = 0; k < index.size(); ++k)
-            heights[index[k]] = cz[k];
+            heights[index[k]] = cz[k] * toUnit_;
     }
+}
+
+bool QueryFrame::OwnRectangle(double& minX, double& minY, double& maxX, double& maxY) const {
+    if (!(minX <= maxX && minY <= maxY) || !std::isfinite(minX + minY + maxX + maxY))
+        return false;
+    if (!input_)
+        return true;
+    // Eight points an edge: the own rectangle of a curved edge is then close to its true one.
+    constexpr int kSteps = 8;
+    std::vector<double> x, y;
+    for (int k = 0; k < kSteps; ++k) {
+        const double t = static_cast<double>(k) / kSteps;
+        const double ax = minX + t * (maxX - minX), ay = minY + t * (maxY - minY);
+        const double bx = maxX - t * (maxX - minX), by = maxY - t * (maxY - minY);
+        x.insert(x.end(), {ax, maxX, bx, minX});
+        y.insert(y.end(), {minY, ay, maxY, by});
+    }
+    input_->Transform(x.size(), x.data(), y.data(), nullptr);
+    double x0 = INFINITY, y0 = INFINITY, x1 = -INFINITY, y1 = -INFINITY;
+    for (std::size_t i = 0; i < x.size(); ++i) {
+        if (!std::isfinite(x[i]) || !std::isfinite(y[i]))
+            continue;
+        x0 = std::min(x0, x[i]), x1 = std::max(x1, x[i]);
+        y0 = std::min(y0, y[i]), y1 = std::max(y1, y[i]);
+    }
+    if (!(x0 <= x1 && y0 <= y1))
+        return false;
+    minX = x0, minY = y0, maxX = x1, maxY = y1;
+    return true;
+}
+
+void QueryFrame::WidenToOutput(double minX, double minY, double maxX, double maxY, double& low,
+                               double& high) const {
+    if (!vertical_)
+        return;
+    // The change of datum is smooth: a 5 x 5 lattice finds its extremes on a tile's area.
+    constexpr int kSide = 5;
+    std::vector<double> x, y, shiftLow, shiftHigh;
+    for (int j = 0; j < kSide; ++j) {
+        for (int i = 0; i < kSide; ++i) {
+            x.push_back(minX + (maxX - minX) * i / (kSide - 1));
+            y.push_back(minY + (maxY - minY) * j / (kSide - 1));
+        }
+    }
+    shiftLow.assign(x.size(), low);
+    shiftHigh.assign(x.size(), high);
+    ConvertHeights(x.size(), x.data(), y.data(), shiftLow.data());
+    ConvertHeights(x.size(), x.data(), y.data(), shiftHigh.data());
+    double newLow = INFINITY, newHigh = -INFINITY;
+    for (std::size_t i = 0; i < x.size(); ++i) {
+        if (std::isfinite(shiftLow[i]))
+            newLow = std::min(newLow, shiftLow[i]);
+        if (std::isfinite(shiftHigh[i]))
+            newHigh = std::max(newHigh, shiftHigh[i]);
+    }
+    if (newLow <= newHigh)
+        low = newLow, high = newHigh;
+    else
+        low = high = NAN;
 }
 
 }  // namespace detail

@@ -80,6 +80,16 @@ class QueryFrame {
     // datum; NaN stays NaN, and a point PROJ cannot convert becomes NaN.
     void ConvertHeights(std::size_t n, const double* x, const double* y, double* heights) const;
 
+    // The rectangle of the source's own coordinates that holds the caller's rectangle (its
+    // edges taken through the input transformation at several points each); false when it has
+    // no finite point.
+    bool OwnRectangle(double& minX, double& minY, double& maxX, double& maxY) const;
+
+    // Widens a range of heights in the source's datum over a rectangle of own coordinates into
+    // the output datum: by the lowest and highest change of datum at a lattice of points on it.
+    void WidenToOutput(double minX, double minY, double maxX, double maxY, double& low,
+                       double& high) const;
+
   private:
     void CheckFinite(std::size_t n, const double* x, const double* y) const;
 
@@ -89,6 +99,7 @@ class QueryFrame {
     std::string name_;
     std::unique_ptr<TransformPool> input_;
     std::unique_ptr<TransformPool> vertical_;
+    double fromUnit_ = 1.0, toUnit_ = 1.0;  // metres per unit of the heights PROJ takes and gives
 };
 
 // The name of a datum in messages: "MSL", "ELLIPS" or "MATHMODEL", or its number.

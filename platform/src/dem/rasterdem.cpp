@@ -133,6 +133,9 @@ std::shared_ptr<detail::PostBlock> ReadPosts(const PostReading& r, int x0, int y
         for (std::size_t i = 0; i < count; ++i)
             v[i] = static_cast<float>(r.offset + r.scale * v[i]);
     }
+    // An infinite post (or one that the scale made infinite) has no height.
+    for (std::size_t i = 0; i < count; ++i)
+        v[i] = std::isfinite(v[i]) ? v[i] : NAN;
     return block;
 }
 
@@ -249,12 +252,13 @@ bool ChooseBlocks(GDALRasterBand* band, unsigned int& blockWidth, unsigned int& 
     return own;
 }
 
+}  // namespace
+
 bool IsDirectory(const std::string& path) {
     VSIStatBufL stat;
     return VSIStatL(path.c_str(), &stat) == 0 && VSI_ISDIR(stat.st_mode);
 }
 
-// The rasters GDAL recognises in a directory, sorted by name.
 std::vector<std::string> RastersIn(const std::string& directory) {
     std::vector<std::string> rasters;
     const CPLStringList names(VSIReadDir(directory.c_str()));
@@ -275,11 +279,14 @@ std::vector<std::string> RastersIn(const std::string& directory) {
         if (raster && raster->GetRasterCount() > 0)
             rasters.push_back(full);
     }
+    if (rasters.empty()) {
+        KESTREL_THROW(FileNotFoundException, directory,
+                      FormatString("The DEM directory %s holds no raster that GDAL reads",
+                                   directory.c_str()));
+    }
     std::sort(rasters.begin(), rasters.end());
     return rasters;
 }
-
-}  // namespace
 
 DatasetPtr NoDataset() {
     return DatasetPtr(nullptr, &CloseDataset);
@@ -329,15 +336,8 @@ std::unique_ptr<IRasterDEM> OpenRasterDEM(const std::string& path,
                                           const RasterDEMOptions& options) {
     gdalsupport::EnsureRegistered();
     CheckOptions(path, options);
-    if (IsDirectory(path)) {
-        const std::vector<std::string> rasters = RastersIn(path);
-        if (rasters.empty()) {
-            KESTREL_THROW(
-                FileNotFoundException, path,
-                FormatString("The DEM directory %s holds no raster that GDAL reads", path.c_str()));
-        }
-        return MakeRasterDEM(BuildMosaic(rasters, path), path, options);
-    }
+    if (IsDirectory(path))
+        return MakeRasterDEM(BuildMosaic(RastersIn(path), path), path, options);
     gdalsupport::ErrorCapture errors;
     DatasetPtr dataset(
         GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY | GDAL_OF_VERBOSE_ERROR),
@@ -379,8 +379,10 @@ std::unique_ptr<IRasterDEM> MakeRasterDEM(DatasetPtr dataset, const std::string&
     if ((maskFlags & (GMF_ALL_VALID | GMF_NODATA)) == 0)
         reading.mask = reading.band->GetMaskBand();
     reading.extraNoData = options.extraNoData;
+    // Heights are delivered in metres: stored values in the unit of the CRS's vertical axis
+    // are converted here, whatever datum is asked for later.
     reading.offset = options.offset;
-    reading.scale = options.scale;
+    reading.scale = options.scale * ogc::utils::GetVerticalReference(crs.get()).metresPerUnit;
     reading.name = name;
 
     const int width = reading.band->GetXSize(), height = reading.band->GetYSize();

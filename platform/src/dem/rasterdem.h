@@ -27,6 +27,10 @@ struct RasterDEMOptions {
 using DatasetPtr = std::unique_ptr<GDALDataset, void (*)(GDALDataset*)>;
 DatasetPtr NoDataset();
 
+bool IsDirectory(const std::string& path);
+// The rasters GDAL recognises in a directory, sorted by name; FileNotFoundException when none.
+std::vector<std::string> RastersIn(const std::string& directory);
+
 // A raster GDAL opens, or a directory of such rasters mosaicked. Throws a kestrel exception
 // naming the path and the reason when it cannot be used.
 std::unique_ptr<IRasterDEM> OpenRasterDEM(const std::string& path, const RasterDEMOptions& options);

@@ -55,7 +55,98 @@ ogc::cs::DatumType DatumFromKeyword(const std::string& path, const char* keyword
                                path.c_str(), kDatumItem, keyword));
 }
 
+// Whether a tile location names a file of this machine's file system: not a URL, not one of
+// GDAL's virtual file systems (/vsicurl/, /vsizip/, ...) nor a driver's connection string, and
+// an existing regular file.
+bool IsLocalFile(const std::string& location) {
+    if (location.find("://") != std::string::npos || STARTS_WITH_CI(location.c_str(), "/vsi") ||
+        STARTS_WITH_CI(location.c_str(), "\\vsi"))
+        return false;
+    VSIStatBufL stat;
+    return VSIStatL(location.c_str(), &stat) == 0 && VSI_ISREG(stat.st_mode);
+}
+
+// The tiles an index names, each a local file; a relative name is taken from the index's
+// directory. Throws DataException naming the index and the feature of a tile that is not a
+// local file, and when the index names none.
+std::vector<std::string> TilesOf(const std::string& path, OGRLayer* layer) {
+    const std::string directory = CPLGetPath(path.c_str());
+    std::vector<std::string> tiles;
+    layer->ResetReading();
+    for (auto& feature : *layer) {
+        const char* location = feature->GetFieldAsString(kLocationField);
+        if (location == nullptr || *location == '\0')
+            continue;
+        const std::string tile = CPLIsFilenameRelative(location)
+                                     ? CPLFormFilename(directory.c_str(), location, nullptr)
+                                     : location;
+        if (!IsLocalFile(tile)) {
+            KESTREL_THROW(
+                DataException,
+                FormatString("Tiled DEM %s, feature %lld: the tile \"%s\" is not a "
+                             "local file (a tile index may name only files of this "
+                             "machine, not URLs or GDAL's /vsi... paths)",
+                             path.c_str(), static_cast<long long>(feature->GetFID()), location));
+        }
+        tiles.push_back(tile);
+    }
+    if (tiles.empty())
+        KESTREL_THROW(DataException, FormatString("Tiled DEM %s names no tile", path.c_str()));
+    return tiles;
+}
+
+// The index's layer, or an exception naming the path.
+OGRLayer* RequireIndexLayer(const std::string& path, GDALDataset* index,
+                            const gdalsupport::ErrorCapture& errors) {
+    OGRLayer* layer = IndexLayer(index);
+    if (layer == nullptr) {
+        KESTREL_THROW(FileAccessException, path, FileAccessException::OpenFailed,
+                      FormatString("%s is not a tile index (a vector file whose first layer has "
+                                   "a \"%s\" field): %s",
+                                   path.c_str(), kLocationField, errors.Reason().c_str()));
+    }
+    return layer;
+}
+
+// The index's own datum: its VERTICAL_DATUM item, else that of its CRS or, without one, of
+// tileSrs (the tiles'). unit gets the CRS's vertical reference.
+ogc::cs::DatumType IndexDatum(const std::string& path, GDALDataset* index, OGRLayer* layer,
+                              const OGRSpatialReference* tileSrs,
+                              ogc::utils::VerticalReference& reference) {
+    const OGRSpatialReference* srs = layer->GetSpatialRef();
+    if (srs == nullptr)
+        srs = tileSrs;
+    const std::unique_ptr<ogc::cs::ICRS> crs(srs != nullptr ? new ogc::cs::ICRS(*srs) : nullptr);
+    reference = ogc::utils::GetVerticalReference(crs.get());
+    const char* keyword = layer->GetMetadataItem(kDatumItem);
+    if (keyword == nullptr)
+        keyword = index->GetMetadataItem(kDatumItem);
+    return keyword != nullptr ? DatumFromKeyword(path, keyword)
+                              : ogc::utils::GetVerticalDatumType(crs.get());
+}
+
 }  // namespace
+
+ogc::utils::VerticalReference TileIndexVerticalReference(const std::string& path) {
+    gdalsupport::EnsureRegistered();
+    gdalsupport::ErrorCapture errors;
+    const DatasetPtr index = OpenVector(path);
+    OGRLayer* layer = RequireIndexLayer(path, index.get(), errors);
+    const std::vector<std::string> tiles = TilesOf(path, layer);
+    DatasetPtr first(GDALDataset::Open(tiles.front().c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY),
+                     [](GDALDataset* d) {
+                         if (d != nullptr)
+                             GDALClose(d);
+                     });
+    ogc::utils::VerticalReference reference;
+    const ogc::cs::DatumType datum =
+        IndexDatum(path, index.get(), layer, first ? first->GetSpatialRef() : nullptr, reference);
+    reference.known = true;
+    reference.datum = datum;
+    if (reference.name.empty())
+        reference.name = "the index's own datum";
+    return reference;
+}
 
 bool IsTileIndex(const std::string& path) {
     if (path.empty())
@@ -73,44 +164,12 @@ std::unique_ptr<IRasterDEM> OpenTileIndexDEM(const std::string& path) {
     gdalsupport::EnsureRegistered();
     gdalsupport::ErrorCapture errors;
     const DatasetPtr index = OpenVector(path);
-    OGRLayer* layer = IndexLayer(index.get());
-    if (layer == nullptr) {
-        KESTREL_THROW(FileAccessException, path, FileAccessException::OpenFailed,
-                      FormatString("%s is not a tile index (a vector file whose first layer has "
-                                   "a \"%s\" field): %s",
-                                   path.c_str(), kLocationField, errors.Reason().c_str()));
-    }
-    const std::string directory = CPLGetPath(path.c_str());
-    std::vector<std::string> tiles;
-    layer->ResetReading();
-    for (auto& feature : *layer) {
-        const char* location = feature->GetFieldAsString(kLocationField);
-        if (location == nullptr || *location == '\0')
-            continue;
-        tiles.push_back(CPLIsFilenameRelative(location)
-                            ? CPLFormFilename(directory.c_str(), location, nullptr)
-                            : location);
-    }
-    if (tiles.empty()) {
-        KESTREL_THROW(DataException, FormatString("Tiled DEM %s names no tile", path.c_str()));
-    }
-
+    OGRLayer* layer = RequireIndexLayer(path, index.get(), errors);
+    DatasetPtr mosaic = BuildMosaic(TilesOf(path, layer), path);
     RasterDEMOptions options;
     options.cacheMegabytes = kTiledCacheMegabytes;
-    const char* keyword = layer->GetMetadataItem(kDatumItem);
-    if (keyword == nullptr)
-        keyword = index->GetMetadataItem(kDatumItem);
-    DatasetPtr mosaic = BuildMosaic(tiles, path);
-    if (keyword != nullptr) {
-        options.datum = DatumFromKeyword(path, keyword);
-    } else {
-        const OGRSpatialReference* srs = layer->GetSpatialRef();
-        if (srs == nullptr)
-            srs = mosaic->GetSpatialRef();
-        const std::unique_ptr<ogc::cs::ICRS> crs(srs != nullptr ? new ogc::cs::ICRS(*srs)
-                                                                : nullptr);
-        options.datum = ogc::utils::GetVerticalDatumType(crs.get());
-    }
+    ogc::utils::VerticalReference reference;
+    options.datum = IndexDatum(path, index.get(), layer, mosaic->GetSpatialRef(), reference);
     return MakeRasterDEM(std::move(mosaic), path, options);
 }
 

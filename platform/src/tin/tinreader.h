@@ -13,5 +13,9 @@ namespace tin {
 std::unique_ptr<TinReader> OpenTinReader(const std::string& path, int layer, double offset,
                                          double scale, ogc::cs::DatumType datum);
 
+// The most triangles that one height lookup of a reader OpenTinReader made tests (0 for
+// another reader): what the index costs at worst, for the tests.
+KESTREL_API std::size_t LargestIndexCell(const TinReader& reader);
+
 }  // namespace tin
 }  // namespace kestrel
