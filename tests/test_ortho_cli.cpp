@@ -9,6 +9,8 @@
 #include <string>
 #include <vector>
 
+// The commands are built with the tools (SILVAN_BUILD_TOOLS).
+#ifdef SILVAN_ORTHO_EXE
 namespace {
 
 namespace fs = std::filesystem;
@@ -63,6 +65,8 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--proc", "GPU:1,1"}, "--proc: Cannot read PROC option \"GPU:1,1\""},
         {{master}, {"--of", "nonsense"}, "--of: Unknown output file type \"nonsense\""},
         {{master}, {"--of", "mem"}, "--of: mem: GDAL's MEM driver keeps no pixels"},
+        {{master}, {"--of", "xyz"}, "--of: xyz: GDAL's XYZ text holds no coordinate system"},
+        {{master}, {"--of", "hdr"}, "--of: hdr names the ENVI header"},
         {{master}, {"--resample", "gauss"}, "--resample: unknown method \"gauss\""},
         {{master}, {"--resample", "nearest"}, "--resample: unknown method \"nearest\""},
         {{master}, {"--dem", absent}, "--dem: " + absent + ": not found"},
@@ -201,3 +205,4 @@ TEST(CommandMessages, NameTheFileWithoutCodeLocations) {
         EXPECT_EQ(r.err.find("(in "), std::string::npos) << r.err;
     }
 }
+#endif  // SILVAN_ORTHO_EXE

@@ -222,13 +222,17 @@ void CheckOutputCrs(const std::string& text) {
                          ") is neither a projected nor a geographic coordinate system");
 }
 
+std::string Lower(std::string text) {
+    std::transform(text.begin(), text.end(), text.begin(),
+                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+    return text;
+}
+
 // The methods --help lists, in GDAL's spelling; compared without regard to case, as GDAL does.
 std::string CheckResampling(const std::string& method) {
     static const char* const kMethods[] = {"near",    "bilinear", "cubic", "cubicspline",
                                            "lanczos", "average",  "mode"};
-    std::string lower = method;
-    std::transform(lower.begin(), lower.end(), lower.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+    const std::string lower = Lower(method);
     std::string known;
     for (const char* name : kMethods) {
         if (lower == name) {
@@ -252,6 +256,13 @@ void CheckFileType(const std::string& type) {
     if (format == "MEM" || format == "VRT")
         throw UsageError("--of: " + type + ": GDAL's " + format +
                          " driver keeps no pixels in a file of its own");
+    if (format == "XYZ")
+        throw UsageError("--of: " + type +
+                         ": GDAL's XYZ text holds no coordinate system; the outputs would lose "
+                         "their georeferencing");
+    // The outputs are named NAME_ortho.TYPE: an ENVI dataset is named after its data file.
+    if (Lower(type) == "hdr")
+        throw UsageError("--of: hdr names the ENVI header, not the data file; give envi");
     if (driver->GetMetadataItem(GDAL_DCAP_CREATE) == nullptr &&
         driver->GetMetadataItem(GDAL_DCAP_CREATECOPY) == nullptr)
         throw UsageError("--of: " + type + ": GDAL's " + format + " driver cannot write files");
