@@ -1,8 +1,11 @@
 // The workflow command, run as a user runs it: command line, derived files, errors that name
-// the master line, summary. With the sample builder and the whole chain, the workflow end to end
-// on a reduced sample city, and the rerun that does nothing.
+// the master line, outputs that never replace inputs, summary. With the sample builder and the
+// whole chain: the workflow end to end on a reduced sample city, reruns that make again exactly
+// what changed, interrupts and the run's lock.
 #include "program.h"
 
+#include <cpl_json.h>
+#include <cpl_string.h>
 #include <gdal_priv.h>
 #include <ogrsf_frmts.h>
 
@@ -13,9 +16,18 @@
 #include <cmath>
 #include <cstdlib>
 #include <filesystem>
+#include <functional>
 #include <map>
 #include <memory>
+#include <set>
 #include <string>
+
+#ifndef _WIN32
+#include <fcntl.h>
+#include <signal.h>
+#include <spawn.h>
+#include <unistd.h>
+#endif
 
 namespace {
 
@@ -79,47 +91,72 @@ TEST(WorkflowCommand, MissingMasterFileStopsNamingIt) {
               std::string::npos);
 }
 
-// A master file whose second data line (line 4 of the file) has a bad channel list and whose
-// third names a missing image: the run stops at the first, naming the master file and line;
-// with --keep-going both are listed in the summary.
+// A master file whose second data line (line 4 of the file) has a bad channel list, whose third
+// repeats the first one's name and whose fourth names a missing image: the run stops at the
+// first, naming the master file and line; with --keep-going all are listed in the summary, with
+// one line numbering whatever ends the lines, and the summary is UTF-8 even for a name that is
+// not.
 TEST(WorkflowCommand, BadMasterLinesNameFileAndLine) {
     TempDir dir;
-    const std::string master = WriteFile(dir.File("master.txt"),
-                                         "!MFILE master\n"
-                                         "a.tif;1,2,3;0;;0;0;LOW;1;FILL\n"
-                                         "\n"
-                                         "b.tif;1,x;0;;0;0;HIGH;2;FILL\n"
-                                         "a.tif;1;0;;0;0;;0;PREP\n"
-                                         "c.tif;1;0;;0;0;;0;FILL\n");
+    const std::vector<std::string> lines = {"!MFILE master",
+                                            "a.tif;1,2,3;0;;0;0;LOW;1;FILL",
+                                            "",
+                                            "b.tif;1,x;0;;0;0;HIGH;2;FILL",
+                                            "a.tif;1;0;;0;0;;0;PREP",
+                                            "c.tif;1;0;;0;0;;0;FILL",
+                                            "caf\xE9.tif;1;0;;0;0;;0;FILL"};
     const std::string dem = WriteFile(dir.File("dsm.tif"), "");
-    const Result stop = Ortho({master, "--out", dir.File("out"), "--dem", dem}, dir);
-    EXPECT_EQ(stop.status, 1);
-    EXPECT_NE(stop.err.find("master.txt, line 4, column 1: \"x\" is not an integer"),
-              std::string::npos)
-        << stop.err;
+    for (const std::string eol : {"\n", "\r\n", "\r"}) {
+        SCOPED_TRACE(eol == "\r" ? "CR" : eol == "\n" ? "LF" : "CR LF");
+        std::string text;
+        for (const std::string& line : lines)
+            text += line + eol;
+        const std::string master = WriteFile(dir.File("master.txt"), text);
+        const Result stop = Ortho({master, "--out", dir.File("out"), "--dem", dem}, dir);
+        EXPECT_EQ(stop.status, 1);
+        EXPECT_NE(stop.err.find("master.txt, line 4, column 1: \"x\" is not an integer"),
+                  std::string::npos)
+            << stop.err;
 
-    // The derived files hold the master file's columns.
-    EXPECT_EQ(ReadFile(dir.File("out/prep.txt")),
-              "!MFILE created for VARNOK\na.tif;1,2,3;0;;0;0\nb.tif;1,x;0;;0;0\n"
-              "a.tif;1;0;;0;0\nc.tif;1;0;;0;0\n");
-    EXPECT_EQ(ReadFile(dir.File("out/imgset.txt")),
-              "!IMGSET created for MELDRA\na.tif;LOW;1\nb.tif;HIGH;2\nc.tif;;0\n");
+        // The derived files hold the master file's columns.
+        EXPECT_EQ(ReadFile(dir.File("out/prep.txt")),
+                  "!MFILE created for VARNOK\na.tif;1,2,3;0;;0;0\nb.tif;1,x;0;;0;0\n"
+                  "a.tif;1;0;;0;0\nc.tif;1;0;;0;0\ncaf\xE9.tif;1;0;;0;0\n");
+        EXPECT_EQ(ReadFile(dir.File("out/imgset.txt")),
+                  "!IMGSET created for MELDRA\na.tif;LOW;1\nb.tif;HIGH;2\nc.tif;;0\n"
+                  "caf\xE9.tif;;0\n");
 
-    const Result going =
-        Ortho({master, "--out", dir.File("out"), "--dem", dem, "--keep-going", "-q"}, dir);
-    EXPECT_EQ(going.status, 1);
-    const std::string summary = ReadFile(dir.File("out/summary.json"));
-    EXPECT_NE(summary.find("\"line\": 1, \"source\": \"b.tif\""), std::string::npos) << summary;
-    EXPECT_NE(summary.find("master.txt, line 4, column 1"), std::string::npos);
-    // The third line repeats the first one's name: its outputs would overwrite the first's.
-    EXPECT_NE(summary.find("master.txt, line 5: the scene name \\\"a\\\" is already taken by "
-                           "line 2"),
-              std::string::npos)
-        << summary;
-    // A missing image is named with the line that names it.
-    EXPECT_NE(summary.find("master.txt, line 6: " + dir.File("c.tif") + ": not found"),
-              std::string::npos)
-        << summary;
+        const Result going =
+            Ortho({master, "--out", dir.File("out"), "--dem", dem, "--keep-going", "-q"}, dir);
+        EXPECT_EQ(going.status, 1);
+        const std::string summary = ReadFile(dir.File("out/summary.json"));
+        EXPECT_TRUE(CPLIsUTF8(summary.c_str(), static_cast<int>(summary.size())));
+        CPLJSONDocument json;
+        ASSERT_TRUE(json.LoadMemory(summary)) << summary;
+        const CPLJSONArray scenes = json.GetRoot().GetArray("scenes");
+        ASSERT_EQ(scenes.Size(), 5);
+        const struct {
+            int master_line;
+            std::string error;
+        } expected[] = {
+            {2, "master.txt, line 2: " + dir.File("a.tif") + ": not found"},
+            {4, "master.txt, line 4, column 1"},
+            // Its outputs would overwrite the first line's.
+            {5, "master.txt, line 5: the scene name \"a\" is already taken by line 2"},
+            {6, "master.txt, line 6: " + dir.File("c.tif") + ": not found"},
+            {7, "master.txt, line 7: "},
+        };
+        for (int i = 0; i < 5; ++i) {
+            EXPECT_EQ(scenes[i].GetInteger("line"), i);
+            EXPECT_EQ(scenes[i].GetInteger("master_line"), expected[i].master_line);
+            EXPECT_NE(scenes[i].GetString("error").find(expected[i].error), std::string::npos)
+                << scenes[i].GetString("error");
+        }
+        // A byte that is not UTF-8 is escaped so that it can be had back.
+        EXPECT_NE(summary.find("\"source\": \"caf\\udce9.tif\""), std::string::npos) << summary;
+        // A failed run lists its failures.
+        EXPECT_GE(json.GetRoot().GetArray("errors").Size(), 5);
+    }
 }
 
 TEST(WorkflowCommand, SliceBeyondTheLastLineDoesNothing) {
@@ -131,6 +168,72 @@ TEST(WorkflowCommand, SliceBeyondTheLastLineDoesNothing) {
     const std::string summary = ReadFile(dir.File("out/summary-4-8.json"));
     EXPECT_NE(summary.find("\"scenes\": []"), std::string::npos) << summary;
     EXPECT_FALSE(std::filesystem::exists(dir.File("out/summary.json")));
+}
+
+// A one-pixel GeoTIFF, for the inputs whose side files GDAL lists.
+void WriteTinyRaster(const std::string& path) {
+    GDALAllRegister();
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
+    GDALClose(driver->Create(path.c_str(), 1, 1, 1, GDT_Byte, nullptr));
+}
+
+// Runs whose outputs, or their temporary files, would fall on an input or on each other are
+// refused before any work, naming both; names that only look alike work.
+TEST(WorkflowCommand, OutputsNeverReplaceInputs) {
+    const struct {
+        std::vector<std::string> lines;  // of the master file; OUT stands for the output directory
+        std::string masterName;          // relative to the test's directory
+        std::string dem;
+        std::string message;  // empty: no refusal
+    } cases[] = {
+        {{"a.tif"}, "out/prep.txt", "dsm.tif",
+         "out/prep.txt: the preparation file would be written over the master file"},
+        {{"a.tif"}, "master.txt", "out/mosaic.tif",
+         "out/mosaic.tif: the mosaic would be written over the surface model"},
+        {{"OUT/a_ortho.tif", "a.tif"}, "master.txt", "dsm.tif",
+         "out/a_ortho.tif: the ortho of MASTER, line 2 would be written over the source image "
+         "of MASTER, line 1"},
+        // GDAL lists the raster's auxiliary file beside it.
+        {{"OUT/b.tif", "b.tif.aux.tif"}, "master.txt", "dsm.tif",
+         "out/b.tif.aux.xml: the scene description of MASTER, line 2 would be written over a "
+         "side file of the source of MASTER, line 1"},
+        // "a.xml.part" is a's temporary description, never "a.part"'s description.
+        {{"a.tif", "a.part.tif", "a_ortho.part.tif"}, "master.txt", "dsm.tif", ""},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.message);
+        TempDir dir;
+        std::filesystem::create_directories(dir.Path() / "out");
+        WriteTinyRaster(dir.File("out/b.tif"));
+        WriteFile(dir.File("out/b.tif.aux.xml"), "<PAMDataset></PAMDataset>\n");
+        WriteFile(dir.File(c.dem), "surface");
+        std::string text;
+        for (std::string line : c.lines) {
+            if (line.rfind("OUT/", 0) == 0)
+                line = dir.File("out/" + line.substr(4));
+            text += line + ";1;0;;0;0;;0;FILL\n";
+        }
+        const std::string master = WriteFile(dir.File(c.masterName), text);
+        const Result r = Ortho(
+            {master, "--out", dir.File("out"), "--dem", dir.File(c.dem), "--keep-going"}, dir);
+        EXPECT_EQ(r.status, 1);
+        if (c.message.empty()) {
+            EXPECT_EQ(r.err.find("would be written"), std::string::npos) << r.err;
+            EXPECT_NE(r.err.find("a.part.tif: not found"), std::string::npos) << r.err;
+            continue;
+        }
+        std::string message = dir.File(c.message);
+        for (std::size_t at; (at = message.find("MASTER")) != std::string::npos;)
+            message.replace(at, 6, master);
+        EXPECT_NE(r.err.find(message), std::string::npos) << r.err;
+        // Nothing was written: the inputs are as they were, no derived file, no summary.
+        EXPECT_EQ(ReadFile(master), text);
+        EXPECT_EQ(ReadFile(dir.File(c.dem)), "surface");
+        EXPECT_NE(ReadFile(dir.File("out/b.tif.aux.xml")).find("PAMDataset"), std::string::npos);
+        if (c.masterName != "out/prep.txt") {
+            EXPECT_FALSE(std::filesystem::exists(dir.File("out/prep.txt")));
+        }
+    }
 }
 
 #ifdef SILVAN_MAKE_SAMPLE_EXE
@@ -156,7 +259,9 @@ std::vector<unsigned char> ReadBytes(GDALDataset& dataset) {
 std::map<std::string, double> ModifiedTimes(const std::filesystem::path& dir) {
     std::map<std::string, double> times;
     for (const auto& entry : std::filesystem::directory_iterator(dir)) {
-        if (entry.path().filename().string().rfind("summary", 0) == 0)
+        // The summary and the lock say what the last run did and who it was.
+        const std::string name = entry.path().filename().string();
+        if (name.rfind("summary", 0) == 0 || name == ".silvan-ortho.lock")
             continue;
         times[entry.path().filename().string()] =
             std::chrono::duration<double>(entry.last_write_time().time_since_epoch()).count();
@@ -171,27 +276,20 @@ constexpr unsigned char kHidden = 2;
 // The sample city at a reduced size, end to end: every output opens, on one grid, with the
 // CRS asked for; buildings hide strips of ground in each image; the mosaic fills every pixel
 // that some image sees; a second run changes nothing.
-TEST(Workflow, SampleCityEndToEnd) {
-    TempDir dir;
+// The reduced sample city in dir/sample, and the arguments of a run on it into dir/out.
+std::vector<std::string> MakeSample(const TempDir& dir) {
     const Result made = RunProgram(SILVAN_MAKE_SAMPLE_EXE,
                                    {dir.File("sample"), "--image-size", "192", "--quiet"}, dir);
-    ASSERT_EQ(made.status, 0) << made.err;
-    const std::vector<std::string> args = {dir.File("sample/master.txt"),
-                                           "--out",
-                                           dir.File("out"),
-                                           "--dem",
-                                           dir.File("sample/dsm.tif"),
-                                           "--elevref",
-                                           "ELLIPS",
-                                           "--srs",
-                                           "EPSG:32632",
-                                           "--pixel-size",
-                                           "1",
-                                           "--jobs",
-                                           "2",
-                                           "--proc",
-                                           "CPU:1",
-                                           "--quiet"};
+    EXPECT_EQ(made.status, 0) << made.err;
+    return {dir.File("sample/master.txt"), "--out", dir.File("out"), "--dem",
+            dir.File("sample/dsm.tif"), "--elevref", "ELLIPS", "--srs", "EPSG:32632",
+            "--pixel-size", "1", "--proc", "CPU:1", "--quiet"};
+}
+
+TEST(Workflow, SampleCityEndToEnd) {
+    TempDir dir;
+    std::vector<std::string> args = MakeSample(dir);
+    args.insert(args.end(), {"--jobs", "2"});
     const Result first = Ortho(args, dir);
     ASSERT_EQ(first.status, 0) << first.err;
     const std::string summary = ReadFile(dir.File("out/summary.json"));
@@ -345,6 +443,215 @@ TEST(Workflow, CamerasFromSideFilesOrFromATable) {
     EXPECT_NE(summary.find("no orientation of the image"), std::string::npos) << summary;
     EXPECT_NE(summary.find("north.tif"), std::string::npos) << summary;
 }
+
+// Each scene's status and reason in a run's summary, by scene name.
+std::map<std::string, std::pair<std::string, std::string>> SceneStates(const TempDir& dir) {
+    CPLJSONDocument summary;
+    EXPECT_TRUE(summary.Load(dir.File("out/summary.json")));
+    std::map<std::string, std::pair<std::string, std::string>> states;
+    for (const CPLJSONObject& scene : summary.GetRoot().GetArray("scenes")) {
+        states[std::filesystem::path(scene.GetString("source")).stem().string()] = {
+            scene.GetString("status"), scene.GetString("reason")};
+    }
+    return states;
+}
+
+void ReplaceInFile(const std::string& path, const std::string& from, const std::string& to) {
+    std::string text = ReadFile(path);
+    const auto at = text.find(from);
+    ASSERT_NE(at, std::string::npos) << from;
+    WriteFile(path, text.replace(at, from.size(), to));
+}
+
+// A rerun after each change makes again exactly the scenes (and the mosaic) that the change
+// touches, and says why.
+TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
+    TempDir dir;
+    std::vector<std::string> args = MakeSample(dir);
+    ASSERT_EQ(Ortho(args, dir).status, 0);
+    const std::set<std::string> all = {"north", "east", "south", "west"};
+    const struct {
+        const char* change;
+        std::function<void()> make;
+        std::set<std::string> madeAgain;
+        std::string reason;  // of each scene made again, or else of the mosaic
+        bool mosaic;
+    } steps[] = {
+        {"nothing", [] {}, {}, "", false},
+        {"a source's time but not its content",
+         [&] {
+             const auto path = dir.Path() / "sample/north.tif";
+             std::filesystem::last_write_time(
+                 path, std::filesystem::last_write_time(path) + std::chrono::hours(1));
+         },
+         {}, "", false},
+        {"the resampling",
+         [&] { args.insert(args.end(), {"--resample", "near"}); },
+         all, "--resample changed: bilinear -> near", true},
+        {"a source's pixels",
+         [&] {
+             GDALAllRegister();
+             Dataset south(GDALDataset::Open(dir.File("sample/south.tif").c_str(),
+                                             GDAL_OF_RASTER | GDAL_OF_UPDATE));
+             ASSERT_TRUE(south);
+             unsigned char value = 0;
+             ASSERT_EQ(south->GetRasterBand(1)->RasterIO(GF_Read, 90, 90, 1, 1, &value, 1, 1,
+                                                         GDT_Byte, 0, 0, nullptr),
+                       CE_None);
+             value = static_cast<unsigned char>(value + 1);
+             ASSERT_EQ(south->GetRasterBand(1)->RasterIO(GF_Write, 90, 90, 1, 1, &value, 1, 1,
+                                                         GDT_Byte, 0, 0, nullptr),
+                       CE_None);
+         },
+         {"south"}, "source file " + dir.File("sample/south.tif") + " changed", true},
+        {"a master line's channels",
+         [&] {
+             ReplaceInFile(dir.File("sample/master.txt"), "east.tif;1,2,3", "east.tif;3,2,1");
+         },
+         {"east"}, "master line changed: ", true},
+        {"an image-set value, which only the mosaic reads",
+         [&] {
+             ReplaceInFile(dir.File("sample/master.txt"), "HIGH;1", "HIGH;2");
+         },
+         {}, "scene west changed", true},
+        {"a lost output",
+         [&] { std::filesystem::remove(dir.Path() / "out/north_vis.png"); },
+         {"north"}, dir.File("out/north_vis.png") + " is missing", false},
+        {"--overwrite", [&] { args.push_back("--overwrite"); }, all, "--overwrite", true},
+    };
+    for (const auto& step : steps) {
+        SCOPED_TRACE(step.change);
+        step.make();
+        const Result r = Ortho(args, dir);
+        ASSERT_EQ(r.status, 0) << r.err;
+        std::set<std::string> madeAgain;
+        for (const auto& scene : SceneStates(dir)) {
+            if (scene.second.first == "done") {
+                madeAgain.insert(scene.first);
+                EXPECT_NE(scene.second.second.find(step.reason), std::string::npos)
+                    << scene.first << ": " << scene.second.second;
+            } else {
+                EXPECT_EQ(scene.second.first, "complete");
+            }
+        }
+        EXPECT_EQ(madeAgain, step.madeAgain);
+        CPLJSONDocument summary;
+        ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
+        const std::string mosaicReason = summary.GetRoot().GetString("mosaic_reason");
+        EXPECT_EQ(!mosaicReason.empty(), step.mosaic) << mosaicReason;
+        if (step.madeAgain.empty() && step.mosaic) {
+            EXPECT_NE(mosaicReason.find(step.reason), std::string::npos) << mosaicReason;
+        }
+    }
+}
+
+// Images of 4 pixels: one scene's footprint has 3 corners. It fails on its own, saying so, and
+// the footprints of the others are merged.
+TEST(Workflow, FootprintWithTooFewCornersFailsItsSceneAlone) {
+    TempDir dir;
+    const Result made = RunProgram(SILVAN_MAKE_SAMPLE_EXE,
+                                   {dir.File("sample"), "--image-size", "4", "--quiet"}, dir);
+    ASSERT_EQ(made.status, 0) << made.err;
+    const Result r = Ortho({dir.File("sample/master.txt"), "--out", dir.File("out"), "--dem",
+                            dir.File("sample/dsm.tif"), "--elevref", "ELLIPS", "--srs",
+                            "EPSG:32632", "--proc", "CPU:1", "--keep-going", "--quiet"},
+                           dir);
+    EXPECT_EQ(r.status, 1);
+    EXPECT_NE(r.err.find("east.tif: the footprint has 3 corner(s); a scene's footprint needs at "
+                         "least 4"),
+              std::string::npos)
+        << r.err;
+    const auto states = SceneStates(dir);
+    EXPECT_EQ(states.at("east").first, "failed");
+    EXPECT_EQ(states.at("south").first, "done");
+    Dataset footprints = Open(dir.File("out/footprints.gpkg"), GDAL_OF_VECTOR);
+    ASSERT_TRUE(footprints);
+    EXPECT_NE(footprints->GetLayerByName("south"), nullptr);
+    EXPECT_EQ(footprints->GetLayerByName("east"), nullptr);
+}
+
+#ifndef _WIN32
+// A run in the background, its output in files of dir.
+pid_t Start(const std::vector<std::string>& args, const TempDir& dir) {
+    std::vector<std::string> argv = {kOrtho};
+    argv.insert(argv.end(), args.begin(), args.end());
+    std::vector<char*> pointers;
+    for (std::string& arg : argv)
+        pointers.push_back(arg.data());
+    pointers.push_back(nullptr);
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_addopen(&actions, 2, dir.File("background.txt").c_str(),
+                                     O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    pid_t pid = -1;
+    EXPECT_EQ(posix_spawn(&pid, kOrtho.c_str(), &actions, nullptr, pointers.data(), environ), 0);
+    posix_spawn_file_actions_destroy(&actions);
+    return pid;
+}
+
+std::vector<std::string> TemporaryFiles(const std::filesystem::path& dir) {
+    std::vector<std::string> parts;
+    for (const auto& entry : std::filesystem::directory_iterator(dir)) {
+        if (entry.path().filename().string().find(".part") != std::string::npos)
+            parts.push_back(entry.path().filename().string());
+    }
+    return parts;
+}
+
+// Waits until the run has started on a scene's ortho; false when it ended first.
+bool AtWork(pid_t pid, const TempDir& dir) {
+    for (;;) {
+        std::error_code ec;
+        for (const auto& entry : std::filesystem::directory_iterator(dir.Path() / "out", ec)) {
+            if (entry.path().filename().string().find("_ortho.part.") != std::string::npos)
+                return true;
+        }
+        int status = 0;
+        if (waitpid(pid, &status, WNOHANG) == pid)
+            return false;
+        usleep(1000);
+    }
+}
+
+int Wait(pid_t pid) {
+    int status = 0;
+    waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
+}
+
+// While a run works on a directory a second run there is refused at once, naming it; Ctrl-C
+// stops the first, which removes its temporary files and reports itself cancelled; a run that
+// crashed leaves no lock behind.
+TEST(Workflow, InterruptAndLock) {
+    TempDir dir;
+    const std::vector<std::string> args = MakeSample(dir);
+
+    const pid_t first = Start(args, dir);
+    ASSERT_TRUE(AtWork(first, dir)) << ReadFile(dir.File("background.txt"));
+    const Result second = Ortho(args, dir);
+    EXPECT_EQ(second.status, 1);
+    EXPECT_NE(second.err.find(dir.File("out") + " is in use by another silvan-ortho run: process " +
+                              std::to_string(first)),
+              std::string::npos)
+        << second.err;
+    EXPECT_FALSE(std::filesystem::exists(dir.Path() / "out/summary.json"));
+
+    ASSERT_EQ(kill(first, SIGINT), 0);
+    EXPECT_EQ(Wait(first), 130) << ReadFile(dir.File("background.txt"));
+    EXPECT_EQ(TemporaryFiles(dir.Path() / "out"), std::vector<std::string>());
+    CPLJSONDocument summary;
+    ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
+    EXPECT_EQ(summary.GetRoot().GetString("status"), "cancelled");
+
+    const pid_t crashed = Start(args, dir);
+    ASSERT_TRUE(AtWork(crashed, dir));
+    ASSERT_EQ(kill(crashed, SIGKILL), 0);
+    EXPECT_EQ(Wait(crashed), -SIGKILL);
+    const Result after = Ortho(args, dir);
+    EXPECT_EQ(after.status, 0) << after.err;
+    EXPECT_EQ(TemporaryFiles(dir.Path() / "out"), std::vector<std::string>());
+}
+#endif
 #endif
 #endif
 

@@ -1,15 +1,20 @@
-// Output files of the workflow: temporary names, publishing, ages, and error texts.
+// Output files of the workflow: temporary names, publishing, the run's lock, and error texts.
 #pragma once
 
 #include <kestrel/exception.h>
 
 #include <exception>
+#include <memory>
 #include <string>
 
 namespace ortho {
 
-// The temporary name an output is written under until it is whole: "dir/a_ortho.tif" gives
-// "dir/a_ortho.part.tif" (the extension stays, for the drivers that look at it).
+// The temporary name an output is written under until it is whole. Rasters and GeoPackages
+// keep their extension, for the drivers that look at it: "dir/a_ortho.tif" gives
+// "dir/a_ortho.part.tif"; every other file gets ".part" appended: "dir/a.xml" gives
+// "dir/a.xml.part". So no temporary name is ever another output's final name: a final name
+// ending in ".xml" or ".json" never ends in ".part", and the final names of rasters and
+// GeoPackages end in a word ("_ortho", "_vis", "mosaic", ...) that is never "part".
 std::string PartName(const std::string& path);
 
 // A temporary name of this process's own, for outputs that several processes (the slices of
@@ -23,11 +28,31 @@ void Publish(const std::string& part, const std::string& path);
 bool FileExists(const std::string& path);
 void RemoveFile(const std::string& path);  // no error when absent
 
-// Seconds of the last change on the file system's clock (whose epoch may lie in the future:
-// compare, do not read); minus infinity when the file is absent.
-double ModifiedTime(const std::string& path);
-
 // One line saying what went wrong, with the file name of file errors.
 std::string Explain(const std::exception& error);
+
+// The lock of an output directory, held for the whole run through an operating-system lock
+// (flock, LockFileEx) on the file DIR/.silvan-ortho.lock: the system drops it when the process
+// ends, however it ends, so a crashed run leaves nothing stuck. A whole run holds it alone;
+// slices (--lines) share it with each other, as a cluster runs them side by side. The holder
+// writes who it is into the file, for the message of a run that is refused.
+class RunLock {
+  public:
+    // Takes the lock or throws std::runtime_error naming the process that holds it. `who`
+    // describes this run for others ("process 123 (--lines 0:20)").
+    RunLock(const std::string& directory, bool shared, const std::string& who);
+    ~RunLock();
+    RunLock(const RunLock&) = delete;
+    RunLock& operator=(const RunLock&) = delete;
+
+    static std::string FileName() { return ".silvan-ortho.lock"; }
+
+  private:
+    struct Handle;
+    std::unique_ptr<Handle> handle_;
+};
+
+// This process's identifier.
+long long ProcessId();
 
 }  // namespace ortho

@@ -1,6 +1,7 @@
 // silvan-ortho: the true-ortho workflow of a master parameter file, end to end.
 #include "files.h"
 #include "inputs.h"
+#include "interrupt.h"
 #include "options.h"
 #include "progress.h"
 #include "steps.h"
@@ -15,8 +16,8 @@ namespace {
 
 void PrintScenes(const ortho::RunSummary& summary, const std::string& summaryPath) {
     for (const ortho::SceneSummary& scene : summary.scenes) {
-        std::printf("line %-4d %-9s %7.1f s  %s", scene.line, scene.status.c_str(), scene.seconds,
-                    scene.source.c_str());
+        std::printf("line %-4u %-9s %7.1f s  %s", scene.masterLine, scene.status.c_str(),
+                    scene.seconds, scene.source.c_str());
         if (!scene.ortho.empty())
             std::printf(" -> %s", scene.ortho.c_str());
         std::printf("\n");
@@ -68,6 +69,7 @@ int main(int argc, char** argv) {
     if (read != 0)
         return read < 0 ? 0 : read;
     try {
+        ortho::CatchInterrupts();
         ortho::Progress progress(stderr, ortho::IsTerminal(stderr), options.quiet);
         for (const std::string& note : notes)
             progress.Info(note);

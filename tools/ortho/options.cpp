@@ -151,6 +151,9 @@ Options ParseOptions(const std::vector<std::string>& args) {
         } else if (name == "--quiet" || name == "-q") {
             flag();
             options.quiet = true;
+        } else if (name == "--overwrite") {
+            flag();
+            options.overwrite = true;
         } else {
             throw UsageError("unknown option " + Quoted(name) + " (see --help)");
         }
@@ -225,6 +228,8 @@ Running:
                       waits for a run without --lines
   --keep-going, -k    go on after a scene fails; the failures are listed in the summary
   --quiet, -q         print errors only
+  --overwrite         make every output again, even those whose inputs and options have not
+                      changed since they were made
   --help, -h          this text
   --version           the version of silvan-ortho, GDAL and PROJ
 
@@ -234,7 +239,7 @@ NAME_footprint.gpkg; footprints.gpkg (one layer per scene), mosaic.tif, mosaic_s
 mosaic.png, NAME_vis.png, and summary.json (summary-A-B.json for a slice).
 
 Exit status: 0 when everything asked for was done, 1 when something failed, 2 for a bad
-command line.
+command line, 130 when interrupted (Ctrl-C).
 )";
 }
 

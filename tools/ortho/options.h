@@ -47,6 +47,7 @@ struct Options {
 
     bool keepGoing = false;
     bool quiet = false;
+    bool overwrite = false;  // make every output again
     bool help = false;
     bool version = false;
 };

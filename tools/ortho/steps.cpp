@@ -487,53 +487,62 @@ Grid SceneLayout(const Options& options, const SceneInput& scene, const std::str
 
 namespace {
 
-// Generator progress, in GDAL's style, to a step's progress.
-bool ReportProgress(double fraction, const char*, void* data) {
-    const StepProgress& progress = *static_cast<const StepProgress*>(data);
-    return !progress || progress(fraction);
-}
+// A process whose generator reports to a step's progress. A progress that says stop (the run
+// is interrupted) sets the process's cancel flag, and the generator stops within a tile.
+class StepProcess : public kestrel::processes::silvan::TOPPFBase {
+  protected:
+    StepProcess(const std::string& procText, const StepProgress& progress) : progress_(progress) {
+        SetProc(procText);
+    }
+    void Attach(kestrel::processes::ITrueOrtho& generator) {
+        generator.SetCancelFlag(GetCancelFlag());
+        generator.SetProgress(Report, this);
+    }
+
+  private:
+    static bool Report(double fraction, const char*, void* data) {
+        auto& process = *static_cast<StepProcess*>(data);
+        if (!process.progress_ || process.progress_(fraction))
+            return true;
+        process.SetCancelFlag(true);
+        return false;
+    }
+    const StepProgress& progress_;
+};
 
 // The true-ortho process of one scene: its generator comes from the PROC text.
-class OrthoProcess : public kestrel::processes::silvan::TOPPFBase {
+class OrthoProcess : public StepProcess {
   public:
     OrthoProcess(const std::string& procText, const kestrel::processes::TorthoJob& job,
                  const StepProgress& progress)
-        : job_(job), progress_(progress) {
-        SetProc(procText);
-    }
+        : StepProcess(procText, progress), job_(job) {}
     void Execute() override {
         std::unique_ptr<kestrel::processes::TorthoGenerator> generator(CreateTorthoGenerator());
-        generator->SetCancelFlag(GetCancelFlag());
-        generator->SetProgress(ReportProgress, const_cast<StepProgress*>(&progress_));
+        Attach(*generator);
         result_ = generator->Generate(job_);
     }
     const kestrel::processes::TorthoResult& Result() const { return result_; }
 
   private:
     const kestrel::processes::TorthoJob& job_;
-    const StepProgress& progress_;
     kestrel::processes::TorthoResult result_;
 };
 
 // The gap-filling process of an image set.
-class RecoveryProcess : public kestrel::processes::silvan::TOPPFBase {
+class RecoveryProcess : public StepProcess {
   public:
     RecoveryProcess(const std::string& procText, const kestrel::processes::RecoveryJob& job,
                     const StepProgress& progress)
-        : job_(job), progress_(progress) {
-        SetProc(procText);
-    }
+        : StepProcess(procText, progress), job_(job) {}
     void Execute() override {
         std::unique_ptr<kestrel::processes::OcclusionRecovery> generator(CreateOcclusionRecovery());
-        generator->SetCancelFlag(GetCancelFlag());
-        generator->SetProgress(ReportProgress, const_cast<StepProgress*>(&progress_));
+        Attach(*generator);
         result_ = generator->Recover(job_);
     }
     const kestrel::processes::TorthoRecoveryResult& Result() const { return result_; }
 
   private:
     const kestrel::processes::RecoveryJob& job_;
-    const StepProgress& progress_;
     kestrel::processes::TorthoRecoveryResult result_;
 };
 

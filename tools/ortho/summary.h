@@ -8,24 +8,28 @@
 namespace ortho {
 
 struct SceneSummary {
-    int line = 0;        // data line of the preparation file, from 0
+    int line = 0;                 // data line of the preparation file, from 0 (as --lines counts)
+    unsigned int masterLine = 0;  // line of the master file, from 1 (as messages count)
     std::string source;  // source image as the master file names it
     std::string ortho;   // paths as written
     std::string visibility;
     std::string scene;      // the scene description XML
     std::string footprint;  // the scene's footprint file
-    std::string status;     // "done", "complete" (found done before), "failed", "not run"
+    std::string status;     // "done", "complete" (found done before), "failed", "cancelled",
+                            // "not run"
     double seconds = 0.0;   // time spent on the scene in this run
     std::string error;      // why it failed
+    std::string reason;     // why it was made in this run ("--resample changed: ...")
 };
 
 struct RunSummary {
     std::string master;
-    std::string status;  // "complete", "partial" (a slice), "failed"
+    std::string status;  // "complete", "partial" (a slice), "failed", "cancelled"
     std::vector<SceneSummary> scenes;
     std::string mosaic;        // empty: not made by this run
     std::string mosaicSource;  // which image each mosaic pixel came from: 1 + its index in
     std::vector<std::string> mosaicScenes;  // these scene names, 0 where none sees the pixel
+    std::string mosaicReason;  // why the mosaic was made in this run; empty: kept
     std::string footprints;
     std::vector<std::string> quicklooks;
     std::vector<std::string> errors;  // failures outside the scenes
@@ -34,6 +38,14 @@ struct RunSummary {
 };
 
 std::string ToJson(const RunSummary& summary);
+
+// A JSON string of any bytes, valid UTF-8: control characters escaped, and each byte that is
+// not part of valid UTF-8 written as the lone surrogate \udcXX (Python's "surrogateescape"),
+// so that the original bytes of a file name can be had back.
+std::string JsonString(const std::string& text);
+// The bytes of a JSON string as JsonString writes it, from just after its opening quote at
+// `at`; `at` ends after the closing quote. False when there is no whole string there.
+bool ReadJsonString(const std::string& text, std::size_t& at, std::string& value);
 
 // Writes the text under a temporary name and renames it over path, so that a reader never sees
 // a half-written file. Throws kestrel::FileAccessException naming the path.

@@ -1,6 +1,7 @@
 #include "workflow.h"
 
 #include "files.h"
+#include "interrupt.h"
 
 #include <silvan/parserfactory.h>
 #include <silvan/tomfileparser.h>
@@ -10,6 +11,7 @@
 #include <kestrel/file.h>
 
 #include <algorithm>
+#include <cctype>
 #include <atomic>
 #include <chrono>
 #include <cstdint>
@@ -19,7 +21,9 @@
 #include <limits>
 #include <map>
 #include <mutex>
+#include <set>
 #include <sstream>
+#include <stdexcept>
 #include <thread>
 
 namespace fs = std::filesystem;
@@ -48,31 +52,34 @@ std::string About(const std::string& path, const std::string& message) {
     return message.find(path) != std::string::npos ? message : path + ": " + message;
 }
 
-// The line numbers (from 1) of the data lines of a parameter file: every line but header and
-// comment lines ("!" first) and blank ones, as the parameter-table reader counts them.
-std::vector<unsigned int> DataLineNumbers(const std::string& path) {
-    std::vector<unsigned int> numbers;
-    std::ifstream in(path, std::ios::binary);
-    std::string text;
-    unsigned int number = 0;
-    while (std::getline(in, text)) {
-        ++number;
-        if (number == 1 && text.compare(0, 3, "\xEF\xBB\xBF") == 0)
-            text.erase(0, 3);
-        if (!text.empty() && text.back() == '\r')
-            text.pop_back();
-        if (text.empty() || text[0] == '!' || text.find_first_not_of(" \t") == std::string::npos)
-            continue;
-        numbers.push_back(number);
-    }
-    return numbers;
-}
-
 std::string ReadText(const std::string& path) {
     std::ifstream in(path, std::ios::binary);
     std::ostringstream text;
     text << in.rdbuf();
     return text.str();
+}
+
+// The data lines of a parameter file with their numbers (from 1): every line but header and
+// comment lines ("!" first) and blank ones, with lines ended by LF, CR LF or CR alone, as the
+// parameter-table reader counts them.
+std::vector<std::pair<unsigned int, std::string>> DataLines(const std::string& path) {
+    std::vector<std::pair<unsigned int, std::string>> lines;
+    std::string text = ReadText(path);
+    if (text.compare(0, 3, "\xEF\xBB\xBF") == 0)
+        text.erase(0, 3);
+    unsigned int number = 0;
+    for (std::size_t start = 0; start < text.size();) {
+        std::size_t end = text.find_first_of("\r\n", start);
+        if (end == std::string::npos)
+            end = text.size();
+        const std::string line = text.substr(start, end - start);
+        ++number;
+        if (!line.empty() && line[0] != '!' &&
+            line.find_first_not_of(" \t") != std::string::npos)
+            lines.emplace_back(number, line);
+        start = end + (text.compare(end, 2, "\r\n") == 0 ? 2 : 1);
+    }
+    return lines;
 }
 
 // Writes a derived file through write(partName) and puts it in place, unless the file there
@@ -93,18 +100,6 @@ void DeriveFile(const std::string& path, Write write) {
         RemoveFile(part);
     else
         Publish(part, path);
-}
-
-// FNV-1a: a stable fingerprint of the inputs the common grid depends on.
-std::string Fingerprint(const std::string& text) {
-    std::uint64_t hash = 1469598103934665603ULL;
-    for (const char c : text) {
-        hash ^= static_cast<unsigned char>(c);
-        hash *= 1099511628211ULL;
-    }
-    char hex[17];
-    std::snprintf(hex, sizeof hex, "%016llx", static_cast<unsigned long long>(hash));
-    return hex;
 }
 
 std::string GridText(const std::string& key, const Grid& grid) {
@@ -134,18 +129,77 @@ bool ReadGridText(const std::string& path, const std::string& key, Grid& grid) {
     return true;
 }
 
-std::string FactorsText(const std::vector<float>& factors) {
-    std::string text;
-    for (const float f : factors)
-        text += std::to_string(f) + ",";
-    return text;
-}
-
 // Scene descriptions go through the XML library one at a time: the DTD beside them is written
 // by whichever scene finds it missing.
 std::mutex& SceneFileMutex() {
     static std::mutex mutex;
     return mutex;
+}
+
+// The run was interrupted (Ctrl-C): it unwinds, cleaning up, to a summary saying so.
+class Cancelled : public std::runtime_error {
+  public:
+    Cancelled() : std::runtime_error("interrupted") {}
+};
+
+void ThrowIfInterrupted() {
+    if (Interrupted())
+        throw Cancelled();
+}
+
+// An output file and what it is, for messages.
+struct Output {
+    std::string path;
+    std::string what;
+};
+
+// The quicklook of the raster dir/stem.FORMAT: dir/stem.png, or dir/stem_quicklook.png when the
+// rasters are PNG files themselves, so that it does not replace the raster.
+std::string QuicklookName(const std::string& dir, const std::string& stem,
+                          const std::string& format) {
+    std::string lower = format;
+    std::transform(lower.begin(), lower.end(), lower.begin(),
+                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+    return Join(dir, stem + (lower == "png" ? "_quicklook.png" : ".png"));
+}
+
+// The outputs of a scene named `name`, in the order of Scene's fields.
+std::vector<Output> SceneOutputs(const std::string& dir, const std::string& name,
+                                 const std::string& format) {
+    return {{Join(dir, name + "_ortho." + format), "the ortho"},
+            {Join(dir, name + "_vis." + format), "the visibility index"},
+            {Join(dir, name + ".xml"), "the scene description"},
+            {Join(dir, name + "_footprint.gpkg"), "the footprint"},
+            {QuicklookName(dir, name + "_vis", format), "the visibility quicklook"},
+            {Join(dir, name + "_manifest.json"), "the record of inputs"}};
+}
+
+// A relative source is taken from the master file's directory, or else from the current one.
+std::string ResolveSource(const std::string& given, const fs::path& masterDir) {
+    std::error_code ec;
+    fs::path source(given);
+    if (source.is_relative() && (fs::exists(masterDir / source, ec) || !fs::exists(source, ec)))
+        source = masterDir / source;
+    return fs::absolute(source, ec).lexically_normal().string();
+}
+
+// What two paths are compared by: the same file however it is named (links, "..", and the
+// letter case on file systems that ignore it).
+std::string SameFileKey(const std::string& path) {
+    std::error_code ec;
+    fs::path key = fs::weakly_canonical(fs::absolute(path, ec), ec);
+    if (ec)
+        key = fs::absolute(path, ec);
+    std::string text = key.lexically_normal().string();
+#if defined(_WIN32) || defined(__APPLE__)
+    std::transform(text.begin(), text.end(), text.begin(),
+                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+#endif
+    return text;
+}
+
+std::string SurfacePath(const Options& options) {
+    return options.dem.empty() ? options.tin : options.dem;
 }
 
 }  // namespace
@@ -175,6 +229,32 @@ void Workflow::Fail(Scene& scene, const std::string& message) {
         stopped_ = true;
 }
 
+const FileIdentity& Workflow::Identity(const std::string& path) {
+    auto known = identities_.find(path);
+    if (known == identities_.end()) {
+        ThrowIfInterrupted();
+        known = identities_.emplace(path, IdentifyFile(path)).first;
+    }
+    return known->second;
+}
+
+const std::vector<std::string>& Workflow::FilesOf(const std::string& dataset) {
+    auto known = files_.find(dataset);
+    if (known == files_.end())
+        known = files_.emplace(dataset, DatasetFiles(dataset)).first;
+    return known->second;
+}
+
+std::string Workflow::SummaryName() const {
+    if (!options_.hasLines)
+        return "summary.json";
+    return "summary-" + std::to_string(options_.firstLine) + "-" +
+           (options_.endLine == std::numeric_limits<unsigned int>::max()
+                ? std::string("end")
+                : std::to_string(options_.endLine)) +
+           ".json";
+}
+
 int Workflow::Run() {
     summary_.master = options_.master;
     const auto start = Clock::now();
@@ -185,8 +265,10 @@ int Workflow::Run() {
         summary_.timings.emplace_back("prepare", SecondsSince(step));
         const bool anyScene =
             std::any_of(scenes_.begin(), scenes_.end(), [](const Scene& s) { return s.inSlice; });
-        if (!anyScene)
-            stopped_ = stopped_ || !options_.hasLines;
+        if (!anyScene && !options_.hasLines) {
+            stopped_ = true;
+            summary_.errors.push_back(options_.master + ": no data line names a scene");
+        }
         step = Clock::now();
         if (anyScene)
             MakeGrid();
@@ -196,7 +278,7 @@ int Workflow::Run() {
             RunScenes();
         summary_.timings.emplace_back("scenes", SecondsSince(step));
         step = Clock::now();
-        if (!stopped_ && anyScene && !options_.hasLines)
+        if (!stopped_ && anyScene && !options_.hasLines && !Interrupted())
             Recover();
         summary_.timings.emplace_back("recovery", SecondsSince(step));
         succeeded = !stopped_ && summary_.errors.empty();
@@ -204,6 +286,7 @@ int Workflow::Run() {
             if (scene.inSlice && scene.status != "done" && scene.status != "complete")
                 succeeded = false;
         }
+    } catch (const Cancelled&) {
     } catch (const RunError& e) {
         summary_.errors.push_back(e.what());
         progress_.Error(e.what());
@@ -214,8 +297,10 @@ int Workflow::Run() {
     summary_.timings.emplace_back("total", SecondsSince(start));
     for (const auto& entry : stepSeconds_)
         summary_.timings.push_back(entry);
-    Finish(succeeded);
-    return succeeded ? 0 : 1;
+    if (Interrupted())
+        progress_.Error("interrupted: the run stopped; run it again to finish");
+    Finish(succeeded && !Interrupted());
+    return Interrupted() ? kInterruptedStatus : succeeded ? 0 : 1;
 }
 
 void Workflow::Prepare() {
@@ -232,16 +317,43 @@ void Workflow::Prepare() {
     imgSetFile_ = Join(outDir_, "imgset.txt");
     gridFile_ = Join(outDir_, "grid.txt");
 
+    // One run at a time on a directory; the slices of one run side by side.
+    try {
+        lock_ = std::make_unique<RunLock>(
+            outDir_, options_.hasLines,
+            "process " + std::to_string(ProcessId()) +
+                (options_.hasLines ? " (" + SummaryName() + ")" : std::string()));
+    } catch (const std::runtime_error& e) {
+        refused_ = true;
+        throw RunError(e.what());
+    }
+
     // The master file gives the two derived files; the process reads them back as the
     // preparation and gap-filling processes would.
+    std::unique_ptr<TOMFileParser> master;
     try {
-        std::unique_ptr<TOMFileParser> master(ParserFactory::CreateTOMFileParser(options_.master));
+        master.reset(ParserFactory::CreateTOMFileParser(options_.master));
+    } catch (const kestrel::Exception& e) {
+        throw RunError(About(options_.master, Explain(e)));
+    }
+    // The source of each line: its first column, blanks trimmed, as the table reads it.
+    std::vector<std::string> sources;
+    for (const auto& line : DataLines(options_.master)) {
+        masterLines_.push_back(line.first);
+        std::string source = line.second.substr(0, line.second.find(';'));
+        source.erase(0, source.find_first_not_of(" \t"));
+        source.erase(source.find_last_not_of(" \t") + 1);
+        sources.push_back(source);
+    }
+    CheckOutputsSpareInputs(sources);
+    try {
         DeriveFile(prepFile_, [&](const std::string& part) { master->WriteMFilePrep(part); });
         DeriveFile(imgSetFile_, [&](const std::string& part) { master->WriteImgSet(part); });
     } catch (const kestrel::Exception& e) {
         throw RunError(About(options_.master, Explain(e)));
     }
-    const std::vector<unsigned int> masterLines = DataLineNumbers(options_.master);
+    const std::vector<std::pair<unsigned int, std::string>> prepLines = DataLines(prepFile_);
+    const fs::path masterDir = fs::absolute(options_.master, ec).parent_path();
 
     std::map<std::string, std::pair<RadiometricDiff, int>> imageSet;
     try {
@@ -268,12 +380,13 @@ void Workflow::Prepare() {
         throw RunError(About(options_.master, Explain(e)));
     }
     const unsigned int count = prep->GetMfileLines();
-    const fs::path masterDir = fs::absolute(options_.master, ec).parent_path();
     std::map<std::string, int> names;
     for (unsigned int i = 0; i < count; ++i) {
         Scene scene;
         scene.line = static_cast<int>(i);
-        scene.masterLine = i < masterLines.size() ? masterLines[i] : i + 1;
+        scene.masterLine = i < masterLines_.size() ? masterLines_[i] : i + 1;
+        if (i < prepLines.size())
+            scene.columns = prepLines[i].second;
         scene.inSlice = !options_.hasLines || (i >= options_.firstLine && i < options_.endLine);
         try {
             prep->ParseLine(scene.line);
@@ -297,13 +410,7 @@ void Workflow::Prepare() {
         if (scene.error.empty() && scene.given.empty())
             scene.error = Where(scene) + ": the source image is missing";
         if (scene.error.empty()) {
-            // A relative source is taken from the master file's directory, or else from the
-            // current one.
-            fs::path source(scene.given);
-            if (source.is_relative() &&
-                (fs::exists(masterDir / source, ec) || !fs::exists(source, ec)))
-                source = masterDir / source;
-            scene.input.source = fs::absolute(source, ec).lexically_normal().string();
+            scene.input.source = ResolveSource(scene.given, masterDir);
             scene.id = kestrel::core::fileio::File(scene.given).GetBasename();
             scene.name = fs::path(scene.id).stem().string();
             const auto known = imageSet.find(scene.id);
@@ -327,11 +434,13 @@ void Workflow::Prepare() {
             }
         }
         if (!scene.name.empty()) {
-            scene.ortho = Join(outDir_, scene.name + "_ortho." + options_.format);
-            scene.visibility = Join(outDir_, scene.name + "_vis." + options_.format);
-            scene.xml = Join(outDir_, scene.name + ".xml");
-            scene.footprint = Join(outDir_, scene.name + "_footprint.gpkg");
-            scene.quicklook = Join(outDir_, scene.name + "_vis.png");
+            const std::vector<Output> outputs = SceneOutputs(outDir_, scene.name, options_.format);
+            scene.ortho = outputs[0].path;
+            scene.visibility = outputs[1].path;
+            scene.xml = outputs[2].path;
+            scene.footprint = outputs[3].path;
+            scene.quicklook = outputs[4].path;
+            scene.manifest = outputs[5].path;
         }
         if (!scene.error.empty() && scene.inSlice) {
             progress_.Error(scene.error);
@@ -344,22 +453,100 @@ void Workflow::Prepare() {
                        " has " + std::to_string(count) + " lines; nothing to do");
 }
 
-void Workflow::MakeGrid() {
-    // The grid depends on the surface, the output options and every line's source.
-    std::string inputs = options_.dem + "|" + options_.tin + "|" + options_.elevref + "|" +
-                         FactorsText(options_.elfactor) + "|" + options_.elunits + "|" +
-                         options_.srs + "|" + std::to_string(options_.pixelSize) + "|" +
-                         options_.cameras + "|" + options_.camerasSrs + "|";
+
+std::vector<std::pair<std::string, std::string>> Workflow::RunOutputs() const {
+    const std::string f = options_.format;
+    std::vector<std::pair<std::string, std::string>> outputs = {
+            {prepFile_, "the preparation file"},
+            {imgSetFile_, "the image-set file"},
+            {gridFile_, "the common grid"},
+            {Join(outDir_, "summary.json"), "the summary"},
+            {Join(outDir_, RunLock::FileName()), "the run's lock"},
+            {Join(outDir_, "TOSceneDesc_Document.dtd"), "the scene descriptions' DTD"},
+            {Join(outDir_, "footprints.gpkg"), "the footprints"},
+            {Join(outDir_, "mosaic." + f), "the mosaic"},
+            {Join(outDir_, "mosaic_source." + f), "the mosaic's source raster"},
+            {QuicklookName(outDir_, "mosaic", f), "the mosaic's quicklook"},
+            {QuicklookName(outDir_, "mosaic_source", f), "the source raster's quicklook"},
+            {Join(outDir_, "mosaic_manifest.json"), "the mosaic's record of inputs"}};
+    if (options_.hasLines)
+        outputs.emplace_back(Join(outDir_, SummaryName()), "the slice's summary");
+    return outputs;
+}
+
+void Workflow::CheckOutputsSpareInputs(const std::vector<std::string>& sources) {
+    // Every file the run reads, and what it is.
+    std::map<std::string, std::string> inputs;
+    const auto read = [&](const std::string& path, const std::string& what) {
+        inputs.emplace(SameFileKey(path), what + " " + path);
+    };
+    read(options_.master, "the master file");
+    for (const std::string& file : FilesOf(SurfacePath(options_)))
+        read(file, "the surface model");
+    std::vector<std::pair<std::string, std::string>> outputs = RunOutputs();
+    std::set<std::string> names;
+    const fs::path masterDir = fs::absolute(options_.master).parent_path();
+    for (std::size_t i = 0; i < sources.size(); ++i) {
+        if (sources[i].empty())
+            continue;
+        const std::string where =
+            options_.master + ", line " +
+            std::to_string(i < masterLines_.size() ? masterLines_[i] : i + 1);
+        const std::string source = ResolveSource(sources[i], masterDir);
+        for (const std::string& file : FilesOf(source))
+            read(file, (file == source ? "the source image of " : "a side file of the source of ") +
+                           where + ":");
+        // A name taken twice fails on its own line.
+        const std::string name =
+            fs::path(kestrel::core::fileio::File(sources[i]).GetBasename()).stem().string();
+        if (name.empty() || !names.insert(name).second)
+            continue;
+        for (const Output& output : SceneOutputs(outDir_, name, options_.format))
+            outputs.emplace_back(output.path, output.what + " of " + where);
+    }
+    // No output over an input, no two outputs (final or temporary) on one file.
+    std::map<std::string, std::string> written;
+    for (const auto& output : outputs) {
+        for (const bool part : {false, true}) {
+            const std::string path = part ? PartName(output.first) : output.first;
+            const std::string what = part ? "the temporary file of " + output.second : output.second;
+            const std::string key = SameFileKey(path);
+            const auto input = inputs.find(key);
+            if (input != inputs.end())
+                throw RunError(path + ": " + what + " would be written over " + input->second +
+                               "; choose another --out");
+            const auto other = written.emplace(key, what);
+            if (!other.second)
+                throw RunError(path + ": both " + other.first->second + " and " + what +
+                               " would be written there");
+        }
+    }
+}
+
+Manifest Workflow::GridInputs() {
+    // The scenes' layouts depend on the surface, the options that move footprints and every
+    // line's source and columns, including those of other slices.
+    Manifest inputs;
+    for (const PixelOption& option : PixelOptions()) {
+        if (option.movesFootprints)
+            inputs.Set(option.name, option.value(options_));
+    }
+    for (const std::string& file : FilesOf(SurfacePath(options_)))
+        inputs.SetFile("surface file", file, Identity(file));
     for (const Scene& scene : scenes_) {
         if (!scene.error.empty())
             continue;
-        inputs += scene.input.source + ";" + std::to_string(scene.input.mmseg) + ";";
-        for (const unsigned int c : scene.input.channels)
-            inputs += std::to_string(c) + ",";
-        inputs += "\n";
+        inputs.Set(Where(scene), scene.columns);
+        for (const std::string& file : FilesOf(scene.input.source))
+            inputs.SetFile("source file", file, Identity(file));
+        RecordCamera(scene, inputs);
     }
-    const std::string key = Fingerprint(inputs);
-    if (ReadGridText(gridFile_, key, grid_))
+    return inputs;
+}
+
+void Workflow::MakeGrid() {
+    const std::string key = GridInputs().Fingerprint();
+    if (!options_.overwrite && ReadGridText(gridFile_, key, grid_))
         return;
 
     // The first scene whose layout can be made fixes the CRS and pixel size of all others.
@@ -369,6 +556,7 @@ void Workflow::MakeGrid() {
     for (Scene& scene : scenes_) {
         if (!scene.error.empty() || stopped_)
             continue;
+        ThrowIfInterrupted();
         try {
             scene.grid = SceneLayout(options_, scene.input, crs, pixelSize, nullptr);
             scene.hasGrid = true;
@@ -394,20 +582,44 @@ void Workflow::MakeGrid() {
     progress_.Info("common grid: " + grid_.Describe());
 }
 
-bool Workflow::IsComplete(const Scene& scene) const {
-    if (!FileExists(scene.xml) || !FileExists(scene.footprint) || !FileExists(scene.quicklook))
-        return false;
-    // Made before its inputs last changed: make it again.
-    const double made = ModifiedTime(scene.xml);
-    if (made < ModifiedTime(scene.input.source) ||
-        made < ModifiedTime(options_.dem.empty() ? options_.tin : options_.dem))
-        return false;
-    // So does the file of its camera.
+void Workflow::RecordInputs(Scene& scene) {
+    Manifest& made = scene.madeFrom;
+    made.Set("master line", scene.columns);
+    for (const PixelOption& option : PixelOptions())
+        made.Set(option.name, option.value(options_));
+    made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
+    for (const std::string& file : FilesOf(scene.input.source))
+        made.SetFile("source file", file, Identity(file));
+    for (const std::string& file : FilesOf(SurfacePath(options_)))
+        made.SetFile("surface file", file, Identity(file));
+    RecordCamera(scene, made);
+}
+
+void Workflow::RecordCamera(const Scene& scene, Manifest& inputs) {
+    // The file of the scene's camera, when it has one: --cameras, or its side file.
     const std::string camera = options_.cameras.empty()
                                    ? kestrel::mathmodel::CameraSideFile(scene.input.source)
                                    : options_.cameras;
-    if (FileExists(camera) && made < ModifiedTime(camera))
-        return false;
+    if (FileExists(camera))
+        inputs.SetFile("camera file", camera, Identity(camera));
+}
+
+std::string Workflow::WhyMake(const Scene& scene) const {
+    if (options_.overwrite)
+        return "--overwrite";
+    Manifest earlier;
+    if (!earlier.Read(scene.manifest))
+        return FileExists(scene.xml) ? "no record of the inputs it was made from"
+                                     : "not made before";
+    const std::vector<std::string> changes = scene.madeFrom.ChangesSince(earlier);
+    if (!changes.empty())
+        return Reason(changes);
+    for (const std::string& output :
+         {scene.ortho, scene.visibility, scene.xml, scene.footprint, scene.quicklook}) {
+        if (!FileExists(output))
+            return output + " is missing";
+    }
+    // A description that names other files (the directory was moved) is made again.
     try {
         std::unique_ptr<TOSceneParser> description;
         {
@@ -417,13 +629,16 @@ bool Workflow::IsComplete(const Scene& scene) const {
         if (description->GetOrthoFilename() != scene.ortho ||
             description->GetVisIdxFilename() != scene.visibility ||
             description->GetSceneFilename() != scene.input.source)
-            return false;
-        Grid ortho, visibility;
-        return ReadGrid(scene.ortho, ortho) && ortho.SameAs(grid_) &&
-               ReadGrid(scene.visibility, visibility) && visibility.SameAs(grid_);
-    } catch (const std::exception&) {
-        return false;
+            return scene.xml + " names other files";
+    } catch (const std::exception& e) {
+        return scene.xml + " cannot be read: " + Explain(e);
     }
+    Grid ortho, visibility;
+    if (!ReadGrid(scene.ortho, ortho) || !ortho.SameAs(grid_))
+        return scene.ortho + " is not whole on the common grid";
+    if (!ReadGrid(scene.visibility, visibility) || !visibility.SameAs(grid_))
+        return scene.visibility + " is not whole on the common grid";
+    return "";
 }
 
 void Workflow::RunScenes() {
@@ -431,10 +646,14 @@ void Workflow::RunScenes() {
     for (Scene& scene : scenes_) {
         if (!scene.inSlice || !scene.error.empty())
             continue;
-        if (IsComplete(scene)) {
+        RecordInputs(scene);
+        scene.reason = WhyMake(scene);
+        if (scene.reason.empty()) {
             scene.status = "complete";
             continue;
         }
+        if (scene.reason != "not made before")
+            progress_.Info(Where(scene) + " (" + scene.name + "): made again: " + scene.reason);
         queue.push_back(&scene);
     }
     const unsigned int skipped = static_cast<unsigned int>(std::count_if(
@@ -456,7 +675,7 @@ void Workflow::RunScenes() {
                 if (next == queue.size())
                     return;
                 scene = queue[next++];
-                if (stop) {
+                if (stop || Interrupted()) {
                     scene->status = "not run";
                     continue;
                 }
@@ -482,19 +701,20 @@ void Workflow::RunScene(Scene& scene) {
     const auto start = Clock::now();
     const std::string label = scene.name;
     progress_.Begin(label);
-    // Step weights for the scene's progress.
+    // Step weights for the scene's progress; an interrupt stops the generator within a tile.
     const auto report = [&](double from, double to, const std::string& step) {
         return [this, label, from, to, step](double fraction) {
             progress_.Update(label, from + (to - from) * fraction, step);
-            return true;
+            return !Interrupted();
         };
     };
     const std::vector<std::string> parts = {PartName(scene.ortho), PartName(scene.visibility),
                                             PartName(scene.quicklook), PartName(scene.xml)};
     try {
-        // Outputs of an earlier, unfinished attempt are made again from the start.
-        for (const std::string& path :
-             {scene.xml, scene.ortho, scene.visibility, scene.footprint, scene.quicklook})
+        // Outputs of an earlier attempt are made again from the start; the record of inputs
+        // goes first, so that no crash leaves it beside outputs it did not make.
+        for (const std::string& path : {scene.manifest, scene.xml, scene.ortho, scene.visibility,
+                                         scene.footprint, scene.quicklook})
             RemoveFile(path);
         for (const std::string& part : parts)
             RemoveFile(part);
@@ -503,10 +723,17 @@ void Workflow::RunScene(Scene& scene) {
         const auto timed = [&](const char* name) {
             AddStep(name, SecondsSince(step));
             step = Clock::now();
+            ThrowIfInterrupted();
         };
         report(0.0, 0.05, "layout")(0.0);
         Footprint footprint;
         SceneLayout(options_, scene.input, grid_.crs, grid_.PixelSize(), &footprint);
+        // The footprint file and the merge take polygons of at least 4 corners.
+        if (!footprint || footprint->numPoints < 4)
+            KESTREL_THROW(kestrel::DataException,
+                          scene.input.source + ": the footprint has " +
+                              std::to_string(footprint ? footprint->numPoints : 0) +
+                              " corner(s); a scene's footprint needs at least 4");
         timed("scene layout");
 
         const OrthoResult result =
@@ -516,7 +743,7 @@ void Workflow::RunScene(Scene& scene) {
         timed("scene ortho");
 
         // The footprint layer is labelled with its file's name, so it is written in place; the
-        // scene description written after it says that it is whole.
+        // record of inputs written last says that it is whole.
         report(0.9, 0.95, "footprint")(0.0);
         WriteFootprint(scene.footprint, *footprint);
         timed("scene footprint");
@@ -524,7 +751,6 @@ void Workflow::RunScene(Scene& scene) {
         Publish(parts[2], scene.quicklook);
         timed("scene quicklook");
 
-        // The scene description comes last: its presence says the scene is complete.
         report(0.95, 1.0, "scene")(0.0);
         {
             std::lock_guard<std::mutex> lock(SceneFileMutex());
@@ -532,7 +758,7 @@ void Workflow::RunScene(Scene& scene) {
             description->SetSceneFilename(scene.input.source);
             description->SetOrthoFilename(scene.ortho);
             description->SetVisIdxFilename(scene.visibility);
-            description->SetElevMapFilename(options_.dem.empty() ? options_.tin : options_.dem);
+            description->SetElevMapFilename(SurfacePath(options_));
             description->SetMmseg(scene.input.mmseg);
             description->SetOrthoNoDataValue(static_cast<float>(result.orthoNoData));
             description->SetElevNoDataValue(static_cast<float>(result.elevationNoData));
@@ -540,62 +766,81 @@ void Workflow::RunScene(Scene& scene) {
             description->Serialize(false);
         }
         Publish(parts[3], scene.xml);
+        // The record of inputs comes last: its presence says the scene is complete.
+        WriteFileAtomically(scene.manifest, scene.madeFrom.ToJson(scene.name));
         timed("scene description");
         scene.status = "done";
     } catch (const std::exception& e) {
         for (const std::string& part : parts)
             RemoveFile(part);
-        Fail(scene, Where(scene) + ": " + Explain(e));
+        RemoveFile(scene.footprint);
+        if (Interrupted())
+            scene.status = "cancelled";
+        else
+            Fail(scene, Where(scene) + ": " + Explain(e));
     }
     scene.seconds = SecondsSince(start);
-    progress_.End(label, scene.status == "done", scene.seconds, scene.error);
+    progress_.End(label, scene.status == "done", scene.seconds,
+                  scene.status == "cancelled" ? "cancelled" : scene.error);
 }
 
 void Workflow::Recover() {
     const std::string mosaic = Join(outDir_, "mosaic." + options_.format);
     const std::string source = Join(outDir_, "mosaic_source." + options_.format);
     const std::string footprints = Join(outDir_, "footprints.gpkg");
-    const std::string stamp = Join(outDir_, "mosaic.inputs");
-    const std::vector<std::string> quicklooks = {Join(outDir_, "mosaic.png"),
-                                                 Join(outDir_, "mosaic_source.png")};
+    const std::string record = Join(outDir_, "mosaic_manifest.json");
+    const std::vector<std::string> quicklooks = {
+        QuicklookName(outDir_, "mosaic", options_.format),
+        QuicklookName(outDir_, "mosaic_source", options_.format)};
 
+    // The mosaic is made from the scenes' outputs, so from what made them, and from the
+    // image set's values and the options.
     std::vector<RecoveryScene> inputs;
     std::vector<FootprintLayer> layers;
-    std::string inputsText;
-    double newest = -std::numeric_limits<double>::infinity();
+    Manifest made;
+    for (const PixelOption& option : PixelOptions())
+        made.Set(option.name, option.value(options_));
+    made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
     for (const Scene& scene : scenes_) {
         if (scene.status != "done" && scene.status != "complete")
             continue;
-        newest = std::max(newest, ModifiedTime(scene.xml));
         layers.push_back({scene.name, scene.footprint, scene.input.source});
-        inputsText += scene.name + (scene.inImageSet ? " fill\n" : " prep\n");
+        made.Set("scene " + scene.name,
+                 scene.inImageSet ? "fill, radiometric difference " +
+                                        std::to_string(static_cast<int>(scene.radioDif)) +
+                                        ", DBM pixel error " + std::to_string(scene.dbmPxErr)
+                                  : std::string("preparation only"));
+        made.Set("outputs of " + scene.name, scene.madeFrom.Fingerprint(), "", false);
         if (!scene.inImageSet)
             continue;
-        // The ortho and visibility index as the scene description records them.
-        std::unique_ptr<TOSceneParser> description;
-        {
-            std::lock_guard<std::mutex> lock(SceneFileMutex());
-            description.reset(ParserFactory::CreateSceneParser(scene.xml));
-        }
-        inputs.push_back({scene.id, scene.input.source, scene.input.mmseg,
-                          description->GetOrthoFilename(), description->GetVisIdxFilename(),
-                          scene.radioDif, scene.dbmPxErr});
+        inputs.push_back({scene.id, scene.input.source, scene.input.mmseg, scene.ortho,
+                          scene.visibility, scene.radioDif, scene.dbmPxErr});
     }
     if (layers.empty())
         return;
 
-    // Nothing changed since the mosaic was made: keep it.
-    bool upToDate = FileExists(stamp) && ReadText(stamp) == inputsText && FileExists(footprints) &&
-                    ModifiedTime(footprints) >= newest;
-    if (!inputs.empty()) {
-        upToDate = upToDate && FileExists(mosaic) && FileExists(source) &&
-                   ModifiedTime(mosaic) >= newest && FileExists(quicklooks[0]) &&
-                   FileExists(quicklooks[1]);
+    std::vector<std::string> outputs = {footprints};
+    if (!inputs.empty())
+        outputs.insert(outputs.end(), {mosaic, source, quicklooks[0], quicklooks[1]});
+    std::string reason;
+    Manifest earlier;
+    if (options_.overwrite)
+        reason = "--overwrite";
+    else if (!earlier.Read(record))
+        reason = "not made before";
+    else
+        reason = Reason(made.ChangesSince(earlier));
+    for (const std::string& output : outputs) {
+        if (reason.empty() && !FileExists(output))
+            reason = output + " is missing";
     }
-    if (upToDate) {
+    if (reason.empty()) {
         progress_.Info("mosaic and footprints are up to date");
     } else {
-        RemoveFile(stamp);
+        if (reason != "not made before")
+            progress_.Info("mosaic and footprints made again: " + reason);
+        summary_.mosaicReason = reason;
+        RemoveFile(record);
         progress_.Info("merging the footprints of " + std::to_string(layers.size()) + " scene(s)");
         auto step = Clock::now();
         MergeFootprints(layers, grid_, PartName(footprints));
@@ -611,7 +856,7 @@ void Workflow::Recover() {
                 RecoverMosaic(options_, inputs, grid_, PartName(mosaic), PartName(source),
                               [this](double fraction) {
                                   progress_.Update("recovery", fraction, "mosaic");
-                                  return true;
+                                  return !Interrupted();
                               });
                 Publish(PartName(mosaic), mosaic);
                 Publish(PartName(source), source);
@@ -622,15 +867,17 @@ void Workflow::Recover() {
                 WriteQuicklook(source, PartName(quicklooks[1]), Quicklook::SourceIndex);
                 Publish(PartName(quicklooks[1]), quicklooks[1]);
                 AddStep("mosaic quicklooks", SecondsSince(step));
+                ThrowIfInterrupted();
             } catch (const std::exception& e) {
                 for (const std::string& path : {mosaic, source, quicklooks[0], quicklooks[1]})
                     RemoveFile(PartName(path));
                 progress_.End("recovery", false, SecondsSince(start), Explain(e));
+                ThrowIfInterrupted();
                 throw RunError(imgSetFile_ + ": occlusion recovery: " + Explain(e));
             }
             progress_.End("recovery", true, SecondsSince(start), "");
         }
-        WriteFileAtomically(stamp, inputsText);
+        WriteFileAtomically(record, made.ToJson("mosaic"));
     }
     summary_.footprints = footprints;
     if (!inputs.empty()) {
@@ -645,16 +892,25 @@ void Workflow::Recover() {
 }
 
 void Workflow::Finish(bool succeeded) {
-    summary_.status = !succeeded ? "failed" : options_.hasLines ? "partial" : "complete";
+    // Another run owns the directory and its summary.
+    if (refused_)
+        return;
+    summary_.status = Interrupted() ? "cancelled"
+                      : !succeeded  ? "failed"
+                      : options_.hasLines ? "partial"
+                                          : "complete";
     for (const Scene& scene : scenes_) {
         if (!scene.inSlice)
             continue;
         SceneSummary s;
         s.line = scene.line;
+        s.masterLine = scene.masterLine;
         s.source = scene.given;
         s.status = scene.status.empty() ? "not run" : scene.status;
         s.seconds = scene.seconds;
         s.error = scene.error;
+        if (s.status != "complete")
+            s.reason = scene.reason;
         if (s.status == "done" || s.status == "complete") {
             s.ortho = scene.ortho;
             s.visibility = scene.visibility;
@@ -662,20 +918,18 @@ void Workflow::Finish(bool succeeded) {
             s.footprint = scene.footprint;
             summary_.quicklooks.push_back(scene.quicklook);
         }
+        // A failed run lists every failure in `errors` too.
+        if (!scene.error.empty())
+            summary_.errors.push_back(scene.error);
         summary_.scenes.push_back(s);
     }
+    if (summary_.status == "failed" && summary_.errors.empty())
+        summary_.errors.push_back("the run stopped before every scene was made");
     if (outDir_.empty())
         return;
-    const std::string name = options_.hasLines
-                                 ? "summary-" + std::to_string(options_.firstLine) + "-" +
-                                       (options_.endLine == std::numeric_limits<unsigned int>::max()
-                                            ? std::string("end")
-                                            : std::to_string(options_.endLine)) +
-                                       ".json"
-                                 : "summary.json";
     try {
-        WriteFileAtomically(Join(outDir_, name), ToJson(summary_));
-        summaryPath_ = Join(outDir_, name);
+        WriteFileAtomically(Join(outDir_, SummaryName()), ToJson(summary_));
+        summaryPath_ = Join(outDir_, SummaryName());
     } catch (const std::exception& e) {
         progress_.Error(Explain(e));
     }
