@@ -67,7 +67,9 @@ TEST(MFileTable, ControlBytesInValuesAreRefused) {
         const char* where;
     } cases[] = {
         {0, 1, ", line 1, column 1: the value holds the control byte 0x01 at character 6"},
-        {1, 0, ", line 3, column 0: the value holds the control byte 0x00 at character 2"},
+        {1, 0,
+         ", line 3, column 0: the value holds the control byte 0x00 at character 2 of the line; "
+         "only tab is allowed (a binary file, such as an image, is no parameter file)"},
         {1, 1, ", line 3, column 1: the value holds the control byte 0x7F at character 6"},
         {1, 2, ", line 3, column 2: the value holds the control byte 0x1B at character 8"}};
     for (const auto& c : cases) {
@@ -76,6 +78,9 @@ TEST(MFileTable, ControlBytesInValuesAreRefused) {
             ADD_FAILURE() << c.where;
         } catch (const DataException& e) {
             EXPECT_EQ(e.GetErrorMessage().rfind(path + c.where, 0), 0u) << e.GetErrorMessage();
+            // Only a NUL says that the file is binary.
+            EXPECT_EQ(e.GetErrorMessage().find("binary") != std::string::npos,
+                      std::string(c.where).find("0x00") != std::string::npos);
         }
     }
 }

@@ -204,5 +204,12 @@ TEST(CommandMessages, NameTheFileWithoutCodeLocations) {
         EXPECT_NE(r.err.find(absent), std::string::npos) << r.err;
         EXPECT_EQ(r.err.find("(in "), std::string::npos) << r.err;
     }
+    // An image where a parameter file is expected.
+    const ProgramResult image =
+        RunProgram(tools + "/silvan-filelist", {WriteImage(dir.File("a.tif"))}, dir);
+    EXPECT_EQ(image.status, 1);
+    EXPECT_NE(image.err.find("(a binary file, such as an image, is no parameter file)"),
+              std::string::npos)
+        << image.err;
 }
 #endif  // SILVAN_ORTHO_EXE

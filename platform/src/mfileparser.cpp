@@ -282,13 +282,18 @@ class MFileTable final : public ParametersTableIF {
             if ((c < 0x20 && c != '\t') || c == 0x7F) {
                 const char* const lineStart =
                     file_->bytes.get() + file_->lineStarts[static_cast<std::size_t>(line)];
+                // Text files hold no NUL: say plainly that this is a binary file (an image
+                // named where a parameter file was expected, most often).
                 KESTREL_THROW_AT(
                     where, DataException,
                     FormatString("%s, line %u, column %d: the value holds the control "
                                  "byte 0x%02X at character %lld of the line; only "
-                                 "tab is allowed",
+                                 "tab is allowed%s",
                                  Name(), FileLineOf(line), column, static_cast<unsigned int>(c),
-                                 static_cast<long long>(q - lineStart) + 1));
+                                 static_cast<long long>(q - lineStart) + 1,
+                                 c == 0 ? " (a binary file, such as an image, is no parameter "
+                                          "file)"
+                                        : ""));
             }
         }
         return Field{text, line, column, false};
