@@ -122,34 +122,41 @@ std::string ImageMasterText(const std::vector<std::string>& images, const std::s
     return text;
 }
 
-void WriteImageMaster(Options& options) {
-    const std::string path = ImageMasterPath(options.outDir);
-    const std::string text = ImageMasterText(options.images, options.outDir);
+namespace {
+
+// The text of the master file that the images' master file would replace (empty: none). Refuses
+// to replace one of the images, or a file that silvan-ortho did not write for images.
+std::string ReplacedImageMaster(const Options& options) {
     std::error_code ec;
-    fs::create_directories(options.outDir, ec);
-    if (ec || !fs::is_directory(options.outDir, ec))
-        throw UsageError("--out: " + options.outDir + ": the output directory cannot be created");
-    if (fs::exists(path, ec)) {
-        for (const std::string& image : options.images) {
-            if (fs::equivalent(image, path, ec))
-                throw UsageError(image + ": this image would be replaced by the master file " +
-                                 "written for the images; choose another --out");
-        }
-        std::ifstream in(path, std::ios::binary);
-        const std::string old((std::istreambuf_iterator<char>(in)),
-                              std::istreambuf_iterator<char>());
-        const std::string header = std::string(kImageMasterHeader) + "\n";
-        if (old.compare(0, header.size(), header) != 0)
-            throw UsageError(path +
-                             " exists and was not written by silvan-ortho for images; "
-                             "choose another --out, or run that master file");
-        if (old == text) {
-            options.master = path;
-            return;
-        }
+    if (!fs::exists(options.master, ec))
+        return "";
+    for (const std::string& image : options.images) {
+        if (fs::equivalent(image, options.master, ec))
+            throw UsageError(image + ": this image would be replaced by the master file " +
+                             "written for the images; choose another --out");
     }
-    WriteFileAtomically(path, text);
-    options.master = path;
+    std::ifstream in(options.master, std::ios::binary);
+    const std::string old((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    const std::string header = std::string(kImageMasterHeader) + "\n";
+    if (old.compare(0, header.size(), header) != 0)
+        throw UsageError(options.master +
+                         " exists and was not written by silvan-ortho for images; "
+                         "choose another --out, or run that master file");
+    return old;
+}
+
+}  // namespace
+
+void PlanImageMaster(Options& options) {
+    ImageMasterText(options.images, options.outDir);
+    options.master = ImageMasterPath(options.outDir);
+    ReplacedImageMaster(options);
+}
+
+void WriteImageMaster(const Options& options) {
+    const std::string text = ImageMasterText(options.images, options.outDir);
+    if (ReplacedImageMaster(options) != text)
+        WriteFileAtomically(options.master, text);
 }
 
 }  // namespace ortho

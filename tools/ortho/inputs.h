@@ -23,9 +23,13 @@ std::string ImageMasterPath(const std::string& outDir);
 // that a master file cannot hold (";", a line end, blanks around it).
 std::string ImageMasterText(const std::vector<std::string>& images, const std::string& masterDir);
 
-// Writes the master file of options.images into options.outDir (created when missing), unless
-// it holds those lines already, and points options.master at it. Refuses, with a UsageError, to
-// replace a file there that it did not write or one of the images.
-void WriteImageMaster(Options& options);
+// Points options.master at the master file for options.images, DIR/master.txt, after checking
+// that it can be written: every image path can be held, and no file there would be replaced
+// that silvan-ortho did not write for images (nor an image). Throws UsageError.
+void PlanImageMaster(Options& options);
+
+// Writes that master file (the output directory exists), unless it holds those lines already.
+// Throws UsageError as PlanImageMaster, FileAccessException when it cannot be written.
+void WriteImageMaster(const Options& options);
 
 }  // namespace ortho

@@ -30,8 +30,7 @@ void PrintScenes(const ortho::RunSummary& summary, const std::string& summaryPat
 }
 
 // Parses and checks the command line before any work: the options, what the named files are,
-// the values the library interprets. Prints what is wrong and returns 2 (1 when the master
-// file for images cannot be written), or 0 to go on (with
+// the values the library interprets. Prints what is wrong and returns 2, or 0 to go on (with
 // the lines worth telling the user in notes). --help and --version print and return -1.
 int ReadCommandLine(int argc, char** argv, ortho::Options& options,
                     std::vector<std::string>& notes) {
@@ -48,14 +47,12 @@ int ReadCommandLine(int argc, char** argv, ortho::Options& options,
         ortho::ResolveInputs(options);
         notes = ortho::CheckOptions(options);
         if (!options.images.empty())
-            ortho::WriteImageMaster(options);
+            ortho::PlanImageMaster(options);
         return 0;
     } catch (const ortho::UsageError& e) {
         std::fprintf(stderr, "silvan-ortho: %s\n(silvan-ortho --help shows the usage)\n", e.what());
     } catch (const std::exception& e) {
-        // Not the command line: the master file for the images cannot be written.
         std::fprintf(stderr, "silvan-ortho: %s\n", ortho::Explain(e).c_str());
-        return 1;
     }
     return 2;
 }

@@ -1,6 +1,7 @@
 #include "workflow.h"
 
 #include "files.h"
+#include "inputs.h"
 #include "interrupt.h"
 
 #include <silvan/parserfactory.h>
@@ -327,6 +328,9 @@ void Workflow::Prepare() {
         refused_ = true;
         throw RunError(e.what());
     }
+    // Images given instead of a master file: their master file, written under the lock.
+    if (!options_.images.empty())
+        WriteImageMaster(options_);
 
     // The master file gives the two derived files; the process reads them back as the
     // preparation and gap-filling processes would.
