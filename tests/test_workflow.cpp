@@ -619,15 +619,17 @@ int Wait(pid_t pid) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
 }
 
-// While a run works on a directory a second run there is refused at once, naming it; Ctrl-C
-// stops the first, which removes its temporary files and reports itself cancelled; a run that
-// crashed leaves no lock behind.
+// While a run works on a directory (held still, so that it cannot end meanwhile) a second run
+// there is refused at once, naming it; Ctrl-C stops the first, which removes its temporary files
+// and reports itself cancelled. Slices share the directory with each other, not with a whole
+// run. A run that crashed leaves no lock behind.
 TEST(Workflow, InterruptAndLock) {
     TempDir dir;
     const std::vector<std::string> args = MakeSample(dir);
 
     const pid_t first = Start(args, dir);
     ASSERT_TRUE(AtWork(first, dir)) << ReadFile(dir.File("background.txt"));
+    ASSERT_EQ(kill(first, SIGSTOP), 0);
     const Result second = Ortho(args, dir);
     EXPECT_EQ(second.status, 1);
     EXPECT_NE(second.err.find(dir.File("out") + " is in use by another silvan-ortho run: process " +
@@ -635,15 +637,34 @@ TEST(Workflow, InterruptAndLock) {
               std::string::npos)
         << second.err;
     EXPECT_FALSE(std::filesystem::exists(dir.Path() / "out/summary.json"));
-
     ASSERT_EQ(kill(first, SIGINT), 0);
+    ASSERT_EQ(kill(first, SIGCONT), 0);
     EXPECT_EQ(Wait(first), 130) << ReadFile(dir.File("background.txt"));
     EXPECT_EQ(TemporaryFiles(dir.Path() / "out"), std::vector<std::string>());
     CPLJSONDocument summary;
     ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
     EXPECT_EQ(summary.GetRoot().GetString("status"), "cancelled");
 
-    const pid_t crashed = Start(args, dir);
+    const auto slice = [&](const char* lines) {
+        std::vector<std::string> sliced = args;
+        sliced.insert(sliced.end(), {"--lines", lines});
+        return sliced;
+    };
+    const pid_t firstSlice = Start(slice("0:2"), dir);
+    ASSERT_TRUE(AtWork(firstSlice, dir));
+    ASSERT_EQ(kill(firstSlice, SIGSTOP), 0);
+    const Result whole = Ortho(args, dir);
+    EXPECT_EQ(whole.status, 1);
+    EXPECT_NE(whole.err.find("process " + std::to_string(firstSlice) + " (--lines 0:2)"),
+              std::string::npos)
+        << whole.err;
+    EXPECT_EQ(Ortho(slice("2:"), dir).status, 0);
+    ASSERT_EQ(kill(firstSlice, SIGCONT), 0);
+    EXPECT_EQ(Wait(firstSlice), 0) << ReadFile(dir.File("background.txt"));
+
+    std::vector<std::string> again = args;
+    again.push_back("--overwrite");
+    const pid_t crashed = Start(again, dir);
     ASSERT_TRUE(AtWork(crashed, dir));
     ASSERT_EQ(kill(crashed, SIGKILL), 0);
     EXPECT_EQ(Wait(crashed), -SIGKILL);

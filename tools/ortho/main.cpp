@@ -73,7 +73,8 @@ int main(int argc, char** argv) {
         ortho::Workflow workflow(options, progress);
         const int status = workflow.Run();
         progress.Done();
-        if (!options.quiet)
+        // A run refused (another one works on the directory) has nothing to list.
+        if (!options.quiet && !workflow.SummaryPath().empty())
             PrintScenes(workflow.Summary(), workflow.SummaryPath());
         return status;
     } catch (const std::exception& e) {

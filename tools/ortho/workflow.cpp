@@ -199,6 +199,14 @@ std::string SameFileKey(const std::string& path) {
     return text;
 }
 
+// The program and the libraries that made an output: a new version may make other pixels.
+std::string ProgramVersion() {
+    std::string text = VersionText();
+    while (!text.empty() && (text.back() == '\n' || text.back() == '\r'))
+        text.pop_back();
+    return text;
+}
+
 std::string SurfacePath(const Options& options) {
     return options.dem.empty() ? options.tin : options.dem;
 }
@@ -323,7 +331,13 @@ void Workflow::Prepare() {
         lock_ = std::make_unique<RunLock>(
             outDir_, options_.hasLines,
             "process " + std::to_string(ProcessId()) +
-                (options_.hasLines ? " (" + SummaryName() + ")" : std::string()));
+                (options_.hasLines
+                     ? " (--lines " + std::to_string(options_.firstLine) + ":" +
+                           (options_.endLine == std::numeric_limits<unsigned int>::max()
+                                ? std::string()
+                                : std::to_string(options_.endLine)) +
+                           ")"
+                     : std::string()));
     } catch (const std::runtime_error& e) {
         refused_ = true;
         throw RunError(e.what());
@@ -531,6 +545,7 @@ Manifest Workflow::GridInputs() {
     // The scenes' layouts depend on the surface, the options that move footprints and every
     // line's source and columns, including those of other slices.
     Manifest inputs;
+    inputs.Set("program", ProgramVersion());
     for (const PixelOption& option : PixelOptions()) {
         if (option.movesFootprints)
             inputs.Set(option.name, option.value(options_));
@@ -589,6 +604,7 @@ void Workflow::MakeGrid() {
 void Workflow::RecordInputs(Scene& scene) {
     Manifest& made = scene.madeFrom;
     made.Set("master line", scene.columns);
+    made.Set("program", ProgramVersion());
     for (const PixelOption& option : PixelOptions())
         made.Set(option.name, option.value(options_));
     made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
@@ -802,6 +818,7 @@ void Workflow::Recover() {
     std::vector<RecoveryScene> inputs;
     std::vector<FootprintLayer> layers;
     Manifest made;
+    made.Set("program", ProgramVersion());
     for (const PixelOption& option : PixelOptions())
         made.Set(option.name, option.value(options_));
     made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
