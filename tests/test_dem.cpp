@@ -1,6 +1,7 @@
 // Raster DEMs: bilinear heights between posts and no-data left out, files, directories and tile
 // indexes alike, the block cache under threads, constant DEMs, vertical datum conversion against
-// PROJ's own answers, and the errors for inputs that cannot be used.
+// PROJ's own answers, height ranges and holes of a window, and the errors for inputs that
+// cannot be used (remote tiles included).
 #include <kestrel/dem.h>
 
 #include "demdata.h"
@@ -273,7 +274,7 @@ TEST_F(Dem, TileIndexNamesOnlyLocalFiles) {
             std::unique_ptr<OGRFeature> second(first->Clone());
             second->SetFID(2);
             second->SetField("location", location);
-            if (layer->GetFeature(2) == nullptr)
+            if (!std::unique_ptr<OGRFeature>(layer->GetFeature(2)))
                 ASSERT_EQ(layer->CreateFeature(second.get()), OGRERR_NONE);
             else
                 ASSERT_EQ(layer->SetFeature(second.get()), OGRERR_NONE);
@@ -434,6 +435,10 @@ TEST(ConstantDem, ConstantInItsDatumFollowingTheGeoidInTheOther) {
     // Between posts, within 1 mm of PROJ's answer (162.513403, see above).
     ASSERT_TRUE(dem->GetHeight(515000, 5034000, h));
     EXPECT_NEAR(h, 162.513403, 1e-3);
+    // The range follows the converted posts (cells of 16 posts: the geoid over a kilometre).
+    double low = NAN, high = NAN;
+    ASSERT_TRUE(dem->GetHeightRange(514900, 5033900, 515100, 5034100, low, high));
+    EXPECT_TRUE(low <= h && h <= high && high - low < 0.5) << low << " " << high;
 }
 
 TEST(DemErrors, EachNamesWhatIsWrong) {

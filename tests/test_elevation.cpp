@@ -142,7 +142,7 @@ std::string MessageOf(const std::function<void()>& f) {
 
 }  // namespace
 
-TEST(VertDatum, KeywordsInAnyCaseAndTheirPrefix) {
+TEST(VertDatum, KeywordsInAnyCaseAndTheirPrefixOthersNamedAsGiven) {
     const std::pair<const char*, DatumType> cases[] = {
         {"", DatumMSL},
         {"MSL", DatumMSL},
@@ -156,9 +156,7 @@ TEST(VertDatum, KeywordsInAnyCaseAndTheirPrefix) {
     };
     for (const auto& c : cases)
         EXPECT_EQ(GetVertDatum(c.first), c.second) << c.first;
-}
-
-TEST(VertDatum, OtherTextsNamedAsGiven) {
+    // Other texts are named as given.
     for (const char* text : {" MSL", "MSL ", "EL", "geoid", "mathmodel2"}) {
         EXPECT_EQ(MessageOf([&] { GetVertDatum(text); }),
                   std::string("Unrecognized value for -elevref: permissible values are MSL, "
@@ -315,15 +313,7 @@ TEST_F(Factories, ConstantDemSwapsItsSizesAndDownsamples128) {
     EXPECT_EQ(dem->GetOutputVerticalDatum(), DatumMathModel);
 }
 
-TEST_F(Factories, DbmNullForEmptyPathOrNoReader) {
-    EXPECT_EQ(GetDbm("", 1, 0, 1, DatumMSL, DatumEllipsoid), nullptr);
-    EXPECT_TRUE(tins->calls.empty());
-    tins->fail = true;
-    EXPECT_EQ(GetDbm("a.gpkg", 2, 0.5, 3, DatumMSL, DatumEllipsoid), nullptr);
-    EXPECT_EQ(tins->calls, Calls{Call("CreateTinReader", "a.gpkg", 2, 0.5, 3, 2001)});
-}
-
-TEST_F(Factories, DbmGetsItsArgumentsAndTheOutputDatumRule) {
+TEST_F(Factories, DbmGetsItsArgumentsAndTheOutputDatumRuleOrGivesNull) {
     const std::pair<DatumType, DatumType> cases[] = {{DatumMSL, DatumEllipsoid},
                                                      {DatumMathModel, DatumMathModel}};
     for (const auto& c : cases) {
@@ -334,6 +324,13 @@ TEST_F(Factories, DbmGetsItsArgumentsAndTheOutputDatumRule) {
                   Calls{Call("CreateTinReader", "t.gpkg", 0, -2, 0.5, static_cast<int>(c.first))});
         EXPECT_EQ(tin->GetOutputVerticalDatum(), c.second);
     }
+    // Null for an empty path (no factory asked) and for a path with no TIN.
+    tins->calls.clear();
+    EXPECT_EQ(GetDbm("", 1, 0, 1, DatumMSL, DatumEllipsoid), nullptr);
+    EXPECT_TRUE(tins->calls.empty());
+    tins->fail = true;
+    EXPECT_EQ(GetDbm("a.gpkg", 2, 0.5, 3, DatumMSL, DatumEllipsoid), nullptr);
+    EXPECT_EQ(tins->calls, Calls{Call("CreateTinReader", "a.gpkg", 2, 0.5, 3, 2001)});
 }
 
 TEST(IsFile, FilesAndDirectoriesExist) {

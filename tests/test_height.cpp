@@ -1,5 +1,6 @@
 // silvan-height against gdallocationinfo -valonly at the posts of a raster DEM, a tile index of
-// it and a TIN of its posts, and its answers to bad arguments and input lines.
+// it and a TIN of its posts; against gdallocationinfo plus cs2cs for every combination of unit,
+// datum and vertical CRS; and its (and silvan-ortho's) answers to bad arguments and input lines.
 #include "demdata.h"
 #include "support.h"
 

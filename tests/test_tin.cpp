@@ -1,6 +1,7 @@
 // TIN readers: a TIN made of a DEM's posts (as 3-D points or as triangles, in GeoPackage and
 // Shapefile) gives the DEM's heights at the posts and planes between them; files without a
-// surface give null, and a named layer that holds something else an error.
+// surface give null, and a named layer that holds something else an error; units of the CRS,
+// outliers and slivers.
 #include <kestrel/tin.h>
 
 #include "../platform/src/tin/tinreader.h"

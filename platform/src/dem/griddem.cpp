@@ -159,8 +159,6 @@ bool GridDEM::GetHeightRange(double minX, double minY, double maxX, double maxY,
     PixelArea window;
     if (!PixelWindow(minX, minY, maxX, maxY, window))
         return false;
-    if (!frame_.OwnRectangle(minX, minY, maxX, maxY))
-        return false;
     // The posts that a bilinear height in the window weighs: those around each point.
     const PostSource& posts = *posts_;
     const unsigned int i0 = ClampPost(std::floor(window.left - 0.5), posts.width);
@@ -189,8 +187,14 @@ bool GridDEM::GetHeightRange(double minX, double minY, double maxX, double maxY,
     }
     if (!(low <= high))
         return false;
-    if (!postsConverted_)
-        frame_.WidenToOutput(minX, minY, maxX, maxY, low, high);
+    if (!postsConverted_) {
+        // The change of datum over the window's own rectangle.
+        double x0, y0, x1, y1;
+        geocoding_.PixelToGround(window.left, window.top, x0, y0);
+        geocoding_.PixelToGround(window.right, window.bottom, x1, y1);
+        frame_.WidenToOutput(std::min(x0, x1), std::min(y0, y1), std::max(x0, x1),
+                             std::max(y0, y1), low, high);
+    }
     if (!(low <= high))
         return false;
     lowest = low;
