@@ -259,11 +259,16 @@ bool IsDirectory(const std::string& path) {
     return VSIStatL(path.c_str(), &stat) == 0 && VSI_ISDIR(stat.st_mode);
 }
 
-std::vector<std::string> RastersIn(const std::string& directory) {
+std::vector<std::string> RastersIn(const std::string& directory, std::size_t limit) {
     std::vector<std::string> rasters;
-    const CPLStringList names(VSIReadDir(directory.c_str()));
-    for (int i = 0; i < names.size(); ++i) {
-        const std::string name = names[i];
+    const CPLStringList listed(VSIReadDir(directory.c_str()));
+    std::vector<std::string> names;
+    for (int i = 0; i < listed.size(); ++i)
+        names.emplace_back(listed[i]);
+    std::sort(names.begin(), names.end());
+    for (const std::string& name : names) {
+        if (limit != 0 && rasters.size() >= limit)
+            break;
         if (name == "." || name == "..")
             continue;
         const std::string full = CPLFormFilename(directory.c_str(), name.c_str(), nullptr);
@@ -284,7 +289,6 @@ std::vector<std::string> RastersIn(const std::string& directory) {
                       FormatString("The DEM directory %s holds no raster that GDAL reads",
                                    directory.c_str()));
     }
-    std::sort(rasters.begin(), rasters.end());
     return rasters;
 }
 

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cmath>
+#include <cstddef>
 #include <memory>
 #include <string>
 #include <vector>
@@ -28,8 +29,9 @@ using DatasetPtr = std::unique_ptr<GDALDataset, void (*)(GDALDataset*)>;
 DatasetPtr NoDataset();
 
 bool IsDirectory(const std::string& path);
-// The rasters GDAL recognises in a directory, sorted by name; FileNotFoundException when none.
-std::vector<std::string> RastersIn(const std::string& directory);
+// The rasters GDAL recognises in a directory, sorted by name, the first limit of them (0: all);
+// FileNotFoundException when none.
+std::vector<std::string> RastersIn(const std::string& directory, std::size_t limit = 0);
 
 // A raster GDAL opens, or a directory of such rasters mosaicked. Throws a kestrel exception
 // naming the path and the reason when it cannot be used.

@@ -42,7 +42,7 @@ VerticalReference ReadVerticalReference(const std::string& path) {
     if (path.empty() || VSIStatL(path.c_str(), &stat) != 0)
         KESTREL_THROW(FileNotFoundException, path, FormatString("%s: not found", path.c_str()));
     if (IsDirectory(path))
-        return ReadVerticalReference(RastersIn(path).front());
+        return ReadVerticalReference(RastersIn(path, 1).front());
     if (IsTileIndex(path))
         return TileIndexVerticalReference(path);
     gdalsupport::ErrorCapture errors;
