@@ -13,6 +13,7 @@
 #include <cstdio>
 #include <filesystem>
 #include <functional>
+#include <limits>
 #include <memory>
 #include <sstream>
 
@@ -74,6 +75,55 @@ TEST(SampleCity, RpcsAgreeWithTheCameraThroughGdalsTransformer) {
             ASSERT_TRUE(out >> col >> row >> z);
             EXPECT_NEAR(col, e.first, 0.01);
             EXPECT_NEAR(row, e.second, 0.01);
+        }
+    }
+}
+
+// The grid-to-image projection interpolated on its lattice stays within its bound of the exact
+// one, on an oblique RPC image from 400 m (strong perspective) over buildings, at the surface's
+// heights and at heights spread over its whole range in every pixel.
+TEST(GridProjection, InterpolationStaysWithinItsBoundOfTheExactProjection) {
+    TempDir dir;
+    samplecity::CityOptions options = samplecity::SmallCity();
+    options.cameras = {{"oblique", 20.0, 30.0, 400.0, 512, 512, 0.5}};
+    const samplecity::Sample sample = samplecity::MakeSample(dir.Path().string(), options, 2);
+    const samplecity::RpcModel model(sample.images[0].path);
+    samplecity::GridSurface surface(sample.dsmPath);
+    const kestrel::ogc::cs::ICRS utm(options.crs);
+    const kestrel::ogc::cs::CoordinateTransformation toModel(utm, *model.GetCRS());
+    const auto grid = kestrel::ogc::cs::GeocodingInfo::NorthUp(
+        options.west, options.south + options.sizeY, 0.5, 0.5);
+    const int x0 = 40, y0 = 60, width = 300, height = 280;
+    const size_t n = static_cast<size_t>(width) * height;
+    std::vector<double> x(n), y(n), onSurface(n), spread(n);
+    for (int j = 0; j < height; ++j)
+        for (int i = 0; i < width; ++i)
+            grid.PixelToGround(x0 + i + 0.5, y0 + j + 0.5, x[j * width + i], y[j * width + i]);
+    surface.GetHeights(n, x.data(), y.data(), onSurface.data());
+    for (size_t k = 0; k < n; ++k)
+        spread[k] = 250.0 + 35.0 * ((k * 7919) % 1000) / 999.0;
+    for (const std::vector<double>* heights : {&onSurface, &spread}) {
+        std::vector<double> col(n), row(n), exactCol(n), exactRow(n);
+        std::unique_ptr<bool[]> ok(new bool[n]), exactOk(new bool[n]);
+        kestrel::processes::GridProjection exact(grid, model, &toModel, 0.0);
+        exact.Project(x0, y0, width, height, heights->data(), exactCol.data(), exactRow.data(),
+                      exactOk.get());
+        EXPECT_EQ(exact.LastStep(), 0);
+        for (const double bound : {0.05, 0.01}) {
+            SCOPED_TRACE(bound);
+            kestrel::processes::GridProjection fast(grid, model, &toModel, bound);
+            fast.Project(x0, y0, width, height, heights->data(), col.data(), row.data(),
+                         ok.get());
+            EXPECT_GE(fast.LastStep(), 4);  // interpolated, not exact in disguise
+            double largest = 0;
+            for (size_t k = 0; k < n; ++k) {
+                ASSERT_EQ(ok[k], exactOk[k]) << k;
+                if (ok[k])
+                    largest = std::max(largest, std::hypot(col[k] - exactCol[k],
+                                                           row[k] - exactRow[k]));
+            }
+            EXPECT_LE(largest, bound);
+            EXPECT_GT(largest, 0.0);
         }
     }
 }
@@ -226,13 +276,17 @@ TEST_F(BoxFixture, VisibleGroundMatchesGdalwarpWithin1) {
     // image (its RPC inversion fails off the DEM).
     UsePixel(0.4, 10.0);
     const std::string reference = dir.File("gdalwarp.tif");
-    for (const char* method : {"bilinear", "cubic"}) {
+    for (const std::string method : {"bilinear", "cubic", "cubicspline", "lanczos"}) {
         const std::string command = FormatCommand(reference, method);
         ASSERT_EQ(std::system(command.c_str()), 0) << command;
-        // The generator's own kernel, and the platform's resampler given in the job.
+        // The generator's own kernel where it has one, and the platform's resampler given in
+        // the job.
         const std::unique_ptr<kestrel::utils::IRasterResampler> resampler(
             kestrel::utils::ResamplerFactory().GetResampler(method));
+        const bool own = method == "bilinear" || method == "cubic";
         for (const bool given : {false, true}) {
+            if (!given && !own)
+                continue;
             TorthoJob job = Job();
             job.resampling = method;
             job.resampler = given ? resampler.get() : nullptr;
@@ -269,17 +323,66 @@ TEST_F(BoxFixture, VisibleGroundMatchesGdalwarpWithin1) {
     }
 }
 
-TEST_F(BoxFixture, TwoThreadsWriteWhatOneWrites) {
-    std::vector<std::vector<double>> outputs[2];
-    for (unsigned int threads : {1u, 2u}) {
+// A surface with one spot (half a metre around a ground point) whose heights are replaced.
+class SpikedSurface : public samplecity::GridSurface {
+  public:
+    SpikedSurface(const std::string& path, double x, double y, double value)
+        : GridSurface(path), x_(x), y_(y), value_(value) {}
+    void GetHeights(std::size_t n, const double* x, const double* y,
+                    double* heights) const override {
+        GridSurface::GetHeights(n, x, y, heights);
+        for (std::size_t k = 0; k < n; ++k)
+            if (std::fabs(x[k] - x_) < 0.5 && std::fabs(y[k] - y_) < 0.5)
+                heights[k] = value_;
+    }
+
+  private:
+    double x_, y_, value_;
+};
+
+// Two threads, more threads than tiles (capped before anything is made for them) and an
+// infinite post (no height there, and no tile widened by it) write what one thread writes on
+// clean data, but for the spot without height.
+TEST_F(BoxFixture, ThreadCountsAndAnInfinitePostChangeNothingElse) {
+    auto run = [&](unsigned int threads, const kestrel::dem::IElevationSource* spiked) {
         kestrel::processes::GeneratorSettings settings;
         settings.threadCount = threads;
-        ASSERT_TRUE(TorthoGenerator(settings).Generate(Job()).completed);
+        TorthoJob job = Job();
+        if (spiked != nullptr)
+            job.surface = const_cast<kestrel::dem::IElevationSource*>(spiked);
+        EXPECT_TRUE(TorthoGenerator(settings).Generate(job).completed);
+        std::vector<std::vector<double>> out;
         for (int band = 1; band <= 3; ++band)
-            outputs[threads - 1].push_back(ReadBand(dir.File("ortho.tif"), band));
-        outputs[threads - 1].push_back(ReadBand(dir.File("visibility.tif")));
+            out.push_back(ReadBand(dir.File("ortho.tif"), band));
+        out.push_back(ReadBand(dir.File("visibility.tif")));
+        return out;
+    };
+    const std::vector<std::vector<double>> clean = run(1, nullptr);
+    const SpikedSurface infinite(sample.dsmPath, options.west + 30.3, options.south + 30.3,
+                                 std::numeric_limits<double>::infinity());
+    const struct {
+        const char* name;
+        unsigned int threads;
+        const SpikedSurface* surface;
+    } cases[] = {{"two threads", 2, nullptr},
+                 {"more threads than tiles", std::numeric_limits<unsigned int>::max(), nullptr},
+                 {"an infinite post", 1, &infinite}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.name);
+        const std::vector<std::vector<double>> out = run(c.threads, c.surface);
+        ASSERT_EQ(out.size(), clean.size());
+        size_t noHeight = 0, differing = 0;
+        for (size_t k = 0; k < out[3].size(); ++k) {
+            if (out[3][k] == kestrel::processes::VISIBILITY_NODATA) {
+                ++noHeight;
+                continue;
+            }
+            for (const size_t b : {0, 1, 2, 3})
+                differing += out[b][k] != clean[b][k];
+        }
+        EXPECT_EQ(differing, 0u);
+        EXPECT_EQ(noHeight, c.surface != nullptr ? 4u : 0u);
     }
-    EXPECT_TRUE(outputs[0] == outputs[1]);
 }
 
 // No output, final or partial, is left in the directory.

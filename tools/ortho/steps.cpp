@@ -546,6 +546,35 @@ class RecoveryProcess : public StepProcess {
     kestrel::processes::TorthoRecoveryResult result_;
 };
 
+// Source pixels per output pixel, along the grid's pixels and lines, at the grid's centre on
+// the surface: the footprint of the area methods (average, mode) and the widening of the other
+// kernels where the ortho is coarser than the image, as in gdalwarp. Left as it is where the
+// centre has no height or no image position.
+void SetSourceStep(kestrel::utils::IRasterResampler& resampler,
+                   const kestrel::mathmodel::IMathModel& model,
+                   kestrel::dem::IElevationSource& surface, const Grid& grid,
+                   const kestrel::ogc::cs::ICRS& crs) {
+    const kestrel::ogc::cs::GeocodingInfo geocoding(grid.geoTransform);
+    const double p = grid.pixels / 2.0, l = grid.lines / 2.0;
+    double x[3], y[3], z[3], col[3], row[3];
+    bool ok[3];
+    geocoding.PixelToGround(p, l, x[0], y[0]);
+    geocoding.PixelToGround(p + 1, l, x[1], y[1]);
+    geocoding.PixelToGround(p, l + 1, x[2], y[2]);
+    surface.SetInputCRS(&crs);
+    if (!surface.GetHeight(x[0], y[0], z[0]) || !std::isfinite(z[0]))
+        return;
+    z[1] = z[2] = z[0];
+    if (model.GetCRS() != nullptr && !model.GetCRS()->IsSame(crs))
+        kestrel::ogc::cs::CoordinateTransformation(crs, *model.GetCRS()).Transform(3, x, y);
+    model.GroundToImage(3, x, y, z, col, row, ok);
+    const double stepX = std::hypot(col[1] - col[0], row[1] - row[0]);
+    const double stepY = std::hypot(col[2] - col[0], row[2] - row[0]);
+    if (ok[0] && ok[1] && ok[2] && stepX > 1e-3 && stepY > 1e-3 && stepX <= 1000 &&
+        stepY <= 1000)
+        resampler.SetSourceStep(stepX, stepY);
+}
+
 }  // namespace
 
 OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Grid& grid,
@@ -559,6 +588,13 @@ OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Gri
     const kestrel::ogc::cs::ICRS crs(grid.crs);
 
     kestrel::processes::TorthoJob job;
+    // The generator's own kernels for the methods it has; the platform's resampler, with the
+    // source step of this grid, for the others.
+    const std::string name = resampler->GetMethod();
+    if (name != "near" && name != "bilinear" && name != "cubic") {
+        SetSourceStep(*resampler, *model, *surface, grid, crs);
+        job.resampler = resampler.get();
+    }
     job.sourcePath = scene.source;
     job.channels = scene.channels;
     job.model = model.get();
@@ -668,21 +704,26 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     if (!source)
         FailFile(raster, "cannot be opened", errors);
     const int width = source->GetRasterXSize(), height = source->GetRasterYSize();
-    const double shrink = std::max(1.0, width / 2048.0);
+    // At most 2048 pixels on the long side, read decimated.
+    const double shrink = std::max(1.0, std::max(width, height) / 2048.0);
     const int outWidth = std::max(1, static_cast<int>(width / shrink));
     const int outHeight = std::max(1, static_cast<int>(height / shrink));
     const std::size_t count = static_cast<std::size_t>(outWidth) * outHeight;
     const int bands = kind == Quicklook::Image ? std::min(3, source->GetRasterCount()) : 1;
 
-    // Pixels at the quicklook's size, and where they hold no data.
-    std::vector<std::vector<double>> values(static_cast<std::size_t>(bands));
+    // Pixels at the quicklook's size, every band in one pass over the file, and where they hold
+    // no data.
+    std::vector<double> all(count * static_cast<std::size_t>(bands));
+    std::vector<int> bandList(static_cast<std::size_t>(bands));
+    std::vector<const double*> values(static_cast<std::size_t>(bands));
+    for (int b = 0; b < bands; ++b)
+        bandList[b] = b + 1, values[b] = all.data() + count * static_cast<std::size_t>(b);
+    if (source->RasterIO(GF_Read, 0, 0, width, height, all.data(), outWidth, outHeight,
+                         GDT_Float64, bands, bandList.data(), 0, 0, 0, nullptr) != CE_None)
+        FailFile(raster, "cannot be read", errors);
     std::vector<bool> empty(count, false);
     for (int b = 0; b < bands; ++b) {
         GDALRasterBand* band = source->GetRasterBand(b + 1);
-        values[b].resize(count);
-        if (band->RasterIO(GF_Read, 0, 0, width, height, values[b].data(), outWidth, outHeight,
-                           GDT_Float64, 0, 0, nullptr) != CE_None)
-            FailFile(raster, "cannot be read", errors);
         int hasNoData = 0;
         const double noData = band->GetNoDataValue(&hasNoData);
         for (std::size_t i = 0; i < count; ++i) {
@@ -695,15 +736,23 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     std::vector<std::vector<unsigned char>> rgba(4, std::vector<unsigned char>(count, 0));
     if (kind == Quicklook::Image) {
         for (int b = 0; b < bands; ++b) {
-            // Stretch between the 2nd and 98th percentiles of the pixels with data.
-            std::vector<double> sorted;
+            // Stretch between the 2nd and 98th percentiles of the pixels with data (selected,
+            // not sorted: the quicklook has millions of them).
+            std::vector<double> data;
+            data.reserve(count);
             for (std::size_t i = 0; i < count; ++i) {
                 if (!empty[i])
-                    sorted.push_back(values[b][i]);
+                    data.push_back(values[b][i]);
             }
-            std::sort(sorted.begin(), sorted.end());
-            const double low = sorted.empty() ? 0.0 : sorted[sorted.size() * 2 / 100];
-            const double high = sorted.empty() ? 1.0 : sorted[sorted.size() * 98 / 100];
+            auto percentile = [&data](std::size_t share, double none) {
+                if (data.empty())
+                    return none;
+                const auto at = data.begin() + static_cast<std::ptrdiff_t>(data.size() * share / 100);
+                std::nth_element(data.begin(), at, data.end());
+                return *at;
+            };
+            const double low = percentile(2, 0.0);
+            const double high = percentile(98, 1.0);
             const double scale = high > low ? 254.0 / (high - low) : 0.0;
             for (std::size_t i = 0; i < count; ++i) {
                 const double v = 1.0 + (values[b][i] - low) * scale;
@@ -739,8 +788,10 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     }
     picture->GetRasterBand(4)->SetColorInterpretation(GCI_AlphaBand);
     RemoveFile(png);
-    DatasetPtr written(
-        pngDriver->CreateCopy(png.c_str(), picture.get(), FALSE, nullptr, nullptr, nullptr));
+    // The fastest deflate level: a quicklook is looked at, not archived.
+    const char* const fast[] = {"ZLEVEL=1", nullptr};
+    DatasetPtr written(pngDriver->CreateCopy(png.c_str(), picture.get(), FALSE,
+                                             const_cast<char**>(fast), nullptr, nullptr));
     if (!written)
         FailFile(png, "cannot be written", errors);
     written.reset();

@@ -35,15 +35,40 @@ struct Worker;
 
 // How far, in output pixels, the surface that can hide a tile's ground reaches beyond the tile
 // on each side: the line of sight's ground displacement per metre of height, largest over the
-// points added, times the surface's height range.
+// points added, times the height range between the tile's lowest ground and the highest surface
+// within that reach.
 struct Extension {
     double left = 0, right = 0, up = 0, down = 0;
     bool any = false;
     // The line of sight at grid position (p, l); inImage tells whether the point is seen in the
     // image's frame at all.
     void Add(const Plan& plan, Worker& w, double p, double l, bool* inImage = nullptr);
-    void Apply(const Plan& plan, int& extendLeft, int& extendRight, int& extendUp,
-               int& extendDown) const;
+    // Pixels on each side for a height range in metres.
+    void Apply(const Plan& plan, double heightRange, int& extendLeft, int& extendRight,
+               int& extendUp, int& extendDown) const;
+};
+
+// The lowest and highest surface in blocks of the output grid, from the survey's sample: a
+// tile's first estimate of its height range.
+struct HeightBlocks {
+    static constexpr int kSize = 32;  // output pixels per block side
+    int columns = 0, rows = 0;
+    std::vector<float> low, high;  // +inf / -inf where the sample found no height
+    // The range over the blocks that meet pixels [x0, x1) x [y0, y1), clipped to the grid; false
+    // where none has a height.
+    bool Range(int x0, int y0, int x1, int y1, double& lowest, double& highest) const {
+        const int i0 = std::max(x0, 0) / kSize, j0 = std::max(y0, 0) / kSize;
+        const int i1 = std::min((std::max(x1, 1) - 1) / kSize, columns - 1);
+        const int j1 = std::min((std::max(y1, 1) - 1) / kSize, rows - 1);
+        lowest = std::numeric_limits<double>::infinity(), highest = -lowest;
+        for (int j = j0; j <= j1; ++j)
+            for (int i = i0; i <= i1; ++i) {
+                const size_t k = static_cast<size_t>(j) * columns + i;
+                lowest = std::min(lowest, static_cast<double>(low[k]));
+                highest = std::max(highest, static_cast<double>(high[k]));
+            }
+        return lowest <= highest;
+    }
 };
 
 // The output grid and everything each tile needs from it, fixed before the tiles run.
@@ -59,10 +84,10 @@ struct Plan {
     std::mutex* readLock = nullptr;
     std::vector<char> hasNoData;
     std::vector<float> noData;
-    // Output pixels by which a tile's surface is extended on each side so that every surface
-    // that can stand between the tile's ground and the sensor is projected.
-    double heightRange = 0;  // metres between the lowest and the highest surface, plus 1
-    Extension global;        // for tiles whose corners have no line of sight
+    // What sizes each tile's extension, so that every surface that can stand between the
+    // tile's ground and the sensor is projected.
+    HeightBlocks blocks;
+    Extension global;  // for tiles whose corners have no line of sight
     const ogc::cs::CoordinateTransformation* toModel = nullptr;  // null: same CRS
 };
 
@@ -150,6 +175,7 @@ class TileOutput {
 struct Worker {
     DatasetPtr source;
     std::unique_ptr<ogc::cs::CoordinateTransformation> toModel;
+    std::unique_ptr<GridProjection> projection;
     std::vector<double> x, y, h, mx, my, col, row;
     std::unique_ptr<bool[]> ok;
     size_t okSize = 0;
@@ -170,7 +196,7 @@ void Extension::Add(const Plan& plan, Worker& w, double p, double l, bool* inIma
     for (int k = 0; k < 4; ++k)
         job.geocoding.PixelToGround(px[k], py[k], gx[k], gy[k]);
     double h;
-    if (!job.surface->GetHeight(gx[0], gy[0], h))
+    if (!job.surface->GetHeight(gx[0], gy[0], h) || !std::isfinite(h))
         return;
     for (int k = 0; k < 4; ++k)
         gz[k] = k == 3 ? h + 1 : h;
@@ -194,46 +220,76 @@ void Extension::Add(const Plan& plan, Worker& w, double p, double l, bool* inIma
     any = true;
 }
 
-void Extension::Apply(const Plan& plan, int& extendLeft, int& extendRight, int& extendUp,
-                      int& extendDown) const {
+void Extension::Apply(const Plan& plan, double heightRange, int& extendLeft, int& extendRight,
+                      int& extendUp, int& extendDown) const {
     const Extension& e = any ? *this : plan.global;
     // A tenth more and two pixels: the line of sight bends a little between the points.
     auto pixels = [&](double perMetre) {
-        return static_cast<int>(std::min(std::ceil(1.1 * perMetre * plan.heightRange) + 2, 1e5));
+        return static_cast<int>(std::min(std::ceil(1.1 * perMetre * heightRange) + 2, 1e5));
     };
     extendLeft = pixels(e.left), extendRight = pixels(e.right);
     extendUp = pixels(e.up), extendDown = pixels(e.down);
 }
 
-// Ground positions of output pixel centres in a window of the grid, their surface heights and
-// their image positions.
-void ProjectWindow(const Plan& plan, Worker& w, int x0, int y0, int width, int height,
-                   const RunControl& control) {
+// Surface heights at the output pixel centres of a window of the grid; a height that is not
+// finite is no height.
+void WindowHeights(const Plan& plan, Worker& w, int x0, int y0, int width, int height) {
     const TorthoJob& job = *plan.job;
     const size_t n = static_cast<size_t>(width) * height;
-    w.x.resize(n), w.y.resize(n), w.h.resize(n), w.col.resize(n), w.row.resize(n);
-    if (w.okSize < n)
-        w.ok.reset(new bool[n]), w.okSize = n;
+    w.x.resize(n), w.y.resize(n), w.h.resize(n);
     for (int j = 0; j < height; ++j)
         for (int i = 0; i < width; ++i) {
             const size_t k = static_cast<size_t>(j) * width + i;
             job.geocoding.PixelToGround(x0 + i + 0.5, y0 + j + 0.5, w.x[k], w.y[k]);
         }
     job.surface->GetHeights(n, w.x.data(), w.y.data(), w.h.data());
-    if (control.Stopped())
-        return;
-    const double* mx = w.x.data();
-    const double* my = w.y.data();
-    if (w.toModel) {
-        w.mx.assign(w.x.begin(), w.x.end());
-        w.my.assign(w.y.begin(), w.y.end());
-        w.toModel->Transform(n, w.mx.data(), w.my.data());
-        mx = w.mx.data(), my = w.my.data();
+    for (double& v : w.h)
+        if (!std::isfinite(v))
+            v = std::numeric_limits<double>::quiet_NaN();
+}
+
+// The tile's window: the tile extended towards the sensor by as far as the highest surface
+// within reach throws its view-shadow over the tile's lowest ground. Starts from the survey's
+// blocks and grows while the heights found in the window reach further; leaves the window's
+// heights in w.h.
+void TileWindow(const Plan& plan, Worker& w, int tx, int ty, int tw, int th, int& ex, int& ey,
+                int& ew, int& eh) {
+    Extension reach;
+    for (const double p : {0.0, tw / 2.0, static_cast<double>(tw)})
+        for (const double l : {0.0, th / 2.0, static_cast<double>(th)})
+            reach.Add(plan, w, tx + p, ty + l);
+    double lowest, highest;
+    if (!plan.blocks.Range(tx, ty, tx + tw, ty + th, lowest, highest))
+        lowest = highest = 0;
+    int left = 0, right = 0, up = 0, down = 0;
+    // Blocks first: the reach of the blocks' heights until it no longer grows.
+    for (int round = 0; round < 8; ++round) {
+        reach.Apply(plan, highest - lowest + 1, left, right, up, down);
+        double low, high;
+        if (!plan.blocks.Range(tx - left, ty - up, tx + tw + right, ty + th + down, low, high) ||
+            high <= highest)
+            break;
+        highest = high;
     }
-    job.model->GroundToImage(n, mx, my, w.h.data(), w.col.data(), w.row.data(), w.ok.get());
-    for (size_t k = 0; k < n; ++k)
-        if (std::isnan(w.h[k]) || !std::isfinite(w.col[k]) || !std::isfinite(w.row[k]))
-            w.ok[k] = false;
+    // Then the window's own heights.
+    for (;;) {
+        ex = tx - left, ey = ty - up, ew = tw + left + right, eh = th + up + down;
+        WindowHeights(plan, w, ex, ey, ew, eh);
+        double low = std::numeric_limits<double>::infinity(), high = -low;
+        for (int j = ty; j < ty + th; ++j)
+            for (int i = tx; i < tx + tw; ++i)
+                low = std::min(low, w.h[static_cast<size_t>(j - ey) * ew + (i - ex)]);
+        for (const double v : w.h)
+            high = std::max(high, v);  // NaN compares false and is skipped
+        if (!(low <= high))
+            return;  // no ground in the tile: nothing to hide
+        int l, r, u, d;
+        reach.Apply(plan, high - low + 1, l, r, u, d);
+        if (l <= left && r <= right && u <= up && d <= down)
+            return;
+        left = std::max(left, l), right = std::max(right, r);
+        up = std::max(up, u), down = std::max(down, d);
+    }
 }
 
 // The seen pixels of a tile through the job's resampler, in one call: the source window (the
@@ -280,17 +336,15 @@ void ProcessTile(const Plan& plan, Worker& w, TileOutput& ortho, TileOutput& vis
                  int ty, int tw, int th, const RunControl& control, TorthoResult& counts) {
     const TorthoJob& job = *plan.job;
     // The tile with its surroundings, so that occluders outside the tile are projected too.
-    Extension reach;
-    for (const double p : {0.0, tw / 2.0, static_cast<double>(tw)})
-        for (const double l : {0.0, th / 2.0, static_cast<double>(th)})
-            reach.Add(plan, w, tx + p, ty + l);
-    int left, right, up, down;
-    reach.Apply(plan, left, right, up, down);
-    const int ex = tx - left, ey = ty - up;
-    const int ew = tw + left + right, eh = th + up + down;
-    ProjectWindow(plan, w, ex, ey, ew, eh, control);
+    int ex, ey, ew, eh;
+    TileWindow(plan, w, tx, ty, tw, th, ex, ey, ew, eh);
     if (control.Stopped())
         return;
+    const size_t n = static_cast<size_t>(ew) * eh;
+    w.col.resize(n), w.row.resize(n);
+    if (w.okSize < n)
+        w.ok.reset(new bool[n]), w.okSize = n;
+    w.projection->Project(ex, ey, ew, eh, w.h.data(), w.col.data(), w.row.data(), w.ok.get());
     auto at = [&](int i, int j) { return static_cast<size_t>(j - ey) * ew + (i - ex); };
 
     // The image area the tile's own ground projects into.
@@ -328,11 +382,6 @@ void ProcessTile(const Plan& plan, Worker& w, TileOutput& ortho, TileOutput& vis
                         continue;
                     const double cols[3] = {w.col[a], w.col[b], w.col[c]};
                     const double rows[3] = {w.row[a], w.row[b], w.row[c]};
-                    if (std::max({cols[0], cols[1], cols[2]}) < zx0 ||
-                        std::min({cols[0], cols[1], cols[2]}) > zx1 ||
-                        std::max({rows[0], rows[1], rows[2]}) < zy0 ||
-                        std::min({rows[0], rows[1], rows[2]}) > zy1)
-                        continue;
                     const double heights[3] = {w.h[a], w.h[b], w.h[c]};
                     w.zbuffer.AddTriangle(cols, rows, heights);
                 }
@@ -345,6 +394,7 @@ void ProcessTile(const Plan& plan, Worker& w, TileOutput& ortho, TileOutput& vis
     src.imageWidth = plan.imageWidth, src.imageHeight = plan.imageHeight;
     src.bands = static_cast<int>(plan.bands.size());
     src.hasNoData = plan.hasNoData, src.noData = plan.noData;
+    src.anyNoData = std::find(src.hasNoData.begin(), src.hasNoData.end(), 1) != src.hasNoData.end();
     const int radius = job.resampler != nullptr
                            ? std::max(1, static_cast<int>(job.resampler->GetRadius()))
                            : trueortho::KernelRadius(plan.kernel);
@@ -435,6 +485,10 @@ Plan MakePlan(const TorthoJob& job, GDALDataset* source) {
                 where);
     Require(job.tileSize >= 16 && job.tileSize <= 8192,
             FormatString("True ortho: tile size %u is outside 16 to 8192", job.tileSize), where);
+    Require(std::isfinite(job.errorThreshold) && job.errorThreshold >= 0,
+            FormatString("True ortho: error threshold %g must be finite and not negative",
+                         job.errorThreshold),
+            where);
     Require(std::isfinite(job.heightTolerance) && job.heightTolerance >= 0,
             FormatString("True ortho: height tolerance %g must be finite and not negative",
                          job.heightTolerance),
@@ -537,30 +591,43 @@ void CheckSurfaceCovers(const TorthoJob& job) {
 // Looks at the grid through the model on a sparse sample: the surface's height range, how far
 // occluders can stand from the ground they hide, and whether the image is reached at all.
 void Survey(const TorthoJob& job, Plan& plan, Worker& w, const RunControl& control) {
-    // Heights on every second pixel and line: the highest surface within reach of every tile.
-    double lowest = std::numeric_limits<double>::infinity(), highest = -lowest;
-    const unsigned int band = 64;
-    for (unsigned int y0 = 0; y0 < job.lines && !control.Stopped(); y0 += band * 2) {
-        const unsigned int rows = std::min(band, (job.lines - y0 + 1) / 2);
-        const unsigned int cols = (job.pixels + 1) / 2;
-        std::vector<double> x(static_cast<size_t>(rows) * cols), y(x.size()), h(x.size());
+    // Heights on every second pixel and line, kept as the lowest and highest of each block: a
+    // tile's first estimate of the surface within its reach. Heights that are not finite are
+    // no heights.
+    HeightBlocks& blocks = plan.blocks;
+    const int size = HeightBlocks::kSize;
+    blocks.columns = static_cast<int>((job.pixels + size - 1) / size);
+    blocks.rows = static_cast<int>((job.lines + size - 1) / size);
+    blocks.low.assign(static_cast<size_t>(blocks.columns) * blocks.rows,
+                      std::numeric_limits<float>::infinity());
+    blocks.high.assign(blocks.low.size(), -std::numeric_limits<float>::infinity());
+    bool any = false;
+    const unsigned int cols = (job.pixels + 1) / 2;
+    std::vector<double> x(static_cast<size_t>(cols) * size / 2), y(x.size()), h(x.size());
+    for (unsigned int y0 = 0; y0 < job.lines && !control.Stopped(); y0 += size) {
+        const unsigned int rows = std::min<unsigned int>(size / 2, (job.lines - y0 + 1) / 2);
+        const size_t n = static_cast<size_t>(rows) * cols;
         for (unsigned int j = 0; j < rows; ++j)
             for (unsigned int i = 0; i < cols; ++i)
                 job.geocoding.PixelToGround(2 * i + 0.5, y0 + 2 * j + 0.5,
                                             x[static_cast<size_t>(j) * cols + i],
                                             y[static_cast<size_t>(j) * cols + i]);
-        job.surface->GetHeights(x.size(), x.data(), y.data(), h.data());
-        for (double v : h)
-            if (!std::isnan(v))
-                lowest = std::min(lowest, v), highest = std::max(highest, v);
+        job.surface->GetHeights(n, x.data(), y.data(), h.data());
+        const size_t line = static_cast<size_t>(y0 / size) * blocks.columns;
+        for (size_t k = 0; k < n; ++k) {
+            if (!std::isfinite(h[k]))
+                continue;
+            const size_t b = line + (k % cols) * 2 / size;
+            const float v = static_cast<float>(h[k]);
+            blocks.low[b] = std::min(blocks.low[b], v), blocks.high[b] = std::max(blocks.high[b], v);
+            any = true;
+        }
     }
     if (control.Stopped())
         return;
-    if (!(lowest <= highest))
+    if (!any)
         KESTREL_THROW(DataException,
                       "True ortho: the surface model has no height anywhere on the output grid");
-
-    plan.heightRange = highest - lowest + 1.0;
 
     // The line of sight on a 17 x 17 lattice: the extension for tiles whose own corners tell
     // nothing, and whether any ground reaches the image.
@@ -615,10 +682,12 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
     const unsigned int tile = job.tileSize;
     const unsigned int tilesX = (job.pixels + tile - 1) / tile,
                        tilesY = (job.lines + tile - 1) / tile;
-    std::vector<TorthoResult> counts(ThreadsToUse());
+    // No more threads than tiles, before anything per thread is made.
+    const size_t tiles = static_cast<size_t>(tilesX) * tilesY;
+    std::vector<TorthoResult> counts(std::min<size_t>(ThreadsToUse(), tiles));
     std::vector<std::unique_ptr<Worker>> workers(counts.size());
     control.RunTiles(
-        static_cast<size_t>(tilesX) * tilesY, static_cast<unsigned int>(counts.size()),
+        tiles, static_cast<unsigned int>(counts.size()),
         "True ortho", [&](unsigned int thread, size_t index) {
             std::unique_ptr<Worker>& w = workers[thread];
             if (!w) {
@@ -627,6 +696,8 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
                     w->source = trueortho::OpenRaster(job.sourcePath, "source image");
                 if (toModel)
                     w->toModel = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel);
+                w->projection = std::make_unique<GridProjection>(
+                    job.geocoding, *job.model, w->toModel.get(), job.errorThreshold);
             }
             const int tx = static_cast<int>((index % tilesX) * tile);
             const int ty = static_cast<int>((index / tilesX) * tile);

@@ -48,6 +48,32 @@ double CubicWeight(double x) {
 bool Weighted(const SourceWindow& w, int i0, int j0, const double* wx, int nx, const double* wy,
               int ny, float* out) {
     const size_t bandSize = static_cast<size_t>(w.width) * w.height;
+    // The usual case: the block inside the window (which lies inside the image) and no no-data
+    // value to look for. One set of weights serves every band.
+    if (!w.anyNoData && i0 >= w.x0 && j0 >= w.y0 && i0 + nx <= w.x0 + w.width &&
+        j0 + ny <= w.y0 + w.height && i0 >= 0 && j0 >= 0 && i0 + nx <= w.imageWidth &&
+        j0 + ny <= w.imageHeight) {
+        double weight = 0, wxSum = 0;
+        for (int di = 0; di < nx; ++di)
+            wxSum += wx[di];
+        for (int dj = 0; dj < ny; ++dj)
+            weight += wy[dj] * wxSum;
+        if (std::fabs(weight) < 1e-5)
+            return false;
+        const size_t first = static_cast<size_t>(j0 - w.y0) * w.width + (i0 - w.x0);
+        for (int b = 0; b < w.bands; ++b) {
+            const float* pixel = w.values.data() + bandSize * b + first;
+            double sum = 0;
+            for (int dj = 0; dj < ny; ++dj, pixel += w.width) {
+                double line = 0;
+                for (int di = 0; di < nx; ++di)
+                    line += wx[di] * pixel[di];
+                sum += wy[dj] * line;
+            }
+            out[b] = static_cast<float>(sum / weight);
+        }
+        return true;
+    }
     for (int b = 0; b < w.bands; ++b) {
         const float* band = w.values.data() + bandSize * b;
         double sum = 0, weight = 0;

@@ -25,6 +25,7 @@ struct SourceWindow {
     std::vector<float> values;
     std::vector<char> hasNoData;
     std::vector<float> noData;
+    bool anyNoData = false;  // whether any band has a no-data value
 };
 
 // Values of every band at (col, row): false where the position is outside the image or only
