@@ -136,6 +136,10 @@ Options ParseOptions(const std::vector<std::string>& args) {
             options.format = take();
         } else if (name == "--co") {
             options.creationOptions.push_back(take());
+        } else if (name == "--cameras") {
+            options.cameras = take();
+        } else if (name == "--cameras-srs") {
+            options.camerasSrs = take();
         } else if (name == "--jobs" || name == "-j") {
             const std::string text = take();
             options.jobs = ParseCount(name, text);
@@ -169,6 +173,8 @@ Options ParseOptions(const std::vector<std::string>& args) {
         throw UsageError("--of: the file type is empty");
     if (options.resample.empty())
         throw UsageError("--resample: the method is empty");
+    if (!options.camerasSrs.empty() && options.cameras.empty())
+        throw UsageError("--cameras-srs is the CRS of a --cameras file, which is missing");
     return options;
 }
 
@@ -201,6 +207,12 @@ Surface model (the terrain with its buildings):
   --elfactor O[,S]    height correction: offset O, then scale S (> 0)
   --elunits UNIT      unit of the surface heights: METER (default), FOOT, US_FOOT
 
+Cameras (instead of each source's own model, docs/cameras.md):
+  --cameras FILE      the frame camera of every image from an OpenSfM reconstruction.json or
+                      an exterior-orientation table (image X Y Z omega phi kappa)
+  --cameras-srs CRS   the coordinate system of the table's centres, with its vertical datum
+                      (EPSG:25832+7837, EPSG:4979, ...)
+
 Output:
   --out DIR           output directory (created when missing)
   --srs CRS           output coordinate system, projected or geographic (EPSG:32632, WKT,
@@ -208,9 +220,9 @@ Output:
   --pixel-size SIZE   output pixel size in CRS units (default: the source's resolution)
   --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
   --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
-  --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, jpg, ...
-                      or a GDAL raster driver that creates files; the mosaic of tif or cog
-                      is a Cloud Optimized GeoTIFF
+  --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, ... or a
+                      GDAL raster driver that writes files losslessly; the mosaic of tif or
+                      cog is a Cloud Optimized GeoTIFF
   --co NAME=VALUE     a GDAL creation option of the mosaic (repeatable), as gdalwarp's -co:
                       COMPRESS=JPEG, COMPRESS=WEBP, QUALITY=85, BLOCKSIZE=256, ...
 

@@ -35,6 +35,11 @@ struct Options {
     std::string format = "tif";  // file type of the ortho and visibility rasters
     std::vector<std::string> creationOptions;  // --co NAME=VALUE, for the mosaic's GDAL driver
 
+    // Every scene's model from one file: an exterior-orientation table (with the CRS of its
+    // centres) or an OpenSfM reconstruction; empty: each source's own model.
+    std::string cameras;
+    std::string camerasSrs;
+
     unsigned int jobs = 1;  // scenes run at the same time
     // Slice of the preparation file's lines, [firstLine, endLine) counted from 0.
     bool hasLines = false;
