@@ -246,7 +246,9 @@ TEST(HeightDatums, AgreeWithGdallocationinfoPlusCs2cs) {
         {"msl.tif --elevref ELLIPS", "not ELLIPS as --elevref says"},
         {"ft.vrt --elunits METER", "not in METER as --elunits says"},
         {"navd88ftus.tif --elunits FOOT", "not in FOOT as --elunits says"},
+        {"index.gpkg --elevref MSL", "nor a VERTICAL_DATUM item"},
     };
+    RunCommand("cd '" + dir.Path().string() + "' && gdaltindex -f GPKG index.gpkg none.tif");
     for (const auto& r : refused) {
         for (const std::string& tool : {"'" + kTool + "' ", ortho}) {
             const std::string output = RunCommand(tool + dir.Path().string() + "/" + r.first +

@@ -67,6 +67,7 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--of", "mem"}, "--of: mem: GDAL's MEM driver keeps no pixels"},
         {{master}, {"--of", "xyz"}, "--of: xyz: GDAL's XYZ text holds no coordinate system"},
         {{master}, {"--of", "hdr"}, "--of: hdr names the ENVI header"},
+        {{master}, {"--of", "jpg"}, "--of: jpg: GDAL's JPEG driver writes lossy files"},
         {{master}, {"--resample", "gauss"}, "--resample: unknown method \"gauss\""},
         {{master}, {"--resample", "nearest"}, "--resample: unknown method \"nearest\""},
         {{master}, {"--dem", absent}, "--dem: " + absent + ": not found"},
@@ -108,7 +109,7 @@ TEST(OrthoCommandLine, ValuesThatHelpListsAreAccepted) {
         {"--resample", "near"},    {"--resample", "bilinear"},    {"--resample", "cubic"},
         {"--resample", "lanczos"}, {"--resample", "cubicspline"}, {"--resample", "average"},
         {"--resample", "mode"},    {"--resample", "CUBIC"},       {"--of", "tif"},
-        {"--of", "cog"},           {"--of", "png"},               {"--of", "jpg"},
+        {"--of", "cog"},           {"--of", "png"},               {"--of", "envi"},
         {"--of", "img"},           {"--of", "gpkg"},              {"--srs", "EPSG:32632"},
         {"--srs", "EPSG:4326"},    {"--proc", "CPU:2"},           {"--elunits", "FOOT"},
     };
@@ -136,9 +137,10 @@ TEST(OrthoCommandLine, ValuesThatHelpListsAreAccepted) {
     EXPECT_NE(help.out.find("silvan-ortho IMAGE [IMAGE...] --out DIR"), std::string::npos);
 }
 
-// Images instead of a master file: the sample city's images run with the default columns, the
-// master file used is written to DIR/master.txt with paths relative to it, and a second run
-// leaves it as it is. The sample's own master file names its images relative to itself.
+// Images instead of a master file: the sample city's images run with the default columns (and
+// --of png, which GDAL writes by copy only), the master file used is written to DIR/master.txt
+// with paths relative to it, and a second run leaves it as it is. The sample's own master file
+// names its images relative to itself.
 TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
     TempDir dir;
     const ProgramResult made =
@@ -149,9 +151,18 @@ TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
     EXPECT_NE(sampleMaster.find("\nview000.tif;1,2,3;0;"), std::string::npos) << sampleMaster;
     EXPECT_NE(sampleMaster.find("\nview180.tif;1,2,3;0;"), std::string::npos) << sampleMaster;
 
-    const std::vector<std::string> args = {
-        dir.File("sample/view000.tif"), dir.File("sample/view180.tif"), "--out", dir.File("out"),
-        "--dem", dir.File("sample/dsm.tif"), "--elevref", "ELLIPS", "--quiet"};
+    // PNG, which GDAL writes only by copy, with its georeferencing beside it.
+    const std::vector<std::string> args = {dir.File("sample/view000.tif"),
+                                           dir.File("sample/view180.tif"),
+                                           "--out",
+                                           dir.File("out"),
+                                           "--dem",
+                                           dir.File("sample/dsm.tif"),
+                                           "--elevref",
+                                           "ELLIPS",
+                                           "--of",
+                                           "png",
+                                           "--quiet"};
     const ProgramResult first = Ortho(args, dir);
     ASSERT_EQ(first.status, 0) << first.err;
     const std::string written = dir.File("out/master.txt");
@@ -162,7 +173,15 @@ TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
               "../sample/view180.tif;;0;;;0;ANY;0;ORTHO\n");
     const std::string summary = ReadFile(dir.File("out/summary.json"));
     EXPECT_NE(summary.find("\"status\": \"complete\""), std::string::npos) << summary;
-    EXPECT_TRUE(fs::exists(dir.File("out/mosaic.tif")));
+    GDALAllRegister();
+    for (const std::string name : {"mosaic.png", "view000_ortho.png", "view180_vis.png"}) {
+        GDALDatasetH raster = GDALOpen(dir.File("out/" + name).c_str(), GA_ReadOnly);
+        ASSERT_NE(raster, nullptr) << name;
+        double geo[6] = {0};
+        EXPECT_EQ(GDALGetGeoTransform(raster, geo), CE_None) << name;
+        EXPECT_NE(GDALGetSpatialRef(raster), nullptr) << name;
+        GDALClose(raster);
+    }
 
     // A master file whose line names a text file: said plainly.
     const std::string wrong =

@@ -26,6 +26,12 @@ std::string Number(double value) {
     return text;
 }
 
+// The same file however the command line names it.
+std::string AbsolutePath(const std::string& path) {
+    std::error_code ec;
+    return fs::absolute(path, ec).lexically_normal().string();
+}
+
 std::string Joined(const std::vector<float>& values) {
     std::string text;
     for (const float v : values)
@@ -79,7 +85,9 @@ constexpr std::uint64_t kSampleBlocks = 16;
 const std::vector<PixelOption>& PixelOptions() {
     static const std::vector<PixelOption> options = {
         {"surface model", true,
-         [](const Options& o) { return o.dem.empty() ? "--tin " + o.tin : "--dem " + o.dem; }},
+         [](const Options& o) {
+             return (o.dem.empty() ? "--tin " : "--dem ") + AbsolutePath(o.dem + o.tin);
+         }},
         {"--elevref", true, [](const Options& o) { return o.elevref; }},
         {"--elfactor", true, [](const Options& o) { return Joined(o.elfactor); }},
         {"--elunits", true, [](const Options& o) { return o.elunits; }},
@@ -137,7 +145,7 @@ std::vector<std::string> DatasetFiles(const std::string& path) {
     if (fs::is_directory(path, ec)) {
         for (const auto& entry : fs::directory_iterator(path, ec)) {
             if (entry.is_regular_file(ec))
-                files.push_back(entry.path().lexically_normal().string());
+                files.push_back(AbsolutePath(entry.path().string()));
         }
         std::sort(files.begin(), files.end());
         return files;
@@ -152,12 +160,12 @@ std::vector<std::string> DatasetFiles(const std::string& path) {
         if (dataset != nullptr) {
             char** list = GDALGetFileList(dataset);
             for (char** name = list; name != nullptr && *name != nullptr; ++name)
-                files.push_back(fs::absolute(*name, ec).lexically_normal().string());
+                files.push_back(AbsolutePath(*name));
             CSLDestroy(list);
             GDALClose(dataset);
         }
     }
-    const std::string self = fs::absolute(path, ec).lexically_normal().string();
+    const std::string self = AbsolutePath(path);
     if (std::find(files.begin(), files.end(), self) == files.end())
         files.insert(files.begin(), self);
     return files;

@@ -206,8 +206,8 @@ Output:
   --pixel-size SIZE   output pixel size in CRS units (default: the source's resolution)
   --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
   --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
-  --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, jpg, ...
-                      or a GDAL raster driver that creates files
+  --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, ... or a
+                      GDAL raster driver that writes files losslessly
 
 Running:
   --jobs N, -j N      scenes run at the same time (default 1)

@@ -11,6 +11,7 @@
 #include <kestrel/exception.h>
 #include <kestrel/formats.h>
 #include <kestrel/processparams.h>
+#include <kestrel/rasterio.h>
 
 #include <cpl_error.h>
 #include <gdal_priv.h>
@@ -244,6 +245,12 @@ void CheckFileType(const std::string& type) {
     if (format == "MEM" || format == "VRT")
         throw UsageError("--of: " + type + ": GDAL's " + format +
                          " driver keeps no pixels in a file of its own");
+    // The visibility index and the mosaic's source raster are classes and scene numbers: a
+    // lossy format changes them (JPEG does even at its highest quality).
+    if (format == "JPEG" || format == "WEBP" || format == "JP2OpenJPEG")
+        throw UsageError("--of: " + type + ": GDAL's " + format +
+                         " driver writes lossy files, which would change the values of the "
+                         "visibility index and of the mosaic's source raster; give tif, cog or png");
     if (format == "XYZ")
         throw UsageError("--of: " + type +
                          ": GDAL's XYZ text holds no coordinate system; the outputs would lose "
@@ -560,6 +567,48 @@ void SetSourceStep(kestrel::utils::IRasterResampler& resampler,
 
 }  // namespace
 
+namespace {
+
+// Removes what a writer of path left behind in a run that was killed: its temporaries are
+// named "STEM.tmp-TAG...", beside the path. Runs on one directory are one at a time, and the
+// slices of a run write other paths.
+void RemoveWriterLeftovers(const std::string& path) {
+    const std::filesystem::path target(path);
+    const std::string prefix = target.stem().string() + ".tmp-";
+    std::vector<std::string> leftovers;
+    std::error_code ec;
+    std::filesystem::directory_iterator entries(
+        target.parent_path().empty() ? std::filesystem::path(".") : target.parent_path(), ec);
+    for (; !ec && entries != std::filesystem::directory_iterator(); entries.increment(ec)) {
+        if (entries->path().filename().string().compare(0, prefix.size(), prefix) == 0)
+            leftovers.push_back(entries->path().string());
+    }
+    for (const std::string& leftover : leftovers)
+        RemoveFile(leftover);
+}
+
+// A new raster of the scene through the platform's writer, which writes every file type (by
+// copy where GDAL's driver only copies) and publishes a dataset's files together.
+std::unique_ptr<kestrel::datasources::BasicWriter> SceneRasterWriter(const std::string& path,
+                                                                     std::size_t channels,
+                                                                     const std::string& format) {
+    RemoveWriterLeftovers(path);
+    std::vector<unsigned int> numbers(channels);
+    for (std::size_t c = 0; c < channels; ++c)
+        numbers[c] = static_cast<unsigned int>(c + 1);
+    return std::make_unique<kestrel::datasources::BasicWriter>(path, numbers, format, "");
+}
+
+// The channels of the scene's ortho: those its line lists, or all of the source's.
+std::size_t OrthoChannelCount(const SceneInput& scene) {
+    std::unique_ptr<kestrel::datasources::IDataset> dataset(GetRasterDataset(scene.source));
+    std::vector<unsigned int> sourceChannels, orthoChannels;
+    GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
+    return orthoChannels.size();
+}
+
+}  // namespace
+
 OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Grid& grid,
                       const std::string& ortho, const std::string& visibility,
                       const StepProgress& progress) {
@@ -590,6 +639,10 @@ OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Gri
     job.orthoPath = ortho;
     job.visibilityPath = visibility;
     job.format = kestrel::core::FType2FormatName(options.format);
+    const auto orthoWriter = SceneRasterWriter(ortho, OrthoChannelCount(scene), job.format);
+    const auto visibilityWriter = SceneRasterWriter(visibility, 1, job.format);
+    job.orthoWriter = orthoWriter.get();
+    job.visibilityWriter = visibilityWriter.get();
 
     OrthoProcess process(options.proc, job, progress);
     process.Execute();
@@ -634,6 +687,8 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
     const std::unique_ptr<kestrel::dem::IElevationSource> surface =
         OpenSurface(options, models.empty() ? nullptr : models.front().get());
     job.surface = surface.get();
+    RemoveWriterLeftovers(mosaic);
+    RemoveWriterLeftovers(source);
     job.mosaicPath = mosaic;
     job.sourcePath = source;
     job.format = kestrel::core::FType2FormatName(options.format);

@@ -564,10 +564,17 @@ gobs::Raster* BasicWriter::ReadWindow(unsigned int x, unsigned int y, unsigned i
 
 namespace {
 
-bool SameCRS(const OGRSpatialReference& a, const OGRSpatialReference& b) {
+// Whether a file's CRS places pixels where the written one does: the same, or an equivalent
+// definition named differently. A vertical part that the format cannot hold is not counted:
+// it does not move pixels.
+bool SameCRS(const OGRSpatialReference& read, const OGRSpatialReference& written) {
+    if (read.IsSame(&written))
+        return true;
+    OGRSpatialReference a(read), b(written);
+    a.StripVertical();
+    b.StripVertical();
     if (a.IsSame(&b))
         return true;
-    // Equivalent definitions that name things differently.
     char* pa = nullptr;
     char* pb = nullptr;
     const bool same = a.exportToProj4(&pa) == OGRERR_NONE && b.exportToProj4(&pb) == OGRERR_NONE &&

@@ -192,8 +192,8 @@ bool GridDEM::GetHeightRange(double minX, double minY, double maxX, double maxY,
         double x0, y0, x1, y1;
         geocoding_.PixelToGround(window.left, window.top, x0, y0);
         geocoding_.PixelToGround(window.right, window.bottom, x1, y1);
-        frame_.WidenToOutput(std::min(x0, x1), std::min(y0, y1), std::max(x0, x1),
-                             std::max(y0, y1), low, high);
+        frame_.WidenToOutput(std::min(x0, x1), std::min(y0, y1), std::max(x0, x1), std::max(y0, y1),
+                             low, high);
     }
     if (!(low <= high))
         return false;

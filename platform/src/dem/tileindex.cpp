@@ -109,7 +109,8 @@ OGRLayer* RequireIndexLayer(const std::string& path, GDALDataset* index,
 }
 
 // The index's own datum: its VERTICAL_DATUM item, else that of its CRS or, without one, of
-// tileSrs (the tiles'). unit gets the CRS's vertical reference.
+// tileSrs (the tiles'). reference gets the CRS's vertical reference, named after what gave the
+// datum.
 ogc::cs::DatumType IndexDatum(const std::string& path, GDALDataset* index, OGRLayer* layer,
                               const OGRSpatialReference* tileSrs,
                               ogc::utils::VerticalReference& reference) {
@@ -121,8 +122,14 @@ ogc::cs::DatumType IndexDatum(const std::string& path, GDALDataset* index, OGRLa
     const char* keyword = layer->GetMetadataItem(kDatumItem);
     if (keyword == nullptr)
         keyword = index->GetMetadataItem(kDatumItem);
-    return keyword != nullptr ? DatumFromKeyword(path, keyword)
-                              : ogc::utils::GetVerticalDatumType(crs.get());
+    if (keyword != nullptr) {
+        reference.name = std::string("its ") + kDatumItem + " item " + keyword;
+        return DatumFromKeyword(path, keyword);
+    }
+    if (!reference.known)
+        reference.name = std::string("neither a vertical CRS nor a ") + kDatumItem +
+                         " item: a tile index's heights are then ellipsoidal";
+    return ogc::utils::GetVerticalDatumType(crs.get());
 }
 
 }  // namespace
@@ -141,10 +148,10 @@ ogc::utils::VerticalReference TileIndexVerticalReference(const std::string& path
     ogc::utils::VerticalReference reference;
     const ogc::cs::DatumType datum =
         IndexDatum(path, index.get(), layer, first ? first->GetSpatialRef() : nullptr, reference);
+    if (!reference.known)
+        reference.unit = "metre";
     reference.known = true;
     reference.datum = datum;
-    if (reference.name.empty())
-        reference.name = "the index's own datum";
     return reference;
 }
 

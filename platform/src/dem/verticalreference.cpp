@@ -83,15 +83,16 @@ SurfaceHeights ResolveSurfaceHeights(const std::string& path,
     if (declaredDatum != nullptr && *declaredDatum != ogc::cs::DatumMathModel &&
         *declaredDatum != file.datum) {
         KESTREL_THROW(DataException,
-                      FormatString("%s: its CRS says the heights are %s, not %s as %s says; "
-                                   "leave %s out to follow the file, or correct the file's CRS",
+                      FormatString("%s: the file says the heights are %s, not %s as %s says; "
+                                   "leave %s out to follow the file, or correct the file's CRS "
+                                   "(a tile index: its VERTICAL_DATUM item)",
                                    path.c_str(), Describe(file).c_str(),
                                    detail::DatumName(*declaredDatum).c_str(), datumOrigin.c_str(),
                                    datumOrigin.c_str()));
     }
     if (!unit.empty() && std::fabs(declaredScale - file.metresPerUnit) > 1e-9 * declaredScale) {
         KESTREL_THROW(DataException,
-                      FormatString("%s: its CRS says the heights are %s, not in %s as %s says; "
+                      FormatString("%s: the file says the heights are %s, not in %s as %s says; "
                                    "leave %s out to follow the file, or correct the file's CRS",
                                    path.c_str(), Describe(file).c_str(), declaredUnit.c_str(),
                                    unitOrigin.c_str(), unitOrigin.c_str()));
