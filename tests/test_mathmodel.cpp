@@ -223,7 +223,7 @@ TEST(SourceModels, SegmentSelectsTheKindAndMissingModelsAreNamed) {
                   std::string::npos);
     }
     EXPECT_THROW(Model(dir.File("missing.tif")), kestrel::FileNotFoundException);
-    EXPECT_THROW(Model(both, 4), kestrel::ParameterException);
+    EXPECT_THROW(Model(both, 5), kestrel::ParameterException);
     // The library's own entry point hands the segment on.
     std::unique_ptr<IMathModel> viaLibrary(GetMathModel(both, 3));
     EXPECT_EQ(viaLibrary->GetCRS(), nullptr);

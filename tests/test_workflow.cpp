@@ -13,6 +13,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cmath>
 #include <cstdlib>
 #include <filesystem>
 #include <functional>
@@ -386,6 +387,61 @@ TEST(Workflow, SampleCityEndToEnd) {
     const std::string rerun = ReadFile(dir.File("out/summary.json"));
     EXPECT_EQ(rerun.find("\"status\": \"done\""), std::string::npos) << rerun;
     EXPECT_NE(rerun.find("\"status\": \"complete\""), std::string::npos);
+}
+
+// The sample's images run through their cameras twice: found beside each image (camera side
+// files), and handed to every scene from the sample's exterior-orientation table (--cameras).
+// The orthos agree; a table without a scene's image fails that scene naming both.
+TEST(Workflow, CamerasFromSideFilesOrFromATable) {
+    TempDir dir;
+    const Result made = RunProgram(SILVAN_MAKE_SAMPLE_EXE,
+                                   {dir.File("sample"), "--image-size", "128", "--quiet"}, dir);
+    ASSERT_EQ(made.status, 0) << made.err;
+    const std::vector<std::string> common = {"--dem",        dir.File("sample/dsm.tif"),
+                                             "--elevref",    "ELLIPS",
+                                             "--pixel-size", "1",
+                                             "--quiet"};
+    const auto run = [&](const std::string& out, std::vector<std::string> extra) {
+        std::vector<std::string> args = {dir.File("sample/master.txt"), "--out", dir.File(out)};
+        args.insert(args.end(), common.begin(), common.end());
+        args.insert(args.end(), extra.begin(), extra.end());
+        return Ortho(args, dir);
+    };
+    const Result side = run("side", {});
+    ASSERT_EQ(side.status, 0) << side.err;
+    const Result table = run("table", {"--cameras", dir.File("sample/cameras.txt"),
+                                       "--cameras-srs", "EPSG:32632"});
+    ASSERT_EQ(table.status, 0) << table.err;
+    for (const char* name : {"north", "east", "south", "west"}) {
+        Dataset a = Open(dir.File(std::string("side/") + name + "_ortho.tif"), GDAL_OF_RASTER);
+        Dataset b = Open(dir.File(std::string("table/") + name + "_ortho.tif"), GDAL_OF_RASTER);
+        ASSERT_TRUE(a && b) << name;
+        const int w = a->GetRasterXSize(), h = a->GetRasterYSize();
+        ASSERT_EQ(w, b->GetRasterXSize());
+        ASSERT_EQ(h, b->GetRasterYSize());
+        std::vector<double> va(static_cast<size_t>(w) * h), vb(va.size());
+        for (int band = 1; band <= 3; ++band) {
+            ASSERT_EQ(a->GetRasterBand(band)->RasterIO(GF_Read, 0, 0, w, h, va.data(), w, h,
+                                                       GDT_Float64, 0, 0, nullptr),
+                      CE_None);
+            ASSERT_EQ(b->GetRasterBand(band)->RasterIO(GF_Read, 0, 0, w, h, vb.data(), w, h,
+                                                       GDT_Float64, 0, 0, nullptr),
+                      CE_None);
+            for (size_t i = 0; i < va.size(); ++i)
+                ASSERT_LE(std::fabs(va[i] - vb[i]), 1.0) << name << " band " << band << " " << i;
+        }
+    }
+    // The table loses its first row (after the comment line).
+    std::string rows = ReadFile(dir.File("sample/cameras.txt"));
+    const size_t first = rows.find('\n') + 1;
+    rows.erase(first, rows.find('\n', first) + 1 - first);
+    WriteFile(dir.File("sample/cameras.txt"), rows);
+    const Result missing = run("missing", {"--cameras", dir.File("sample/cameras.txt"),
+                                           "--cameras-srs", "EPSG:32632", "--keep-going"});
+    EXPECT_EQ(missing.status, 1);
+    const std::string summary = ReadFile(dir.File("missing/summary.json")) + missing.err;
+    EXPECT_NE(summary.find("no orientation of the image"), std::string::npos) << summary;
+    EXPECT_NE(summary.find("north.tif"), std::string::npos) << summary;
 }
 
 // Each scene's status and reason in a run's summary, by scene name.

@@ -93,6 +93,10 @@ const std::vector<PixelOption>& PixelOptions() {
         {"--elunits", true, [](const Options& o) { return o.elunits; }},
         {"--srs", true, [](const Options& o) { return o.srs; }},
         {"--pixel-size", true, [](const Options& o) { return Number(o.pixelSize); }},
+        {"--cameras", true,
+         [](const Options& o) {
+             return o.camerasSrs.empty() ? o.cameras : o.cameras + " --cameras-srs " + o.camerasSrs;
+         }},
         {"--resample", false, [](const Options& o) { return o.resample; }},
         {"--proc", false, [](const Options& o) { return o.proc; }},
         {"--of", false, [](const Options& o) { return o.format; }},

@@ -134,6 +134,10 @@ Options ParseOptions(const std::vector<std::string>& args) {
             options.proc = take();
         } else if (name == "--of") {
             options.format = take();
+        } else if (name == "--cameras") {
+            options.cameras = take();
+        } else if (name == "--cameras-srs") {
+            options.camerasSrs = take();
         } else if (name == "--jobs" || name == "-j") {
             const std::string text = take();
             options.jobs = ParseCount(name, text);
@@ -167,6 +171,8 @@ Options ParseOptions(const std::vector<std::string>& args) {
         throw UsageError("--of: the file type is empty");
     if (options.resample.empty())
         throw UsageError("--resample: the method is empty");
+    if (!options.camerasSrs.empty() && options.cameras.empty())
+        throw UsageError("--cameras-srs is the CRS of a --cameras file, which is missing");
     return options;
 }
 
@@ -198,6 +204,12 @@ Surface model (the terrain with its buildings):
   --elevref KEYWORD   vertical datum of the surface heights: MSL (default), ELLIPS, MATHMODEL
   --elfactor O[,S]    height correction: offset O, then scale S (> 0)
   --elunits UNIT      unit of the surface heights: METER (default), FOOT, US_FOOT
+
+Cameras (instead of each source's own model, docs/cameras.md):
+  --cameras FILE      the frame camera of every image from an OpenSfM reconstruction.json or
+                      an exterior-orientation table (image X Y Z omega phi kappa)
+  --cameras-srs CRS   the coordinate system of the table's centres, with its vertical datum
+                      (EPSG:25832+7837, EPSG:4979, ...)
 
 Output:
   --out DIR           output directory (created when missing)

@@ -34,6 +34,11 @@ struct Options {
     std::string proc;            // PROC text of the generator
     std::string format = "tif";  // file type of the ortho and visibility rasters
 
+    // Every scene's model from one file: an exterior-orientation table (with the CRS of its
+    // centres) or an OpenSfM reconstruction; empty: each source's own model.
+    std::string cameras;
+    std::string camerasSrs;
+
     unsigned int jobs = 1;  // scenes run at the same time
     // Slice of the preparation file's lines, [firstLine, endLine) counted from 0.
     bool hasLines = false;

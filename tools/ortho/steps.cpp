@@ -182,6 +182,18 @@ bool ReadGrid(const std::string& path, Grid& grid) {
     return true;
 }
 
+std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
+                                                          const std::string& source, int mmseg) {
+    if (!options.cameras.empty())
+        return kestrel::mathmodel::OpenCameraModel(source, options.cameras, options.camerasSrs);
+    return std::unique_ptr<kestrel::mathmodel::IMathModel>(GetMathModel(source, mmseg));
+}
+
+std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
+                                                          const SceneInput& scene) {
+    return OpenModel(options, scene.source, scene.mmseg);
+}
+
 namespace {
 
 // Runs a check of one option; what it throws becomes a UsageError naming the option.
@@ -296,6 +308,11 @@ std::string CheckGenerator(const std::string& procText) {
 std::vector<std::string> CheckOptions(Options& options) {
     CheckSurfaceFile("--dem", options.dem);
     CheckSurfaceFile("--tin", options.tin);
+    CheckSurfaceFile("--cameras", options.cameras);
+    CheckOption("--cameras-srs", [&] {
+        if (!options.camerasSrs.empty())
+            kestrel::ogc::cs::ICRS{options.camerasSrs};
+    });
     CheckOption("--elevref", [&] { GetVertDatum(options.elevref); });
     double offset = 0.0, scale = 1.0;
     CheckOption("--elfactor", [&] { GetElFactor(options.elfactor, offset, scale); });
@@ -427,7 +444,7 @@ Grid SceneLayout(const Options& options, const SceneInput& scene, const std::str
     GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
     std::unique_ptr<kestrel::datasources::IRasterReader> reader(
         GetRasterReader(dataset.get(), sourceChannels));
-    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetMathModel(scene.source, scene.mmseg));
+    const std::unique_ptr<kestrel::mathmodel::IMathModel> model = OpenModel(options, scene);
     const std::unique_ptr<kestrel::dem::IElevationSource> surface =
         OpenSurface(options, model.get());
 
@@ -612,7 +629,7 @@ std::size_t OrthoChannelCount(const SceneInput& scene) {
 OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Grid& grid,
                       const std::string& ortho, const std::string& visibility,
                       const StepProgress& progress) {
-    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetMathModel(scene.source, scene.mmseg));
+    const std::unique_ptr<kestrel::mathmodel::IMathModel> model = OpenModel(options, scene);
     const std::unique_ptr<kestrel::dem::IElevationSource> surface =
         OpenSurface(options, model.get());
     std::string method = options.resample;
@@ -674,7 +691,7 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
     std::vector<std::unique_ptr<kestrel::mathmodel::IMathModel>> models;
     kestrel::processes::RecoveryJob job;
     for (const RecoveryScene& scene : scenes) {
-        models.emplace_back(GetMathModel(scene.source, scene.mmseg));
+        models.push_back(OpenModel(options, scene.source, scene.mmseg));
         kestrel::processes::RecoveryScene input;
         input.orthoPath = scene.ortho;
         input.visibilityPath = scene.visibility;

@@ -51,6 +51,13 @@ using StepProgress = std::function<bool(double fraction)>;
 // a generator that falls back to the central processor.
 std::vector<std::string> CheckOptions(Options& options);
 
+// The math model of a source: the camera of --cameras when given, else the source's own model
+// of segment mmseg.
+std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
+                                                          const std::string& source, int mmseg);
+std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
+                                                          const SceneInput& scene);
+
 // Checks what the surface model's file says of its heights (vertical datum and unit) against
 // --elevref and --elunits, without reading the heights: a contradiction throws, naming the file
 // and the option. Where the file says nothing, the options hold (MSL and metres by default).

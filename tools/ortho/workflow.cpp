@@ -558,6 +558,7 @@ Manifest Workflow::GridInputs() {
         inputs.Set(Where(scene), scene.columns);
         for (const std::string& file : FilesOf(scene.input.source))
             inputs.SetFile("source file", file, Identity(file));
+        RecordCamera(scene, inputs);
     }
     return inputs;
 }
@@ -611,6 +612,16 @@ void Workflow::RecordInputs(Scene& scene) {
         made.SetFile("source file", file, Identity(file));
     for (const std::string& file : FilesOf(SurfacePath(options_)))
         made.SetFile("surface file", file, Identity(file));
+    RecordCamera(scene, made);
+}
+
+void Workflow::RecordCamera(const Scene& scene, Manifest& inputs) {
+    // The file of the scene's camera, when it has one: --cameras, or its side file.
+    const std::string camera = options_.cameras.empty()
+                                   ? kestrel::mathmodel::CameraSideFile(scene.input.source)
+                                   : options_.cameras;
+    if (FileExists(camera))
+        inputs.SetFile("camera file", camera, Identity(camera));
 }
 
 std::string Workflow::WhyMake(const Scene& scene) const {

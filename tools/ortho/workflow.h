@@ -72,6 +72,7 @@ class Workflow {
     std::string SummaryName() const;
     Manifest GridInputs();
     void RecordInputs(Scene& scene);
+    void RecordCamera(const Scene& scene, Manifest& inputs);
     // Why the scene is to be made in this run; empty when its outputs are complete and made
     // from the inputs and options of this run.
     std::string WhyMake(const Scene& scene) const;

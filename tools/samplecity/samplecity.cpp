@@ -9,6 +9,7 @@
 #include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <thread>
 
@@ -345,30 +346,58 @@ FrameCamera::FrameCamera(const CameraSpec& spec, const Dsm& dsm) : spec_(spec) {
     const Vec3 target = {cx, cy, dsm.Ground(cx, cy)};
     const double az = spec.azimuthDegrees * kPi / 180, tilt = spec.offNadirDegrees * kPi / 180;
     const double horizontal = spec.altitude * std::tan(tilt);
-    centre_ = {target[0] + horizontal * std::sin(az), target[1] + horizontal * std::cos(az),
-               target[2] + spec.altitude};
-    forward_ = Normalised(Sub(target, centre_));
-    right_ = Normalised(Cross(forward_, {0.0, 0.0, 1.0}));
-    down_ = Cross(forward_, right_);
-    focal_ = spec.altitude / std::cos(tilt) / spec.groundSampleDistance;
+    const Vec3 centre = {target[0] + horizontal * std::sin(az),
+                         target[1] + horizontal * std::cos(az), target[2] + spec.altitude};
+    // Axes in the local map frame at the centre: looking at the target, no roll.
+    const Vec3 forward = Normalised(Sub(target, centre));
+    const Vec3 right = Normalised(Cross(forward, {0.0, 0.0, 1.0}));
+    const Vec3 down = Cross(forward, right);
+    intrinsics_.width = spec.width, intrinsics_.height = spec.height;
+    intrinsics_.fx = intrinsics_.fy = spec.altitude / std::cos(tilt) / spec.groundSampleDistance;
+    intrinsics_.cx = spec.width / 2.0 - 0.5, intrinsics_.cy = spec.height / 2.0 - 0.5;
+    pose_.crs = o.crs;
+    pose_.centre = centre;
+    pose_.rotation = {right[0], right[1], right[2], down[0],    down[1],
+                      down[2],  forward[0], forward[1], forward[2]};
+    model_ = kestrel::mathmodel::MakeFrameCameraModel(intrinsics_, pose_, spec.name);
+    top_ = dsm.MaxHeight() + 5, bottom_ = dsm.MinHeight() - 5;
 }
 
 bool FrameCamera::Project(double x, double y, double z, double& col, double& row) const {
-    const Vec3 v = Sub({x, y, z}, centre_);
-    const double depth = Dot(v, forward_);
-    if (depth <= 0)
-        return false;
-    col = spec_.width / 2.0 + focal_ * Dot(v, right_) / depth;
-    row = spec_.height / 2.0 + focal_ * Dot(v, down_) / depth;
-    return true;
+    bool ok = false;
+    model_->GroundToImage(1, &x, &y, &z, &col, &row, &ok);
+    return ok;
+}
+
+void FrameCamera::Rays(std::size_t n, const double* col, const double* row, double* origins,
+                       double* dirs) const {
+    std::vector<double> heights(2 * n), x(2 * n), y(2 * n), c(2 * n), r(2 * n);
+    std::copy(col, col + n, c.begin());
+    std::copy(col, col + n, c.begin() + n);
+    std::copy(row, row + n, r.begin());
+    std::copy(row, row + n, r.begin() + n);
+    std::fill(heights.begin(), heights.begin() + n, top_);
+    std::fill(heights.begin() + n, heights.end(), bottom_);
+    std::unique_ptr<bool[]> ok(new bool[2 * n]);
+    model_->ImageToGround(2 * n, c.data(), r.data(), heights.data(), x.data(), y.data(), ok.get());
+    for (std::size_t i = 0; i < n; ++i) {
+        if (!ok[i] || !ok[n + i]) {
+            std::fill(origins + 3 * i, origins + 3 * i + 3, NAN);
+            std::fill(dirs + 3 * i, dirs + 3 * i + 3, NAN);
+            continue;
+        }
+        const Vec3 d = Normalised({x[n + i] - x[i], y[n + i] - y[i], bottom_ - top_});
+        origins[3 * i] = x[i], origins[3 * i + 1] = y[i], origins[3 * i + 2] = top_;
+        dirs[3 * i] = d[0], dirs[3 * i + 1] = d[1], dirs[3 * i + 2] = d[2];
+    }
 }
 
 void FrameCamera::Ray(double col, double row, Vec3& origin, Vec3& dir) const {
-    const double u = (col - spec_.width / 2.0) / focal_, v = (row - spec_.height / 2.0) / focal_;
-    origin = centre_;
-    dir = Normalised({forward_[0] + u * right_[0] + v * down_[0],
-                      forward_[1] + u * right_[1] + v * down_[1],
-                      forward_[2] + u * right_[2] + v * down_[2]});
+    Rays(1, &col, &row, origin.data(), dir.data());
+    if (std::isnan(dir[0]))
+        KESTREL_THROW(DataException,
+                      FormatString("Sample city: camera %s has no line of sight at (%g, %g)",
+                                   spec_.name.c_str(), col, row));
 }
 
 // ---------------------------------------------------------------------------------------------
@@ -447,16 +476,16 @@ Rpc FitRpc(const FrameCamera& camera, const ICRS& crs, double minHeight, double 
                     const double c = width * (a + shift) / (nGrid - 1 + 2 * shift);
                     const double r = height * (b + shift) / (nGrid - 1 + 2 * shift);
                     const double z = h0 + (h1 - h0) * (k + shift) / (nHeights - 1 + 2 * shift);
-                    Vec3 o, d;
-                    camera.Ray(c, r, o, d);
-                    const double t = (z - o[2]) / d[2];
-                    lon.push_back(o[0] + t * d[0]);
-                    lat.push_back(o[1] + t * d[1]);
                     h.push_back(z);
                     col.push_back(c);
                     row.push_back(r);
                 }
-        if (!toGeographic.Transform(lon.size(), lon.data(), lat.data()))
+        lon.resize(h.size()), lat.resize(h.size());
+        std::unique_ptr<bool[]> ok(new bool[h.size()]);
+        camera.Model().ImageToGround(h.size(), col.data(), row.data(), h.data(), lon.data(),
+                                     lat.data(), ok.get());
+        if (!std::all_of(ok.get(), ok.get() + h.size(), [](bool b) { return b; }) ||
+            !toGeographic.Transform(lon.size(), lon.data(), lat.data()))
             KESTREL_THROW(DataException, "RPC fit: ground points outside the coordinate system");
     };
     std::vector<double> lon, lat, h, col, row;
@@ -537,11 +566,17 @@ void RenderImage(const FrameCamera& camera, const Dsm& dsm, const Rpc& rpc, cons
     std::vector<std::uint8_t> pixels(static_cast<size_t>(w) * h * 3, 0);
     std::atomic<unsigned int> nextRow{0};
     auto work = [&] {
+        std::vector<double> cols(w), rows(w), origins(3 * w), dirs(3 * w);
+        for (unsigned int c = 0; c < w; ++c)
+            cols[c] = c + 0.5;
         for (unsigned int r; (r = nextRow++) < h;) {
+            std::fill(rows.begin(), rows.end(), r + 0.5);
+            camera.Rays(w, cols.data(), rows.data(), origins.data(), dirs.data());
             for (unsigned int c = 0; c < w; ++c) {
-                Vec3 o, d, hit;
-                camera.Ray(c + 0.5, r + 0.5, o, d);
-                if (!dsm.Intersect(o, d, hit))
+                const Vec3 o = {origins[3 * c], origins[3 * c + 1], origins[3 * c + 2]};
+                const Vec3 d = {dirs[3 * c], dirs[3 * c + 1], dirs[3 * c + 2]};
+                Vec3 hit;
+                if (std::isnan(d[0]) || !dsm.Intersect(o, d, hit))
                     continue;  // off the surface model: background 0
                 const auto rgb = Texture(dsm, hit[0], hit[1], hit[2], seed);
                 std::uint8_t* p = &pixels[(static_cast<size_t>(r) * w + c) * 3];
@@ -600,7 +635,27 @@ Sample MakeSample(const std::string& directory, const CityOptions& options, unsi
             FitRpc(*image.camera, crs, dsm.MinHeight(), dsm.MaxHeight(), &image.rpcMaxResidual);
         image.path = directory + "/" + options.cameras[i].name + ".tif";
         RenderImage(*image.camera, dsm, rpc, image.path, options.seed, threads);
+        image.cameraPath = kestrel::mathmodel::CameraSideFile(image.path);
+        kestrel::mathmodel::WriteCameraFile(image.cameraPath, image.camera->Intrinsics(),
+                                            image.camera->Pose());
         sample.images.push_back(std::move(image));
+    }
+    // The same cameras as an exterior-orientation table, each row naming its image's side file
+    // as its interior orientation.
+    {
+        std::string table = "# image X Y Z omega phi kappa camera (" + options.crs + ")\n";
+        for (const SampleImage& image : sample.images) {
+            const auto& c = image.camera->Pose().centre;
+            const auto opk = kestrel::mathmodel::OpkFromRotation(image.camera->Pose().rotation);
+            table += FormatString("%s %.6f %.6f %.6f %.12f %.12f %.12f %s\n",
+                                  std::filesystem::path(image.path).filename().string().c_str(),
+                                  c[0], c[1], c[2], opk[0], opk[1], opk[2],
+                                  std::filesystem::path(image.cameraPath).filename().string().c_str());
+        }
+        std::ofstream out(directory + "/cameras.txt", std::ios::binary);
+        if (!(out << table).flush())
+            KESTREL_THROW(DataException, FormatString("%s/cameras.txt: cannot write the table",
+                                                      directory.c_str()));
     }
     // The master parameter file: fili; dbic; mmseg; dbiw; srcBgd; edgeClip; radioDif; dbmPxErr;
     // role. The radiometric levels differ so that the fill order shows.

@@ -1,6 +1,7 @@
 // A synthetic city for examples, tests and benchmarks: a surface model (DSM) with box buildings,
 // oblique frame-camera images rendered by casting rays through it onto a procedural texture,
-// RPC coefficients fitted to each camera, and the master parameter file that names the images.
+// each image's camera in its side file and RPC coefficients fitted to it, and the master
+// parameter file that names the images.
 //
 // Heights are ellipsoidal (WGS 84) in a UTM coordinate system without a vertical part, which is
 // how both GDAL's RPC transformer and the platform read such a DSM: RPC heights are ellipsoidal
@@ -89,22 +90,35 @@ class Dsm {
     double minHeight_, maxHeight_;
 };
 
-// A pin-hole camera in the scene's projected coordinates. Image coordinates are continuous with
-// (0, 0) at the top-left corner of the first pixel, as GDAL counts them.
+// A pinhole camera standing over the scene, as the platform's frame-camera model: it projects in
+// the earth's Cartesian frame, with its attitude given in the local map frame at its centre.
+// Image coordinates are continuous with (0, 0) at the top-left corner of the first pixel, as GDAL
+// counts them.
 class FrameCamera {
   public:
     FrameCamera(const CameraSpec& spec, const Dsm& dsm);
     bool Project(double x, double y, double z, double& col, double& row) const;
-    // The viewing ray through an image position: from the camera centre, unit direction.
+    // The line of sight through an image position across the surface model's heights, as a
+    // straight segment in the scene's coordinates (a line of sight bends by micrometres there):
+    // from where it is 5 m above the highest surface point, unit direction.
     void Ray(double col, double row, std::array<double, 3>& origin,
              std::array<double, 3>& dir) const;
-    const std::array<double, 3>& Centre() const { return centre_; }
+    // The same for n positions; origins and dirs hold 3 n values, NaN where the line of sight
+    // does not come down through those heights.
+    void Rays(std::size_t n, const double* col, const double* row, double* origins,
+              double* dirs) const;
+    const std::array<double, 3>& Centre() const { return pose_.centre; }
     const CameraSpec& Spec() const { return spec_; }
+    const kestrel::mathmodel::CameraIntrinsics& Intrinsics() const { return intrinsics_; }
+    const kestrel::mathmodel::CameraPose& Pose() const { return pose_; }
+    const kestrel::mathmodel::IMathModel& Model() const { return *model_; }
 
   private:
     CameraSpec spec_;
-    std::array<double, 3> centre_, right_, down_, forward_;
-    double focal_;
+    kestrel::mathmodel::CameraIntrinsics intrinsics_;
+    kestrel::mathmodel::CameraPose pose_;
+    std::unique_ptr<kestrel::mathmodel::IMathModel> model_;
+    double top_, bottom_;  // heights of the ends of Ray's segments
 };
 
 // Rational polynomial coefficients in the RPC00B layout (offsets, scales, four times 20 terms).
@@ -132,7 +146,8 @@ std::array<std::uint8_t, 3> Texture(const Dsm& dsm, double x, double y, double z
                                     std::uint64_t seed);
 
 struct SampleImage {
-    std::string path;       // the GeoTIFF with its RPCs
+    std::string path;        // the GeoTIFF with its RPCs
+    std::string cameraPath;  // its camera side file
     double rpcMaxResidual;  // pixels
     std::unique_ptr<FrameCamera> camera;
 };
@@ -143,8 +158,8 @@ struct Sample {
     std::vector<SampleImage> images;
 };
 
-// Writes the DSM (dsm.tif), the images (<camera name>.tif) and master.txt into an existing
-// directory. threads: rendering threads (0: the hardware's count).
+// Writes the DSM (dsm.tif), the images (<camera name>.tif) with their cameras
+// (<camera name>.camera.json) and master.txt into an existing directory. threads: rendering threads (0: the hardware's count).
 Sample MakeSample(const std::string& directory, const CityOptions& options,
                   unsigned int threads = 0);
 

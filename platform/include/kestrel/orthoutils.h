@@ -68,7 +68,9 @@ class IRasterDEM;
 // The sensor model of a source raster, owned by the caller. segment selects where it comes from:
 // 1 the RPC coefficients (GDAL's "RPC" metadata domain: the TIFF tag, an .RPB or _RPC.TXT side
 // file), 2 the ground control points (polynomial), 3 the geotransform (an image that is already
-// georeferenced); 0 or less the first found in that order. The second argument is not used (it
+// georeferenced), 4 the frame camera of the side file IMAGE.camera.json beside it
+// (docs/cameras.md); 0 or less the camera side file when there is one, else the first found of
+// 1, 2, 3 in that order. The second argument is not used (it
 // names no other source of a model). Throws FileNotFoundException for a missing file,
 // DataException when GDAL cannot open it or it has no model of the kind asked for (naming the
 // file and what was looked for), ParameterException for another segment number.

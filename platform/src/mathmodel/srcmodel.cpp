@@ -16,7 +16,7 @@ namespace mathmodel {
 
 namespace {
 
-enum Segment { kAny = 0, kRpc = 1, kGcp = 2, kGeoTransform = 3 };
+enum Segment { kAny = 0, kRpc = 1, kGcp = 2, kGeoTransform = 3, kCamera = 4 };
 
 const char* SegmentName(int segment) {
     switch (segment) {
@@ -26,19 +26,23 @@ const char* SegmentName(int segment) {
             return "ground control points";
         case kGeoTransform:
             return "a geotransform";
+        case kCamera:
+            return "camera side file (IMAGE.camera.json)";
         default:
-            return "RPC coefficients, ground control points or a geotransform";
+            return "a camera side file, RPC coefficients, ground control points or a "
+                   "geotransform";
     }
 }
 
 }  // namespace
 
 std::unique_ptr<IMathModel> OpenSourceModel(const std::string& path, int segment) {
-    if (segment > kGeoTransform) {
+    if (segment > kCamera) {
         KESTREL_THROW(ParameterException, "segment", ParameterException::Unsupported,
-                      std::to_string(segment), "0 or less, 1, 2 or 3",
+                      std::to_string(segment), "0 or less, 1, 2, 3 or 4",
                       FormatString("Math-model segment %d of \"%s\" is not one of 1 (RPC), 2 "
-                                   "(GCP), 3 (geotransform) or 0 (the first found)",
+                                   "(GCP), 3 (geotransform), 4 (camera side file) or 0 (the "
+                                   "first found)",
                                    segment, path.c_str()));
     }
     gdalsupport::EnsureRegistered();
@@ -57,6 +61,9 @@ std::unique_ptr<IMathModel> OpenSourceModel(const std::string& path, int segment
     const auto width = static_cast<unsigned int>(dataset->GetRasterXSize());
     const auto height = static_cast<unsigned int>(dataset->GetRasterYSize());
 
+    const std::string cameraFile = CameraSideFile(path);
+    if ((segment <= kAny || segment == kCamera) && VSIStatL(cameraFile.c_str(), &stat) == 0)
+        return ReadCameraFile(cameraFile, width, height);
     if (segment <= kAny || segment == kRpc) {
         char** rpcDomain = dataset->GetMetadata("RPC");
         GDALRPCInfoV2 rpc;
