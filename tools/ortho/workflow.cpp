@@ -281,6 +281,11 @@ int Workflow::Run() {
         step = Clock::now();
         if (anyScene)
             MakeGrid();
+        if (anyScene && !stopped_) {
+            const std::string holes = SurfaceHoles(options_, grid_);
+            if (!holes.empty())
+                progress_.Info(holes);
+        }
         summary_.timings.emplace_back("grid", SecondsSince(step));
         step = Clock::now();
         if (!stopped_ && anyScene)
