@@ -271,8 +271,9 @@ void TileWindow(const Plan& plan, Worker& w, int tx, int ty, int tw, int th, int
             break;
         highest = high;
     }
-    // Then the window's own heights.
-    for (;;) {
+    // Then the window's own heights (a few rounds at most: only a surface whose heights keep
+    // rising ever farther out needs more, and gets the reach of the last round).
+    for (int round = 0;; ++round) {
         ex = tx - left, ey = ty - up, ew = tw + left + right, eh = th + up + down;
         WindowHeights(plan, w, ex, ey, ew, eh);
         double low = std::numeric_limits<double>::infinity(), high = -low;
@@ -285,7 +286,7 @@ void TileWindow(const Plan& plan, Worker& w, int tx, int ty, int tw, int th, int
             return;  // no ground in the tile: nothing to hide
         int l, r, u, d;
         reach.Apply(plan, high - low + 1, l, r, u, d);
-        if (l <= left && r <= right && u <= up && d <= down)
+        if ((l <= left && r <= right && u <= up && d <= down) || round == 8)
             return;
         left = std::max(left, l), right = std::max(right, r);
         up = std::max(up, u), down = std::max(down, d);
