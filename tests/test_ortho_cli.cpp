@@ -61,6 +61,7 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
     const CommandLine cases[] = {
         {{master}, {"--srs", "EPSG:99999"}, "--srs: \"EPSG:99999\" names no coordinate system"},
         {{master}, {"--srs", "EPSG:4978"}, "neither a projected nor a geographic"},
+        {{master}, {"--srs", "foo"}, "--srs: \"foo\" names no coordinate system: not an"},
         {{master}, {"--proc", "FPGA"}, "--proc: Cannot read PROC option \"FPGA\""},
         {{master}, {"--proc", "GPU:1,1"}, "--proc: Cannot read PROC option \"GPU:1,1\""},
         {{master}, {"--of", "nonsense"}, "--of: Unknown output file type \"nonsense\""},
@@ -75,6 +76,16 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--elevref", "XX"}, "--elevref: Unrecognized value"},
         {{master}, {"--elunits", "parsec"}, "--elunits: Unknown elevation unit"},
         {{master}, {"--elfactor", "1,0"}, "--elfactor: Invalid -elfactor argument"},
+        {{master}, {"--elfactor", "1,x"}, "--elfactor: \"x\" is not a number"},
+        {{master}, {"--tin", dem, "--dem", dem}, "exactly one of --dem and --tin"},
+        {{master}, {"--jobs", "0"}, "--jobs: at least one job"},
+        {{master}, {"--jobs", "two"}, "\"two\" is not a whole"},
+        {{master}, {"--lines", "5:5"}, "empty slice"},
+        {{master}, {"--lines", "x:2"}, "--lines: \"x\""},
+        {{master}, {"--pixel-size", "-1"}, "is negative"},
+        {{master}, {"--pixel-size", "nan"}, "is not a number"},
+        {{master}, {"--frobnicate"}, "unknown option"},
+        {{master}, {"--dem"}, "--dem needs a value"},
         // A master file where images are expected, and the reverse, said plainly.
         {{image, master}, {}, master + textNotImage},
         {{master, master}, {}, "give either one master parameter file or images"},
@@ -97,6 +108,19 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         EXPECT_FALSE(fs::exists(out));
     }
     EXPECT_EQ(ReadFile(dir.File("taken/master.txt")), "mine.tif\n");
+
+    // Command lines without their essential parts.
+    const std::pair<std::vector<std::string>, std::string> incomplete[] = {
+        {{}, "the master parameter file is missing"},
+        {{master, "--dem", dem}, "--out DIR is missing"},
+        {{master, "--out", out}, "exactly one of --dem and --tin"},
+    };
+    for (const auto& [args, message] : incomplete) {
+        const ProgramResult r = Ortho(args, dir);
+        EXPECT_EQ(r.status, 2) << message;
+        EXPECT_NE(r.err.find(message), std::string::npos) << r.err;
+    }
+    EXPECT_FALSE(fs::exists(out));
 }
 
 // Every value --help offers passes the checks: a slice beyond the master file's one line runs

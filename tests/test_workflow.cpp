@@ -45,41 +45,6 @@ Result Ortho(const std::vector<std::string>& args, const TempDir& dir) {
     return RunProgram(kOrtho, args, dir);
 }
 
-TEST(WorkflowCommand, RefusesBadCommandLinesWithStatus2) {
-    TempDir dir;
-    const std::string master = WriteFile(dir.File("master.txt"), "a.tif\n");
-    const std::string out = dir.File("out");
-    const struct {
-        std::vector<std::string> args;
-        std::string message;
-    } cases[] = {
-        {{}, "the master parameter file is missing"},
-        {{master, "--dem", "d.tif"}, "--out DIR is missing"},
-        {{master, "--out", out}, "exactly one of --dem and --tin"},
-        {{master, "--out", out, "--dem", "d.tif", "--tin", "t.gpkg"}, "exactly one of"},
-        {{master, "--out", out, "--dem", "d.tif", "--jobs", "0"}, "--jobs: at least one job"},
-        {{master, "--out", out, "--dem", "d.tif", "--jobs", "two"}, "\"two\" is not a whole"},
-        {{master, "--out", out, "--dem", "d.tif", "--lines", "5:5"}, "empty slice"},
-        {{master, "--out", out, "--dem", "d.tif", "--lines", "x:2"}, "--lines: \"x\""},
-        {{master, "--out", out, "--dem", "d.tif", "--pixel-size", "-1"}, "is negative"},
-        {{master, "--out", out, "--dem", "d.tif", "--pixel-size", "nan"}, "is not a number"},
-        {{master, "--out", out, "--dem", "d.tif", "--elfactor", "1,x"}, "\"x\" is not a number"},
-        {{master, "--out", out, "--dem"}, "--dem needs a value"},
-        {{master, "--out", out, "--dem", "d.tif", "--frobnicate"}, "unknown option"},
-        {{master, master, "--out", out, "--dem", "d.tif"}, "one master parameter file"},
-    };
-    for (const auto& c : cases) {
-        const Result r = Ortho(c.args, dir);
-        EXPECT_EQ(r.status, 2) << c.message;
-        EXPECT_NE(r.err.find(c.message), std::string::npos) << r.err;
-    }
-    EXPECT_FALSE(std::filesystem::exists(out));
-
-    const Result help = Ortho({"--help"}, dir);
-    EXPECT_EQ(help.status, 0);
-    EXPECT_NE(help.out.find("usage: silvan-ortho MASTER --out DIR"), std::string::npos);
-}
-
 TEST(WorkflowCommand, MissingMasterFileStopsNamingIt) {
     TempDir dir;
     const std::string dem = WriteFile(dir.File("d.tif"), "");

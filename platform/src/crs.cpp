@@ -32,8 +32,11 @@ ICRS::ICRS(const std::string& definition) : srs_(NewSpatialReference()) {
     gdalsupport::ErrorCapture errors;
     if (definition.empty() || definition.find('\0') != std::string::npos ||
         srs_->SetFromUserInput(definition.c_str()) != OGRERR_NONE) {
+        const std::string reason =
+            errors.Reason("not an authority code (EPSG:32632), WKT, PROJ string or file that "
+                          "holds one");
         KESTREL_THROW(DataException, FormatString("\"%s\" names no coordinate system: %s",
-                                                  definition.c_str(), errors.Reason().c_str()));
+                                                  definition.c_str(), reason.c_str()));
     }
     srs_->SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
 }

@@ -45,12 +45,12 @@ void ErrorCapture::Handler(int errorClass, int /*errorNumber*/, const char* mess
     }
 }
 
-std::string ErrorCapture::Reason() const {
+std::string ErrorCapture::Reason(const char* fallback) const {
     if (!failure_.empty())
         return failure_;
     if (!warning_.empty())
         return warning_;
-    return "unknown reason";
+    return fallback;
 }
 
 }  // namespace gdalsupport

@@ -19,8 +19,8 @@ class ErrorCapture {
     ErrorCapture(const ErrorCapture&) = delete;
     ErrorCapture& operator=(const ErrorCapture&) = delete;
 
-    // The last failure's message (warnings when there was no failure), or "unknown reason".
-    std::string Reason() const;
+    // The last failure's message (warnings when there was no failure), or else fallback.
+    std::string Reason(const char* fallback = "unknown reason") const;
     bool Failed() const { return failed_; }
 
   private:
