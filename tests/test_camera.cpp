@@ -494,5 +494,7 @@ TEST(FrameCamera, UnusableOrientationsAreNamed) {
     testsupport::WriteFile(side, "{" + std::string(good).replace(good.find("80"), 2, "81") + "}");
     const std::string message = Thrown(fromSide);
     EXPECT_NE(message.find(side), std::string::npos) << message;
-    EXPECT_NE(message.find("100 x 81 pixels, the image 100 x 80"), std::string::npos) << message;
+    EXPECT_NE(message.find("the camera of \"" + image + "\" is 100 x 81 pixels, the image 100 x 80"),
+              std::string::npos)
+        << message;
 }

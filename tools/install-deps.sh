@@ -1,9 +1,10 @@
 #!/usr/bin/env bash
-# Installs the Debian 12 packages needed to build, test and benchmark the library.
+# Installs the Debian 12 packages needed to build, test and benchmark the library (OpenCV's
+# Python module is the oracle of the camera-model tests).
 set -euo pipefail
 packages=(cmake g++ make pkg-config googletest libgtest-dev libgmock-dev libbenchmark-dev
           libxerces-c-dev libgdal-dev libproj-dev proj-data proj-bin gdal-bin
-          libxml2-utils locales)
+          libxml2-utils locales python3-opencv)
 missing=()
 for p in "${packages[@]}"; do
     dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")

@@ -102,10 +102,10 @@ KESTREL_API std::array<double, 9> RotationFromAxisAngle(const std::array<double,
 // The side file of an image: its name without the extension, then ".camera.json".
 KESTREL_API std::string CameraSideFile(const std::string& imagePath);
 
-// Reads a camera side file (the image's width and height are checked against it when not 0).
+// Reads a camera side file; the size of the image at imagePath, when given, is checked against
+// the camera's.
 KESTREL_API std::unique_ptr<IMathModel> ReadCameraFile(const std::string& path,
-                                                       unsigned int imageWidth = 0,
-                                                       unsigned int imageHeight = 0);
+                                                       const std::string& imagePath = "");
 
 // Writes a camera side file whole (under a temporary name, then renamed).
 KESTREL_API void WriteCameraFile(const std::string& path, const CameraIntrinsics& intrinsics,

@@ -332,8 +332,10 @@ std::string CameraSideFile(const std::string& imagePath) {
     return fs::path(imagePath).replace_extension(".camera.json").string();
 }
 
-std::unique_ptr<IMathModel> ReadCameraFile(const std::string& path, unsigned int imageWidth,
-                                           unsigned int imageHeight) {
+std::unique_ptr<IMathModel> ReadCameraFile(const std::string& path, const std::string& imagePath) {
+    unsigned int imageWidth = 0, imageHeight = 0;
+    if (!imagePath.empty())
+        RasterSize(imagePath, imageWidth, imageHeight);
     const CPLJSONObject root = LoadJson(path);
     if (root.GetType() != CPLJSONObject::Type::Object) {
         KESTREL_THROW(DataException,
@@ -341,7 +343,7 @@ std::unique_ptr<IMathModel> ReadCameraFile(const std::string& path, unsigned int
                                    path.c_str()));
     }
     const CameraIntrinsics intrinsics = ReadIntrinsics(root, path);
-    CheckSize(intrinsics, imageWidth, imageHeight, path, root.GetString("image", "the image"));
+    CheckSize(intrinsics, imageWidth, imageHeight, path, imagePath);
     CameraPose pose;
     pose.crs = root.GetString("crs", "");
     if (pose.crs.empty()) {

@@ -202,6 +202,11 @@ class FrameCameraModel final : public IMathModel {
         const double inverseFlattening = geocentric.GetInvFlattening();
         const double f = inverseFlattening > 0 ? 1.0 / inverseFlattening : 0.0;
         eccentricity2_ = f * (2 - f);
+        // Longitude, latitude in degrees and ellipsoidal heights go to the geocentric frame by a
+        // closed formula, without PROJ.
+        geodetic_ = srs.IsGeographic() && !srs.IsCompound() && srs.GetAxesCount() == 3 &&
+                    std::fabs(srs.GetAngularUnits() - kPi / 180) < 1e-15 &&
+                    srs.GetPrimeMeridian() == 0.0;
 
         Matrix frame;  // geocentric to the pose's frame
         if (pose.frame == CameraPose::Frame::LocalGrid) {
@@ -254,7 +259,18 @@ class FrameCameraModel final : public IMathModel {
     void GroundToImage(std::size_t n, const double* x, const double* y, const double* z,
                        double* pixel, double* line, bool* ok) const override {
         std::vector<double> gx(x, x + n), gy(y, y + n), gz(z, z + n);
-        toCartesian_->Take()->Transform(n, gx.data(), gy.data(), gz.data());
+        if (geodetic_) {
+            for (std::size_t i = 0; i < n; ++i) {
+                const double lon = gx[i] * (kPi / 180), lat = gy[i] * (kPi / 180);
+                const double sp = std::sin(lat), cp = std::cos(lat);
+                const double nu = semiMajor_ / std::sqrt(1 - eccentricity2_ * sp * sp);
+                gx[i] = (nu + gz[i]) * cp * std::cos(lon);
+                gy[i] = (nu + gz[i]) * cp * std::sin(lon);
+                gz[i] = (nu * (1 - eccentricity2_) + gz[i]) * sp;
+            }
+        } else {
+            toCartesian_->Take()->Transform(n, gx.data(), gy.data(), gz.data());
+        }
         for (std::size_t i = 0; i < n; ++i) {
             const Vector p = Apply(rotation_, {gx[i] - centre_[0], gy[i] - centre_[1],
                                                gz[i] - centre_[2]});
@@ -337,6 +353,7 @@ class FrameCameraModel final : public IMathModel {
     ogc::cs::ICRS crs_;
     std::unique_ptr<TransformPool> toCartesian_, fromCartesian_;
     double semiMajor_ = 0, eccentricity2_ = 0;
+    bool geodetic_ = false;
     Vector centre_{};      // geocentric
     Matrix rotation_{};    // geocentric to camera
     Matrix up_{};          // the east-north-up frame at the centre

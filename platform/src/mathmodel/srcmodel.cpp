@@ -63,7 +63,7 @@ std::unique_ptr<IMathModel> OpenSourceModel(const std::string& path, int segment
 
     const std::string cameraFile = CameraSideFile(path);
     if ((segment <= kAny || segment == kCamera) && VSIStatL(cameraFile.c_str(), &stat) == 0)
-        return ReadCameraFile(cameraFile, width, height);
+        return ReadCameraFile(cameraFile, path);
     if (segment <= kAny || segment == kRpc) {
         char** rpcDomain = dataset->GetMetadata("RPC");
         GDALRPCInfoV2 rpc;
