@@ -616,15 +616,19 @@ void RemoveWriterLeftovers(const std::string& path) {
 // copy where GDAL's driver only copies) and publishes a dataset's files together.
 std::unique_ptr<kestrel::datasources::BasicWriter> SceneRasterWriter(const std::string& path,
                                                                      std::size_t channels,
-                                                                     const std::string& format) {
+                                                                     const std::string& format,
+                                                                     bool classes = false) {
     RemoveWriterLeftovers(path);
     std::vector<unsigned int> numbers(channels);
     for (std::size_t c = 0; c < channels; ++c)
         numbers[c] = static_cast<unsigned int>(c + 1);
     // The fastest deflate level for GeoTIFF: the scene's rasters are read once more, by
     // recovery, and the level costs a quarter of a scene's processor time at the default.
-    return std::make_unique<kestrel::datasources::BasicWriter>(path, numbers, format,
-                                                               format == "GTiff" ? "ZLEVEL=1" : "");
+    // Overviews of classes take the nearest class, never a mean of two.
+    const std::string options = format == "GTiff"            ? "ZLEVEL=1"
+                                : format == "COG" && classes ? "OVERVIEW_RESAMPLING=NEAREST"
+                                                             : "";
+    return std::make_unique<kestrel::datasources::BasicWriter>(path, numbers, format, options);
 }
 
 // The channels of the scene's ortho: those its line lists, or all of the source's.
@@ -668,7 +672,7 @@ OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Gri
     job.visibilityPath = visibility;
     job.format = kestrel::core::FType2FormatName(options.format);
     const auto orthoWriter = SceneRasterWriter(ortho, OrthoChannelCount(scene), job.format);
-    const auto visibilityWriter = SceneRasterWriter(visibility, 1, job.format);
+    const auto visibilityWriter = SceneRasterWriter(visibility, 1, job.format, true);
     job.orthoWriter = orthoWriter.get();
     job.visibilityWriter = visibilityWriter.get();
 
