@@ -502,7 +502,7 @@ TEST_F(BoxFixture, BadInputIsRefusedWithWhatAndWhere) {
          [&](TorthoJob& j) {
              j.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(516000, 5034000, 0.5, 0.5);
          },
-         "does not cover the output grid"},
+         "does not meet the output grid"},
         {"grid outside the image",
          [&](TorthoJob& j) {
              j.surface = &flat;

@@ -414,9 +414,10 @@ TEST(Layout, ExtentAgreesWithGdalwarpOverTerrain) {
     }
 }
 
-// A DEM that misses part of the scene, one that misses all of it, and requests that would
-// give a useless grid, are refused with what was wrong.
-TEST(Layout, RefusesTerrainThatMissesTheSceneAndUselessGrids) {
+// A DEM that covers part of the scene gives the layout of the covered ground and says what share
+// it leaves out; one that misses all of it, or covers under 2 %, and requests that would give a
+// useless grid, are refused with what was wrong.
+TEST(Layout, PartialTerrainCutsTheSceneAndTooLittleIsRefused) {
     TempDir dir;
     const std::string image = dir.File("src.tif");
     rpcscene::WriteRpcImage(image, 1000, 800);
@@ -433,12 +434,26 @@ TEST(Layout, RefusesTerrainThatMissesTheSceneAndUselessGrids) {
     };
     const kestrel::orthoutils::LayoutRequest plain;
     // The scene's centre is near (514900, 5034000).
-    const FunctionTerrain half(&rpcscene::Hills, 511000, 5030000, 514900, 5038000);
-    expectMessage(&half, plain, "The DEM does not cover the scene");
+    const FunctionTerrain terrain = SceneHills();
+    const kestrel::orthoutils::Layout whole =
+        kestrel::orthoutils::ComputeLayout(*model, &terrain, plain);
+    EXPECT_EQ(whole.uncoveredShare, 0.0);
+    const auto xs = std::minmax_element(whole.borderX.begin(), whole.borderX.end());
+    const double west = *xs.first, east = *xs.second;
+    const FunctionTerrain half(&rpcscene::Hills, 511000, 5030000, (west + east) / 2, 5038000);
+    const kestrel::orthoutils::Layout cut =
+        kestrel::orthoutils::ComputeLayout(*model, &half, plain);
+    EXPECT_NEAR(cut.uncoveredShare, 0.5, 0.1);
+    for (double x : cut.borderX)
+        EXPECT_LE(x, (west + east) / 2 + 1e-6);
+    EXPECT_NEAR(cut.geocoding.GetGeoTransform()[0], whole.geocoding.GetGeoTransform()[0], 2.0);
+    EXPECT_LT(cut.pixels, whole.pixels * 0.6);
+    const FunctionTerrain sliver(&rpcscene::Hills, 511000, 5030000, west + (east - west) * 0.01,
+                                 5038000);
+    expectMessage(&sliver, plain, "% of the scene's ground, under the 2 % needed");
     const FunctionTerrain far(&rpcscene::Hills, 600000, 5030000, 608000, 5038000);
     expectMessage(&far, plain, "miss the DEM entirely");
 
-    const FunctionTerrain terrain = SceneHills();
     kestrel::orthoutils::LayoutRequest request;
     request.pixelWidth = -1;
     expectMessage(&terrain, request, "is not a finite value of 0 or more");

@@ -463,6 +463,34 @@ void ReplaceInFile(const std::string& path, const std::string& from, const std::
     WriteFile(path, text.replace(at, from.size(), to));
 }
 
+// A surface model that covers only the middle of the images: orthos of the covered ground, and
+// one warning line per scene saying what share of its ground the surface leaves out.
+TEST(Workflow, SurfaceOverPartOfTheImagesMakesOrthosOfTheCoveredGround) {
+    TempDir dir;
+    std::vector<std::string> args = MakeSample(dir);
+    const Result cut = RunProgram("gdal_translate", {"-q", "-srcwin", "160", "160", "160", "160",
+                                                     dir.File("sample/dsm.tif"),
+                                                     dir.File("sample/middle.tif")},
+                                  dir);
+    ASSERT_EQ(cut.status, 0) << cut.err;
+    std::replace(args.begin(), args.end(), dir.File("sample/dsm.tif"),
+                 dir.File("sample/middle.tif"));
+    args.erase(std::remove(args.begin(), args.end(), std::string("--quiet")), args.end());
+    const Result run = Ortho(args, dir);
+    ASSERT_EQ(run.status, 0) << run.err;
+    std::size_t warnings = 0;
+    for (std::size_t at = run.err.find("the surface model leaves out"); at != std::string::npos;
+         at = run.err.find("the surface model leaves out", at + 1))
+        ++warnings;
+    EXPECT_EQ(warnings, SceneStates(dir).size()) << run.err;
+    Dataset middle = Open(dir.File("sample/middle.tif"));
+    Dataset mosaic = Open(dir.File("out/mosaic.tif"));
+    ASSERT_TRUE(middle && mosaic);
+    // The grid is the covered ground's, in whole blocks of 16 pixels.
+    EXPECT_LE(mosaic->GetRasterXSize(), middle->GetRasterXSize() + 32);
+    EXPECT_LE(mosaic->GetRasterYSize(), middle->GetRasterYSize() + 32);
+}
+
 // A rerun after each change makes again exactly the scenes (and the mosaic) that the change
 // touches, and says why.
 TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {

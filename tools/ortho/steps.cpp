@@ -10,6 +10,7 @@
 #include <kestrel/crs.h>
 #include <kestrel/exception.h>
 #include <kestrel/formats.h>
+#include <kestrel/orthoutils.h>
 #include <kestrel/processparams.h>
 #include <kestrel/rasterio.h>
 
@@ -497,6 +498,10 @@ Grid SceneLayout(const Options& options, const SceneInput& scene, const std::str
     grid.lines = lines;
     if (footprint != nullptr)
         *footprint = std::move(outFootprint);
+    else if (dem != nullptr)
+        grid.uncoveredShare =
+            kestrel::orthoutils::ComputeLayout(*model, dem, kestrel::orthoutils::LayoutRequest())
+                .uncoveredShare;
     return grid;
 }
 

@@ -23,6 +23,9 @@ struct Grid {
     std::array<double, 6> geoTransform{};
     unsigned int pixels = 0;
     unsigned int lines = 0;
+    // Of a scene's own layout over a raster DSM: the share of the image's ground that the
+    // surface does not cover (the layout is that of the covered ground).
+    double uncoveredShare = 0.0;
 
     double PixelSize() const;
     // Same size, same placement (to a thousandth of a pixel), same CRS text.
@@ -81,7 +84,8 @@ std::string SurfaceHoles(const Options& options, const Grid& grid);
 void CheckSource(const SceneInput& scene);
 
 // The layout of a scene on its own: the grid in crs (empty: chosen for the scene) with the
-// pixel size (0: the source's resolution), and the scene's footprint when asked for.
+// pixel size (0: the source's resolution), and the scene's footprint when asked for (without
+// it, the grid's uncoveredShare is worked out too).
 Grid SceneLayout(const Options& options, const SceneInput& scene, const std::string& crs,
                  double pixelSize, Footprint* footprint);
 

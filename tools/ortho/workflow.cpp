@@ -600,6 +600,12 @@ void Workflow::MakeGrid() {
         try {
             scene.grid = SceneLayout(options_, scene.input, crs, pixelSize, nullptr);
             scene.hasGrid = true;
+            if (scene.grid.uncoveredShare > 0) {
+                char share[32];
+                std::snprintf(share, sizeof share, "%.1f %%", 100.0 * scene.grid.uncoveredShare);
+                progress_.Info("warning: " + scene.name + ": the surface model leaves out " +
+                               share + " of the image's ground; the ortho covers the rest");
+            }
             grids.push_back(scene.grid);
             if (grids.size() == 1) {
                 crs = scene.grid.crs;

@@ -183,6 +183,10 @@ struct Layout {
     std::vector<double> borderY;
     double minHeight = 0.0;
     double maxHeight = 0.0;
+    // The share of the image's ground (0 to 1) that the surface does not cover. A surface that
+    // covers part of it gives the layout and border of the covered ground; under 2 % covered,
+    // the layout is refused.
+    double uncoveredShare = 0.0;
 };
 
 // The layout of the model's image over the terrain (null: flat at request.flatHeight).

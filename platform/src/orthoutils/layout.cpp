@@ -24,6 +24,8 @@ using ogc::cs::ICRS;
 
 // The largest grid side accepted: a wrong pixel size must not give an absurd raster.
 constexpr double kMaxGridSide = 1048576.0;
+// The least share of an image's ground that a surface must cover.
+constexpr double kMinSurfaceCover = 0.02;
 
 // The horizontal part of a coordinate system (compound: its horizontal CRS; geographic 3-D: the
 // 2-D one), so that transformations between ground positions never touch heights.
@@ -332,6 +334,31 @@ bool TerrainBox(const PlaneMapping& toTerrain, std::vector<double> x, std::vecto
     return true;
 }
 
+// The part of a ring inside a box (minX, minY, maxX, maxY), by clipping it against each side.
+void ClipRing(std::vector<double>& x, std::vector<double>& y, const double box[4]) {
+    for (int side = 0; side < 4 && !x.empty(); ++side) {
+        const bool horizontal = side % 2 == 0;  // sides 0 and 2 bound x, 1 and 3 bound y
+        const double limit = box[side];
+        auto inside = [&](double px, double py) {
+            const double v = horizontal ? px : py;
+            return side < 2 ? v >= limit : v <= limit;
+        };
+        std::vector<double> cx, cy;
+        for (std::size_t i = 0, n = x.size(); i < n; ++i) {
+            const std::size_t j = (i + 1) % n;
+            const bool a = inside(x[i], y[i]), b = inside(x[j], y[j]);
+            if (a)
+                cx.push_back(x[i]), cy.push_back(y[i]);
+            if (a != b) {
+                const double t = horizontal ? (limit - x[i]) / (x[j] - x[i])
+                                            : (limit - y[i]) / (y[j] - y[i]);
+                cx.push_back(x[i] + t * (x[j] - x[i])), cy.push_back(y[i] + t * (y[j] - y[i]));
+            }
+        }
+        x.swap(cx), y.swap(cy);
+    }
+}
+
 std::unique_ptr<ICRS> UtmZoneOf(double longitude, double latitude) {
     int zone = static_cast<int>(std::floor((longitude + 180.0) / 6.0)) % 60 + 1;
     if (zone < 1)
@@ -345,6 +372,44 @@ void CheckFinite(const std::vector<double>& values, const char* what, const Sour
         if (!std::isfinite(v))
             KESTREL_THROW_AT(at, DataException, FormatString("%s holds a non-finite value", what));
     }
+}
+
+// A surface that covers part of the image: the border rays that miss it are placed at the
+// mean height (flat), and the ring is cut to the surface's extent, so that the layout is that of
+// the ground the surface covers. Refused when what remains is under kMinSurfaceCover of the
+// image's ground.
+void ClipToTerrain(const mathmodel::IMathModel& model, const dem::IElevationSource& terrain,
+                   const std::vector<double>& flatX, const std::vector<double>& flatY,
+                   double firstPixel, double firstLine, std::vector<double>& gx,
+                   std::vector<double>& gy, Layout& layout) {
+    for (std::size_t i = 0; i < gx.size(); ++i) {
+        if (!std::isfinite(gx[i]) || !std::isfinite(gy[i]))
+            gx[i] = flatX[i], gy[i] = flatY[i];
+    }
+    std::vector<double> tx = gx, ty = gy;
+    PlaneMapping(model.GetCRS(), terrain.GetCRS()).Map(tx.size(), tx.data(), ty.data());
+    const double whole = PolygonArea(tx, ty);
+    double box[4];
+    terrain.GetExtent(box[0], box[1], box[2], box[3]);
+    ClipRing(tx, ty, box);
+    const double covered = tx.size() >= 3 ? PolygonArea(tx, ty) : 0.0;
+    const double share = whole > 0 ? covered / whole : 0.0;
+    if (share == 0.0) {
+        KESTREL_THROW(DataException,
+                      "The border rays of the image miss the DEM entirely: the surface and the "
+                      "image's ground do not overlap");
+    }
+    if (share < kMinSurfaceCover) {
+        KESTREL_THROW(DataException,
+                      FormatString("The DEM covers %.1f %% of the scene's ground, under the "
+                                   "%.0f %% needed (the border ray at pixel %g, line %g misses "
+                                   "it)",
+                                   100.0 * share, 100.0 * kMinSurfaceCover, firstPixel,
+                                   firstLine));
+    }
+    PlaneMapping(terrain.GetCRS(), model.GetCRS()).Map(tx.size(), tx.data(), ty.data());
+    gx.swap(tx), gy.swap(ty);
+    layout.uncoveredShare = 1.0 - share;
 }
 
 }  // namespace
@@ -481,20 +546,17 @@ Layout ComputeLayout(const mathmodel::IMathModel& model, const dem::IElevationSo
                 first = std::min(first, i);
             }
         }
-        if (missed == n) {
-            KESTREL_THROW(DataException,
-                          "The border rays of the image miss the DEM entirely: no ray through "
-                          "the image's border meets the terrain");
+        // Heights of the rays' hits; of the surveyed terrain when every ray misses (a surface
+        // inside the image's border).
+        double hitLow = HUGE_VAL, hitHigh = -HUGE_VAL;
+        for (double v : gh) {
+            if (std::isfinite(v))
+                hitLow = std::min(hitLow, v), hitHigh = std::max(hitHigh, v);
         }
-        if (missed > 0) {
-            KESTREL_THROW(DataException,
-                          FormatString("The DEM does not cover the scene: %zu of %zu rays "
-                                       "through the image's border miss it, the first at pixel "
-                                       "%g, line %g",
-                                       missed, n, pixel[first], line[first]));
-        }
-        const auto range = std::minmax_element(gh.begin(), gh.end());
-        layout.minHeight = *range.first, layout.maxHeight = *range.second;
+        layout.minHeight = missed == n ? low : hitLow;
+        layout.maxHeight = missed == n ? high : hitHigh;
+        if (missed > 0)
+            ClipToTerrain(model, *terrain, fx, fy, pixel[first], line[first], gx, gy, layout);
     }
 
     // The output coordinate system.
@@ -505,21 +567,23 @@ Layout ComputeLayout(const mathmodel::IMathModel& model, const dem::IElevationSo
     } else if (model.GetCRS() != nullptr) {
         const ICRS wgs84("EPSG:4326");
         double lon = 0, lat = 0;
-        for (std::size_t i = 0; i < n; ++i)
-            lon += gx[i] / n, lat += gy[i] / n;
+        for (std::size_t i = 0; i < gx.size(); ++i)
+            lon += gx[i] / gx.size(), lat += gy[i] / gy.size();
         PlaneMapping(model.GetCRS(), &wgs84).Map(1, &lon, &lat);
         if (!std::isfinite(lon) || !std::isfinite(lat))
             KESTREL_THROW(DataException, "The scene's centre has no longitude and latitude");
         layout.crs = UtmZoneOf(lon, lat);
     }
-    PlaneMapping(model.GetCRS(), layout.crs.get()).Map(n, gx.data(), gy.data());
+    PlaneMapping(model.GetCRS(), layout.crs.get()).Map(gx.size(), gx.data(), gy.data());
     CheckFinite(gx, "The border traced in the output coordinate system", KESTREL_HERE);
     CheckFinite(gy, "The border traced in the output coordinate system", KESTREL_HERE);
 
     // Pixel size and grid.
     double pw = request.pixelWidth, ph = request.pixelHeight;
     if (pw == 0 && ph == 0) {
-        pw = ph = std::sqrt(PolygonArea(gx, gy) / (static_cast<double>(width) * height));
+        // The ground that the surface covers holds its share of the image's pixels.
+        pw = ph = std::sqrt(PolygonArea(gx, gy) / (static_cast<double>(width) * height *
+                                                   (1.0 - layout.uncoveredShare)));
         if (!(pw > 0) || !std::isfinite(pw)) {
             KESTREL_THROW(DataException,
                           "The pixel size is 0 and the math model gives no ground resolution");

@@ -561,8 +561,8 @@ void ReadFileSource(const TorthoJob& job, GDALDataset& source, Plan& plan,
     plan.dataType = type;
 }
 
-// The surface must cover the output grid: a grid partly without heights is a wrong input
-// rather than a smaller ortho.
+// The surface must meet the output grid; where it does not cover the grid, the visibility index
+// says "no height".
 void CheckSurfaceCovers(const TorthoJob& job) {
     double minX, minY, maxX, maxY;
     job.surface->GetExtent(minX, minY, maxX, maxY);
@@ -576,17 +576,14 @@ void CheckSurfaceCovers(const TorthoJob& job) {
         job.geocoding.PixelToGround(corners[k][0], corners[k][1], gx[k], gy[k]);
     if (surfaceCrs != nullptr && !surfaceCrs->IsSame(*job.crs))
         ogc::cs::CoordinateTransformation(*job.crs, *surfaceCrs).Transform(4, gx.data(), gy.data());
-    const double slackX = 1e-6 * std::max(1.0, std::fabs(maxX - minX));
-    const double slackY = 1e-6 * std::max(1.0, std::fabs(maxY - minY));
-    for (int k = 0; k < 4; ++k)
-        if (!(gx[k] >= minX - slackX && gx[k] <= maxX + slackX && gy[k] >= minY - slackY &&
-              gy[k] <= maxY + slackY))
-            KESTREL_THROW(DataException,
-                          FormatString("True ortho: the surface model (%.3f, %.3f to %.3f, %.3f) "
-                                       "does not cover the output grid: its corner pixel (%.1f, "
-                                       "%.1f) lies at (%.3f, %.3f)",
-                                       minX, minY, maxX, maxY, corners[k][0] - 0.5,
-                                       corners[k][1] - 0.5, gx[k], gy[k]));
+    const auto xs = std::minmax_element(gx.begin(), gx.end());
+    const auto ys = std::minmax_element(gy.begin(), gy.end());
+    if (!(*xs.second >= minX && *xs.first <= maxX && *ys.second >= minY && *ys.first <= maxY))
+        KESTREL_THROW(DataException,
+                      FormatString("True ortho: the surface model (%.3f, %.3f to %.3f, %.3f) "
+                                   "does not meet the output grid (%.3f, %.3f to %.3f, %.3f)",
+                                   minX, minY, maxX, maxY, *xs.first, *ys.first, *xs.second,
+                                   *ys.second));
 }
 
 // Looks at the grid through the model on a sparse sample: the surface's height range, how far
