@@ -471,6 +471,28 @@ TEST_F(BoxFixture, ReaderAndWritersGiveWhatPathsGive) {
         EXPECT_TRUE(ReadBand(dir.File("w-ortho.tif"), band) == expected) << band;
     }
     EXPECT_TRUE(ReadBand(dir.File("w-visibility.tif")) == ReadBand(dir.File("visibility.tif")));
+
+    // Paths in a format written by copy: the same values, the visibility index one Byte band.
+    for (const auto& [format, ext] : {std::pair<const char*, const char*>{"COG", ".tif"},
+                                      std::pair<const char*, const char*>{"PNG", ".png"}}) {
+        TorthoJob job = Job();
+        job.format = format;
+        job.orthoPath = dir.File(std::string("f-ortho") + ext);
+        job.visibilityPath = dir.File(std::string("f-visibility") + ext);
+        ASSERT_TRUE(TorthoGenerator(settings).Generate(job).completed) << format;
+        for (int band = 1; band <= 3; ++band)
+            EXPECT_TRUE(ReadBand(job.orthoPath, band) == ReadBand(dir.File("ortho.tif"), band))
+                << format << ", band " << band;
+        EXPECT_TRUE(ReadBand(job.visibilityPath) == ReadBand(dir.File("visibility.tif")))
+            << format;
+        std::unique_ptr<GDALDataset> vis(
+            GDALDataset::Open(job.visibilityPath.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
+        ASSERT_TRUE(vis) << format;
+        EXPECT_EQ(vis->GetRasterCount(), 1) << format;
+        EXPECT_EQ(vis->GetRasterBand(1)->GetRasterDataType(), GDT_Byte) << format;
+        const char* layout = vis->GetMetadataItem("LAYOUT", "IMAGE_STRUCTURE");
+        EXPECT_EQ(std::string(format) == "COG", layout != nullptr && std::string(layout) == "COG");
+    }
 }
 
 // The same height everywhere, with no edge.

@@ -617,33 +617,6 @@ void RemoveWriterLeftovers(const std::string& path) {
         RemoveFile(leftover);
 }
 
-// A new raster of the scene through the platform's writer, which writes every file type (by
-// copy where GDAL's driver only copies) and publishes a dataset's files together.
-std::unique_ptr<kestrel::datasources::BasicWriter> SceneRasterWriter(const std::string& path,
-                                                                     std::size_t channels,
-                                                                     const std::string& format,
-                                                                     bool classes = false) {
-    RemoveWriterLeftovers(path);
-    std::vector<unsigned int> numbers(channels);
-    for (std::size_t c = 0; c < channels; ++c)
-        numbers[c] = static_cast<unsigned int>(c + 1);
-    // The fastest deflate level for GeoTIFF: the scene's rasters are read once more, by
-    // recovery, and the level costs a quarter of a scene's processor time at the default.
-    // Overviews of classes take the nearest class, never a mean of two.
-    const std::string options = format == "GTiff"            ? "ZLEVEL=1"
-                                : format == "COG" && classes ? "OVERVIEW_RESAMPLING=NEAREST"
-                                                             : "";
-    return std::make_unique<kestrel::datasources::BasicWriter>(path, numbers, format, options);
-}
-
-// The channels of the scene's ortho: those its line lists, or all of the source's.
-std::size_t OrthoChannelCount(const SceneInput& scene) {
-    std::unique_ptr<kestrel::datasources::IDataset> dataset(GetRasterDataset(scene.source));
-    std::vector<unsigned int> sourceChannels, orthoChannels;
-    GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
-    return orthoChannels.size();
-}
-
 }  // namespace
 
 OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Grid& grid,
@@ -675,11 +648,11 @@ OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Gri
     job.lines = grid.lines;
     job.orthoPath = ortho;
     job.visibilityPath = visibility;
+    // The generator writes both through the platform's writer (every file type, by copy where
+    // GDAL's driver only copies) and publishes them only when complete.
     job.format = kestrel::core::FType2FormatName(options.format);
-    const auto orthoWriter = SceneRasterWriter(ortho, OrthoChannelCount(scene), job.format);
-    const auto visibilityWriter = SceneRasterWriter(visibility, 1, job.format, true);
-    job.orthoWriter = orthoWriter.get();
-    job.visibilityWriter = visibilityWriter.get();
+    RemoveWriterLeftovers(ortho);
+    RemoveWriterLeftovers(visibility);
 
     OrthoProcess process(options.proc, job, progress);
     process.Execute();

@@ -112,9 +112,11 @@ struct KESTREL_API TorthoJob {
     const ogc::cs::ICRS* crs = nullptr;
     ogc::cs::GeocodingInfo geocoding;
     unsigned int pixels = 0, lines = 0;
-    // Outputs, written under a temporary name beside the final one and renamed when complete.
+    // Outputs, written through the platform's BasicWriter under a temporary name beside the final
+    // one and published when complete: tiled and compressed GeoTIFF by default; the visibility
+    // index one Byte band in any format, its overviews (COG) the nearest class.
     std::string orthoPath, visibilityPath;
-    std::string format = "GTiff";  // a GDAL driver that can create files
+    std::string format = "GTiff";  // a GDAL raster driver that writes files, directly or by copy
     // When given (both or neither), the outputs go to these writers instead of orthoPath and
     // visibilityPath. Not owned. The generator describes and creates them and closes them only
     // when the run completes; after a cancelled or failed run the caller deletes them unclosed,

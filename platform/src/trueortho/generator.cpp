@@ -25,7 +25,6 @@ namespace processes {
 
 using trueortho::DatasetPtr;
 using trueortho::Kernel;
-using trueortho::OutputRaster;
 using trueortho::RunControl;
 
 namespace {
@@ -123,49 +122,57 @@ void ReadSource(const Plan& plan, GDALDataset* dataset, int x, int y, int width,
     }
 }
 
-// An output of the run: a file of the generator's own, or a writer the caller gave.
+// The creation options of an output the generator makes itself: the fastest deflate level for
+// GeoTIFF (an ortho is read once more, by recovery, and the default level costs a quarter of a
+// run's processor time); overviews of the visibility index take the nearest class, never a mean
+// of two.
+std::string OutputOptions(const std::string& format, bool classes) {
+    if (format == "GTiff")
+        return "ZLEVEL=1";
+    return classes && format == "COG" ? "OVERVIEW_RESAMPLING=NEAREST" : "";
+}
+
+// A writer of the generator's own for an output given by path.
+std::unique_ptr<datasources::BasicWriter> OutputWriter(const TorthoJob& job,
+                                                       const std::string& path, size_t bands,
+                                                       bool classes) {
+    if (job.orthoWriter != nullptr)
+        return nullptr;
+    std::vector<unsigned int> channels(bands);
+    for (size_t b = 0; b < bands; ++b)
+        channels[b] = static_cast<unsigned int>(b + 1);
+    return std::make_unique<datasources::BasicWriter>(path, channels, job.format,
+                                                      OutputOptions(job.format, classes));
+}
+
+// An output of the run, through a writer of the caller's or of the generator's own.
 class TileOutput {
   public:
-    TileOutput(const TorthoJob& job, datasources::IRasterWriter* writer, const std::string& path,
-               int bands, GDALDataType type, double noData)
+    TileOutput(const TorthoJob& job, datasources::IRasterWriter& writer, int bands,
+               GDALDataType type, double noData)
         : writer_(writer), bands_(static_cast<unsigned int>(bands)) {
-        if (writer_ == nullptr) {
-            file_ = std::make_unique<OutputRaster>(path, job.format, job.pixels, job.lines, bands,
-                                                   type, job.crs, job.geocoding, noData);
-            return;
-        }
-        writer_->SetSize(job.pixels, job.lines);
-        writer_->SetDataType(static_cast<datasources::DataType>(type));
-        writer_->SetChannelCount(bands_);
-        writer_->SetCRS(job.crs);
-        writer_->SetGeocoding(job.geocoding);
-        writer_->SetNoDataValue(noData);
-        writer_->Create();
+        writer_.SetSize(job.pixels, job.lines);
+        writer_.SetDataType(static_cast<datasources::DataType>(type));
+        writer_.SetChannelCount(bands_);
+        writer_.SetCRS(job.crs);
+        writer_.SetGeocoding(job.geocoding);
+        writer_.SetNoDataValue(noData);
+        writer_.Create();
     }
 
     // Writes a window of every band from a Float32 buffer (band after band); thread-safe.
     void Write(int x, int y, int width, int height, const float* buffer) {
-        if (file_) {
-            file_->Write(x, y, width, height, buffer);
-            return;
-        }
         gobs::Raster raster(static_cast<unsigned int>(width), static_cast<unsigned int>(height),
                             bands_, datasources::DataType::Float32, gobs::Raster::Initial::Unset);
         std::memcpy(raster.GetData(), buffer, raster.GetByteSize());
         std::lock_guard<std::mutex> lock(mutex_);
-        writer_->WriteWindow(raster, static_cast<unsigned int>(x), static_cast<unsigned int>(y));
+        writer_.WriteWindow(raster, static_cast<unsigned int>(x), static_cast<unsigned int>(y));
     }
 
-    void Commit() {
-        if (file_)
-            file_->Commit();
-        else
-            writer_->Close();
-    }
+    void Commit() { writer_.Close(); }
 
   private:
-    std::unique_ptr<OutputRaster> file_;
-    datasources::IRasterWriter* writer_;
+    datasources::IRasterWriter& writer_;
     unsigned int bands_;
     std::mutex mutex_;
 };
@@ -656,6 +663,11 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
     std::mutex readLock;
     Plan plan = MakePlan(job, source.get());
     plan.readLock = &readLock;
+    // Outputs given by path: writers of the generator's own, made now so that a format or
+    // option GDAL cannot write is refused before any work. Destroyed unclosed, after a
+    // cancelled or failed run, they leave nothing.
+    const auto ownOrtho = OutputWriter(job, job.orthoPath, plan.bands.size(), false);
+    const auto ownVisibility = OutputWriter(job, job.visibilityPath, 1, true);
     job.surface->SetInputCRS(job.crs);
     CheckSurfaceCovers(job);
     std::unique_ptr<ogc::cs::CoordinateTransformation> toModel;
@@ -672,10 +684,10 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
     if (control.Stopped())
         return result;
 
-    TileOutput ortho(job, job.orthoWriter, job.orthoPath, static_cast<int>(plan.bands.size()),
-                     plan.dataType, job.orthoNoData);
-    TileOutput visibility(job, job.visibilityWriter, job.visibilityPath, 1, GDT_Byte,
-                          VISIBILITY_NODATA);
+    TileOutput ortho(job, ownOrtho ? *ownOrtho : *job.orthoWriter,
+                     static_cast<int>(plan.bands.size()), plan.dataType, job.orthoNoData);
+    TileOutput visibility(job, ownVisibility ? *ownVisibility : *job.visibilityWriter, 1,
+                          GDT_Byte, VISIBILITY_NODATA);
 
     const unsigned int tile = job.tileSize;
     const unsigned int tilesX = (job.pixels + tile - 1) / tile,
@@ -704,7 +716,7 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
             ProcessTile(plan, *w, ortho, visibility, tx, ty, tw, th, control, counts[thread]);
         });
     if (control.Stopped())
-        return result;  // the outputs discard themselves; writers are left unclosed
+        return result;  // the writers are left unclosed
     ortho.Commit();
     visibility.Commit();
     for (const TorthoResult& c : counts) {
