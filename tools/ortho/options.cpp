@@ -140,8 +140,8 @@ Options ParseOptions(const std::vector<std::string>& args) {
         } else if (name == "--te") {
             if (hasValue)
                 throw UsageError(name + " takes four values: --te XMIN YMIN XMAX YMAX");
-            for (double& value : options.extent)
-                value = ParseNumber(name, take());
+            for (double& bound : options.extent)
+                bound = ParseNumber(name, take());
             options.hasExtent = true;
             const auto& e = options.extent;
             if (!(e[0] < e[2]) || !(e[1] < e[3]))
