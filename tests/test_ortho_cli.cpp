@@ -96,6 +96,8 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--te=0,0,1,1"}, "--te takes four values"},
         {{master}, {"--te-srs", "EPSG:4326"}, "--te-srs is the CRS of --te, which is missing"},
         {{master}, {"--te", "0", "0", "1", "1", "--te-srs", "EPSG:99999"}, "--te-srs: "},
+        {{master}, {"--cutline", absent}, "--cutline: " + absent + ": cannot be opened"},
+        {{master}, {"--cutline", master}, "--cutline: " + master + ": cannot be opened"},
         {{master}, {"--frobnicate"}, "unknown option"},
         {{master}, {"--dem"}, "--dem needs a value"},
         // A master file where images are expected, and the reverse, said plainly.

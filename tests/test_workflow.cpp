@@ -529,6 +529,49 @@ TEST(Workflow, AreaOfInterestIsTheGridGdalwarpMakes) {
     ASSERT_EQ(reference->GetGeoTransform(b), CE_None);
     for (int i = 0; i < 6; ++i)
         EXPECT_DOUBLE_EQ(a[i], b[i]) << i;
+    mosaic.reset();
+
+    // --cutline makes the mosaic again (the scenes are kept): filled where the mosaic without it
+    // was and gdalwarp -cutline keeps the cell.
+    std::filesystem::copy_file(dir.File("out/mosaic.tif"), dir.File("uncut.tif"));
+    const std::string cutline = WriteFile(
+        dir.File("cut.geojson"),
+        R"({"type": "FeatureCollection", "crs": {"type": "name", "properties": {"name":
+        "urn:ogc:def:crs:EPSG::32632"}}, "features": [{"type": "Feature", "properties": {},
+        "geometry": {"type": "Polygon", "coordinates": [[[514905, 5033976], [514948, 5033978],
+        [514915, 5033989], [514905, 5033976]]]}}]})");
+    args.insert(args.end(), {"--cutline", cutline});
+    const Result cut = Ortho(args, dir);
+    ASSERT_EQ(cut.status, 0) << cut.err;
+    EXPECT_EQ(SceneStates(dir).at("north").first, "complete");
+    const Result cutWarped =
+        RunProgram("gdalwarp", {"-q", "-te", area[0], area[1], area[2], area[3], "-tr", "1.5", "1",
+                                "-cutline", cutline, "-dstalpha", dir.File("uncut.tif"),
+                                dir.File("cut_warped.tif")},
+                   dir);
+    ASSERT_EQ(cutWarped.status, 0) << cutWarped.err;
+    mosaic = Open(dir.File("out/mosaic.tif"));
+    reference = Open(dir.File("cut_warped.tif"));
+    Dataset uncut = Open(dir.File("uncut.tif"));
+    ASSERT_TRUE(mosaic && reference && uncut);
+    const auto filled = [](GDALRasterBand& band) {
+        std::vector<unsigned char> values(static_cast<std::size_t>(band.GetXSize()) *
+                                          band.GetYSize());
+        EXPECT_EQ(band.RasterIO(GF_Read, 0, 0, band.GetXSize(), band.GetYSize(), values.data(),
+                                band.GetXSize(), band.GetYSize(), GDT_Byte, 0, 0, nullptr),
+                  CE_None);
+        for (unsigned char& v : values)
+            v = v != 0;
+        return values;
+    };
+    const auto kept = filled(*mosaic->GetRasterBand(1)->GetMaskBand());
+    auto expected = filled(*reference->GetRasterBand(reference->GetRasterCount()));
+    const auto before = filled(*uncut->GetRasterBand(1)->GetMaskBand());
+    for (std::size_t i = 0; i < expected.size(); ++i)
+        expected[i] = expected[i] && before[i];
+    EXPECT_EQ(kept, expected);
+    EXPECT_GT(std::count(kept.begin(), kept.end(), 1), 0);
+    EXPECT_LT(std::count(kept.begin(), kept.end(), 1), 34 * 15 / 2);
 }
 
 // A rerun after each change makes again exactly the scenes (and the mosaic) that the change

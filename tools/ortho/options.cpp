@@ -148,6 +148,8 @@ Options ParseOptions(const std::vector<std::string>& args) {
                 throw UsageError(name + ": XMIN must be less than XMAX and YMIN less than YMAX");
         } else if (name == "--te-srs") {
             options.extentSrs = take();
+        } else if (name == "--cutline") {
+            options.cutline = take();
         } else if (name == "--resample") {
             options.resample = take();
         } else if (name == "--proc") {
@@ -252,6 +254,8 @@ Output:
                       outward to hold every scene (as gdalwarp's -tap)
   --te-srs CRS        the coordinate system of --te, when it is not the output CRS (the
                       rectangle's densified edges are transformed, their bounding box taken)
+  --cutline FILE      a polygon layer (the file's first, any OGR format): mosaic pixels whose
+                      centre lies outside it are left empty, as gdalwarp's -cutline
   --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
   --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
   --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, ... or a

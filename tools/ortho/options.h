@@ -39,6 +39,9 @@ struct Options {
     bool hasExtent = false;
     std::array<double, 4> extent{};
     std::string extentSrs;
+    // --cutline FILE: a polygon layer (the first of the file, in any OGR format); mosaic pixels
+    // whose centre lies outside it are left empty, as gdalwarp's -cutline.
+    std::string cutline;
     std::string resample = "bilinear";
     std::string proc;            // PROC text of the generator
     std::string format = "tif";  // file type of the ortho and visibility rasters

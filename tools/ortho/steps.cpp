@@ -15,6 +15,7 @@
 #include <kestrel/rasterio.h>
 
 #include <cpl_error.h>
+#include <gdal_alg.h>
 #include <gdal_priv.h>
 #include <ogrsf_frmts.h>
 
@@ -397,6 +398,8 @@ std::vector<std::string> CheckOptions(Options& options) {
         if (!options.extentSrs.empty())
             kestrel::ogc::cs::ICRS{options.extentSrs};
     });
+    if (!options.cutline.empty())
+        CheckCutline(options.cutline);
     CheckOption("--resample", [&] { options.resample = CheckResampling(options.resample); });
     CheckOption("--of", [&] { CheckFileType(options.format); });
     CheckOption("--co", [&] {
@@ -778,7 +781,60 @@ void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>
     WriteSceneFootprint(path, &footprint);
 }
 
-void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes, const Grid&,
+namespace {
+
+DatasetPtr OpenCutline(const std::string& path, const GdalErrors& errors) {
+    DatasetPtr dataset(
+        GDALDataset::Open(path.c_str(), GDAL_OF_VECTOR | GDAL_OF_READONLY, nullptr, nullptr));
+    if (!dataset)
+        throw UsageError("--cutline: " + path + ": cannot be opened as a vector file: " +
+                         errors.Reason());
+    OGRLayer* layer = dataset->GetLayerCount() > 0 ? dataset->GetLayer(0) : nullptr;
+    const OGRwkbGeometryType type =
+        layer == nullptr ? wkbNone : wkbFlatten(layer->GetGeomType());
+    if (type != wkbPolygon && type != wkbMultiPolygon && type != wkbUnknown)
+        throw UsageError("--cutline: " + path + ": the first layer holds no polygons");
+    if (layer->GetSpatialRef() == nullptr)
+        throw UsageError("--cutline: " + path + ": the layer has no coordinate system");
+    return dataset;
+}
+
+// The cutline burnt into a Byte raster on the grid: 1 where a pixel's centre lies inside.
+void BurnCutline(const std::string& cutline, const Grid& grid, const std::string& path) {
+    GdalErrors errors;
+    DatasetPtr vector = OpenCutline(cutline, errors);
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
+    const char* createOptions[] = {"TILED=YES", "COMPRESS=DEFLATE", "SPARSE_OK=YES", nullptr};
+    RemoveFile(path);
+    DatasetPtr mask(driver == nullptr ? nullptr
+                                      : driver->Create(path.c_str(), static_cast<int>(grid.pixels),
+                                                       static_cast<int>(grid.lines), 1, GDT_Byte,
+                                                       const_cast<char**>(createOptions)));
+    if (!mask)
+        FailFile(path, "cannot be created", errors);
+    std::array<double, 6> geoTransform = grid.geoTransform;
+    mask->SetGeoTransform(geoTransform.data());
+    const OGRSpatialReference srs = GridSrs(grid);
+    mask->SetSpatialRef(&srs);
+    int band = 1;
+    double burn = 1.0;
+    OGRLayerH layer = OGRLayer::ToHandle(vector->GetLayer(0));
+    if (GDALRasterizeLayers(GDALDataset::ToHandle(mask.get()), 1, &band, 1, &layer, nullptr,
+                            nullptr, &burn, nullptr, nullptr, nullptr) != CE_None)
+        FailFile(cutline, "cannot be burnt into the grid", errors);
+    mask->FlushCache();
+    if (CPLGetLastErrorType() == CE_Failure)
+        FailFile(path, "cannot be written", errors);
+}
+
+}  // namespace
+
+void CheckCutline(const std::string& path) {
+    GdalErrors errors;
+    OpenCutline(path, errors);
+}
+
+void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes, const Grid& grid,
                    const std::string& mosaic, const std::string& source,
                    const StepProgress& progress) {
     std::vector<std::unique_ptr<kestrel::mathmodel::IMathModel>> models;
@@ -804,6 +860,20 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
     job.format = MosaicFormat(options);
     for (const std::string& option : options.creationOptions)
         job.mosaicOptions += "\"" + option + "\" ";
+
+    // The burnt cutline goes beside the mosaic under a temporary name, whatever happens.
+    struct Removed {
+        std::string path;
+        ~Removed() {
+            if (!path.empty())
+                RemoveFile(path);
+        }
+    } mask;
+    if (!options.cutline.empty()) {
+        mask.path = mosaic + ".cutline.tif";
+        BurnCutline(options.cutline, grid, mask.path);
+        job.maskPath = mask.path;
+    }
 
     RecoveryProcess process(options.proc, job, progress);
     process.Execute();

@@ -138,8 +138,13 @@ struct RecoveryScene {
 // format of --of otherwise. --co is checked against it.
 std::string MosaicFormat(const Options& options);
 
+// Checks that --cutline opens as a vector file whose first layer holds polygons. Throws
+// UsageError naming the option.
+void CheckCutline(const std::string& path);
+
 // Fills the hidden ground of each scene from the others into the mosaic, and records in
-// source which scene each mosaic pixel came from.
+// source which scene each mosaic pixel came from; with --cutline, pixels outside it are left
+// empty (the cutline is burnt into a temporary raster beside the mosaic, removed after).
 void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes,
                    const Grid& grid, const std::string& mosaic, const std::string& source,
                    const StepProgress& progress);

@@ -546,6 +546,8 @@ void Workflow::CheckOutputsSpareInputs(const std::vector<std::string>& sources) 
     read(options_.master, "the master file");
     for (const std::string& file : FilesOf(SurfacePath(options_)))
         read(file, "the surface model");
+    if (!options_.cutline.empty())
+        read(options_.cutline, "the cutline");
     std::vector<std::pair<std::string, std::string>> outputs = RunOutputs();
     std::set<std::string> names;
     const fs::path masterDir = fs::absolute(options_.master).parent_path();
@@ -906,6 +908,11 @@ void Workflow::Recover() {
     for (const PixelOption& option : PixelOptions())
         made.Set(option.name, option.value(options_));
     made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
+    // The cutline changes the mosaic alone, not the scenes.
+    made.Set("--cutline",
+             options_.cutline.empty() ? "" : fs::absolute(options_.cutline).lexically_normal().string());
+    if (!options_.cutline.empty())
+        made.SetFile("cutline file", options_.cutline, Identity(options_.cutline));
     for (const Scene& scene : scenes_) {
         if (scene.status != "done" && scene.status != "complete")
             continue;
