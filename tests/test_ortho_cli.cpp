@@ -88,6 +88,16 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--lines", "x:2"}, "--lines: \"x\""},
         {{master}, {"--pixel-size", "-1"}, "is negative"},
         {{master}, {"--pixel-size", "nan"}, "is not a number"},
+        {{master}, {"--tr", "1", "0"}, "--tr: \"0\" is not a positive size"},
+        {{master}, {"--tr", "1"}, "--tr needs a value"},
+        {{master}, {"--tr", "1", "1", "--pixel-size", "1"}, "give one of them"},
+        {{master}, {"--te", "0", "0", "10", "x"}, "--te: \"x\" is not a number"},
+        {{master}, {"--te", "10", "0", "0", "10"}, "--te: XMIN must be less than XMAX"},
+        {{master}, {"--te=0,0,1,1"}, "--te takes four values"},
+        {{master}, {"--te-srs", "EPSG:4326"}, "--te-srs is the CRS of --te, which is missing"},
+        {{master}, {"--te", "0", "0", "1", "1", "--te-srs", "EPSG:99999"}, "--te-srs: "},
+        {{master}, {"--cutline", absent}, "--cutline: " + absent + ": cannot be opened"},
+        {{master}, {"--cutline", master}, "--cutline: " + master + ": cannot be opened"},
         {{master}, {"--frobnicate"}, "unknown option"},
         {{master}, {"--dem"}, "--dem needs a value"},
         // A master file where images are expected, and the reverse, said plainly.
@@ -141,6 +151,7 @@ TEST(OrthoCommandLine, ValuesThatHelpListsAreAccepted) {
         {"--of", "img"},           {"--of", "gpkg"},              {"--srs", "EPSG:32632"},
         {"--srs", "EPSG:4326"},    {"--proc", "CPU:2"},           {"--elunits", "FOOT"},
         {"--co", "COMPRESS=JPEG"}, {"--co", "QUALITY=90"},        {"--co", "BLOCKSIZE=256"},
+        {"--tr", "0.5", "0.25"},   {"--te", "9", "45", "9.1", "45.1", "--te-srs", "EPSG:4326"},
     };
     for (const auto& option : accepted) {
         SCOPED_TRACE(option[0] + " " + option[1]);

@@ -491,6 +491,89 @@ TEST(Workflow, SurfaceOverPartOfTheImagesMakesOrthosOfTheCoveredGround) {
     EXPECT_LE(mosaic->GetRasterYSize(), middle->GetRasterYSize() + 32);
 }
 
+// --te and --tr: the mosaic holds exactly the cells gdalwarp -te -tr makes (not whole blocks,
+// pixels not square, corners not on multiples of the pixel size); scenes whose footprint does
+// not reach the area are skipped and listed so, also when a rerun keeps everything.
+TEST(Workflow, AreaOfInterestIsTheGridGdalwarpMakes) {
+    TempDir dir;
+    std::vector<std::string> args = MakeSample(dir);
+    const auto size = std::find(args.begin(), args.end(), std::string("--pixel-size"));
+    args.erase(size, size + 2);
+    const std::vector<std::string> area = {"514900", "5033975.5", "514950.5", "5033990"};
+    args.insert(args.end(), {"--tr", "1.5", "1", "--te"});
+    args.insert(args.end(), area.begin(), area.end());
+    for (const char* run : {"first", "rerun"}) {
+        SCOPED_TRACE(run);
+        const Result result = Ortho(args, dir);
+        ASSERT_EQ(result.status, 0) << result.err;
+        const auto states = SceneStates(dir);
+        const std::string made = std::string(run) == "first" ? "done" : "complete";
+        EXPECT_EQ(states.at("north").first, made);
+        EXPECT_EQ(states.at("south").first, made);
+        EXPECT_EQ(states.at("east").first, "outside the area of interest");
+        EXPECT_EQ(states.at("west").first, "outside the area of interest");
+        EXPECT_FALSE(std::filesystem::exists(dir.File("out/east_ortho.tif")));
+    }
+    const Result warped = RunProgram("gdalwarp", {"-q", "-te", area[0], area[1], area[2], area[3],
+                                                  "-tr", "1.5", "1", dir.File("out/north_ortho.tif"),
+                                                  dir.File("warped.tif")},
+                                     dir);
+    ASSERT_EQ(warped.status, 0) << warped.err;
+    Dataset mosaic = Open(dir.File("out/mosaic.tif"));
+    Dataset reference = Open(dir.File("warped.tif"));
+    ASSERT_TRUE(mosaic && reference);
+    EXPECT_EQ(mosaic->GetRasterXSize(), reference->GetRasterXSize());
+    EXPECT_EQ(mosaic->GetRasterYSize(), reference->GetRasterYSize());
+    double a[6], b[6];
+    ASSERT_EQ(mosaic->GetGeoTransform(a), CE_None);
+    ASSERT_EQ(reference->GetGeoTransform(b), CE_None);
+    for (int i = 0; i < 6; ++i)
+        EXPECT_DOUBLE_EQ(a[i], b[i]) << i;
+    mosaic.reset();
+
+    // --cutline makes the mosaic again (the scenes are kept): filled where the mosaic without it
+    // was and gdalwarp -cutline keeps the cell.
+    std::filesystem::copy_file(dir.File("out/mosaic.tif"), dir.File("uncut.tif"));
+    const std::string cutline = WriteFile(
+        dir.File("cut.geojson"),
+        R"({"type": "FeatureCollection", "crs": {"type": "name", "properties": {"name":
+        "urn:ogc:def:crs:EPSG::32632"}}, "features": [{"type": "Feature", "properties": {},
+        "geometry": {"type": "Polygon", "coordinates": [[[514905, 5033976], [514948, 5033978],
+        [514915, 5033989], [514905, 5033976]]]}}]})");
+    args.insert(args.end(), {"--cutline", cutline});
+    const Result cut = Ortho(args, dir);
+    ASSERT_EQ(cut.status, 0) << cut.err;
+    EXPECT_EQ(SceneStates(dir).at("north").first, "complete");
+    const Result cutWarped =
+        RunProgram("gdalwarp", {"-q", "-te", area[0], area[1], area[2], area[3], "-tr", "1.5", "1",
+                                "-cutline", cutline, "-dstalpha", dir.File("uncut.tif"),
+                                dir.File("cut_warped.tif")},
+                   dir);
+    ASSERT_EQ(cutWarped.status, 0) << cutWarped.err;
+    mosaic = Open(dir.File("out/mosaic.tif"));
+    reference = Open(dir.File("cut_warped.tif"));
+    Dataset uncut = Open(dir.File("uncut.tif"));
+    ASSERT_TRUE(mosaic && reference && uncut);
+    const auto filled = [](GDALRasterBand& band) {
+        std::vector<unsigned char> values(static_cast<std::size_t>(band.GetXSize()) *
+                                          band.GetYSize());
+        EXPECT_EQ(band.RasterIO(GF_Read, 0, 0, band.GetXSize(), band.GetYSize(), values.data(),
+                                band.GetXSize(), band.GetYSize(), GDT_Byte, 0, 0, nullptr),
+                  CE_None);
+        for (unsigned char& v : values)
+            v = v != 0;
+        return values;
+    };
+    const auto kept = filled(*mosaic->GetRasterBand(1)->GetMaskBand());
+    auto expected = filled(*reference->GetRasterBand(reference->GetRasterCount()));
+    const auto before = filled(*uncut->GetRasterBand(1)->GetMaskBand());
+    for (std::size_t i = 0; i < expected.size(); ++i)
+        expected[i] = expected[i] && before[i];
+    EXPECT_EQ(kept, expected);
+    EXPECT_GT(std::count(kept.begin(), kept.end(), 1), 0);
+    EXPECT_LT(std::count(kept.begin(), kept.end(), 1), 34 * 15 / 2);
+}
+
 // A rerun after each change makes again exactly the scenes (and the mosaic) that the change
 // touches, and says why.
 TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {

@@ -93,6 +93,19 @@ const std::vector<PixelOption>& PixelOptions() {
         {"--elunits", true, [](const Options& o) { return o.elunits; }},
         {"--srs", true, [](const Options& o) { return o.srs; }},
         {"--pixel-size", true, [](const Options& o) { return Number(o.pixelSize); }},
+        {"--tr", true,
+         [](const Options& o) {
+             return o.xRes > 0.0 ? Number(o.xRes) + " " + Number(o.yRes) : std::string();
+         }},
+        {"--te", true,
+         [](const Options& o) {
+             if (!o.hasExtent)
+                 return std::string();
+             std::string text;
+             for (const double v : o.extent)
+                 text += (text.empty() ? "" : " ") + Number(v);
+             return o.extentSrs.empty() ? text : text + " --te-srs " + o.extentSrs;
+         }},
         {"--cameras", true,
          [](const Options& o) {
              return o.camerasSrs.empty() ? o.cameras : o.cameras + " --cameras-srs " + o.camerasSrs;

@@ -128,6 +128,28 @@ Options ParseOptions(const std::vector<std::string>& args) {
             options.pixelSize = ParseNumber(name, text);
             if (options.pixelSize < 0.0)
                 throw UsageError(name + ": " + Quoted(text) + " is negative");
+        } else if (name == "--tr") {
+            if (hasValue)
+                throw UsageError(name + " takes two values: --tr XRES YRES");
+            for (double* size : {&options.xRes, &options.yRes}) {
+                const std::string text = take();
+                *size = ParseNumber(name, text);
+                if (*size <= 0.0)
+                    throw UsageError(name + ": " + Quoted(text) + " is not a positive size");
+            }
+        } else if (name == "--te") {
+            if (hasValue)
+                throw UsageError(name + " takes four values: --te XMIN YMIN XMAX YMAX");
+            for (double& bound : options.extent)
+                bound = ParseNumber(name, take());
+            options.hasExtent = true;
+            const auto& e = options.extent;
+            if (!(e[0] < e[2]) || !(e[1] < e[3]))
+                throw UsageError(name + ": XMIN must be less than XMAX and YMIN less than YMAX");
+        } else if (name == "--te-srs") {
+            options.extentSrs = take();
+        } else if (name == "--cutline") {
+            options.cutline = take();
         } else if (name == "--resample") {
             options.resample = take();
         } else if (name == "--proc") {
@@ -173,6 +195,10 @@ Options ParseOptions(const std::vector<std::string>& args) {
         throw UsageError("--of: the file type is empty");
     if (options.resample.empty())
         throw UsageError("--resample: the method is empty");
+    if (!options.extentSrs.empty() && !options.hasExtent)
+        throw UsageError("--te-srs is the CRS of --te, which is missing");
+    if (options.xRes > 0.0 && options.pixelSize > 0.0)
+        throw UsageError("--tr and --pixel-size both set the pixel size; give one of them");
     if (!options.camerasSrs.empty() && options.cameras.empty())
         throw UsageError("--cameras-srs is the CRS of a --cameras file, which is missing");
     return options;
@@ -218,6 +244,18 @@ Output:
   --srs CRS           output coordinate system, projected or geographic (EPSG:32632, WKT,
                       PROJ string; default: the UTM zone of the scene)
   --pixel-size SIZE   output pixel size in CRS units (default: the source's resolution)
+  --tr XRES YRES      output pixel width and height in CRS units, as gdalwarp's -tr (instead
+                      of --pixel-size)
+  --te XMIN YMIN XMAX YMAX
+                      area of interest in the output CRS, as gdalwarp's -te: the common grid
+                      is exactly this rectangle (with --tr, the cells gdalwarp -te -tr makes),
+                      and scenes whose footprint does not reach it are skipped. Without --te the
+                      grid's corners are whole multiples of the pixel size, the grid grown
+                      outward to hold every scene (as gdalwarp's -tap)
+  --te-srs CRS        the coordinate system of --te, when it is not the output CRS (the
+                      rectangle's densified edges are transformed, their bounding box taken)
+  --cutline FILE      a polygon layer (the file's first, any OGR format): mosaic pixels whose
+                      centre lies outside it are left empty, as gdalwarp's -cutline
   --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
   --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
   --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, ... or a

@@ -1,6 +1,7 @@
 // Command-line options of silvan-ortho.
 #pragma once
 
+#include <array>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -30,6 +31,17 @@ struct Options {
 
     std::string srs;         // output CRS; empty: chosen from the scene
     double pixelSize = 0.0;  // output pixel size in CRS units; 0: the source's resolution
+    // --tr XRES YRES: pixel width and height in CRS units, instead of --pixel-size; 0: unset.
+    double xRes = 0.0;
+    double yRes = 0.0;
+    // --te XMIN YMIN XMAX YMAX: the area of interest, in the output CRS or in --te-srs. The
+    // common grid is exactly this rectangle, as gdalwarp's -te makes it.
+    bool hasExtent = false;
+    std::array<double, 4> extent{};
+    std::string extentSrs;
+    // --cutline FILE: a polygon layer (the first of the file, in any OGR format); mosaic pixels
+    // whose centre lies outside it are left empty, as gdalwarp's -cutline.
+    std::string cutline;
     std::string resample = "bilinear";
     std::string proc;            // PROC text of the generator
     std::string format = "tif";  // file type of the ortho and visibility rasters

@@ -15,6 +15,7 @@
 #include <kestrel/rasterio.h>
 
 #include <cpl_error.h>
+#include <gdal_alg.h>
 #include <gdal_priv.h>
 #include <ogrsf_frmts.h>
 
@@ -108,13 +109,18 @@ std::string Grid::Describe() const {
         name = kestrel::ogc::cs::ICRS(crs).GetName();
     } catch (const kestrel::Exception&) {
     }
+    char size[64];
+    if (std::fabs(geoTransform[1] + geoTransform[5]) > 1e-9 * std::fabs(geoTransform[1]))
+        std::snprintf(size, sizeof size, "%.6g x %.6g", geoTransform[1], -geoTransform[5]);
+    else
+        std::snprintf(size, sizeof size, "%.6g", PixelSize());
     char text[256];
-    std::snprintf(text, sizeof text, "%u x %u pixels of %.6g, top left (%.3f, %.3f), ", pixels,
-                  lines, PixelSize(), geoTransform[0], geoTransform[3]);
+    std::snprintf(text, sizeof text, "%u x %u pixels of %s, top left (%.3f, %.3f), ", pixels, lines,
+                  size, geoTransform[0], geoTransform[3]);
     return text + name;
 }
 
-Grid CommonGrid(const std::vector<Grid>& grids) {
+Grid CommonGrid(const std::vector<Grid>& grids, const Area* area) {
     if (grids.empty())
         KESTREL_THROW(kestrel::DataException, "no grid to join");
     const Grid& first = grids.front();
@@ -141,20 +147,83 @@ Grid CommonGrid(const std::vector<Grid>& grids) {
         top = std::max(top, t[3]);
         bottom = std::min(bottom, t[3] + grid.lines * t[5]);
     }
-    // Snap outwards onto the first grid's pixel lattice; whole blocks of 16.
     const double step = g[1], height = -g[5];
-    const double x0 = g[0] + std::floor((left - g[0]) / step + 1e-6) * step;
-    const double y0 = g[3] + std::ceil((top - g[3]) / height - 1e-6) * height;
+    Grid common;
+    common.crs = first.crs;
+    if (area != nullptr) {
+        // gdalwarp -te -tr: the top left corner at XMIN YMAX, sizes rounded to whole pixels.
+        const Area& a = *area;
+        const double pixels = std::floor((a[2] - a[0] + step / 2) / step);
+        const double lines = std::floor((a[3] - a[1] + height / 2) / height);
+        if (!(pixels >= 1 && lines >= 1 && pixels <= 1u << 30 && lines <= 1u << 30))
+            KESTREL_THROW(kestrel::DataException,
+                          kestrel::FormatString("--te: the area of interest makes a grid of %.0f "
+                                                "x %.0f pixels of %g x %g",
+                                                pixels, lines, step, height));
+        common.pixels = static_cast<unsigned int>(pixels);
+        common.lines = static_cast<unsigned int>(lines);
+        common.geoTransform = {a[0], step, 0.0, a[3], 0.0, g[5]};
+        return common;
+    }
+    // Corners on whole multiples of the pixel size, grown outward; whole blocks of 16.
+    const double x0 = std::floor(left / step + 1e-6) * step;
+    const double y0 = std::ceil(top / height - 1e-6) * height;
     const auto blocks = [](double cells) {
         const auto n = static_cast<unsigned int>(std::ceil(cells - 1e-6));
         return (n + 15u) / 16u * 16u;
     };
-    Grid common;
-    common.crs = first.crs;
     common.pixels = blocks((right - x0) / step);
     common.lines = blocks((y0 - bottom) / height);
     common.geoTransform = {x0, step, 0.0, y0, 0.0, g[5]};
     return common;
+}
+
+Area AreaInCrs(const Options& options, const std::string& crs) {
+    if (options.extentSrs.empty())
+        return options.extent;
+    GdalErrors errors;
+    OGRSpatialReference from;
+    from.SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
+    if (from.SetFromUserInput(options.extentSrs.c_str()) != OGRERR_NONE)
+        throw UsageError("--te-srs: \"" + options.extentSrs + "\" cannot be read as a CRS");
+    Grid target;
+    target.crs = crs;
+    const OGRSpatialReference to = GridSrs(target);
+    const std::unique_ptr<OGRCoordinateTransformation> transform(
+        OGRCreateCoordinateTransformation(&from, &to));
+    const auto& e = options.extent;
+    Area area{};
+    if (!transform || !transform->TransformBounds(e[0], e[1], e[2], e[3], &area[0], &area[1],
+                                                  &area[2], &area[3], 21))
+        KESTREL_THROW(kestrel::DataException,
+                      "--te in --te-srs " + options.extentSrs +
+                          " cannot be transformed into the output CRS: " + errors.Reason());
+    return area;
+}
+
+bool Overlaps(const kestrel::tin::Polygon<double>& footprint, const Area& area) {
+    GdalErrors errors;
+    OGRLinearRing ring;
+    for (unsigned int i = 0; i < footprint.numPoints; ++i)
+        ring.addPoint(footprint.points[i].x, footprint.points[i].y);
+    ring.closeRings();
+    OGRPolygon scene;
+    scene.addRing(&ring);
+    OGRLinearRing corners;
+    for (const auto& corner : {std::make_pair(area[0], area[1]), std::make_pair(area[2], area[1]),
+                               std::make_pair(area[2], area[3]), std::make_pair(area[0], area[3]),
+                               std::make_pair(area[0], area[1])})
+        corners.addPoint(corner.first, corner.second);
+    OGRPolygon rectangle;
+    rectangle.addRing(&corners);
+    // A footprint that crosses itself is made valid first, as GEOS needs.
+    std::unique_ptr<OGRGeometry> valid(scene.IsValid() ? scene.clone() : scene.MakeValid());
+    if (!valid)
+        return true;
+    const std::unique_ptr<OGRGeometry> shared(valid->Intersection(&rectangle));
+    if (!shared)  // no geometry engine: the scene is kept
+        return true;
+    return OGR_G_Area(OGRGeometry::ToHandle(shared.get())) > 0.0;
 }
 
 bool ReadGrid(const std::string& path, Grid& grid) {
@@ -325,6 +394,12 @@ std::vector<std::string> CheckOptions(Options& options) {
     if (!options.elunits.empty())
         CheckOption("--elunits", [&] { GetElUnits(options.elunits, scale); });
     CheckOption("--srs", [&] { CheckOutputCrs(options.srs); });
+    CheckOption("--te-srs", [&] {
+        if (!options.extentSrs.empty())
+            kestrel::ogc::cs::ICRS{options.extentSrs};
+    });
+    if (!options.cutline.empty())
+        CheckCutline(options.cutline);
     CheckOption("--resample", [&] { options.resample = CheckResampling(options.resample); });
     CheckOption("--of", [&] { CheckFileType(options.format); });
     CheckOption("--co", [&] {
@@ -447,7 +522,8 @@ void CheckSource(const SceneInput& scene) {
 }
 
 Grid SceneLayout(const Options& options, const SceneInput& scene, const std::string& crs,
-                 double pixelSize, Footprint* footprint) {
+                 double pixelWidth, double pixelHeight, Footprint* footprint,
+                 bool withUncoveredShare) {
     std::unique_ptr<kestrel::datasources::IDataset> dataset(GetRasterDataset(scene.source));
     std::vector<unsigned int> sourceChannels, orthoChannels;
     GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
@@ -479,7 +555,7 @@ Grid SceneLayout(const Options& options, const SceneInput& scene, const std::str
     try {
         // Border rays every 16 pixels; grid corners on whole multiples of the pixel size, so
         // that the scenes' grids share one lattice.
-        GetOrthoParams(0, "PIXEL", crs, pixelSize, pixelSize, dataset.get(), model.get(), channels,
+        GetOrthoParams(0, "PIXEL", crs, pixelWidth, pixelHeight, dataset.get(), model.get(), channels,
                        dem, flatHeight, crsOut, geocodingOut, pixels, lines, footprintOut);
     } catch (...) {
         delete crsOut;
@@ -498,7 +574,7 @@ Grid SceneLayout(const Options& options, const SceneInput& scene, const std::str
     grid.lines = lines;
     if (footprint != nullptr)
         *footprint = std::move(outFootprint);
-    else if (dem != nullptr)
+    if (withUncoveredShare && dem != nullptr)
         grid.uncoveredShare =
             kestrel::orthoutils::ComputeLayout(*model, dem, kestrel::orthoutils::LayoutRequest())
                 .uncoveredShare;
@@ -678,7 +754,60 @@ void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>
     WriteSceneFootprint(path, &footprint);
 }
 
-void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes, const Grid&,
+namespace {
+
+DatasetPtr OpenCutline(const std::string& path, const GdalErrors& errors) {
+    DatasetPtr dataset(
+        GDALDataset::Open(path.c_str(), GDAL_OF_VECTOR | GDAL_OF_READONLY, nullptr, nullptr));
+    if (!dataset)
+        throw UsageError("--cutline: " + path + ": cannot be opened as a vector file: " +
+                         errors.Reason());
+    OGRLayer* layer = dataset->GetLayerCount() > 0 ? dataset->GetLayer(0) : nullptr;
+    const OGRwkbGeometryType type =
+        layer == nullptr ? wkbNone : wkbFlatten(layer->GetGeomType());
+    if (type != wkbPolygon && type != wkbMultiPolygon && type != wkbUnknown)
+        throw UsageError("--cutline: " + path + ": the first layer holds no polygons");
+    if (layer->GetSpatialRef() == nullptr)
+        throw UsageError("--cutline: " + path + ": the layer has no coordinate system");
+    return dataset;
+}
+
+// The cutline burnt into a Byte raster on the grid: 1 where a pixel's centre lies inside.
+void BurnCutline(const std::string& cutline, const Grid& grid, const std::string& path) {
+    GdalErrors errors;
+    DatasetPtr vector = OpenCutline(cutline, errors);
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
+    const char* createOptions[] = {"TILED=YES", "COMPRESS=DEFLATE", "SPARSE_OK=YES", nullptr};
+    RemoveFile(path);
+    DatasetPtr mask(driver == nullptr ? nullptr
+                                      : driver->Create(path.c_str(), static_cast<int>(grid.pixels),
+                                                       static_cast<int>(grid.lines), 1, GDT_Byte,
+                                                       const_cast<char**>(createOptions)));
+    if (!mask)
+        FailFile(path, "cannot be created", errors);
+    std::array<double, 6> geoTransform = grid.geoTransform;
+    mask->SetGeoTransform(geoTransform.data());
+    const OGRSpatialReference srs = GridSrs(grid);
+    mask->SetSpatialRef(&srs);
+    int band = 1;
+    double burn = 1.0;
+    OGRLayerH layer = OGRLayer::ToHandle(vector->GetLayer(0));
+    if (GDALRasterizeLayers(GDALDataset::ToHandle(mask.get()), 1, &band, 1, &layer, nullptr,
+                            nullptr, &burn, nullptr, nullptr, nullptr) != CE_None)
+        FailFile(cutline, "cannot be burnt into the grid", errors);
+    mask->FlushCache();
+    if (CPLGetLastErrorType() == CE_Failure)
+        FailFile(path, "cannot be written", errors);
+}
+
+}  // namespace
+
+void CheckCutline(const std::string& path) {
+    GdalErrors errors;
+    OpenCutline(path, errors);
+}
+
+void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes, const Grid& grid,
                    const std::string& mosaic, const std::string& source,
                    const StepProgress& progress) {
     std::vector<std::unique_ptr<kestrel::mathmodel::IMathModel>> models;
@@ -704,6 +833,20 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
     job.format = MosaicFormat(options);
     for (const std::string& option : options.creationOptions)
         job.mosaicOptions += "\"" + option + "\" ";
+
+    // The burnt cutline goes beside the mosaic under a temporary name, whatever happens.
+    struct Removed {
+        std::string path;
+        ~Removed() {
+            if (!path.empty())
+                RemoveFile(path);
+        }
+    } mask;
+    if (!options.cutline.empty()) {
+        mask.path = mosaic + ".cutline.tif";
+        BurnCutline(options.cutline, grid, mask.path);
+        job.maskPath = mask.path;
+    }
 
     RecoveryProcess process(options.proc, job, progress);
     process.Execute();

@@ -84,14 +84,27 @@ std::string SurfaceHoles(const Options& options, const Grid& grid);
 void CheckSource(const SceneInput& scene);
 
 // The layout of a scene on its own: the grid in crs (empty: chosen for the scene) with the
-// pixel size (0: the source's resolution), and the scene's footprint when asked for (without
-// it, the grid's uncoveredShare is worked out too).
+// pixel width and height (0: the source's resolution), the scene's footprint when asked for, and
+// the grid's uncoveredShare when asked for.
 Grid SceneLayout(const Options& options, const SceneInput& scene, const std::string& crs,
-                 double pixelSize, Footprint* footprint);
+                 double pixelWidth, double pixelHeight, Footprint* footprint,
+                 bool uncoveredShare);
 
-// The smallest grid that holds every grid, on the pixel lattice of the first one, in whole
-// blocks of 16 pixels and lines. All grids must share the first one's CRS and pixel size.
-Grid CommonGrid(const std::vector<Grid>& grids);
+// A rectangle XMIN YMIN XMAX YMAX, as gdalwarp's -te.
+using Area = std::array<double, 4>;
+
+// The area of interest (--te) in crs: as given, or, with --te-srs, the bounding box of its
+// densified edges transformed into crs. Throws when the transformation fails.
+Area AreaInCrs(const Options& options, const std::string& crs);
+
+// Whether the footprint and the area share ground (more than an edge or a corner).
+bool Overlaps(const kestrel::tin::Polygon<double>& footprint, const Area& area);
+
+// The common grid of the scenes' grids, all in the first one's CRS and pixel size. Without an
+// area: the smallest grid that holds every grid, its corners whole multiples of the pixel size,
+// in whole blocks of 16 pixels and lines. With one: exactly the area's cells as gdalwarp -te
+// -tr makes them (top left at XMIN YMAX, sizes rounded to whole pixels).
+Grid CommonGrid(const std::vector<Grid>& grids, const Area* area = nullptr);
 
 // The grid of an existing raster; false when it cannot be opened as one.
 bool ReadGrid(const std::string& path, Grid& grid);
@@ -125,8 +138,13 @@ struct RecoveryScene {
 // format of --of otherwise. --co is checked against it.
 std::string MosaicFormat(const Options& options);
 
+// Checks that --cutline opens as a vector file whose first layer holds polygons. Throws
+// UsageError naming the option.
+void CheckCutline(const std::string& path);
+
 // Fills the hidden ground of each scene from the others into the mosaic, and records in
-// source which scene each mosaic pixel came from.
+// source which scene each mosaic pixel came from; with --cutline, pixels outside it are left
+// empty (the cutline is burnt into a temporary raster beside the mosaic, removed after).
 void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes,
                    const Grid& grid, const std::string& mosaic, const std::string& source,
                    const StepProgress& progress);

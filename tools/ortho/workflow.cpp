@@ -104,17 +104,29 @@ void DeriveFile(const std::string& path, Write write) {
         Publish(part, path);
 }
 
-std::string GridText(const std::string& key, const Grid& grid) {
+// The status of a scene whose layout does not reach --te.
+const char* const kOutsideArea = "outside the area of interest";
+
+// The common grid, and the data lines of the scenes outside the area of interest (when any).
+std::string GridText(const std::string& key, const Grid& grid,
+                     const std::vector<int>& outside = {}) {
     std::ostringstream out;
     out.precision(17);
     out << key << '\n' << grid.pixels << ' ' << grid.lines << '\n';
     for (const double g : grid.geoTransform)
         out << g << ' ';
     out << '\n' << grid.crs << '\n';
+    if (!outside.empty()) {
+        out << "outside";
+        for (const int line : outside)
+            out << ' ' << line;
+        out << '\n';
+    }
     return out.str();
 }
 
-bool ReadGridText(const std::string& path, const std::string& key, Grid& grid) {
+bool ReadGridText(const std::string& path, const std::string& key, Grid& grid,
+                  std::vector<int>& outside) {
     std::ifstream in(path);
     std::string storedKey;
     if (!std::getline(in, storedKey) || storedKey != key)
@@ -127,7 +139,18 @@ bool ReadGridText(const std::string& path, const std::string& key, Grid& grid) {
     if (!in || !std::getline(in, read.crs) || read.crs.empty() || read.pixels == 0 ||
         read.lines == 0)
         return false;
+    std::vector<int> lines;
+    std::string word;
+    if (in >> word) {
+        if (word != "outside")
+            return false;
+        for (int line = 0; in >> line;)
+            lines.push_back(line);
+        if (!in.eof())
+            return false;
+    }
     grid = read;
+    outside = lines;
     return true;
 }
 
@@ -312,7 +335,8 @@ int Workflow::Run() {
         summary_.timings.emplace_back("recovery", SecondsSince(step));
         succeeded = !stopped_ && summary_.errors.empty();
         for (const Scene& scene : scenes_) {
-            if (scene.inSlice && scene.status != "done" && scene.status != "complete")
+            if (scene.inSlice && scene.status != "done" && scene.status != "complete" &&
+                scene.status != kOutsideArea)
                 succeeded = false;
         }
     } catch (const Cancelled&) {
@@ -522,6 +546,8 @@ void Workflow::CheckOutputsSpareInputs(const std::vector<std::string>& sources) 
     read(options_.master, "the master file");
     for (const std::string& file : FilesOf(SurfacePath(options_)))
         read(file, "the surface model");
+    if (!options_.cutline.empty())
+        read(options_.cutline, "the cutline");
     std::vector<std::pair<std::string, std::string>> outputs = RunOutputs();
     std::set<std::string> names;
     const fs::path masterDir = fs::absolute(options_.master).parent_path();
@@ -586,19 +612,30 @@ Manifest Workflow::GridInputs() {
 
 void Workflow::MakeGrid() {
     const std::string key = GridInputs().Fingerprint();
-    if (!options_.overwrite && ReadGridText(gridFile_, key, grid_))
+    std::vector<int> outside;
+    if (!options_.overwrite && ReadGridText(gridFile_, key, grid_, outside)) {
+        for (Scene& scene : scenes_) {
+            if (std::find(outside.begin(), outside.end(), scene.line) != outside.end())
+                scene.status = kOutsideArea;
+        }
         return;
+    }
 
     // The first scene whose layout can be made fixes the CRS and pixel size of all others.
     std::vector<Grid> grids;
     std::string crs = options_.srs;
-    double pixelSize = options_.pixelSize;
+    double pixelWidth = options_.xRes > 0.0 ? options_.xRes : options_.pixelSize;
+    double pixelHeight = options_.yRes > 0.0 ? options_.yRes : options_.pixelSize;
+    Area area{};
+    bool fixed = false;
     for (Scene& scene : scenes_) {
         if (!scene.error.empty() || stopped_)
             continue;
         ThrowIfInterrupted();
+        Footprint footprint;
         try {
-            scene.grid = SceneLayout(options_, scene.input, crs, pixelSize, nullptr);
+            scene.grid = SceneLayout(options_, scene.input, crs, pixelWidth, pixelHeight,
+                                     options_.hasExtent ? &footprint : nullptr, true);
             scene.hasGrid = true;
             if (scene.grid.uncoveredShare > 0) {
                 char share[32];
@@ -606,26 +643,45 @@ void Workflow::MakeGrid() {
                 progress_.Info("warning: " + scene.name + ": the surface model leaves out " +
                                share + " of the image's ground; the ortho covers the rest");
             }
-            grids.push_back(scene.grid);
-            if (grids.size() == 1) {
-                crs = scene.grid.crs;
-                pixelSize = scene.grid.PixelSize();
-            }
         } catch (const std::exception& e) {
             scene.error = Where(scene) + ": " + Explain(e);
             if (scene.inSlice) {
                 progress_.Error(scene.error);
                 Fail(scene, scene.error);
             }
+            continue;
         }
+        if (!fixed) {
+            fixed = true;
+            crs = scene.grid.crs;
+            pixelWidth = scene.grid.geoTransform[1];
+            pixelHeight = -scene.grid.geoTransform[5];
+            try {
+                if (options_.hasExtent)
+                    area = AreaInCrs(options_, crs);
+            } catch (const std::exception& e) {
+                throw RunError(Explain(e));
+            }
+        }
+        if (footprint && !Overlaps(*footprint, area)) {
+            scene.status = kOutsideArea;
+            outside.push_back(scene.line);
+            continue;
+        }
+        grids.push_back(scene.grid);
     }
     if (stopped_)
         return;
+    if (grids.empty() && !outside.empty())
+        throw RunError("--te: no scene reaches the area of interest");
     if (grids.empty())
         throw RunError(options_.master + ": no scene has a usable layout");
-    grid_ = CommonGrid(grids);
-    WriteFileAtomically(gridFile_, GridText(key, grid_));
+    grid_ = CommonGrid(grids, options_.hasExtent ? &area : nullptr);
+    WriteFileAtomically(gridFile_, GridText(key, grid_, outside));
     progress_.Info("common grid: " + grid_.Describe());
+    if (!outside.empty())
+        progress_.Info(std::to_string(outside.size()) +
+                       " scene(s) outside the area of interest are skipped");
 }
 
 void Workflow::RecordInputs(Scene& scene) {
@@ -691,7 +747,7 @@ std::string Workflow::WhyMake(const Scene& scene) const {
 void Workflow::RunScenes() {
     std::vector<Scene*> queue;
     for (Scene& scene : scenes_) {
-        if (!scene.inSlice || !scene.error.empty())
+        if (!scene.inSlice || !scene.error.empty() || scene.status == kOutsideArea)
             continue;
         RecordInputs(scene);
         scene.reason = WhyMake(scene);
@@ -774,7 +830,8 @@ void Workflow::RunScene(Scene& scene) {
         };
         report(0.0, 0.05, "layout")(0.0);
         Footprint footprint;
-        SceneLayout(options_, scene.input, grid_.crs, grid_.PixelSize(), &footprint);
+        SceneLayout(options_, scene.input, grid_.crs, grid_.geoTransform[1],
+                    -grid_.geoTransform[5], &footprint, false);
         // The footprint file and the merge take polygons of at least 4 corners.
         if (!footprint || footprint->numPoints < 4)
             KESTREL_THROW(kestrel::DataException,
@@ -851,6 +908,11 @@ void Workflow::Recover() {
     for (const PixelOption& option : PixelOptions())
         made.Set(option.name, option.value(options_));
     made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
+    // The cutline changes the mosaic alone, not the scenes.
+    made.Set("--cutline",
+             options_.cutline.empty() ? "" : fs::absolute(options_.cutline).lexically_normal().string());
+    if (!options_.cutline.empty())
+        made.SetFile("cutline file", options_.cutline, Identity(options_.cutline));
     for (const Scene& scene : scenes_) {
         if (scene.status != "done" && scene.status != "complete")
             continue;

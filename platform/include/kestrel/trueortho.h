@@ -213,6 +213,9 @@ struct KESTREL_API RecoveryJob {
     std::string format = "GTiff";
     std::string mosaicOptions;  // the mosaic's creation options (BasicWriter's `options`)
     unsigned int tileSize = 256;
+    // A raster on the common grid (a cutline burnt in): where its first band holds 0 no scene
+    // fills the mosaic. Empty: none.
+    std::string maskPath;
 };
 
 struct TorthoRecoveryResult {

@@ -53,6 +53,7 @@ struct Grid {
     std::vector<SceneInfo> scenes;
     std::vector<std::unique_ptr<SceneFiles>> files;
     int halo = 0;  // the largest pixel error
+    std::unique_ptr<SceneFiles> mask;  // RecoveryJob::maskPath, in `ortho`
 };
 
 // The choice for one pixel among the scenes that see it. Lower ranks first:
@@ -372,6 +373,26 @@ void ProcessTile(const RecoveryJob& job, const Grid& grid, Worker& w,
             w.toModel[s] = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel[s]);
         OfferScene(job, grid, s, w, t, w.toModel[s].get(), mosaic, source);
     }
+    if (grid.mask) {
+        // Outside the mask the pixels stay empty.
+        w.values.assign(t.Size(), 0.0f);
+        {
+            std::lock_guard<std::mutex> lock(grid.mask->mutex);
+            trueortho::ReadWindow(*grid.mask->ortho, job.maskPath, {1}, t.x, t.y, t.width,
+                                  t.height, w.values.data());
+        }
+        float* out = static_cast<float*>(mosaic.GetData());
+        float* from = static_cast<float*>(source.GetData());
+        const size_t size = t.Size();
+        for (size_t o = 0; o < size; ++o) {
+            if (w.values[o] != 0.0f || w.best[o].index == Rank::kNone)
+                continue;
+            w.best[o] = Rank();
+            from[o] = 0.0f;
+            for (int b = 0; b < grid.bands; ++b)
+                out[size * b + o] = static_cast<float>(first.hasNoData ? first.noData : 0);
+        }
+    }
     for (const Rank& rank : w.best)
         ++(rank.index == Rank::kNone ? counts.unfilled : counts.filled);
     mosaicOut.WriteWindow(mosaic, t.x, t.y);
@@ -400,7 +421,7 @@ std::unique_ptr<datasources::BasicWriter> OutputWriter(const std::string& path,
 
 TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     RunControl control(CancelFlag(), Progress(), ProgressData());
-    const Grid grid = Inspect(job);
+    Grid grid = Inspect(job);
     std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel(job.scenes.size());
     if (job.surface != nullptr && grid.crs)
         job.surface->SetInputCRS(grid.crs.get());
@@ -414,6 +435,10 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     TorthoRecoveryResult result;
     if (control.Stopped())
         return result;
+    if (!job.maskPath.empty()) {
+        grid.mask = std::make_unique<SceneFiles>();
+        grid.mask->ortho = trueortho::OpenRaster(job.maskPath, "mask");
+    }
 
     const SceneInfo& first = grid.scenes[0];
     const bool cog = job.format == "COG";
