@@ -572,6 +572,14 @@ TEST(Workflow, AreaOfInterestIsTheGridGdalwarpMakes) {
     EXPECT_EQ(kept, expected);
     EXPECT_GT(std::count(kept.begin(), kept.end(), 1), 0);
     EXPECT_LT(std::count(kept.begin(), kept.end(), 1), 34 * 15 / 2);
+
+    // A cutline that no scene reaches (here, in another CRS) stops the run, saying so.
+    WriteFile(cutline, R"({"type": "FeatureCollection", "features": [{"type": "Feature",
+        "properties": {}, "geometry": {"type": "Polygon", "coordinates": [[[9.1, 45.3],
+        [9.12, 45.3], [9.1, 45.32], [9.1, 45.3]]]}}]})");
+    const Result far = Ortho(args, dir);
+    EXPECT_EQ(far.status, 1);
+    EXPECT_NE(far.err.find("no scene reaches the area of interest"), std::string::npos) << far.err;
 }
 
 // A rerun after each change makes again exactly the scenes (and the mosaic) that the change

@@ -255,7 +255,8 @@ Output:
   --te-srs CRS        the coordinate system of --te, when it is not the output CRS (the
                       rectangle's densified edges are transformed, their bounding box taken)
   --cutline FILE      a polygon layer (the file's first, any OGR format): mosaic pixels whose
-                      centre lies outside it are left empty, as gdalwarp's -cutline
+                      centre lies outside it are left empty, as gdalwarp's -cutline, and
+                      scenes whose footprint does not reach it are skipped
   --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
   --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
   --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, ... or a

@@ -178,6 +178,10 @@ Grid CommonGrid(const std::vector<Grid>& grids, const Area* area) {
     return common;
 }
 
+namespace {
+DatasetPtr OpenCutline(const std::string& path, const GdalErrors& errors);
+}  // namespace
+
 Area AreaInCrs(const Options& options, const std::string& crs) {
     if (options.extentSrs.empty())
         return options.extent;
@@ -201,7 +205,74 @@ Area AreaInCrs(const Options& options, const std::string& crs) {
     return area;
 }
 
-bool Overlaps(const kestrel::tin::Polygon<double>& footprint, const Area& area) {
+AreaOfInterest::AreaOfInterest(const Options& options, const std::string& crs,
+                               const Area* area) {
+    GdalErrors errors;
+    if (area != nullptr) {
+        const Area& a = *area;
+        OGRLinearRing corners;
+        corners.addPoint(a[0], a[1]);
+        corners.addPoint(a[2], a[1]);
+        corners.addPoint(a[2], a[3]);
+        corners.addPoint(a[0], a[3]);
+        corners.closeRings();
+        auto rectangle = std::make_unique<OGRPolygon>();
+        rectangle->addRing(&corners);
+        shape_ = std::move(rectangle);
+    }
+    if (options.cutline.empty())
+        return;
+    DatasetPtr vector = OpenCutline(options.cutline, errors);
+    OGRLayer* layer = vector->GetLayer(0);
+    Grid target;
+    target.crs = crs;
+    const OGRSpatialReference to = GridSrs(target);
+    OGRSpatialReference from(*layer->GetSpatialRef());
+    from.SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
+    const std::unique_ptr<OGRCoordinateTransformation> transform(
+        OGRCreateCoordinateTransformation(&from, &to));
+    if (!transform)
+        throw UsageError("--cutline: " + options.cutline +
+                         ": its CRS cannot be transformed into the output CRS: " +
+                         errors.Reason());
+    std::unique_ptr<OGRGeometry> cut;
+    layer->ResetReading();
+    for (auto& feature : *layer) {
+        const OGRGeometry* geometry = feature->GetGeometryRef();
+        if (geometry == nullptr)
+            continue;
+        std::unique_ptr<OGRGeometry> copy(geometry->clone());
+        if (copy->transform(transform.get()) != OGRERR_NONE)
+            throw UsageError("--cutline: " + options.cutline +
+                             ": a polygon cannot be transformed into the output CRS");
+        if (!copy->IsValid())
+            copy.reset(copy->MakeValid());
+        if (!copy)
+            return;  // no geometry engine: only the rectangle selects scenes
+        if (cut) {
+            cut.reset(cut->Union(copy.get()));
+            if (!cut)
+                return;
+        } else {
+            cut = std::move(copy);
+        }
+    }
+    if (!cut)
+        throw UsageError("--cutline: " + options.cutline + ": the first layer holds no polygons");
+    if (shape_) {
+        std::unique_ptr<OGRGeometry> both(shape_->Intersection(cut.get()));
+        if (both)
+            shape_ = std::move(both);
+    } else {
+        shape_ = std::move(cut);
+    }
+}
+
+AreaOfInterest::~AreaOfInterest() = default;
+
+bool AreaOfInterest::Reaches(const kestrel::tin::Polygon<double>& footprint) const {
+    if (!shape_)
+        return true;
     GdalErrors errors;
     OGRLinearRing ring;
     for (unsigned int i = 0; i < footprint.numPoints; ++i)
@@ -209,18 +280,11 @@ bool Overlaps(const kestrel::tin::Polygon<double>& footprint, const Area& area) 
     ring.closeRings();
     OGRPolygon scene;
     scene.addRing(&ring);
-    OGRLinearRing corners;
-    for (const auto& corner : {std::make_pair(area[0], area[1]), std::make_pair(area[2], area[1]),
-                               std::make_pair(area[2], area[3]), std::make_pair(area[0], area[3]),
-                               std::make_pair(area[0], area[1])})
-        corners.addPoint(corner.first, corner.second);
-    OGRPolygon rectangle;
-    rectangle.addRing(&corners);
     // A footprint that crosses itself is made valid first, as GEOS needs.
     std::unique_ptr<OGRGeometry> valid(scene.IsValid() ? scene.clone() : scene.MakeValid());
     if (!valid)
         return true;
-    const std::unique_ptr<OGRGeometry> shared(valid->Intersection(&rectangle));
+    const std::unique_ptr<OGRGeometry> shared(valid->Intersection(shape_.get()));
     if (!shared)  // no geometry engine: the scene is kept
         return true;
     return OGR_G_Area(OGRGeometry::ToHandle(shared.get())) > 0.0;

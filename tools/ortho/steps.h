@@ -15,6 +15,8 @@
 #include <string>
 #include <vector>
 
+class OGRGeometry;
+
 namespace ortho {
 
 // Where a raster grid lies: its CRS as WKT, GDAL's geotransform, and its size.
@@ -97,8 +99,21 @@ using Area = std::array<double, 4>;
 // densified edges transformed into crs. Throws when the transformation fails.
 Area AreaInCrs(const Options& options, const std::string& crs);
 
-// Whether the footprint and the area share ground (more than an edge or a corner).
-bool Overlaps(const kestrel::tin::Polygon<double>& footprint, const Area& area);
+// The ground that --te and --cutline keep, in one CRS.
+class AreaOfInterest {
+  public:
+    // The --te rectangle (area) and the --cutline polygons in crs; both when both are given.
+    // Throws when the cutline cannot be read or transformed.
+    AreaOfInterest(const Options& options, const std::string& crs, const Area* area);
+    ~AreaOfInterest();
+    AreaOfInterest(const AreaOfInterest&) = delete;
+    AreaOfInterest& operator=(const AreaOfInterest&) = delete;
+    // Whether the footprint and the area share ground (more than an edge or a corner).
+    bool Reaches(const kestrel::tin::Polygon<double>& footprint) const;
+
+  private:
+    std::unique_ptr<OGRGeometry> shape_;
+};
 
 // The common grid of the scenes' grids, all in the first one's CRS and pixel size. Without an
 // area: the smallest grid that holds every grid, its corners whole multiples of the pixel size,

@@ -599,6 +599,9 @@ Manifest Workflow::GridInputs() {
     }
     for (const std::string& file : FilesOf(SurfacePath(options_)))
         inputs.SetFile("surface file", file, Identity(file));
+    // The cutline says which scenes are outside the area of interest.
+    if (!options_.cutline.empty())
+        inputs.SetFile("cutline file", options_.cutline, Identity(options_.cutline));
     for (const Scene& scene : scenes_) {
         if (!scene.error.empty())
             continue;
@@ -627,6 +630,8 @@ void Workflow::MakeGrid() {
     double pixelWidth = options_.xRes > 0.0 ? options_.xRes : options_.pixelSize;
     double pixelHeight = options_.yRes > 0.0 ? options_.yRes : options_.pixelSize;
     Area area{};
+    std::unique_ptr<AreaOfInterest> aoi;
+    const bool limited = options_.hasExtent || !options_.cutline.empty();
     bool fixed = false;
     for (Scene& scene : scenes_) {
         if (!scene.error.empty() || stopped_)
@@ -635,7 +640,7 @@ void Workflow::MakeGrid() {
         Footprint footprint;
         try {
             scene.grid = SceneLayout(options_, scene.input, crs, pixelWidth, pixelHeight,
-                                     options_.hasExtent ? &footprint : nullptr, true);
+                                     limited ? &footprint : nullptr, true);
             scene.hasGrid = true;
             if (scene.grid.uncoveredShare > 0) {
                 char share[32];
@@ -659,11 +664,14 @@ void Workflow::MakeGrid() {
             try {
                 if (options_.hasExtent)
                     area = AreaInCrs(options_, crs);
+                if (limited)
+                    aoi = std::make_unique<AreaOfInterest>(
+                        options_, crs, options_.hasExtent ? &area : nullptr);
             } catch (const std::exception& e) {
                 throw RunError(Explain(e));
             }
         }
-        if (footprint && !Overlaps(*footprint, area)) {
+        if (aoi && footprint && !aoi->Reaches(*footprint)) {
             scene.status = kOutsideArea;
             outside.push_back(scene.line);
             continue;
@@ -673,7 +681,7 @@ void Workflow::MakeGrid() {
     if (stopped_)
         return;
     if (grids.empty() && !outside.empty())
-        throw RunError("--te: no scene reaches the area of interest");
+        throw RunError("no scene reaches the area of interest of --te or --cutline");
     if (grids.empty())
         throw RunError(options_.master + ": no scene has a usable layout");
     grid_ = CommonGrid(grids, options_.hasExtent ? &area : nullptr);
