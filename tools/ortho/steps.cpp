@@ -357,12 +357,6 @@ void CheckOutputCrs(const std::string& text) {
                          ") is neither a projected nor a geographic coordinate system");
 }
 
-std::string Lower(std::string text) {
-    std::transform(text.begin(), text.end(), text.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
-    return text;
-}
-
 // The methods --help lists, in GDAL's spelling; compared without regard to case, as GDAL does.
 std::string CheckResampling(const std::string& method) {
     static const char* const kMethods[] = {"near",    "bilinear", "cubic", "cubicspline",
@@ -1085,6 +1079,14 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     // NAME.pgw, which no raster format but PNG reads (a .wld would be a JPEG raster's too).
     if (placed && !GDALWriteWorldFile(png.c_str(), "pgw", geo))
         FailFile(png, "cannot have its world file written", errors);
+}
+
+std::string Lower(std::string text) {
+    for (char& c : text) {
+        if (c >= 'A' && c <= 'Z')
+            c = static_cast<char>(c - 'A' + 'a');
+    }
+    return text;
 }
 
 }  // namespace ortho

@@ -180,4 +180,7 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
 // The colour of a value of the source raster in its quicklook, "#rrggbb".
 std::string SourceColour(unsigned int value);
 
+// text with A-Z lower-cased, whatever the locale.
+std::string Lower(std::string text);
+
 }  // namespace ortho

@@ -195,10 +195,7 @@ std::string RasterExtension(const std::string& type) {
 // rasters are PNG files themselves, so that it does not replace the raster.
 std::string QuicklookName(const std::string& dir, const std::string& stem,
                           const std::string& ext) {
-    std::string lower = ext;
-    std::transform(lower.begin(), lower.end(), lower.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
-    return Join(dir, stem + (lower == "png" ? "_quicklook.png" : ".png"));
+    return Join(dir, stem + (Lower(ext) == "png" ? "_quicklook.png" : ".png"));
 }
 
 // The outputs of a scene named `name`, in the order of Scene's fields.
@@ -231,8 +228,7 @@ std::string SameFileKey(const std::string& path) {
         key = fs::absolute(path, ec);
     std::string text = key.lexically_normal().string();
 #if defined(_WIN32) || defined(__APPLE__)
-    std::transform(text.begin(), text.end(), text.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+    text = Lower(text);
 #endif
     return text;
 }
