@@ -597,6 +597,8 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         bool mosaic;
     } steps[] = {
         {"nothing", [] {}, {}, "", false},
+        {"the generator's threads, which change no pixel",
+         [&] { args.insert(args.end(), {"--proc", "CPU:2"}); }, {}, "", false},
         {"a source's time but not its content",
          [&] {
              const auto path = dir.Path() / "sample/north.tif";

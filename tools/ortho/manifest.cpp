@@ -111,7 +111,6 @@ const std::vector<PixelOption>& PixelOptions() {
              return o.camerasSrs.empty() ? o.cameras : o.cameras + " --cameras-srs " + o.camerasSrs;
          }},
         {"--resample", false, [](const Options& o) { return o.resample; }},
-        {"--proc", false, [](const Options& o) { return o.proc; }},
         {"--of", false, [](const Options& o) { return o.format; }},
         {"--co", false,
          [](const Options& o) {

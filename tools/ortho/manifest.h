@@ -15,7 +15,9 @@
 namespace ortho {
 
 // The options that change the pixels of the outputs, each with the way to read its value. A
-// new option that changes pixels is one more line of the table in manifest.cpp.
+// new option that changes pixels is one more line of the table in manifest.cpp. --proc is not
+// one: the central-processor generator writes the same pixels on any number of threads, and a
+// graphics processor asked for falls back to it.
 struct PixelOption {
     const char* name;  // as the command line spells it
     // It moves the scenes' footprints too, so the common grid is worked out again.
