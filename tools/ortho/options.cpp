@@ -277,10 +277,12 @@ Running:
   --help, -h          this text
   --version           the version of silvan-ortho, GDAL and PROJ
 
-Outputs in DIR: master.txt (when images were given), prep.txt and imgset.txt (derived parameter files), per scene NAME_ortho.tif,
-NAME_vis.tif, NAME.xml (scene description, with TOSceneDesc_Document.dtd) and
-NAME_footprint.gpkg; footprints.gpkg (one layer per scene), mosaic.tif, mosaic_source.tif,
-mosaic.png, NAME_vis.png, and summary.json (summary-A-B.json for a slice).
+Outputs in DIR: master.txt (when images were given), prep.txt and imgset.txt (derived
+parameter files); per scene NAME_ortho.tif, NAME_vis.tif, NAME.xml (scene description, with
+TOSceneDesc_Document.dtd), NAME_footprint.gpkg and NAME_manifest.json (what made them);
+footprints.gpkg (one layer per scene), mosaic.tif, mosaic_source.tif, mosaic_manifest.json;
+PNG quicklooks with world files (NAME_vis.png, mosaic.png, mosaic_source.png and its legend
+mosaic_source_legend.json); summary.json (summary-A-B.json for a slice).
 
 Exit status: 0 when everything asked for was done, 1 when something failed, 2 for a bad
 command line, 130 when interrupted (Ctrl-C).
