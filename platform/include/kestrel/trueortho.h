@@ -204,7 +204,12 @@ struct KESTREL_API RecoveryScene {
 };
 
 struct KESTREL_API RecoveryJob {
-    std::vector<RecoveryScene> scenes;  // orthos on one common grid
+    // Orthos on windows of one grid: one CRS and pixel size, origins a whole number of pixels
+    // apart.
+    std::vector<RecoveryScene> scenes;
+    // The mosaic's grid on the same lattice; pixels 0: the smallest grid holding every scene.
+    ogc::cs::GeocodingInfo geocoding;
+    unsigned int pixels = 0, lines = 0;
     // Heights for the viewing angles (may be null: angles unknown), in the models' datum.
     dem::IElevationSource* surface = nullptr;
     std::string mosaicPath, sourcePath;  // the mosaic and the raster of source scenes
@@ -216,12 +221,29 @@ struct KESTREL_API RecoveryJob {
     // A raster on the common grid (a cutline burnt in): where its first band holds 0 no scene
     // fills the mosaic. Empty: none.
     std::string maskPath;
+
+    // The regions: a raster on the mosaic grid giving each pixel's scene (1 + its index in
+    // `scenes`, 0 none), edited seamlines burnt in, say. Empty: chosen by seamlines that avoid
+    // raised objects. Where a region's scene does not see the ground the best other scene fills.
+    std::string regionsPath;
+    // Ground heights without raised objects (a DTM), in the surface's datum, for the seam cost;
+    // null: estimated from the surface.
+    dem::IElevationSource* ground = nullptr;
+    // Across each seam the two scenes are blended over this many mosaic pixels; 0: hard seams.
+    unsigned int blendWidth = 16;
+    enum class Blend { Feather, Multiband };
+    Blend blend = Blend::Feather;
+    // Per scene and channel a gain (and offset) that makes overlapping scenes agree.
+    enum class Balance { None, Gain, GainOffset };
+    Balance balance = Balance::GainOffset;
 };
 
 struct TorthoRecoveryResult {
     bool completed = false;
     unsigned long long filled = 0;    // pixels that came from a scene
     unsigned long long unfilled = 0;  // pixels that no scene sees
+    // The balance applied, per scene and channel: value * gain + offset.
+    std::vector<std::vector<double>> gain, offset;
 };
 
 // Occlusion recovery: the true-ortho mosaic of several orthos of one image set.

@@ -1,0 +1,39 @@
+// Blending across seams: each mosaic pixel a weighted mean of the scenes whose regions lie
+// within the blend band, weights falling to zero where a scene does not see the ground.
+#pragma once
+
+#include <kestrel/export.h>
+
+#include <cstddef>
+#include <vector>
+
+namespace kestrel {
+namespace processes {
+namespace trueortho {
+
+enum class BlendMode { Feather, Multiband };
+
+// A tile of the mosaic with a border of `border` pixels on each side (width and height
+// include it). Arrays line after line.
+struct BlendTile {
+    int width = 0, height = 0, border = 0, bands = 0;
+    std::vector<std::size_t> scenes;  // the scenes present (indices into the job's scenes)
+    // Per scene: `bands` planes of width x height values (balanced); only read where seen.
+    std::vector<std::vector<float>> values;
+    // Per scene: 1 where the scene sees the ground.
+    std::vector<std::vector<unsigned char>> seen;
+    // Per pixel: the index into `scenes` of the region the pixel belongs to, or -1 for none.
+    std::vector<int> labels;
+};
+
+// The border a tile needs for a blend of `blendWidth` pixels.
+KESTREL_API int BlendBorder(BlendMode mode, int blendWidth);
+
+// The blended inner tile ((width - 2 border) x (height - 2 border), `bands` planes) into out;
+// pixels whose label is -1 take noData. blendWidth 0: every pixel its region's value.
+KESTREL_API void BlendRegions(const BlendTile& tile, BlendMode mode, int blendWidth,
+                              float noData, std::vector<float>& out);
+
+}  // namespace trueortho
+}  // namespace processes
+}  // namespace kestrel

@@ -1,0 +1,77 @@
+// Seamlines: the choice of one scene per mosaic pixel by regions, as the minimum of a cost made
+// of a data term per scene and pixel and a seam term between neighbouring pixels that take
+// different scenes.
+#pragma once
+
+#include <kestrel/export.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <limits>
+#include <vector>
+
+namespace kestrel {
+namespace processes {
+namespace trueortho {
+
+class RunControl;
+
+constexpr float kForbidden = std::numeric_limits<float>::infinity();
+
+// A window of the mosaic grid, at full or reduced resolution, as the seam solver sees it. Arrays
+// hold one value per cell, line after line.
+struct SeamWindow {
+    int width = 0, height = 0;
+    // The scenes that may take cells here (indices into the recovery job's scenes) and, for
+    // each of them, per cell:
+    std::vector<std::size_t> scenes;
+    // the data cost (>= 0; kForbidden where the scene does not see the ground), and
+    std::vector<std::vector<float>> cost;
+    // the scene's brightness after balancing, for the colour-disagreement part of the seam term.
+    std::vector<std::vector<float>> grey;
+    // Metres the surface stands above the ground (0 where unknown); empty: all 0.
+    std::vector<float> raised;
+    // The index into `scenes` a cell must take, or -1 where it is free; empty: all free.
+    std::vector<int> fixed;
+};
+
+struct SeamParams {
+    double pixelSize = 1.0;      // metres per full-resolution pixel
+    float seamWeight = 1.0f;     // cost of a seam between two cells on open ground
+    float raisedWeight = 4.0f;   // added per metre the surface stands above the ground
+    float colourWeight = 0.05f;  // added per grey level the two scenes disagree
+};
+
+// The labels of a window: per cell an index into window.scenes, -1 where every cost is
+// kForbidden.
+KESTREL_API std::vector<int> SolveSeams(const SeamWindow& window, const SeamParams& params);
+
+// What the region chooser reads: a window of the mosaic grid in which each cell stands for
+// factor x factor pixels (factor 1: full resolution). May be called from several threads.
+class SeamSource {
+  public:
+    virtual ~SeamSource() = default;
+    virtual SeamWindow Read(int x0, int y0, int width, int height, int factor) = 0;
+};
+
+// Receives labels (1 + scene index, 0 where no scene sees the pixel) of a full-resolution
+// window, line after line; called for windows that tile the grid, one call at a time.
+using LabelSink =
+    std::function<void(int x0, int y0, int width, int height, const std::vector<std::uint16_t>&)>;
+
+// Chooses the regions over a grid of pixels x lines and hands them to `sink`, with memory
+// bounded independently of the grid's size.
+KESTREL_API void ChooseRegions(SeamSource& source, unsigned int pixels, unsigned int lines,
+                               const SeamParams& params, unsigned int threads,
+                               RunControl& control, const LabelSink& sink);
+
+// Metres the surface stands above the ground under it, from surface heights alone: the heights
+// minus their morphological opening with a square of side 2 radius + 1 cells. NaN is no height
+// (0 out).
+KESTREL_API std::vector<float> RaisedHeights(const std::vector<float>& heights, int width,
+                                             int height, int radius);
+
+}  // namespace trueortho
+}  // namespace processes
+}  // namespace kestrel
