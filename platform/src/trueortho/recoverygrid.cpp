@@ -125,7 +125,38 @@ void SharedRaster::Read(const std::vector<int>& bands, const Rect& r, float* buf
     if (r.Intersect(window).Empty())
         return;
     std::lock_guard<std::mutex> lock(mutex);
+    if (!dataset) {
+        dataset = OpenRaster(path, role);
+        if (dataset->GetRasterXSize() != window.width || dataset->GetRasterYSize() != window.height)
+            KESTREL_THROW(DataException,
+                          FormatString("Occlusion recovery: the %s %s changed during the run "
+                                       "(%d x %d pixels, was %d x %d)",
+                                       role, path.c_str(), dataset->GetRasterXSize(),
+                                       dataset->GetRasterYSize(), window.width, window.height));
+    }
+    if (pool != nullptr)
+        pool->Touch(*this);
     ReadWindow(*dataset, path, bands, r.x - window.x, r.y - window.y, r.width, r.height, buffer);
+}
+
+void RasterPool::Touch(SharedRaster& raster) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (raster.listed_)
+        order_.splice(order_.begin(), order_, raster.place_);
+    else
+        order_.push_front(&raster), raster.listed_ = true, raster.place_ = order_.begin();
+    // Close the least recently read rasters that no thread holds (never waiting for one).
+    for (auto it = std::prev(order_.end()); order_.size() > capacity_ && it != order_.begin();) {
+        SharedRaster& old = **it;
+        const auto previous = std::prev(it);
+        std::unique_lock<std::mutex> held(old.mutex, std::try_to_lock);
+        if (held.owns_lock()) {
+            old.dataset.reset();
+            old.listed_ = false;
+            order_.erase(it);
+        }
+        it = previous;
+    }
 }
 
 std::vector<std::size_t> RecoveryGrid::ScenesMeeting(const Rect& r) const {
@@ -150,6 +181,7 @@ std::unique_ptr<SharedRaster> RecoveryGrid::OpenOnGrid(const std::string& path,
     auto raster = std::make_unique<SharedRaster>();
     raster->dataset = OpenRaster(path, role);
     raster->path = path;
+    raster->role = role;
     raster->window = {0, 0, raster->dataset->GetRasterXSize(), raster->dataset->GetRasterYSize()};
     std::array<double, 6> gt{};
     if (raster->dataset->GetGeoTransform(gt.data()) == CE_None &&
@@ -186,8 +218,10 @@ RecoveryGrid InspectScenes(const RecoveryJob& job) {
         SharedRaster& orthoFile = *grid.orthos.back();
         SharedRaster& visibilityFile = *grid.visibilities.back();
         orthoFile.path = scene.orthoPath, visibilityFile.path = scene.visibilityPath;
-        orthoFile.dataset = OpenRaster(scene.orthoPath, "ortho");
-        visibilityFile.dataset = OpenRaster(scene.visibilityPath, "visibility index");
+        orthoFile.role = "ortho", visibilityFile.role = "visibility index";
+        orthoFile.pool = visibilityFile.pool = grid.pool.get();
+        orthoFile.dataset = OpenRaster(scene.orthoPath, orthoFile.role);
+        visibilityFile.dataset = OpenRaster(scene.visibilityPath, visibilityFile.role);
         GDALDataset& ortho = *orthoFile.dataset;
         GDALDataset& visibility = *visibilityFile.dataset;
         std::array<double, 6> gt{};
@@ -243,6 +277,8 @@ RecoveryGrid InspectScenes(const RecoveryJob& job) {
                              scene.visibilityPath.c_str(), visibility.GetRasterXSize(),
                              visibility.GetRasterYSize(), scene.orthoPath.c_str(), pixels, lines));
         raw.push_back(window);
+        // Opened again when read.
+        orthoFile.dataset.reset(), visibilityFile.dataset.reset();
     }
 
     // The mosaic grid: the job's, on the scenes' lattice, or the union of their windows.

@@ -16,6 +16,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <limits>
+#include <list>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -36,16 +37,40 @@ struct Rect {
     }
 };
 
-// A raster opened once for the run and shared by the threads. GDAL datasets serve one thread
-// at a time, hence the lock.
+class RasterPool;
+
+// A raster of the run, shared by the threads: opened when read, and closed again by its pool
+// when too many are open. GDAL datasets serve one thread at a time, hence the lock.
 struct SharedRaster {
-    DatasetPtr dataset;
     std::string path;
+    const char* role = "raster";
     Rect window;  // where it lies on the mosaic grid
+    RasterPool* pool = nullptr;  // null: stays open
     std::mutex mutex;
+    DatasetPtr dataset;  // while open
     // Reads bands over `r` (mosaic pixels) into buffer (r.width x r.height per band); parts
     // outside the raster keep what the buffer holds.
     void Read(const std::vector<int>& bands, const Rect& r, float* buffer);
+
+  private:
+    friend class RasterPool;
+    bool listed_ = false;
+    std::list<SharedRaster*>::iterator place_;
+};
+
+// Keeps at most about `capacity` rasters open, closing the least recently read one that no
+// thread is reading, so that open files and their memory do not grow with the number of
+// scenes.
+class RasterPool {
+  public:
+    explicit RasterPool(std::size_t capacity) : capacity_(capacity) {}
+    // Marks `raster` (whose lock the caller holds) as just read.
+    void Touch(SharedRaster& raster);
+
+  private:
+    std::mutex mutex_;
+    std::list<SharedRaster*> order_;  // most recently read first
+    std::size_t capacity_;
 };
 
 struct RecoveryGrid {
@@ -57,6 +82,9 @@ struct RecoveryGrid {
     bool hasNoData = false;
     double noData = 0;  // the first scene's
     int halo = 0;       // the largest pixel error
+    // Rasters open at once: the scenes' working set on most surveys, a few tens of MB.
+    static constexpr std::size_t kOpenRasters = 128;
+    std::unique_ptr<RasterPool> pool = std::make_unique<RasterPool>(kOpenRasters);
     std::vector<std::unique_ptr<SharedRaster>> orthos, visibilities;
     // The scenes' windows clipped to the grid (empty when a scene lies outside it).
     std::vector<Rect> windows;
@@ -137,9 +165,11 @@ class ValueRange {
 // Metres per pixel of the grid (near enough on a geographic one).
 double PixelMetres(const RecoveryGrid& grid);
 
-// Per scene and pair of scenes whose windows meet, the pixels both see clearly, decimated on a
-// lattice so that a pair gives at most about kMaxSamples.
-constexpr double kMaxSamples = 20000;
+// Per pair of scenes whose windows meet, the pixels both see clearly, decimated on a lattice so
+// that a pair gives at most about kPairSamples, and all pairs together about kTotalSamples
+// (but a pair at least kFewestSamples), so that the samples' memory stays within some 25 MB
+// however many scenes there are.
+constexpr double kPairSamples = 20000, kTotalSamples = 1e6, kFewestSamples = 1000;
 std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const RecoveryGrid& grid,
                                            const SceneReader& reader, unsigned int threads,
                                            RunControl& control);

@@ -49,29 +49,23 @@ class RecoverySeamSource : public SeamSource {
         const size_t cells = static_cast<size_t>(width) * height;
         const Rect pixels{x0 * factor, y0 * factor, width * factor, height * factor};
         const Rect in = pixels.Intersect(grid_.Whole());
-        const std::vector<size_t> scenes = grid_.ScenesMeeting(in);
-        struct Sums {
-            std::vector<unsigned int> seen;
-            std::vector<float> cost, grey;
-        };
-        std::vector<Sums> sums(scenes.size());
         SceneReader::Scratch scratch;
         SceneTile tile;
-        // Chunks of whole cells, about 256 pixels across, hold one scene at a time.
+        std::vector<unsigned int> seen;
+        // One scene at a time, in chunks of about 256 pixels across: the sums of its pixel costs
+        // and brightness per cell go straight into the window's arrays.
         const int chunk = std::max(factor, 256 / factor * factor);
-        for (int cy = in.y; cy < in.y + in.height; cy += chunk)
-            for (int cx = in.x; cx < in.x + in.width; cx += chunk) {
-                const Rect part = Rect{cx, cy, chunk, chunk}.Intersect(in);
-                for (size_t k = 0; k < scenes.size(); ++k) {
-                    const size_t s = scenes[k];
-                    if (!reader_.Read(s, part, true, true, scratch, tile))
+        for (const size_t s : grid_.ScenesMeeting(in)) {
+            const Rect sceneIn = in.Intersect(grid_.windows[s]);
+            std::vector<float> cost, grey;
+            const int level = job_.scenes[s].radiometricLevel;
+            for (int cy = in.y; cy < in.y + in.height; cy += chunk)
+                for (int cx = in.x; cx < in.x + in.width; cx += chunk) {
+                    const Rect part = Rect{cx, cy, chunk, chunk}.Intersect(sceneIn);
+                    if (part.Empty() || !reader_.Read(s, part, true, true, scratch, tile))
                         continue;
-                    Sums& sum = sums[k];
-                    if (sum.seen.empty()) {
-                        sum.seen.assign(cells, 0);
-                        sum.cost.assign(cells, 0.0f), sum.grey.assign(cells, 0.0f);
-                    }
-                    const int level = job_.scenes[s].radiometricLevel;
+                    if (cost.empty())
+                        seen.assign(cells, 0), cost.assign(cells, 0.0f), grey.assign(cells, 0.0f);
                     for (int j = 0; j < part.height; ++j)
                         for (int i = 0; i < part.width; ++i) {
                             const size_t p = static_cast<size_t>(j) * part.width + i;
@@ -80,40 +74,37 @@ class RecoverySeamSource : public SeamSource {
                             const size_t c =
                                 static_cast<size_t>((part.y + j - pixels.y) / factor) * width +
                                 (part.x + i - pixels.x) / factor;
-                            ++sum.seen[c];
-                            sum.cost[c] += PixelCost(tile, p, level);
-                            double grey = 0;
+                            ++seen[c];
+                            cost[c] += PixelCost(tile, p, level);
+                            double sum = 0;
                             for (int b = 0; b < grid_.bands; ++b)
-                                grey += fit_.gain[s][b] * tile.values[part.Size() * b + p] +
-                                        fit_.offset[s][b];
-                            sum.grey[c] += static_cast<float>(grey / grid_.bands);
+                                sum += fit_.gain[s][b] * tile.values[part.Size() * b + p] +
+                                       fit_.offset[s][b];
+                            grey[c] += static_cast<float>(sum / grid_.bands);
                         }
                 }
-            }
-        for (size_t k = 0; k < scenes.size(); ++k) {
-            Sums& sum = sums[k];
-            if (sum.seen.empty())
+            if (cost.empty())
                 continue;
-            std::vector<float> cost(cells, kForbidden), grey(cells, 0.0f);
             bool any = false;
             for (int cy = 0; cy < height; ++cy)
                 for (int cx = 0; cx < width; ++cx) {
                     const size_t c = static_cast<size_t>(cy) * width + cx;
-                    const Rect cell =
+                    const size_t total =
                         Rect{pixels.x + cx * factor, pixels.y + cy * factor, factor, factor}
-                            .Intersect(in);
-                    const size_t total = cell.Size();
-                    const unsigned int seen = sum.seen[c];
-                    if (total == 0 || 2 * static_cast<size_t>(seen) < total || seen == 0)
+                            .Intersect(in)
+                            .Size();
+                    if (seen[c] == 0 || 2 * static_cast<size_t>(seen[c]) < total) {
+                        cost[c] = kForbidden, grey[c] = 0;
                         continue;
-                    cost[c] = sum.cost[c] / seen +
-                              kUnclearCost * static_cast<float>(total - seen) / total;
-                    grey[c] = sum.grey[c] / seen;
+                    }
+                    cost[c] = cost[c] / seen[c] +
+                              kUnclearCost * static_cast<float>(total - seen[c]) / total;
+                    grey[c] /= seen[c];
                     any = true;
                 }
             if (!any)
                 continue;
-            window.scenes.push_back(scenes[k]);
+            window.scenes.push_back(s);
             window.cost.push_back(std::move(cost));
             window.grey.push_back(std::move(grey));
         }
@@ -207,12 +198,17 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
         for (const size_t b : grid.ScenesMeeting(grid.windows[a])) {
             if (b <= a)
                 continue;
-            const double area = static_cast<double>(grid.windows[a].Intersect(grid.windows[b]).Size());
             index[a * count + b] = pairs.size();
-            pairs.push_back({a, b, std::max(1, static_cast<int>(std::ceil(std::sqrt(area / kMaxSamples))))});
+            pairs.push_back({a, b, 1});
         }
     if (pairs.empty())
         return {};
+    const double budget = std::min(kPairSamples, std::max(kFewestSamples, kTotalSamples / pairs.size()));
+    for (Pair& pair : pairs) {
+        const double area =
+            static_cast<double>(grid.windows[pair.a].Intersect(grid.windows[pair.b]).Size());
+        pair.stride = std::max(1, static_cast<int>(std::ceil(std::sqrt(area / budget))));
+    }
 
     // Tiles of the grid; each thread keeps its samples per tile and pair, put in order after.
     struct Chunk {
@@ -274,7 +270,7 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
         return std::tie(x.pair, x.tile) < std::tie(y.pair, y.tile);
     });
     std::vector<OverlapSamples> overlaps;
-    for (const Chunk& chunk : chunks) {
+    for (Chunk& chunk : chunks) {
         if (overlaps.empty() || overlaps.back().a != pairs[chunk.pair].a ||
             overlaps.back().b != pairs[chunk.pair].b) {
             overlaps.emplace_back();
@@ -283,6 +279,7 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
         auto& o = overlaps.back();
         o.valuesA.insert(o.valuesA.end(), chunk.a.begin(), chunk.a.end());
         o.valuesB.insert(o.valuesB.end(), chunk.b.begin(), chunk.b.end());
+        std::vector<float>().swap(chunk.a), std::vector<float>().swap(chunk.b);
     }
     return overlaps;
 }
