@@ -300,6 +300,8 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
         : job.balance == RecoveryJob::Balance::Gain ? trueortho::BalanceMode::Gain
                                                     : trueortho::BalanceMode::GainOffset;
     std::vector<trueortho::OverlapSamples> overlaps;
+    // Progress: a fifth for the balance, two for the regions, two for the composition.
+    control.SetSpan(0.0, 0.2);
     if (balance != trueortho::BalanceMode::None && job.scenes.size() > 1)
         overlaps = trueortho::GatherOverlaps(job, grid, reader, threads, control);
     if (control.Stopped())
@@ -310,6 +312,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
 
     // 2. The regions: the job's raster, seamlines, or none (the first-ranked scene per pixel).
     ScratchFile scratch;
+    control.SetSpan(0.2, 0.4);
     if (!regions && job.seamlines) {
         regions = ChooseSeamlines(job, grid, reader, fit, threads, control, scratch);
         if (control.Stopped())
@@ -338,6 +341,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
                                   trueortho::ValueRange(grid.type),
                                   mosaic.get(),
                                   source.get()};
+    control.SetSpan(0.6, 0.4);
     std::vector<TorthoRecoveryResult> counts(threads);
     std::vector<Worker> workers(threads);
     control.RunTiles(tiles, threads, "Occlusion recovery", [&](unsigned int thread, size_t index) {
