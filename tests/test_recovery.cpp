@@ -308,11 +308,12 @@ TEST(RecoveryChoice, PixelErrorNeighbourhoodMatchesTheRuleAtEveryPixel) {
 }
 
 // Many scenes on many threads under a small limit of open files, and a thread count far beyond
-// the work: each scene's rasters are opened once, and threads are capped by the tiles.
+// the work: the threads share each scene's rasters, more scenes than stay open at once (closed
+// and opened again as tiles need them), and threads are capped by the tiles.
 TEST(RecoveryChoice, ThreadsShareEachScenesFilesAndAreCappedByTheWork) {
     TempDir dir;
     std::vector<std::vector<unsigned char>> visibility;
-    const RecoveryJob job = synthetic::MakeScenes(dir, 40, 0.01, 7, visibility);
+    const RecoveryJob job = synthetic::MakeScenes(dir, 70, 0.01, 7, visibility);
     const auto expected = synthetic::ExpectedSource(job, visibility);
 #if !defined(_WIN32)
     rlimit saved{};
