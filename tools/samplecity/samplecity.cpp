@@ -682,13 +682,15 @@ void ForEachRow(unsigned int rows, unsigned int threads, const RowWork& rowWork)
         t.join();
 }
 
-// Writes width x height pixel-interleaved RGB bytes as a tiled GeoTIFF with no-data 0; the
-// metadata items (NAME=VALUE) go into the given domain.
+// Writes width x height pixel-interleaved RGB bytes as a tiled GeoTIFF with no-data 0 (DEFLATE
+// when georeferenced: the ideal image is large and mostly smooth); the metadata items
+// (NAME=VALUE) go into the given domain.
 void WriteRgb(const std::string& path, const std::vector<std::uint8_t>& pixels, unsigned int w,
               unsigned int h, const std::array<double, 6>* geoTransform, const ICRS* crs,
               std::vector<std::string> metadata, const char* domain) {
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
-    const char* options[] = {"TILED=YES", "INTERLEAVE=PIXEL", "PHOTOMETRIC=RGB", nullptr};
+    const char* options[] = {"TILED=YES", "INTERLEAVE=PIXEL", "PHOTOMETRIC=RGB",
+                             geoTransform != nullptr ? "COMPRESS=DEFLATE" : nullptr, nullptr};
     DatasetPtr ds(driver->Create(path.c_str(), static_cast<int>(w), static_cast<int>(h), 3,
                                  GDT_Byte, const_cast<char**>(options)));
     if (!ds)
