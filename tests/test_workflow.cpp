@@ -726,9 +726,11 @@ TEST(Workflow, EditedSeamlinesChangeTheMosaicThereAlone) {
     ASSERT_TRUE(burnt);
     EXPECT_EQ(ReadBytes(*burnt), sourceBefore);
 
-    // Later features win where polygons overlap: the largest region, dragged last, its vertex
-    // farthest from its centre moved 6 m (6 pixels) farther out.
+    // Later features win where polygons overlap: the largest region, dragged last, one vertex
+    // moved 6 m (6 pixels) away from its centre into another scene's region.
     std::filesystem::copy_file(dir.File("out/seamlines.gpkg"), dir.File("edited.gpkg"));
+    double geo[6];
+    ASSERT_EQ(source->GetGeoTransform(geo), CE_None);
     std::vector<unsigned char> between;
     {
         Dataset edited(GDALDataset::Open(dir.File("edited.gpkg").c_str(),
@@ -752,16 +754,23 @@ TEST(Workflow, EditedSeamlinesChangeTheMosaicThereAlone) {
         OGRPoint centre;
         ASSERT_EQ(polygon->Centroid(&centre), OGRERR_NONE);
         OGRLinearRing* ring = polygon->getExteriorRing();
-        int far = 1;
-        double farthest = 0.0;
-        for (int i = 1; i + 1 < ring->getNumPoints(); ++i) {
-            const double d = std::hypot(ring->getX(i) - centre.getX(), ring->getY(i) - centre.getY());
-            if (d > farthest)
-                farthest = d, far = i;
+        bool moved = false;
+        for (int i = 1; i + 1 < ring->getNumPoints() && !moved; ++i) {
+            const double dx = ring->getX(i) - centre.getX(), dy = ring->getY(i) - centre.getY();
+            const double x = ring->getX(i) + 6 * dx / std::hypot(dx, dy);
+            const double y = ring->getY(i) + 6 * dy / std::hypot(dx, dy);
+            const int u = static_cast<int>(std::floor((x - geo[0]) / geo[1]));
+            const int v = static_cast<int>(std::floor((y - geo[3]) / geo[5]));
+            // Inside, away from the mosaic's edges.
+            if (u < 16 || v < 16 || u + 16 >= width || v + 16 >= height)
+                continue;
+            const unsigned char there = sourceBefore[static_cast<std::size_t>(v) * width + u];
+            if (there == 0 || scenes[there - 1].ToString() == largest->GetFieldAsString("scene"))
+                continue;
+            ring->setPoint(i, x, y);
+            moved = true;
         }
-        const double ux = (ring->getX(far) - centre.getX()) / farthest;
-        const double uy = (ring->getY(far) - centre.getY()) / farthest;
-        ring->setPoint(far, ring->getX(far) + 6 * ux, ring->getY(far) + 6 * uy);
+        ASSERT_TRUE(moved);
         ASSERT_EQ(layer->CreateFeature(largest.get()), OGRERR_NONE);
         const std::vector<unsigned char> a = Burnt(*source, *old);
         between = Burnt(*source, *polygon);
@@ -815,6 +824,8 @@ TEST(Workflow, EditedSeamlinesChangeTheMosaicThereAlone) {
             ++strayedPixels;
     }
     EXPECT_GT(movedSource, 0u);
+
+
     EXPECT_EQ(strayedSource, 0u);
     EXPECT_EQ(strayedPixels, 0u);
 }
