@@ -23,6 +23,11 @@ std::string Where(const std::string& path) {
     return "--seamlines: " + path + ", layer \"" + kLayer + "\"";
 }
 
+// Polygons, multi-polygons and their curved kinds (an editor may draw arcs).
+bool Areal(OGRwkbGeometryType type) {
+    return OGR_GT_IsSurface(type) || OGR_GT_IsSubClassOf(type, wkbMultiSurface);
+}
+
 // The layer "seamlines" of the file, checked to hold polygons with a CRS and the scene field.
 OGRLayer* OpenLayer(const std::string& path, DatasetPtr& dataset, const GdalErrors& errors) {
     dataset.reset(
@@ -39,7 +44,7 @@ OGRLayer* OpenLayer(const std::string& path, DatasetPtr& dataset, const GdalErro
                          (names.empty() ? std::string("no layers") : "layers: " + names) + ")");
     }
     const OGRwkbGeometryType type = wkbFlatten(layer->GetGeomType());
-    if (type != wkbPolygon && type != wkbMultiPolygon && type != wkbUnknown)
+    if (!Areal(type) && type != wkbUnknown)
         throw UsageError(Where(path) + ": holds " + OGRGeometryTypeToName(type) +
                          " geometries, not polygons");
     if (layer->GetSpatialRef() == nullptr)
@@ -66,12 +71,14 @@ void ForEachRegion(const std::string& path, const GdalErrors& errors,
         // A row without a shape (a table row added in an editor) covers nothing.
         if (!shape || shape->IsEmpty())
             continue;
-        if (shape->getSpatialReference() == nullptr)
-            shape->assignSpatialReference(layer->GetSpatialRef());
         const OGRwkbGeometryType type = wkbFlatten(shape->getGeometryType());
-        if (type != wkbPolygon && type != wkbMultiPolygon)
+        if (!Areal(type))
             throw UsageError(Where(path) + ", feature " + std::to_string(feature->GetFID()) +
                              ": a " + OGRGeometryTypeToName(type) + ", not a polygon");
+        if (OGR_GT_IsNonLinear(type))
+            shape.reset(shape->getLinearGeometry());
+        if (shape->getSpatialReference() == nullptr)
+            shape->assignSpatialReference(layer->GetSpatialRef());
         use(feature->GetFID(), feature->GetFieldAsString(field), std::move(shape));
     }
 }
@@ -193,7 +200,9 @@ void BurnSeamlines(const std::string& path, const std::vector<SeamlineScene>& sc
         values.push_back(static_cast<double>(scene - scenes.begin() + 1));
     });
 
-    DatasetPtr regions = CreateGridRaster(grid, raster, errors);
+    // Values as the source raster holds them: Byte, UInt16 from 255 scenes on.
+    DatasetPtr regions =
+        CreateGridRaster(grid, raster, errors, scenes.size() < 255 ? GDT_Byte : GDT_UInt16);
     std::vector<OGRGeometryH> handles;
     for (const auto& shape : shapes)
         handles.push_back(OGRGeometry::ToHandle(shape.get()));

@@ -74,13 +74,14 @@ OGRSpatialReference GridSrs(const Grid& grid) {
     return srs;
 }
 
-DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const GdalErrors& errors) {
+DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const GdalErrors& errors,
+                            GDALDataType type) {
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
     const char* createOptions[] = {"TILED=YES", "COMPRESS=DEFLATE", "SPARSE_OK=YES", nullptr};
     RemoveFile(path);
     DatasetPtr raster(driver == nullptr ? nullptr
                                         : driver->Create(path.c_str(), static_cast<int>(grid.pixels),
-                                                         static_cast<int>(grid.lines), 1, GDT_Byte,
+                                                         static_cast<int>(grid.lines), 1, type,
                                                          const_cast<char**>(createOptions)));
     if (!raster)
         FailFile(path, "cannot be created", errors);

@@ -9,6 +9,8 @@
 #include <silvan/polygon.h>
 #include <silvan/toimgsetparser.h>
 
+#include <gdal.h>
+
 #include <array>
 #include <functional>
 #include <memory>
@@ -225,8 +227,9 @@ using DatasetPtr = std::unique_ptr<GDALDataset, DatasetClose>;
 DatasetPtr CreateVector(const std::string& path, const GdalErrors& errors);
 // The grid's CRS, axes in GIS order (easting, northing).
 OGRSpatialReference GridSrs(const Grid& grid);
-// A working Byte GeoTIFF on the grid, all 0 (tiled, sparse), for layers burnt in.
-DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const GdalErrors& errors);
+// A working one-band GeoTIFF on the grid, all 0 (tiled, sparse), for layers burnt in.
+DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const GdalErrors& errors,
+                            GDALDataType type = GDT_Byte);
 
 // text with A-Z lower-cased, whatever the locale.
 std::string Lower(std::string text);
