@@ -4,6 +4,7 @@
 #include "program.h"
 
 #include <gdal_priv.h>
+#include <ogr_spatialref.h>
 
 #include <array>
 #include <filesystem>
@@ -71,6 +72,15 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
     const std::string points = layer("points.geojson", "seamlines",
                                      R"({"type": "Point", "coordinates": [0, 0]})", R"({"scene": "a"})");
     const std::string unnamed = layer("unnamed.geojson", "seamlines", square, R"({"name": "a"})");
+    // Ground heights above mean sea level, as the file's CRS says.
+    const std::string msl = WriteImage(dir.File("msl.tif"));
+    {
+        GDALDataset* raster = GDALDataset::Open(msl.c_str(), GDAL_OF_RASTER | GDAL_OF_UPDATE);
+        OGRSpatialReference crs;
+        crs.SetFromUserInput("EPSG:32632+5773");
+        raster->SetSpatialRef(&crs);
+        GDALClose(raster);
+    }
     const std::string out = dir.File("out");
     const std::string textNotImage = ": a text file (a master parameter file?), not an image";
     const CommandLine cases[] = {
@@ -119,6 +129,7 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--seamlines", unnamed}, "has no field \"scene\""},
         {{master}, {"--dtm", absent}, "--dtm: " + absent + ": not found"},
         {{master}, {"--dtm", master}, "--dtm: " + master + ": cannot be opened as a raster"},
+        {{master}, {"--dtm", msl, "--elevref", "ELLIPS"}, "--dtm " + msl + ": the file says the heights are \"EGM96 height\""},
         {{master}, {"--blend-width", "wide"}, "--blend-width: \"wide\" is not a whole number"},
         {{master}, {"--blend", "gauss"}, "--blend: \"gauss\" is not one of feather, multiband"},
         {{master}, {"--balance", "mean"}, "--balance: \"mean\" is not one of gain, gain-offset"},
