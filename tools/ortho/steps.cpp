@@ -79,10 +79,11 @@ DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const Gda
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
     const char* createOptions[] = {"TILED=YES", "COMPRESS=DEFLATE", "SPARSE_OK=YES", nullptr};
     RemoveFile(path);
-    DatasetPtr raster(driver == nullptr ? nullptr
-                                        : driver->Create(path.c_str(), static_cast<int>(grid.pixels),
-                                                         static_cast<int>(grid.lines), 1, type,
-                                                         const_cast<char**>(createOptions)));
+    DatasetPtr raster(driver == nullptr
+                          ? nullptr
+                          : driver->Create(path.c_str(), static_cast<int>(grid.pixels),
+                                           static_cast<int>(grid.lines), 1, type,
+                                           const_cast<char**>(createOptions)));
     if (!raster)
         FailFile(path, "cannot be created", errors);
     std::array<double, 6> geoTransform = grid.geoTransform;
@@ -1094,11 +1095,11 @@ MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoverySce
     const std::unique_ptr<kestrel::dem::IElevationSource> ground = OpenGround(options, model);
     job.ground = ground.get();
     job.blendWidth = BlendWidth(options);
-    job.blend = options.blend == "multiband" ? kestrel::processes::RecoveryJob::Blend::Multiband
-                                             : kestrel::processes::RecoveryJob::Blend::Feather;
-    job.balance = options.balance == "none"   ? kestrel::processes::RecoveryJob::Balance::None
-                  : options.balance == "gain" ? kestrel::processes::RecoveryJob::Balance::Gain
-                                              : kestrel::processes::RecoveryJob::Balance::GainOffset;
+    using Job = kestrel::processes::RecoveryJob;
+    job.blend = options.blend == "multiband" ? Job::Blend::Multiband : Job::Blend::Feather;
+    job.balance = options.balance == "none"   ? Job::Balance::None
+                  : options.balance == "gain" ? Job::Balance::Gain
+                                              : Job::Balance::GainOffset;
     // Files beside the mosaic under temporary names, removed whatever happens: the burnt
     // cutline and regions, and the lossless mosaic that a lossy type is copied from.
     struct Removed {
