@@ -27,6 +27,7 @@ constexpr float kUnclearCost = 1000.0f;
 // wider than most buildings are deep, so that its floor is the ground between them.
 constexpr double kGroundRadius = 20.0;  // metres
 constexpr int kMaxGroundRadius = 256;   // cells
+constexpr int kBlockRadius = 8;         // blocks of the opening
 
 float PixelCost(const SceneTile& tile, size_t p, int level) {
     const float angle = tile.angle[p];
@@ -145,17 +146,40 @@ class RecoverySeamSource : public SeamSource {
             }
             return raised;
         }
+        // The opening runs on blocks of b x b cells, each the lowest height in it, so that its
+        // radius stays within kBlockRadius blocks (its cost grows with the radius); the ground
+        // of a cell is its block's.
         const int radius = std::min(
             kMaxGroundRadius,
             static_cast<int>(std::ceil(kGroundRadius / (PixelMetres(grid_) * factor))));
-        const int w = width + 2 * radius, h = height + 2 * radius;
-        const std::vector<float> opened =
-            RaisedHeights(Heights(*job_.surface, x0 - radius, y0 - radius, w, h, factor), w, h,
-                          radius);
-        std::vector<float> raised(static_cast<size_t>(width) * height);
+        const int b = std::max(1, (radius + kBlockRadius - 1) / kBlockRadius);
+        const int blockRadius = (radius + b - 1) / b;
+        // Blocks from the one holding cell x0 - radius (aligned to the grid's blocks).
+        auto floorDiv = [](int v, int d) { return v >= 0 ? v / d : -((-v + d - 1) / d); };
+        const int bx0 = floorDiv(x0, b) - blockRadius, by0 = floorDiv(y0, b) - blockRadius;
+        const int bx1 = floorDiv(x0 + width - 1, b) + blockRadius + 1;
+        const int by1 = floorDiv(y0 + height - 1, b) + blockRadius + 1;
+        const int bw = bx1 - bx0, bh = by1 - by0;
+        const std::vector<float> fine = Heights(*job_.surface, bx0 * b, by0 * b, bw * b, bh * b, factor);
+        std::vector<float> lowest(static_cast<size_t>(bw) * bh, NAN);
+        for (int j = 0; j < bh * b; ++j)
+            for (int i = 0; i < bw * b; ++i) {
+                const float h = fine[static_cast<size_t>(j) * bw * b + i];
+                float& l = lowest[static_cast<size_t>(j / b) * bw + i / b];
+                if (std::isfinite(h) && !(l <= h))
+                    l = h;
+            }
+        // The opening is the heights less what stands above it.
+        const std::vector<float> above = RaisedHeights(lowest, bw, bh, blockRadius);
+        std::vector<float> raised(static_cast<size_t>(width) * height, 0.0f);
         for (int j = 0; j < height; ++j)
-            std::copy_n(opened.begin() + static_cast<size_t>(j + radius) * w + radius, width,
-                        raised.begin() + static_cast<size_t>(j) * width);
+            for (int i = 0; i < width; ++i) {
+                const int fx = x0 + i - bx0 * b, fy = y0 + j - by0 * b;
+                const size_t block = static_cast<size_t>(fy / b) * bw + fx / b;
+                const float ground = lowest[block] - above[block];
+                const float d = fine[static_cast<size_t>(fy) * bw * b + fx] - ground;
+                raised[static_cast<size_t>(j) * width + i] = std::isfinite(d) ? std::max(0.0f, d) : 0.0f;
+            }
         return raised;
     }
 
