@@ -7,8 +7,8 @@
 //     the share of mosaic pixels within 15 grey levels of the mosaic of the same images at one
 //     exposure, unbalanced;
 //   surface error: a surface model whose building edges are moved by up to a pixel, mosaicked
-//     by the per-pixel choice and by seamlines: the share of seam pixels on buildings, and the
-//     share of mosaic pixels more than 15 grey levels from the ideal image (the texture seen
+//     by the per-pixel choice and by seamlines: the share of the seams that crosses a building, and
+//     the share of mosaic pixels more than 15 grey levels from the ideal image (the texture seen
 //     from straight above); the per-pixel choice on the true surface model beside them.
 //
 //   bench_mosaic [DIR]    work in DIR and keep it (default: a scratch directory)
@@ -231,22 +231,37 @@ double ShareApart(const Raster& mosaic, const Raster& mosaicSource, const Raster
     return apart / both;
 }
 
-// The share of seam pixels (pixels with a 4-neighbour of another scene) on a building.
-double SeamsOnBuildings(const City& city, const Raster& source) {
+// The seams' length (pairs of 4-neighbours that take different scenes), the share of it on a
+// building (both pixels on one) and the share inside one (both pixels more than 1 m inside its
+// outline): a seam along a roof's outline goes around the building, even where the surface's
+// error has put it a pixel inside.
+struct SeamFigures {
+    double length = 0, onBuildings = 0, insideBuildings = 0;
+};
+
+SeamFigures Seams(const City& city, const Raster& source) {
     const samplecity::Dsm truth(city.options);  // the buildings the images show
-    std::vector<unsigned char> seam(source.values.size(), 0);
-    ForEachSeam(source, [&](std::size_t p, std::size_t q) { seam[p] = seam[q] = 1; });
-    double seams = 0, onBuildings = 0;
-    for (std::size_t p = 0; p < seam.size(); ++p) {
-        if (!seam[p])
-            continue;
-        const double x = city.options.west + (p % source.width + 0.5) * kPixel;
-        const double y =
-            city.options.south + city.options.sizeY - (p / source.width + 0.5) * kPixel;
-        seams += 1;
-        onBuildings += truth.BuildingAt(x, y) != 0;
-    }
-    return onBuildings / seams;
+    auto building = [&](std::size_t p, int dx, int dy) {
+        return truth.BuildingAt(
+            city.options.west + (static_cast<double>(p % source.width) + 0.5 + dx) * kPixel,
+            city.options.south + city.options.sizeY -
+                (static_cast<double>(p / source.width) + 0.5 + dy) * kPixel);
+    };
+    auto inside = [&](std::size_t p) {
+        const int id = building(p, 0, 0);
+        for (const auto& [dx, dy] : {std::pair{-2, 0}, {2, 0}, {0, -2}, {0, 2}})
+            if (building(p, dx, dy) != id)
+                return 0;
+        return id;
+    };
+    SeamFigures f;
+    ForEachSeam(source, [&](std::size_t p, std::size_t q) {
+        f.length += 1;
+        f.onBuildings += building(p, 0, 0) != 0 && building(p, 0, 0) == building(q, 0, 0);
+        f.insideBuildings += inside(p) != 0 && inside(p) == inside(q);
+    });
+    f.onBuildings /= f.length, f.insideBuildings /= f.length;
+    return f;
 }
 
 std::string Load() {
@@ -304,16 +319,17 @@ int main(int argc, char** argv) {
             return 1;
         }
         std::printf("\nsurface model's building edges moved by up to 1 pixel\n");
-        std::printf("%-32s %18s %20s %8s\n", "regions", "seams on buildings",
-                    "more than 15 from ideal", "seconds");
+        std::printf("%-24s %11s %12s %16s %23s %8s\n", "regions", "seam length", "on buildings",
+                    "inside buildings", "more than 15 from ideal", "seconds");
         for (const auto& [label, tag, seamlines] :
              {std::make_tuple("per pixel, true surface", "true", false),
               std::make_tuple("per pixel", "err", false),
               std::make_tuple("seamlines", "err", true)}) {
             const Mosaic m = MakeMosaic(*city, tag, RecoveryJob::Balance::GainOffset, seamlines,
                                         std::string(tag) + (seamlines ? "_seams" : "_pixel"));
-            std::printf("%-32s %17.2f%% %19.2f%% %8.2f\n", label,
-                        100 * SeamsOnBuildings(*city, m.source),
+            const SeamFigures seams = Seams(*city, m.source);
+            std::printf("%-24s %11.0f %11.2f%% %15.2f%% %22.2f%% %8.2f\n", label, seams.length,
+                        100 * seams.onBuildings, 100 * seams.insideBuildings,
                         100 * ShareApart(m.values, m.source, ideal, nullptr), m.seconds);
         }
     }
