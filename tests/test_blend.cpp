@@ -190,10 +190,12 @@ TEST(Blend, MultibandBlendsAroundTheSeamAndKeepsValuesAwayFromIt) {
 }
 
 // Scene 1 does not see a strip left of the seam, scene 0 a strip right of it: there the other
-// scene's value stands alone.
+// scene's value stands alone (feather), or is pulled away from less (multiband, where the unseen
+// scene still adds its low frequencies).
 TEST(Blend, AnUnseenSceneHasNoWeight) {
     const int seam = 30;
     Mosaic m = StraightSeam(seam);
+    const std::vector<float> seen = m.Blend(BlendMode::Multiband, 16, 64);
     for (int y = 0; y < m.height; ++y) {
         for (int x = seam - 4; x < seam - 1; ++x)
             m.seen[1][m.At(x, y)] = 0;
@@ -205,6 +207,10 @@ TEST(Blend, AnUnseenSceneHasNoWeight) {
     EXPECT_EQ(feather[seam + 2], 100.0f);
     EXPECT_GT(feather[seam - 1], 0.0f);
     EXPECT_LT(feather[seam + 1], 100.0f);
+
+    const std::vector<float> multiband = m.Blend(BlendMode::Multiband, 16, 64);
+    for (int x = seam - 4; x < seam - 1; ++x)
+        EXPECT_LT(multiband[x], seen[x] - 2.0f) << x;
 }
 
 float MaxDifference(const std::vector<float>& a, const std::vector<float>& b) {
