@@ -5,6 +5,7 @@
 
 #include <gdal_priv.h>
 
+#include <array>
 #include <filesystem>
 #include <string>
 #include <vector>
@@ -69,10 +70,10 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--of", "xyz"}, "--of: xyz: GDAL's XYZ text holds no coordinate system"},
         {{master}, {"--of", "hdr"}, "--of: hdr names the ENVI header"},
         {{master}, {"--co", "FOO=BAR"}, "--co: Creation option \"FOO=BAR\" of GDAL's COG driver"},
+        {{master}, {"--of", "jpg", "--co", "COMPRESS=LZW"}, "of GDAL's JPEG driver"},
         {{master}, {"--co", "COMPRESS=ZIP"}, "COMPRESS=ZIP\" of GDAL's COG driver"},
         {{master}, {"--co", "COMPRESS"}, "is written NAME=VALUE"},
         {{master}, {"--of", "png", "--co", "BLOCKSIZE=64"}, "of GDAL's PNG driver"},
-        {{master}, {"--of", "jpg"}, "--of: jpg: GDAL's JPEG driver writes lossy files"},
         {{master}, {"--resample", "gauss"}, "--resample: unknown method \"gauss\""},
         {{master}, {"--resample", "nearest"}, "--resample: unknown method \"nearest\""},
         {{master}, {"--dem", absent}, "--dem: " + absent + ": not found"},
@@ -149,6 +150,8 @@ TEST(OrthoCommandLine, ValuesThatHelpListsAreAccepted) {
         {"--resample", "mode"},    {"--resample", "CUBIC"},       {"--of", "tif"},
         {"--of", "cog"},           {"--of", "png"},               {"--of", "envi"},
         {"--of", "img"},           {"--of", "gpkg"},              {"--srs", "EPSG:32632"},
+        {"--of", "jpg"},           {"--of", "webp"},              {"--of", "jp2"},
+        {"--co", "TILED=NO"},
         {"--srs", "EPSG:4326"},    {"--proc", "CPU:2"},           {"--elunits", "FOOT"},
         {"--co", "COMPRESS=JPEG"}, {"--co", "QUALITY=90"},        {"--co", "BLOCKSIZE=256"},
         {"--tr", "0.5", "0.25"},   {"--te", "9", "45", "9.1", "45.1", "--te-srs", "EPSG:4326"},
@@ -213,14 +216,64 @@ TEST(OrthoCommandLine, ImagesRunWithTheMasterFileWrittenForThem) {
               "../sample/view180.tif;;0;;;0;ANY;0;ORTHO\n");
     const std::string summary = ReadFile(dir.File("out/summary.json"));
     EXPECT_NE(summary.find("\"status\": \"complete\""), std::string::npos) << summary;
+
+    // Every documented type round-trips with its georeferencing: the rasters lie where the PNG
+    // run's do. Lossy types keep the visibility index and the source raster in lossless GeoTIFF,
+    // with the same classes.
     GDALAllRegister();
-    for (const std::string name : {"mosaic.png", "view000_ortho.png", "view180_vis.png"}) {
-        GDALDatasetH raster = GDALOpen(dir.File("out/" + name).c_str(), GA_ReadOnly);
-        ASSERT_NE(raster, nullptr) << name;
-        double geo[6] = {0};
-        EXPECT_EQ(GDALGetGeoTransform(raster, geo), CE_None) << name;
-        EXPECT_NE(GDALGetSpatialRef(raster), nullptr) << name;
-        GDALClose(raster);
+    struct Raster {
+        std::array<double, 6> geo{};
+        std::string crs;
+        std::vector<unsigned char> values;  // of the first band
+    };
+    const auto read = [](const std::string& path) {
+        Raster raster;
+        GDALDatasetH dataset = GDALOpen(path.c_str(), GA_ReadOnly);
+        EXPECT_NE(dataset, nullptr) << path;
+        if (dataset == nullptr)
+            return raster;
+        EXPECT_EQ(GDALGetGeoTransform(dataset, raster.geo.data()), CE_None) << path;
+        const OGRSpatialReferenceH srs = GDALGetSpatialRef(dataset);
+        EXPECT_NE(srs, nullptr) << path;
+        if (srs != nullptr && OSRGetAuthorityCode(srs, nullptr) != nullptr)
+            raster.crs = OSRGetAuthorityCode(srs, nullptr);
+        const int width = GDALGetRasterXSize(dataset), height = GDALGetRasterYSize(dataset);
+        raster.values.resize(static_cast<std::size_t>(width) * height);
+        EXPECT_EQ(GDALRasterIO(GDALGetRasterBand(dataset, 1), GF_Read, 0, 0, width, height,
+                               raster.values.data(), width, height, GDT_Byte, 0, 0),
+                  CE_None);
+        GDALClose(dataset);
+        return raster;
+    };
+    const std::vector<std::string> names = {"mosaic", "view000_ortho", "view180_vis",
+                                            "mosaic_source"};
+    std::vector<Raster> png;
+    for (const std::string& name : names)
+        png.push_back(read(dir.File("out/" + name + ".png")));
+    const struct {
+        const char* type;
+        const char* ext;      // of the ortho and the mosaic
+        const char* classes;  // of the visibility index and the source raster
+    } types[] = {{"tif", "tif", "tif"},  {"cog", "tif", "tif"},  {"img", "img", "img"},
+                 {"gpkg", "gpkg", "gpkg"}, {"jpg", "jpg", "tif"}, {"webp", "webp", "tif"},
+                 {"jp2", "jp2", "tif"}};
+    for (const auto& t : types) {
+        SCOPED_TRACE(t.type);
+        std::vector<std::string> typed = args;
+        typed[3] = dir.File(std::string("out-") + t.type);
+        typed[typed.size() - 2] = t.type;
+        const ProgramResult run = Ortho(typed, dir);
+        ASSERT_EQ(run.status, 0) << run.err;
+        for (std::size_t k = 0; k < names.size(); ++k) {
+            const Raster raster =
+                read(typed[3] + "/" + names[k] + "." + (k < 2 ? t.ext : t.classes));
+            for (std::size_t i = 0; i < raster.geo.size(); ++i)  // GeoPackage rounds a little
+                EXPECT_NEAR(raster.geo[i], png[k].geo[i], 1e-6 * png[k].geo[1]) << names[k];
+            EXPECT_EQ(raster.crs, png[k].crs) << names[k];
+            if (k >= 2) {
+                EXPECT_EQ(raster.values, png[k].values) << names[k];
+            }
+        }
     }
 
     // A master file whose line names a text file: said plainly.

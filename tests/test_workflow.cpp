@@ -254,8 +254,9 @@ std::vector<std::string> MakeSample(const TempDir& dir) {
 TEST(Workflow, SampleCityEndToEnd) {
     TempDir dir;
     std::vector<std::string> args = MakeSample(dir);
-    // Blocks small enough for the sample's mosaic to have overviews.
-    args.insert(args.end(), {"--jobs", "2", "--co", "BLOCKSIZE=128"});
+    // Blocks small enough for the sample's mosaic to have overviews (an option of the mosaic's
+    // driver alone), and a compression that the orthos take too.
+    args.insert(args.end(), {"--jobs", "2", "--co", "BLOCKSIZE=128", "--co", "COMPRESS=LZW"});
     const Result first = Ortho(args, dir);
     ASSERT_EQ(first.status, 0) << first.err;
     const std::string summary = ReadFile(dir.File("out/summary.json"));
@@ -272,62 +273,91 @@ TEST(Workflow, SampleCityEndToEnd) {
     }
     ASSERT_GE(names.size(), 3u);
 
-    // One grid for all: same size and placement, whole blocks of 16, the CRS asked for.
-    double geo[6] = {0}, first_geo[6] = {0};
-    int width = 0, height = 0;
-    std::vector<std::vector<unsigned char>> visibility;
+    // The mosaic's grid: whole blocks of 16, the CRS and pixel size asked for.
+    Dataset mosaic = Open(dir.File("out/mosaic.tif"));
+    Dataset source = Open(dir.File("out/mosaic_source.tif"));
+    ASSERT_TRUE(mosaic && source);
+    double grid[6] = {0};
+    ASSERT_EQ(mosaic->GetGeoTransform(grid), CE_None);
+    const int width = mosaic->GetRasterXSize(), height = mosaic->GetRasterYSize();
+    EXPECT_EQ(width % 16, 0);
+    EXPECT_EQ(height % 16, 0);
+    EXPECT_DOUBLE_EQ(grid[1], 1.0);
+
+    // Each scene's ortho and visibility index on its own window of that grid: whole pixels
+    // from its origin, inside it, and no larger than the footprint's bounding box and a block.
+    struct Window {
+        int column = 0, row = 0, width = 0, height = 0;
+        std::vector<unsigned char> visibility;
+        unsigned char at(int x, int y) const {
+            x -= column, y -= row;
+            return x < 0 || y < 0 || x >= width || y >= height
+                       ? 0
+                       : visibility[static_cast<std::size_t>(y) * width + x];
+        }
+    };
+    std::vector<Window> windows;
     for (const std::string& name : names) {
         SCOPED_TRACE(name);
         const std::string xml = dir.File("out/" + name + ".xml");
         std::unique_ptr<kestrel::processes::silvan::TOSceneParser> scene(
             kestrel::processes::silvan::ParserFactory::CreateSceneParser(xml));
         EXPECT_EQ(scene->GetOrthoFilename(), dir.File("out/" + name + "_ortho.tif"));
-        ASSERT_NE(scene->GetSceneFootprint(), nullptr);
-        EXPECT_GE(scene->GetSceneFootprint()->numPoints, 4u);
+        const auto* footprint = scene->GetSceneFootprint();
+        ASSERT_NE(footprint, nullptr);
+        EXPECT_GE(footprint->numPoints, 4u);
         if (std::system("xmllint --version > /dev/null 2>&1") == 0) {
             EXPECT_EQ(std::system(("xmllint --valid --noout \"" + xml + "\"").c_str()), 0);
         }
+        double minX = 1e300, maxX = -1e300, minY = 1e300, maxY = -1e300;
+        for (unsigned int i = 0; i < footprint->numPoints; ++i) {
+            minX = std::min(minX, footprint->points[i].x), maxX = std::max(maxX, footprint->points[i].x);
+            minY = std::min(minY, footprint->points[i].y), maxY = std::max(maxY, footprint->points[i].y);
+        }
+        Window window;
         for (const std::string& raster : {scene->GetOrthoFilename(), scene->GetVisIdxFilename()}) {
             Dataset ds = Open(raster);
             ASSERT_TRUE(ds) << raster;
+            double geo[6] = {0};
             ASSERT_EQ(ds->GetGeoTransform(geo), CE_None);
-            if (width == 0) {
-                width = ds->GetRasterXSize(), height = ds->GetRasterYSize();
-                std::copy(geo, geo + 6, first_geo);
-                EXPECT_EQ(width % 16, 0);
-                EXPECT_EQ(height % 16, 0);
-                EXPECT_DOUBLE_EQ(geo[1], 1.0);
-            }
-            EXPECT_EQ(ds->GetRasterXSize(), width);
-            EXPECT_EQ(ds->GetRasterYSize(), height);
-            for (int i = 0; i < 6; ++i)
-                EXPECT_DOUBLE_EQ(geo[i], first_geo[i]);
+            const double column = (geo[0] - grid[0]) / grid[1], row = (geo[3] - grid[3]) / grid[5];
+            EXPECT_NEAR(column, std::round(column), 1e-6);
+            EXPECT_NEAR(row, std::round(row), 1e-6);
+            EXPECT_DOUBLE_EQ(geo[1], grid[1]);
+            EXPECT_DOUBLE_EQ(geo[5], grid[5]);
+            window.column = static_cast<int>(std::lround(column));
+            window.row = static_cast<int>(std::lround(row));
+            window.width = ds->GetRasterXSize(), window.height = ds->GetRasterYSize();
+            EXPECT_GE(window.column, 0);
+            EXPECT_GE(window.row, 0);
+            EXPECT_LE(window.column + window.width, width);
+            EXPECT_LE(window.row + window.height, height);
             ASSERT_NE(ds->GetSpatialRef(), nullptr);
             EXPECT_STREQ(ds->GetSpatialRef()->GetAuthorityCode(nullptr), "32632");
         }
         Dataset vis = Open(scene->GetVisIdxFilename());
-        visibility.push_back(ReadBytes(*vis));
+        window.visibility = ReadBytes(*vis);
         // Each oblique image has ground hidden behind the buildings.
-        const auto hidden = std::count(visibility.back().begin(), visibility.back().end(), kHidden);
+        const auto hidden = std::count(window.visibility.begin(), window.visibility.end(), kHidden);
         EXPECT_GT(hidden, 50) << "hidden pixels";
         EXPECT_TRUE(Open(dir.File("out/" + name + "_vis.png")));
+        windows.push_back(std::move(window));
     }
 
     // The mosaic takes every pixel that some image sees from an image that sees it.
-    Dataset mosaic = Open(dir.File("out/mosaic.tif"));
-    Dataset source = Open(dir.File("out/mosaic_source.tif"));
-    ASSERT_TRUE(mosaic && source);
-    EXPECT_EQ(mosaic->GetRasterXSize(), width);
     const std::vector<unsigned char> from = ReadBytes(*source);
     std::size_t unfilled = 0, wrong = 0;
-    for (std::size_t i = 0; i < from.size(); ++i) {
-        bool seen = false;
-        for (const auto& vis : visibility)
-            seen = seen || vis[i] == kSeen;
-        if (seen && from[i] == 0)
-            ++unfilled;
-        if (from[i] != 0 && (from[i] > visibility.size() || visibility[from[i] - 1][i] != kSeen))
-            ++wrong;
+    for (int y = 0; y < height; ++y) {
+        for (int x = 0; x < width; ++x) {
+            const unsigned char k = from[static_cast<std::size_t>(y) * width + x];
+            bool seen = false;
+            for (const Window& window : windows)
+                seen = seen || window.at(x, y) == kSeen;
+            if (seen && k == 0)
+                ++unfilled;
+            if (k != 0 && (k > windows.size() || windows[k - 1].at(x, y) != kSeen))
+                ++wrong;
+        }
     }
     EXPECT_EQ(unfilled, 0u);
     EXPECT_EQ(wrong, 0u);
@@ -335,10 +365,17 @@ TEST(Workflow, SampleCityEndToEnd) {
     // A deliverable: a Cloud Optimized GeoTIFF, compressed, with overviews and a mask where no
     // image sees the ground rather than a no-data colour.
     const Result info = RunProgram("gdalinfo", {dir.File("out/mosaic.tif")}, dir);
-    for (const char* shown : {"LAYOUT=COG", "COMPRESSION=DEFLATE", "Block=128x128", "Overviews: ",
+    for (const char* shown : {"LAYOUT=COG", "COMPRESSION=LZW", "Block=128x128", "Overviews: ",
                               "Mask Flags: PER_DATASET"})
         EXPECT_NE(info.out.find(shown), std::string::npos) << shown << "\n" << info.out;
     EXPECT_EQ(info.out.find("NoData Value"), std::string::npos) << info.out;
+    // The orthos take --co too; the visibility index keeps its own lossless options.
+    for (const auto& [raster, shown] : {std::pair<std::string, std::string>{"north_ortho.tif",
+                                                                            "COMPRESSION=LZW"},
+                                        {"north_vis.tif", "COMPRESSION=DEFLATE"}}) {
+        const Result scene = RunProgram("gdalinfo", {dir.File("out/" + raster)}, dir);
+        EXPECT_NE(scene.out.find(shown), std::string::npos) << scene.out;
+    }
     // Quicklooks lie where their rasters do (world files); the source raster's has a legend,
     // beside it and in the summary, whose value k names scene k.
     double mosaicGeo[6] = {0}, pictureGeo[6] = {0};
@@ -464,7 +501,8 @@ void ReplaceInFile(const std::string& path, const std::string& from, const std::
 }
 
 // A surface model that covers only the middle of the images: orthos of the covered ground, and
-// one warning line per scene saying what share of its ground the surface leaves out.
+// one warning line per scene saying what share of its ground the surface leaves out, also when
+// a rerun finds the grid worked out.
 TEST(Workflow, SurfaceOverPartOfTheImagesMakesOrthosOfTheCoveredGround) {
     TempDir dir;
     std::vector<std::string> args = MakeSample(dir);
@@ -476,13 +514,16 @@ TEST(Workflow, SurfaceOverPartOfTheImagesMakesOrthosOfTheCoveredGround) {
     std::replace(args.begin(), args.end(), dir.File("sample/dsm.tif"),
                  dir.File("sample/middle.tif"));
     args.erase(std::remove(args.begin(), args.end(), std::string("--quiet")), args.end());
-    const Result run = Ortho(args, dir);
-    ASSERT_EQ(run.status, 0) << run.err;
-    std::size_t warnings = 0;
-    for (std::size_t at = run.err.find("the surface model leaves out"); at != std::string::npos;
-         at = run.err.find("the surface model leaves out", at + 1))
-        ++warnings;
-    EXPECT_EQ(warnings, SceneStates(dir).size()) << run.err;
+    for (const char* run : {"first", "rerun"}) {
+        SCOPED_TRACE(run);
+        const Result result = Ortho(args, dir);
+        ASSERT_EQ(result.status, 0) << result.err;
+        std::size_t warnings = 0;
+        for (std::size_t at = result.err.find("the surface model leaves out");
+             at != std::string::npos; at = result.err.find("the surface model leaves out", at + 1))
+            ++warnings;
+        EXPECT_EQ(warnings, SceneStates(dir).size()) << result.err;
+    }
     Dataset middle = Open(dir.File("sample/middle.tif"));
     Dataset mosaic = Open(dir.File("out/mosaic.tif"));
     ASSERT_TRUE(middle && mosaic);
@@ -499,6 +540,7 @@ TEST(Workflow, AreaOfInterestIsTheGridGdalwarpMakes) {
     std::vector<std::string> args = MakeSample(dir);
     const auto size = std::find(args.begin(), args.end(), std::string("--pixel-size"));
     args.erase(size, size + 2);
+    const std::vector<std::string> plain = args;
     const std::vector<std::string> area = {"514900", "5033975.5", "514950.5", "5033990"};
     args.insert(args.end(), {"--tr", "1.5", "1", "--te"});
     args.insert(args.end(), area.begin(), area.end());
@@ -572,6 +614,35 @@ TEST(Workflow, AreaOfInterestIsTheGridGdalwarpMakes) {
     EXPECT_EQ(kept, expected);
     EXPECT_GT(std::count(kept.begin(), kept.end(), 1), 0);
     EXPECT_LT(std::count(kept.begin(), kept.end(), 1), 34 * 15 / 2);
+
+    // --te alone, as gdalwarp -te without -tr: the area exactly, in whole cells of about the
+    // source's resolution (that of an ortho made without --te).
+    std::vector<std::string> natural = plain, alone = plain;
+    natural[2] = dir.File("natural");
+    natural.insert(natural.end(), {"--lines", "0:1"});
+    alone[2] = dir.File("alone");
+    alone.push_back("--te");
+    alone.insert(alone.end(), area.begin(), area.end());
+    ASSERT_EQ(Ortho(natural, dir).status, 0);
+    ASSERT_EQ(Ortho(alone, dir).status, 0);
+    std::string ortho;
+    for (const auto& entry : std::filesystem::directory_iterator(dir.File("natural"))) {
+        if (entry.path().string().find("_ortho.tif") != std::string::npos)
+            ortho = entry.path().string();
+    }
+    const Result warpedAlone = RunProgram(
+        "gdalwarp", {"-q", "-te", area[0], area[1], area[2], area[3], ortho, dir.File("alone.tif")},
+        dir);
+    ASSERT_EQ(warpedAlone.status, 0) << warpedAlone.err;
+    mosaic = Open(dir.File("alone/mosaic.tif"));
+    reference = Open(dir.File("alone.tif"));
+    ASSERT_TRUE(mosaic && reference);
+    EXPECT_EQ(mosaic->GetRasterXSize(), reference->GetRasterXSize());
+    EXPECT_EQ(mosaic->GetRasterYSize(), reference->GetRasterYSize());
+    ASSERT_EQ(mosaic->GetGeoTransform(a), CE_None);
+    ASSERT_EQ(reference->GetGeoTransform(b), CE_None);
+    for (int i = 0; i < 6; ++i)
+        EXPECT_NEAR(a[i], b[i], 1e-9) << i;
 
     // A cutline that no scene reaches (here, in another CRS) stops the run, saying so.
     WriteFile(cutline, R"({"type": "FeatureCollection", "features": [{"type": "Feature",

@@ -217,8 +217,8 @@ std::string UsageText() {
        silvan-ortho IMAGE [IMAGE...] --out DIR (--dem DSM | --tin TIN) [options]
 
 Runs the true-ortho workflow of a master parameter file: derives the preparation and image-set
-files, makes the ortho, visibility index, scene description and footprint of every scene on one
-common grid, then fills the hidden ground of each image from the others (occlusion recovery)
+files, makes the ortho, visibility index, scene description and footprint of every scene on its
+window of one common grid (the grid's cells under its footprint), then fills the hidden ground of each image from the others (occlusion recovery)
 into a true-ortho mosaic, with PNG quicklooks. A run that was stopped does only what is missing
 when started again.
 
@@ -249,7 +249,9 @@ Output:
   --te XMIN YMIN XMAX YMAX
                       area of interest in the output CRS, as gdalwarp's -te: the common grid
                       is exactly this rectangle (with --tr, the cells gdalwarp -te -tr makes),
-                      and scenes whose footprint does not reach it are skipped. Without --te the
+                      and scenes whose footprint does not reach it are skipped; without --tr
+                      or --pixel-size, the extent is kept and the pixel size adjusted to whole
+                      cells of about the source's resolution, as gdalwarp. Without --te the
                       grid's corners are whole multiples of the pixel size, the grid grown
                       outward to hold every scene (as gdalwarp's -tap)
   --te-srs CRS        the coordinate system of --te, when it is not the output CRS (the
@@ -259,11 +261,14 @@ Output:
                       scenes whose footprint does not reach it are skipped
   --resample METHOD   near, bilinear (default), cubic, cubicspline, lanczos, average, mode
   --proc TEXT         generator: AUTO[:threads], CPU[:threads], GPU[:devices] (PROC syntax)
-  --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, ... or a
-                      GDAL raster driver that writes files losslessly; the mosaic of tif or
-                      cog is a Cloud Optimized GeoTIFF
-  --co NAME=VALUE     a GDAL creation option of the mosaic (repeatable), as gdalwarp's -co:
-                      COMPRESS=JPEG, COMPRESS=WEBP, QUALITY=85, BLOCKSIZE=256, ...
+  --of TYPE           file type of the rasters: tif (default), cog, img, gpkg, png, jpg, webp,
+                      jp2, ... or a GDAL raster driver that writes files; the mosaic of tif or
+                      cog is a Cloud Optimized GeoTIFF. With a lossy type the visibility index
+                      and mosaic_source stay lossless GeoTIFFs, so that their values hold
+  --co NAME=VALUE     a GDAL creation option of the mosaic and the orthos (repeatable), as
+                      gdalwarp's -co: COMPRESS=JPEG, COMPRESS=WEBP, QUALITY=85, BLOCKSIZE=256,
+                      ...; each takes the options its driver knows (with tif the orthos are
+                      GeoTIFFs, the mosaic a COG); one that neither knows is refused
 
 Running:
   --jobs N, -j N      scenes run at the same time (default 1)

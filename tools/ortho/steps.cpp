@@ -180,6 +180,30 @@ Grid CommonGrid(const std::vector<Grid>& grids, const Area* area) {
 
 namespace {
 DatasetPtr OpenCutline(const std::string& path, const GdalErrors& errors);
+
+std::unique_ptr<OGRPolygon> Rectangle(double minX, double minY, double maxX, double maxY) {
+    OGRLinearRing corners;
+    corners.addPoint(minX, minY);
+    corners.addPoint(maxX, minY);
+    corners.addPoint(maxX, maxY);
+    corners.addPoint(minX, maxY);
+    corners.closeRings();
+    auto rectangle = std::make_unique<OGRPolygon>();
+    rectangle->addRing(&corners);
+    return rectangle;
+}
+
+// The footprint as a valid polygon (one that crosses itself is made valid, as GEOS needs); null
+// without a geometry engine.
+std::unique_ptr<OGRGeometry> FootprintShape(const kestrel::tin::Polygon<double>& footprint) {
+    OGRLinearRing ring;
+    for (unsigned int i = 0; i < footprint.numPoints; ++i)
+        ring.addPoint(footprint.points[i].x, footprint.points[i].y);
+    ring.closeRings();
+    OGRPolygon scene;
+    scene.addRing(&ring);
+    return std::unique_ptr<OGRGeometry>(scene.IsValid() ? scene.clone() : scene.MakeValid());
+}
 }  // namespace
 
 Area AreaInCrs(const Options& options, const std::string& crs) {
@@ -208,18 +232,8 @@ Area AreaInCrs(const Options& options, const std::string& crs) {
 AreaOfInterest::AreaOfInterest(const Options& options, const std::string& crs,
                                const Area* area) {
     GdalErrors errors;
-    if (area != nullptr) {
-        const Area& a = *area;
-        OGRLinearRing corners;
-        corners.addPoint(a[0], a[1]);
-        corners.addPoint(a[2], a[1]);
-        corners.addPoint(a[2], a[3]);
-        corners.addPoint(a[0], a[3]);
-        corners.closeRings();
-        auto rectangle = std::make_unique<OGRPolygon>();
-        rectangle->addRing(&corners);
-        shape_ = std::move(rectangle);
-    }
+    if (area != nullptr)
+        shape_ = Rectangle((*area)[0], (*area)[1], (*area)[2], (*area)[3]);
     if (options.cutline.empty())
         return;
     DatasetPtr vector = OpenCutline(options.cutline, errors);
@@ -274,20 +288,58 @@ bool AreaOfInterest::Reaches(const kestrel::tin::Polygon<double>& footprint) con
     if (!shape_)
         return true;
     GdalErrors errors;
-    OGRLinearRing ring;
-    for (unsigned int i = 0; i < footprint.numPoints; ++i)
-        ring.addPoint(footprint.points[i].x, footprint.points[i].y);
-    ring.closeRings();
-    OGRPolygon scene;
-    scene.addRing(&ring);
-    // A footprint that crosses itself is made valid first, as GEOS needs.
-    std::unique_ptr<OGRGeometry> valid(scene.IsValid() ? scene.clone() : scene.MakeValid());
+    const std::unique_ptr<OGRGeometry> valid = FootprintShape(footprint);
     if (!valid)
         return true;
     const std::unique_ptr<OGRGeometry> shared(valid->Intersection(shape_.get()));
     if (!shared)  // no geometry engine: the scene is kept
         return true;
     return OGR_G_Area(OGRGeometry::ToHandle(shared.get())) > 0.0;
+}
+
+bool SceneWindow(const Grid& common, const kestrel::tin::Polygon<double>& footprint,
+                 Grid& window) {
+    GdalErrors errors;
+    const auto& g = common.geoTransform;
+    const std::unique_ptr<OGRPolygon> rectangle =
+        Rectangle(g[0], g[3] + common.lines * g[5], g[0] + common.pixels * g[1], g[3]);
+    // The footprint's part inside the grid; without a geometry engine, the whole footprint.
+    const std::unique_ptr<OGRGeometry> valid = FootprintShape(footprint);
+    const std::unique_ptr<OGRGeometry> inside(valid ? valid->Intersection(rectangle.get())
+                                                    : nullptr);
+    OGREnvelope box;
+    if (inside) {
+        if (inside->IsEmpty() || OGR_G_Area(OGRGeometry::ToHandle(inside.get())) <= 0.0)
+            return false;
+        inside->getEnvelope(&box);
+    } else {
+        for (unsigned int i = 0; i < footprint.numPoints; ++i)
+            box.Merge(footprint.points[i].x, footprint.points[i].y);
+    }
+    // Whole cells, two more on each side, inside the grid.
+    const long long margin = 2;
+    const auto clip = [](double cell, unsigned int size) {
+        return static_cast<long long>(std::clamp(cell, 0.0, static_cast<double>(size)));
+    };
+    const long long x0 = clip(std::floor((box.MinX - g[0]) / g[1] + 1e-6) - margin, common.pixels);
+    const long long x1 = clip(std::ceil((box.MaxX - g[0]) / g[1] - 1e-6) + margin, common.pixels);
+    const long long y0 = clip(std::floor((box.MaxY - g[3]) / g[5] + 1e-6) - margin, common.lines);
+    const long long y1 = clip(std::ceil((box.MinY - g[3]) / g[5] - 1e-6) + margin, common.lines);
+    if (x1 <= x0 || y1 <= y0)
+        return false;
+    window = common;
+    window.uncoveredShare = 0.0;
+    window.pixels = static_cast<unsigned int>(x1 - x0);
+    window.lines = static_cast<unsigned int>(y1 - y0);
+    window.geoTransform[0] = g[0] + static_cast<double>(x0) * g[1];
+    window.geoTransform[3] = g[3] + static_cast<double>(y0) * g[5];
+    return true;
+}
+
+std::array<long long, 2> CellOffset(const Grid& grid, const Grid& window) {
+    const auto& g = grid.geoTransform;
+    const auto& w = window.geoTransform;
+    return {std::llround((w[0] - g[0]) / g[1]), std::llround((w[3] - g[3]) / g[5])};
 }
 
 bool ReadGrid(const std::string& path, Grid& grid) {
@@ -385,12 +437,6 @@ void CheckFileType(const std::string& type) {
     if (format == "MEM" || format == "VRT")
         throw UsageError("--of: " + type + ": GDAL's " + format +
                          " driver keeps no pixels in a file of its own");
-    // The visibility index and the mosaic's source raster are classes and scene numbers: a
-    // lossy format changes them (JPEG does even at its highest quality).
-    if (format == "JPEG" || format == "WEBP" || format == "JP2OpenJPEG")
-        throw UsageError("--of: " + type + ": GDAL's " + format +
-                         " driver writes lossy files, which would change the values of the "
-                         "visibility index and of the mosaic's source raster; give tif, cog or png");
     if (format == "XYZ")
         throw UsageError("--of: " + type +
                          ": GDAL's XYZ text holds no coordinate system; the outputs would lose "
@@ -438,6 +484,74 @@ std::string MosaicFormat(const Options& options) {
     return format == "GTiff" ? "COG" : format;
 }
 
+namespace {
+
+// GDAL drivers that write lossy files by default: JPEG changes values even at its highest
+// quality.
+bool LossyFormat(const std::string& format) {
+    return format == "JPEG" || format == "WEBP" || format == "JP2OpenJPEG" ||
+           format == "JPEGXL" || format == "JP2KAK" || format == "JP2ECW";
+}
+
+bool TakesOption(const std::string& format, const std::string& option) {
+    try {
+        kestrel::core::CheckCreationOptions(format, {option});
+        return true;
+    } catch (const kestrel::Exception&) {
+        return false;
+    }
+}
+
+// Each --co must be taken by the mosaic's driver or by the per-scene orthos' (GTiff's options
+// for the orthos of tif, COG's for its mosaic); one that neither takes is refused with the
+// mosaic driver's reason.
+void CheckCreationOptions(const Options& options) {
+    const std::string mosaic = MosaicFormat(options);
+    const std::string ortho = kestrel::core::FType2FormatName(options.format);
+    for (const std::string& option : options.creationOptions) {
+        if (ortho == mosaic || !TakesOption(ortho, option))
+            kestrel::core::CheckCreationOptions(mosaic, {option});
+    }
+}
+
+// BasicWriter's option text: each option quoted, after the defaults (which they override).
+std::string OptionText(const std::string& defaults, const std::vector<std::string>& options) {
+    std::string text = defaults;
+    for (const std::string& option : options)
+        text += " \"" + option + "\"";
+    return text;
+}
+
+// The options of a per-scene raster of GDAL's format: the fastest deflate level for GeoTIFF (an
+// ortho is read once more, by recovery, and the default level costs a quarter of a run's
+// processor time) and the nearest class for overviews of a raster of classes; then the --co
+// options its driver takes, for the ortho.
+std::string SceneRasterOptions(const Options& options, const std::string& format, bool classes) {
+    const std::string defaults = format == "GTiff"                 ? "ZLEVEL=1"
+                                 : classes && format == "COG" ? "OVERVIEW_RESAMPLING=NEAREST"
+                                                              : "";
+    if (classes)
+        return defaults;
+    std::vector<std::string> taken;
+    for (const std::string& option : options.creationOptions) {
+        if (TakesOption(format, option))
+            taken.push_back(option);
+    }
+    return OptionText(defaults, taken);
+}
+
+}  // namespace
+
+std::string ClassRasterType(const std::string& type) {
+    std::string format;
+    try {
+        format = kestrel::core::FType2FormatName(type);
+    } catch (const std::exception&) {
+        return type;  // refused by the option checks
+    }
+    return LossyFormat(format) ? "tif" : type;
+}
+
 std::vector<std::string> CheckOptions(Options& options) {
     CheckSurfaceFile("--dem", options.dem);
     CheckSurfaceFile("--tin", options.tin);
@@ -460,9 +574,7 @@ std::vector<std::string> CheckOptions(Options& options) {
         CheckCutline(options.cutline);
     CheckOption("--resample", [&] { options.resample = CheckResampling(options.resample); });
     CheckOption("--of", [&] { CheckFileType(options.format); });
-    CheckOption("--co", [&] {
-        kestrel::core::CheckCreationOptions(MosaicFormat(options), options.creationOptions);
-    });
+    CheckOption("--co", [&] { CheckCreationOptions(options); });
     std::vector<std::string> notes;
     CheckOption("--proc", [&] {
         const std::string note = CheckGenerator(options.proc);
@@ -780,13 +892,29 @@ OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Gri
     job.geocoding = kestrel::ogc::cs::GeocodingInfo(grid.geoTransform);
     job.pixels = grid.pixels;
     job.lines = grid.lines;
-    job.orthoPath = ortho;
-    job.visibilityPath = visibility;
-    // The generator writes both through the platform's writer (every file type, by copy where
-    // GDAL's driver only copies) and publishes them only when complete.
-    job.format = kestrel::core::FType2FormatName(options.format);
+    // Both through the platform's writer (every file type, by a temporary GeoTIFF and GDAL's
+    // copy where the driver only copies), published only when complete: the ortho in --of's
+    // type with the --co its driver takes; the visibility index in a lossless type with options
+    // of its own. Deleted unclosed after a failed or cancelled run, they leave nothing.
+    std::vector<unsigned int> sourceChannels, orthoChannels;
+    {
+        std::unique_ptr<kestrel::datasources::IDataset> dataset(GetRasterDataset(scene.source));
+        GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
+    }
+    std::vector<unsigned int> bands(sourceChannels.size());
+    for (std::size_t b = 0; b < bands.size(); ++b)
+        bands[b] = static_cast<unsigned int>(b + 1);
+    const std::string orthoFormat = kestrel::core::FType2FormatName(options.format);
+    const std::string classFormat =
+        kestrel::core::FType2FormatName(ClassRasterType(options.format));
     RemoveWriterLeftovers(ortho);
     RemoveWriterLeftovers(visibility);
+    kestrel::datasources::BasicWriter orthoWriter(
+        ortho, bands, orthoFormat, SceneRasterOptions(options, orthoFormat, false));
+    kestrel::datasources::BasicWriter visibilityWriter(
+        visibility, {1}, classFormat, SceneRasterOptions(options, classFormat, true));
+    job.orthoWriter = &orthoWriter;
+    job.visibilityWriter = &visibilityWriter;
 
     OrthoProcess process(options.proc, job, progress);
     process.Execute();
@@ -865,6 +993,40 @@ void CheckCutline(const std::string& path) {
     OpenCutline(path, errors);
 }
 
+namespace {
+
+// The raster at `from` copied into a new file of GDAL's format at `to` through the platform's
+// writer (a temporary GeoTIFF and GDAL's copy where the driver only copies), strip by strip.
+void CopyRaster(const std::string& from, const std::string& to, const std::string& format,
+                const std::string& options) {
+    kestrel::datasources::BasicReader reader(from);
+    std::vector<unsigned int> bands(reader.GetChannelCount());
+    for (std::size_t b = 0; b < bands.size(); ++b)
+        bands[b] = static_cast<unsigned int>(b + 1);
+    RemoveWriterLeftovers(to);
+    kestrel::datasources::BasicWriter writer(to, bands, format, options);
+    const unsigned int width = reader.GetWidth(), height = reader.GetHeight();
+    writer.SetSize(width, height);
+    writer.SetDataType(reader.GetDataType());
+    writer.SetChannelCount(reader.GetChannelCount());
+    writer.SetCRS(reader.GetCRS());
+    if (reader.GetGeocoding() != nullptr)
+        writer.SetGeocoding(*reader.GetGeocoding());
+    double noData = 0.0;
+    if (reader.GetNoDataValue(0, noData))
+        writer.SetNoDataValue(noData);
+    writer.Create();
+    const unsigned int strip = 256;
+    for (unsigned int y = 0; y < height; y += strip) {
+        const std::unique_ptr<kestrel::gobs::Raster> rows(
+            reader.ReadWindow(0, y, width, std::min(strip, height - y)));
+        writer.WriteWindow(*rows, 0, y);
+    }
+    writer.Close();
+}
+
+}  // namespace
+
 void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes, const Grid& grid,
                    const std::string& mosaic, const std::string& source,
                    const StepProgress& progress) {
@@ -884,22 +1046,32 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
     const std::unique_ptr<kestrel::dem::IElevationSource> surface =
         OpenSurface(options, models.empty() ? nullptr : models.front().get());
     job.surface = surface.get();
-    RemoveWriterLeftovers(mosaic);
-    RemoveWriterLeftovers(source);
-    job.mosaicPath = mosaic;
-    job.sourcePath = source;
-    job.format = MosaicFormat(options);
-    for (const std::string& option : options.creationOptions)
-        job.mosaicOptions += "\"" + option + "\" ";
-
-    // The burnt cutline goes beside the mosaic under a temporary name, whatever happens.
+    job.geocoding = kestrel::ogc::cs::GeocodingInfo(grid.geoTransform);
+    job.pixels = grid.pixels;
+    job.lines = grid.lines;
+    // Files beside the mosaic under temporary names, removed whatever happens: the burnt
+    // cutline, and the lossless mosaic that a lossy type is copied from.
     struct Removed {
         std::string path;
         ~Removed() {
             if (!path.empty())
                 RemoveFile(path);
         }
-    } mask;
+    } mask, lossless;
+    // A lossy type: recovery writes GeoTIFFs (the source raster stays one), and the mosaic is
+    // copied into the type.
+    const std::string format = MosaicFormat(options);
+    const bool lossy = LossyFormat(format);
+    if (lossy)
+        lossless.path = mosaic + ".tif";
+    RemoveWriterLeftovers(mosaic);
+    RemoveWriterLeftovers(source);
+    job.mosaicPath = lossy ? lossless.path : mosaic;
+    RemoveWriterLeftovers(job.mosaicPath);
+    job.sourcePath = source;
+    job.format = lossy ? "GTiff" : format;
+    if (!lossy)
+        job.mosaicOptions = OptionText("", options.creationOptions);
     if (!options.cutline.empty()) {
         mask.path = mosaic + ".cutline.tif";
         BurnCutline(options.cutline, grid, mask.path);
@@ -910,6 +1082,8 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
     process.Execute();
     if (!process.Result().completed)
         KESTREL_THROW(kestrel::DataException, "occlusion recovery was cancelled");
+    if (lossy)
+        CopyRaster(lossless.path, mosaic, format, OptionText("", options.creationOptions));
 }
 
 void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid,

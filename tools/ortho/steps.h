@@ -121,6 +121,14 @@ class AreaOfInterest {
 // -tr makes them (top left at XMIN YMAX, sizes rounded to whole pixels).
 Grid CommonGrid(const std::vector<Grid>& grids, const Area* area = nullptr);
 
+// The window of a scene on the common grid: the cells under the part of the footprint inside
+// the grid, grown outward to whole cells and by a margin of two cells, clipped to the grid. Same
+// CRS, pixel size and lattice as the grid. False when the footprint covers no ground of the grid.
+bool SceneWindow(const Grid& common, const kestrel::tin::Polygon<double>& footprint, Grid& window);
+
+// Where window's top left cell lies in grid, in whole cells.
+std::array<long long, 2> CellOffset(const Grid& grid, const Grid& window);
+
 // The grid of an existing raster; false when it cannot be opened as one.
 bool ReadGrid(const std::string& path, Grid& grid);
 
@@ -150,8 +158,12 @@ struct RecoveryScene {
 };
 
 // The GDAL format of the mosaic: a Cloud Optimized GeoTIFF when --of is a GeoTIFF type, the
-// format of --of otherwise. --co is checked against it.
+// format of --of otherwise.
 std::string MosaicFormat(const Options& options);
+
+// The file type of the rasters of classes and scene numbers (the visibility index, the mosaic's
+// source raster): --of, or tif where --of's driver is lossy, which would change their values.
+std::string ClassRasterType(const std::string& type);
 
 // Checks that --cutline opens as a vector file whose first layer holds polygons. Throws
 // UsageError naming the option.

@@ -16,6 +16,7 @@
 #include <cctype>
 #include <atomic>
 #include <chrono>
+#include <cmath>
 #include <cstdint>
 #include <cstdio>
 #include <filesystem>
@@ -107,9 +108,20 @@ void DeriveFile(const std::string& path, Write write) {
 // The status of a scene whose layout does not reach --te.
 const char* const kOutsideArea = "outside the area of interest";
 
-// The common grid, and the data lines of the scenes outside the area of interest (when any).
+// A scene's window on the common grid, as grid.txt keeps it: its data line, its top left cell
+// in the common grid, its size, and the share of its image's ground the surface leaves out.
+struct WindowRecord {
+    int line = 0;
+    long long column = 0, row = 0;
+    unsigned int pixels = 0, lines = 0;
+    double uncoveredShare = 0.0;
+};
+
+// The common grid, the data lines of the scenes outside the area of interest (when any) and the
+// other scenes' windows.
 std::string GridText(const std::string& key, const Grid& grid,
-                     const std::vector<int>& outside = {}) {
+                     const std::vector<int>& outside = {},
+                     const std::vector<WindowRecord>& windows = {}) {
     std::ostringstream out;
     out.precision(17);
     out << key << '\n' << grid.pixels << ' ' << grid.lines << '\n';
@@ -122,11 +134,14 @@ std::string GridText(const std::string& key, const Grid& grid,
             out << ' ' << line;
         out << '\n';
     }
+    for (const WindowRecord& w : windows)
+        out << "window " << w.line << ' ' << w.column << ' ' << w.row << ' ' << w.pixels << ' '
+            << w.lines << ' ' << w.uncoveredShare << '\n';
     return out.str();
 }
 
 bool ReadGridText(const std::string& path, const std::string& key, Grid& grid,
-                  std::vector<int>& outside) {
+                  std::vector<int>& outside, std::vector<WindowRecord>& windows) {
     std::ifstream in(path);
     std::string storedKey;
     if (!std::getline(in, storedKey) || storedKey != key)
@@ -140,17 +155,29 @@ bool ReadGridText(const std::string& path, const std::string& key, Grid& grid,
         read.lines == 0)
         return false;
     std::vector<int> lines;
-    std::string word;
-    if (in >> word) {
-        if (word != "outside")
+    std::vector<WindowRecord> records;
+    for (std::string text; std::getline(in, text);) {
+        std::istringstream words(text);
+        std::string word;
+        if (!(words >> word))
+            continue;
+        if (word == "outside") {
+            for (int line = 0; words >> line;)
+                lines.push_back(line);
+        } else if (word == "window") {
+            WindowRecord w;
+            if (!(words >> w.line >> w.column >> w.row >> w.pixels >> w.lines >> w.uncoveredShare))
+                return false;
+            records.push_back(w);
+        } else {
             return false;
-        for (int line = 0; in >> line;)
-            lines.push_back(line);
-        if (!in.eof())
+        }
+        if (!words.eof())
             return false;
     }
     grid = read;
     outside = lines;
+    windows = records;
     return true;
 }
 
@@ -202,11 +229,12 @@ std::string QuicklookName(const std::string& dir, const std::string& stem,
 std::vector<Output> SceneOutputs(const std::string& dir, const std::string& name,
                                  const std::string& type) {
     const std::string format = RasterExtension(type);
+    const std::string classes = RasterExtension(ClassRasterType(type));
     return {{Join(dir, name + "_ortho." + format), "the ortho"},
-            {Join(dir, name + "_vis." + format), "the visibility index"},
+            {Join(dir, name + "_vis." + classes), "the visibility index"},
             {Join(dir, name + ".xml"), "the scene description"},
             {Join(dir, name + "_footprint.gpkg"), "the footprint"},
-            {QuicklookName(dir, name + "_vis", format), "the visibility quicklook"},
+            {QuicklookName(dir, name + "_vis", classes), "the visibility quicklook"},
             {Join(dir, name + "_manifest.json"), "the record of inputs"}};
 }
 
@@ -514,6 +542,7 @@ void Workflow::Prepare() {
 
 std::vector<std::pair<std::string, std::string>> Workflow::RunOutputs() const {
     const std::string f = RasterExtension(options_.format);
+    const std::string c = RasterExtension(ClassRasterType(options_.format));
     std::vector<std::pair<std::string, std::string>> outputs = {
             {prepFile_, "the preparation file"},
             {imgSetFile_, "the image-set file"},
@@ -523,9 +552,9 @@ std::vector<std::pair<std::string, std::string>> Workflow::RunOutputs() const {
             {Join(outDir_, "TOSceneDesc_Document.dtd"), "the scene descriptions' DTD"},
             {Join(outDir_, "footprints.gpkg"), "the footprints"},
             {Join(outDir_, "mosaic." + f), "the mosaic"},
-            {Join(outDir_, "mosaic_source." + f), "the mosaic's source raster"},
+            {Join(outDir_, "mosaic_source." + c), "the mosaic's source raster"},
             {QuicklookName(outDir_, "mosaic", f), "the mosaic's quicklook"},
-            {QuicklookName(outDir_, "mosaic_source", f), "the source raster's quicklook"},
+            {QuicklookName(outDir_, "mosaic_source", c), "the source raster's quicklook"},
             {Join(outDir_, "mosaic_source_legend.json"), "the source quicklook's legend"},
             {Join(outDir_, "mosaic_manifest.json"), "the mosaic's record of inputs"}};
     if (options_.hasLines)
@@ -609,49 +638,98 @@ Manifest Workflow::GridInputs() {
     return inputs;
 }
 
+void Workflow::WarnUncovered(const Scene& scene, double share) {
+    if (share <= 0.0)
+        return;
+    char text[32];
+    std::snprintf(text, sizeof text, "%.1f %%", 100.0 * share);
+    progress_.Info("warning: " + scene.name + ": the surface model leaves out " + text +
+                   " of the image's ground; the ortho covers the rest");
+}
+
+bool Workflow::UseStoredGrid(const std::string& key) {
+    std::vector<int> outside;
+    std::vector<WindowRecord> windows;
+    if (options_.overwrite || !ReadGridText(gridFile_, key, grid_, outside, windows))
+        return false;
+    // Every usable scene is outside the area or has its window, else the layouts are made again.
+    std::map<int, const WindowRecord*> byLine;
+    for (const WindowRecord& w : windows)
+        byLine[w.line] = &w;
+    for (const Scene& scene : scenes_) {
+        const bool isOutside =
+            std::find(outside.begin(), outside.end(), scene.line) != outside.end();
+        const auto w = byLine.find(scene.line);
+        if (scene.error.empty() && !isOutside &&
+            (w == byLine.end() || w->second->pixels == 0 || w->second->lines == 0 ||
+             w->second->column < 0 || w->second->row < 0 ||
+             w->second->column + w->second->pixels > grid_.pixels ||
+             w->second->row + w->second->lines > grid_.lines))
+            return false;
+    }
+    for (Scene& scene : scenes_) {
+        if (std::find(outside.begin(), outside.end(), scene.line) != outside.end()) {
+            scene.status = kOutsideArea;
+            continue;
+        }
+        const auto w = byLine.find(scene.line);
+        if (!scene.error.empty() || w == byLine.end())
+            continue;
+        const WindowRecord& r = *w->second;
+        const auto& g = grid_.geoTransform;
+        scene.window = grid_;
+        scene.window.pixels = r.pixels;
+        scene.window.lines = r.lines;
+        scene.window.geoTransform[0] = g[0] + static_cast<double>(r.column) * g[1];
+        scene.window.geoTransform[3] = g[3] + static_cast<double>(r.row) * g[5];
+        scene.hasWindow = true;
+        if (scene.inSlice)
+            WarnUncovered(scene, r.uncoveredShare);
+    }
+    return true;
+}
+
 void Workflow::MakeGrid() {
     const std::string key = GridInputs().Fingerprint();
-    std::vector<int> outside;
-    if (!options_.overwrite && ReadGridText(gridFile_, key, grid_, outside)) {
-        for (Scene& scene : scenes_) {
-            if (std::find(outside.begin(), outside.end(), scene.line) != outside.end())
-                scene.status = kOutsideArea;
-        }
+    if (UseStoredGrid(key))
         return;
-    }
 
     // The first scene whose layout can be made fixes the CRS and pixel size of all others.
-    std::vector<Grid> grids;
     std::string crs = options_.srs;
     double pixelWidth = options_.xRes > 0.0 ? options_.xRes : options_.pixelSize;
     double pixelHeight = options_.yRes > 0.0 ? options_.yRes : options_.pixelSize;
+    const bool sizeGiven = pixelWidth > 0.0;
     Area area{};
     std::unique_ptr<AreaOfInterest> aoi;
     const bool limited = options_.hasExtent || !options_.cutline.empty();
     bool fixed = false;
-    for (Scene& scene : scenes_) {
-        if (!scene.error.empty() || stopped_)
-            continue;
-        ThrowIfInterrupted();
-        Footprint footprint;
+    std::map<int, Footprint> footprints;
+    const auto layout = [&](Scene& scene) {
         try {
+            Footprint footprint;
             scene.grid = SceneLayout(options_, scene.input, crs, pixelWidth, pixelHeight,
-                                     limited ? &footprint : nullptr, true);
+                                     &footprint, true);
             scene.hasGrid = true;
-            if (scene.grid.uncoveredShare > 0) {
-                char share[32];
-                std::snprintf(share, sizeof share, "%.1f %%", 100.0 * scene.grid.uncoveredShare);
-                progress_.Info("warning: " + scene.name + ": the surface model leaves out " +
-                               share + " of the image's ground; the ortho covers the rest");
-            }
+            footprints[scene.line] = std::move(footprint);
+            return true;
         } catch (const std::exception& e) {
+            scene.hasGrid = false;
             scene.error = Where(scene) + ": " + Explain(e);
             if (scene.inSlice) {
                 progress_.Error(scene.error);
                 Fail(scene, scene.error);
             }
-            continue;
+            return false;
         }
+    };
+    std::vector<Grid> grids;
+    std::vector<int> outside;
+    for (Scene& scene : scenes_) {
+        if (!scene.error.empty() || stopped_)
+            continue;
+        ThrowIfInterrupted();
+        if (!layout(scene))
+            continue;
         if (!fixed) {
             fixed = true;
             crs = scene.grid.crs;
@@ -666,8 +744,22 @@ void Workflow::MakeGrid() {
             } catch (const std::exception& e) {
                 throw RunError(Explain(e));
             }
+            // --te without a pixel size, as gdalwarp -te: the area exactly, in whole cells of
+            // about the source's resolution.
+            if (options_.hasExtent && !sizeGiven) {
+                const double columns =
+                    std::floor((area[2] - area[0] + pixelWidth / 2) / pixelWidth);
+                const double rows = std::floor((area[3] - area[1] + pixelHeight / 2) / pixelHeight);
+                if (columns >= 1 && rows >= 1) {
+                    pixelWidth = (area[2] - area[0]) / columns;
+                    pixelHeight = (area[3] - area[1]) / rows;
+                    if (!layout(scene))
+                        continue;
+                }
+            }
         }
-        if (aoi && footprint && !aoi->Reaches(*footprint)) {
+        const auto footprint = footprints.find(scene.line);
+        if (aoi && footprint->second && !aoi->Reaches(*footprint->second)) {
             scene.status = kOutsideArea;
             outside.push_back(scene.line);
             continue;
@@ -681,7 +773,31 @@ void Workflow::MakeGrid() {
     if (grids.empty())
         throw RunError(options_.master + ": no scene has a usable layout");
     grid_ = CommonGrid(grids, options_.hasExtent ? &area : nullptr);
-    WriteFileAtomically(gridFile_, GridText(key, grid_, outside));
+
+    // Each scene's window of the common grid; one whose footprint covers no cell of it is
+    // outside the area.
+    std::vector<WindowRecord> windows;
+    for (Scene& scene : scenes_) {
+        if (!scene.hasGrid || scene.status == kOutsideArea)
+            continue;
+        const Footprint& footprint = footprints[scene.line];
+        if (!footprint || footprint->numPoints < 3) {
+            scene.window = grid_;  // the scene fails on its footprint when it runs
+        } else if (!SceneWindow(grid_, *footprint, scene.window)) {
+            scene.status = kOutsideArea;
+            outside.push_back(scene.line);
+            continue;
+        }
+        // Until recovery takes orthos on windows of its grid, each scene's window is all of it.
+        scene.window = grid_;
+        scene.hasWindow = true;
+        const auto cell = CellOffset(grid_, scene.window);
+        windows.push_back({scene.line, cell[0], cell[1], scene.window.pixels, scene.window.lines,
+                           scene.grid.uncoveredShare});
+        if (scene.inSlice)
+            WarnUncovered(scene, scene.grid.uncoveredShare);
+    }
+    WriteFileAtomically(gridFile_, GridText(key, grid_, outside, windows));
     progress_.Info("common grid: " + grid_.Describe());
     if (!outside.empty())
         progress_.Info(std::to_string(outside.size()) +
@@ -692,9 +808,13 @@ void Workflow::RecordInputs(Scene& scene) {
     Manifest& made = scene.madeFrom;
     made.Set("master line", scene.columns);
     made.Set("program", ProgramVersion());
-    for (const PixelOption& option : PixelOptions())
-        made.Set(option.name, option.value(options_));
-    made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
+    // The area of interest changes a scene's pixels only through its window.
+    for (const PixelOption& option : PixelOptions()) {
+        if (std::string(option.name) != "--te")
+            made.Set(option.name, option.value(options_));
+    }
+    made.Set("window", scene.window.Describe() + " (" +
+                           Fingerprint(GridText("", scene.window)) + ")");
     for (const std::string& file : FilesOf(scene.input.source))
         made.SetFile("source file", file, Identity(file));
     for (const std::string& file : FilesOf(SurfacePath(options_)))
@@ -741,10 +861,10 @@ std::string Workflow::WhyMake(const Scene& scene) const {
         return scene.xml + " cannot be read: " + Explain(e);
     }
     Grid ortho, visibility;
-    if (!ReadGrid(scene.ortho, ortho) || !ortho.SameAs(grid_))
-        return scene.ortho + " is not whole on the common grid";
-    if (!ReadGrid(scene.visibility, visibility) || !visibility.SameAs(grid_))
-        return scene.visibility + " is not whole on the common grid";
+    if (!ReadGrid(scene.ortho, ortho) || !ortho.SameAs(scene.window))
+        return scene.ortho + " is not whole on the scene's window";
+    if (!ReadGrid(scene.visibility, visibility) || !visibility.SameAs(scene.window))
+        return scene.visibility + " is not whole on the scene's window";
     return "";
 }
 
@@ -753,6 +873,10 @@ void Workflow::RunScenes() {
     for (Scene& scene : scenes_) {
         if (!scene.inSlice || !scene.error.empty() || scene.status == kOutsideArea)
             continue;
+        if (!scene.hasWindow) {
+            Fail(scene, Where(scene) + ": the scene has no window on the common grid");
+            continue;
+        }
         RecordInputs(scene);
         scene.reason = WhyMake(scene);
         if (scene.reason.empty()) {
@@ -845,7 +969,8 @@ void Workflow::RunScene(Scene& scene) {
         timed("scene layout");
 
         const OrthoResult result =
-            MakeOrtho(options_, scene.input, grid_, parts[0], parts[1], report(0.05, 0.9, "ortho"));
+            MakeOrtho(options_, scene.input, scene.window, parts[0], parts[1],
+                      report(0.05, 0.9, "ortho"));
         Publish(parts[0], scene.ortho);
         Publish(parts[1], scene.visibility);
         timed("scene ortho");
@@ -894,12 +1019,13 @@ void Workflow::RunScene(Scene& scene) {
 
 void Workflow::Recover() {
     const std::string ext = RasterExtension(options_.format);
+    const std::string classes = RasterExtension(ClassRasterType(options_.format));
     const std::string mosaic = Join(outDir_, "mosaic." + ext);
-    const std::string source = Join(outDir_, "mosaic_source." + ext);
+    const std::string source = Join(outDir_, "mosaic_source." + classes);
     const std::string footprints = Join(outDir_, "footprints.gpkg");
     const std::string record = Join(outDir_, "mosaic_manifest.json");
     const std::vector<std::string> quicklooks = {QuicklookName(outDir_, "mosaic", ext),
-                                                 QuicklookName(outDir_, "mosaic_source", ext)};
+                                                 QuicklookName(outDir_, "mosaic_source", classes)};
     const std::string legend = Join(outDir_, "mosaic_source_legend.json");
 
     // The mosaic is made from the scenes' outputs, so from what made them, and from the

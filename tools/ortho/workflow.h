@@ -48,6 +48,9 @@ struct Scene {
     double seconds = 0.0;
     bool hasGrid = false;
     Grid grid;  // the scene's own layout
+    // The scene's window of the common grid, on which its ortho and visibility index lie.
+    bool hasWindow = false;
+    Grid window;
 };
 
 class Workflow {
@@ -63,6 +66,11 @@ class Workflow {
   private:
     void Prepare();
     void MakeGrid();
+    // The common grid and the scenes' windows from grid.txt when it was worked out from these
+    // inputs; false when it must be worked out again.
+    bool UseStoredGrid(const std::string& key);
+    // The warning line of a scene whose image's ground the surface covers only in part.
+    void WarnUncovered(const Scene& scene, double share);
     void RunScenes();
     // Refuses a run in which an output, or its temporary file, would be written over an input
     // or over another output. `sources`: the source of each master line, as given.
