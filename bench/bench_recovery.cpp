@@ -3,8 +3,15 @@
 // 64 pixels and for 4 and 16 scenes. Time and peak memory of each run, in a child process of
 // its own so that its peak memory is its own.
 //
+// --windows: scenes of 256 x 256 pixels on windows 128 pixels apart (each pixel in 4 scenes)
+// over grids of 512 to 2048 pixels across (9 to 225 scenes), the choice per pixel and the full
+// pipeline (balance, seamlines, blending): time per megapixel and peak memory should not grow
+// with the number of scenes.
+//
 //   bench_recovery [SIZE]                      default: 512
+//   bench_recovery --windows
 //   bench_recovery --run DIR SCENES ERROR      (internal) one recovery run
+//   bench_recovery --run-windows DIR GRID PIPELINE  (internal)
 #include <kestrel/trueortho.h>
 
 #include "support.h"
@@ -14,6 +21,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <memory>
 #include <random>
 #include <string>
@@ -30,13 +38,15 @@ using Clock = std::chrono::steady_clock;
 
 constexpr int kMaxScenes = 16;
 
+constexpr int kWindow = 256, kStep = 128;
+
 void WriteRaster(const std::string& path, int size, int bands,
-                 const std::vector<unsigned char>& values) {
+                 const std::vector<unsigned char>& values, int x = 0, int y = 0) {
     GDALDriver* gtiff = GetGDALDriverManager()->GetDriverByName("GTiff");
     const char* options[] = {"TILED=YES", nullptr};
     std::unique_ptr<GDALDataset> ds(gtiff->Create(path.c_str(), size, size, bands, GDT_Byte,
                                                   const_cast<char**>(options)));
-    double gt[6] = {500000, 0.5, 0, 4100000, 0, -0.5};
+    double gt[6] = {500000 + 0.5 * x, 0.5, 0, 4100000 - 0.5 * y, 0, -0.5};
     ds->SetGeoTransform(gt);
     for (int b = 1; b <= bands; ++b)
         ds->GetRasterBand(b)->SetNoDataValue(0);
@@ -45,21 +55,98 @@ void WriteRaster(const std::string& path, int size, int bands,
         std::exit(1);
 }
 
+// Visibility with hidden rectangles of 8 to 40 pixels until about a tenth is hidden.
+std::vector<unsigned char> Visibility(std::mt19937& random, int size) {
+    std::vector<unsigned char> vis(static_cast<size_t>(size) * size, 1);
+    std::uniform_int_distribution<int> at(0, size - 1), side(8, 40);
+    for (size_t hidden = 0; hidden < vis.size() / 10;) {
+        const int x = at(random), y = at(random), w = side(random), h = side(random);
+        for (int j = y; j < std::min(size, y + h); ++j)
+            for (int i = x; i < std::min(size, x + w); ++i) {
+                unsigned char& v = vis[static_cast<size_t>(j) * size + i];
+                hidden += v == 1;
+                v = 2;
+            }
+    }
+    return vis;
+}
+
+// Scenes on windows kStep apart over a grid of `grid` pixels across, "sceneX_Y_*.tif"; each
+// with its own exposure over a gentle gradient.
+void MakeWindows(const std::string& dir, int grid) {
+    std::mt19937 random(2);
+    std::uniform_real_distribution<double> exposure(0.8, 1.2);
+    for (int y = 0; y + kWindow <= grid; y += kStep)
+        for (int x = 0; x + kWindow <= grid; x += kStep) {
+            const std::string name = dir + "/scene" + std::to_string(x) + "_" + std::to_string(y);
+            const double gain = exposure(random);
+            std::vector<unsigned char> ortho(static_cast<size_t>(kWindow) * kWindow * 3);
+            for (size_t k = 0; k < ortho.size(); ++k) {
+                const size_t p = k % (static_cast<size_t>(kWindow) * kWindow);
+                const int gx = x + static_cast<int>(p % kWindow), gy = y + static_cast<int>(p / kWindow);
+                ortho[k] = static_cast<unsigned char>(gain * (60 + (gx + gy) % 100));
+            }
+            WriteRaster(name + "_vis.tif", kWindow, 1, Visibility(random, kWindow), x, y);
+            WriteRaster(name + "_ortho.tif", kWindow, 3, ortho, x, y);
+        }
+}
+
+int RunWindows(const std::string& dir, int grid, bool pipeline) {
+    kestrel::processes::RecoveryJob job;
+    for (int y = 0; y + kWindow <= grid; y += kStep)
+        for (int x = 0; x + kWindow <= grid; x += kStep) {
+            const std::string name = dir + "/scene" + std::to_string(x) + "_" + std::to_string(y);
+            kestrel::processes::RecoveryScene scene;
+            scene.orthoPath = name + "_ortho.tif";
+            scene.visibilityPath = name + "_vis.tif";
+            scene.dbmPixelError = 2;
+            job.scenes.push_back(scene);
+        }
+    job.mosaicPath = dir + "/mosaic.tif";
+    job.sourcePath = dir + "/source.tif";
+    if (!pipeline) {
+        job.seamlines = false, job.blendWidth = 0;
+        job.balance = kestrel::processes::RecoveryJob::Balance::None;
+    }
+    kestrel::processes::GeneratorSettings settings;
+    settings.threadCount = 1;
+    const auto start = Clock::now();
+    const auto result = kestrel::processes::OcclusionRecovery(settings).Recover(job);
+    std::printf("%.3f %.1f %zu\n", std::chrono::duration<double>(Clock::now() - start).count(),
+                benchsupport::PeakMemoryBytes() / 1e6, job.scenes.size());
+    return result.completed ? 0 : 1;
+}
+
+int Windows(const char* self) {
+    std::printf("scenes of %d x %d pixels every %d pixels (4 over each pixel), one thread\n",
+                kWindow, kWindow, kStep);
+    std::printf("%6s %7s %9s %10s %12s %9s\n", "grid", "scenes", "pipeline", "seconds",
+                "s per Mpx", "peak MB");
+    for (const int grid : {512, 1024, 2048}) {
+        const std::string dir =
+            benchsupport::ScratchDir("recovery-windows-" + std::to_string(grid)).string();
+        if (!std::filesystem::exists(dir + "/scene0_0_ortho.tif"))
+            MakeWindows(dir, grid);
+        for (const int pipeline : {0, 1}) {
+            const std::string command = std::string("\"") + self + "\" --run-windows \"" + dir +
+                                        "\" " + std::to_string(grid) + " " + std::to_string(pipeline);
+            std::unique_ptr<FILE, int (*)(FILE*)> pipe(popen(command.c_str(), "r"), pclose);
+            double seconds = 0, megabytes = 0;
+            size_t scenes = 0;
+            if (!pipe || std::fscanf(pipe.get(), "%lf %lf %zu", &seconds, &megabytes, &scenes) != 3)
+                return 1;
+            std::printf("%6d %7zu %9s %10.3f %12.3f %9.1f\n", grid, scenes,
+                        pipeline ? "full" : "per pixel", seconds,
+                        seconds / (static_cast<double>(grid) * grid / 1e6), megabytes);
+        }
+    }
+    return 0;
+}
+
 void Make(const std::string& dir, int size) {
     std::mt19937 random(1);
     for (int s = 0; s < kMaxScenes; ++s) {
-        std::vector<unsigned char> vis(static_cast<size_t>(size) * size, 1);
-        // Hidden rectangles of 8 to 40 pixels until about a tenth is hidden.
-        std::uniform_int_distribution<int> at(0, size - 1), side(8, 40);
-        for (size_t hidden = 0; hidden < vis.size() / 10;) {
-            const int x = at(random), y = at(random), w = side(random), h = side(random);
-            for (int j = y; j < std::min(size, y + h); ++j)
-                for (int i = x; i < std::min(size, x + w); ++i) {
-                    unsigned char& v = vis[static_cast<size_t>(j) * size + i];
-                    hidden += v == 1;
-                    v = 2;
-                }
-        }
+        const std::vector<unsigned char> vis = Visibility(random, size);
         std::vector<unsigned char> ortho(vis.size() * 3, static_cast<unsigned char>(10 + s));
         const std::string name = dir + "/scene" + std::to_string(s);
         WriteRaster(name + "_vis.tif", size, 1, vis);
@@ -93,6 +180,10 @@ int main(int argc, char** argv) {
     GDALAllRegister();
     if (argc == 5 && std::string(argv[1]) == "--run")
         return RunOnce(argv[2], std::atoi(argv[3]), std::atoi(argv[4]));
+    if (argc == 5 && std::string(argv[1]) == "--run-windows")
+        return RunWindows(argv[2], std::atoi(argv[3]), std::atoi(argv[4]) != 0);
+    if (argc == 2 && std::string(argv[1]) == "--windows")
+        return Windows(argv[0]);
     const int size = argc > 1 ? std::atoi(argv[1]) : 512;
     const std::string dir = benchsupport::ScratchDir("recovery-" + std::to_string(size)).string();
     Make(dir, size);

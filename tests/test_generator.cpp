@@ -512,6 +512,39 @@ class FlatEverywhere : public kestrel::dem::IElevationSource {
     }
 };
 
+// A grid that reaches the image by one corner pixel (a scene's window that an area of interest
+// clips to a sliver), which a 17 x 17 lattice over it misses: made, not refused.
+TEST_F(BoxFixture, GridThatReachesTheImageByOnePixelIsMade) {
+    FlatEverywhere flat;
+    // Where the image lies on a coarse grid around it: its pixel nearest the grid's top left.
+    const double step = 4.0, margin = 200.0;
+    const unsigned int cells = static_cast<unsigned int>((options.sizeX + 2 * margin) / step);
+    TorthoJob around = Job();
+    around.surface = &flat;
+    around.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(
+        options.west - margin, options.south + options.sizeY + margin, step, step);
+    around.pixels = around.lines = cells;
+    ASSERT_TRUE(TorthoGenerator().Generate(around).completed);
+    const std::vector<double> coarse = ReadBand(dir.File("visibility.tif"));
+    unsigned int corner = cells * cells;
+    for (unsigned int k = 0; k < coarse.size(); ++k) {
+        if (coarse[k] != 0 && (corner == cells * cells ||
+                               k % cells + k / cells < corner % cells + corner / cells))
+            corner = k;
+    }
+    ASSERT_LT(corner, cells * cells);
+    // A grid of 100 x 100 whose last pixel is that one: no other pixel of it is in the image.
+    TorthoJob sliver = around;
+    sliver.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(
+        options.west - margin + (corner % cells - 99.0) * step,
+        options.south + options.sizeY + margin - (corner / cells - 99.0) * step, step, step);
+    sliver.pixels = sliver.lines = 100;
+    ASSERT_TRUE(TorthoGenerator().Generate(sliver).completed);
+    const std::vector<double> visibility = ReadBand(dir.File("visibility.tif"));
+    EXPECT_NE(visibility.back(), 0.0);
+    EXPECT_EQ(std::count(visibility.begin(), visibility.end(), 0.0), 100 * 100 - 1);
+}
+
 TEST_F(BoxFixture, BadInputIsRefusedWithWhatAndWhere) {
     FlatEverywhere flat;
     const struct {

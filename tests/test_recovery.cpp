@@ -71,6 +71,7 @@ class OppositeViews : public ::testing::Test {
         job.mosaicPath = dir->File("mosaic.tif");
         job.sourcePath = dir->File("source.tif");
         job.tileSize = 64;
+        job.seamlines = false, job.blendWidth = 0, job.balance = RecoveryJob::Balance::None;
         return job;
     }
     static std::vector<double> Visibility(int s) {
@@ -89,33 +90,41 @@ samplecity::CityOptions OppositeViews::options;
 samplecity::GridSurface* OppositeViews::surface = nullptr;
 samplecity::RpcModel* OppositeViews::models[2] = {nullptr, nullptr};
 
+// Without seamlines and with them (blended across the seams), each scene fills the other's
+// hidden strip with its own values: a scene's weight is zero where it does not see the ground.
 TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
-    const TorthoRecoveryResult result = OcclusionRecovery().Recover(Job(1, 1, 1, true));
-    ASSERT_TRUE(result.completed);
-    const auto vis1 = Visibility(0), vis2 = Visibility(1);
-    const auto source = ReadBand(dir->File("source.tif"));
-    const auto mosaic = ReadBand(dir->File("mosaic.tif"), 2);
-    const auto ortho2 = ReadBand(dir->File("view180_ortho.tif"), 2);
-    const auto ortho1 = ReadBand(dir->File("view000_ortho.tif"), 2);
-    size_t hidden[2] = {0, 0};
-    for (size_t k = 0; k < source.size(); ++k) {
-        if (vis1[k] == VISIBILITY_HIDDEN && vis2[k] == VISIBILITY_SEEN) {
-            ++hidden[0];
-            ASSERT_EQ(source[k], 2) << k;
-            ASSERT_EQ(mosaic[k], ortho2[k]) << k;
+    for (const bool seamlines : {false, true}) {
+        SCOPED_TRACE(seamlines ? "seamlines" : "first-ranked scene per pixel");
+        RecoveryJob job = Job(1, 1, 1, true);
+        job.seamlines = seamlines;
+        job.blendWidth = seamlines ? 16 : 0;
+        const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
+        ASSERT_TRUE(result.completed);
+        const auto vis1 = Visibility(0), vis2 = Visibility(1);
+        const auto source = ReadBand(dir->File("source.tif"));
+        const auto mosaic = ReadBand(dir->File("mosaic.tif"), 2);
+        const auto ortho2 = ReadBand(dir->File("view180_ortho.tif"), 2);
+        const auto ortho1 = ReadBand(dir->File("view000_ortho.tif"), 2);
+        size_t hidden[2] = {0, 0};
+        for (size_t k = 0; k < source.size(); ++k) {
+            if (vis1[k] == VISIBILITY_HIDDEN && vis2[k] == VISIBILITY_SEEN) {
+                ++hidden[0];
+                ASSERT_EQ(source[k], 2) << k;
+                ASSERT_EQ(mosaic[k], ortho2[k]) << k;
+            }
+            if (vis2[k] == VISIBILITY_HIDDEN && vis1[k] == VISIBILITY_SEEN) {
+                ++hidden[1];
+                ASSERT_EQ(source[k], 1) << k;
+                ASSERT_EQ(mosaic[k], ortho1[k]) << k;
+            }
+            if (vis1[k] != VISIBILITY_SEEN && vis2[k] != VISIBILITY_SEEN) {
+                EXPECT_EQ(source[k], 0) << k;
+            }
         }
-        if (vis2[k] == VISIBILITY_HIDDEN && vis1[k] == VISIBILITY_SEEN) {
-            ++hidden[1];
-            ASSERT_EQ(source[k], 1) << k;
-            ASSERT_EQ(mosaic[k], ortho1[k]) << k;
-        }
-        if (vis1[k] != VISIBILITY_SEEN && vis2[k] != VISIBILITY_SEEN) {
-            EXPECT_EQ(source[k], 0) << k;
-        }
+        EXPECT_GT(hidden[0], 1000u);
+        EXPECT_GT(hidden[1], 1000u);
+        EXPECT_EQ(result.filled + result.unfilled, static_cast<unsigned long long>(kSize) * kSize);
     }
-    EXPECT_GT(hidden[0], 1000u);
-    EXPECT_GT(hidden[1], 1000u);
-    EXPECT_EQ(result.filled + result.unfilled, static_cast<unsigned long long>(kSize) * kSize);
 }
 
 // At equal levels the line of sight nearer the vertical wins: the northern camera north of the
@@ -163,42 +172,61 @@ TEST_F(OppositeViews, CancelledOrRefusedRunsLeaveNoOutput) {
 namespace synthetic {
 
 constexpr int kWidth = 70, kHeight = 50;
+constexpr double kLeft = 500000, kTop = 4100000, kPixel = 0.5;
 
-// Writes a one-band Byte GeoTIFF on the common grid.
-void WriteBand(const std::string& path, const std::vector<unsigned char>& values) {
+// A part of the common grid, in pixels.
+struct Window {
+    int x = 0, y = 0, width = kWidth, height = kHeight;
+};
+
+// Writes the window of a one-band Byte raster on the common grid as a GeoTIFF of its own,
+// origin `shift` pixels off the grid's lattice.
+void WriteBand(const std::string& path, const std::vector<unsigned char>& values,
+               const Window& w = Window(), double shift = 0) {
     GDALAllRegister();
     GDALDriver* gtiff = GetGDALDriverManager()->GetDriverByName("GTiff");
     std::unique_ptr<GDALDataset> ds(
-        gtiff->Create(path.c_str(), kWidth, kHeight, 1, GDT_Byte, nullptr));
-    const double gt[6] = {500000, 0.5, 0, 4100000, 0, -0.5};
+        gtiff->Create(path.c_str(), w.width, w.height, 1, GDT_Byte, nullptr));
+    const double gt[6] = {kLeft + (w.x + shift) * kPixel, kPixel, 0, kTop - w.y * kPixel, 0,
+                          -kPixel};
     ds->SetGeoTransform(const_cast<double*>(gt));
     ds->GetRasterBand(1)->SetNoDataValue(0);
-    ASSERT_EQ(ds->GetRasterBand(1)->RasterIO(GF_Write, 0, 0, kWidth, kHeight,
-                                             const_cast<unsigned char*>(values.data()), kWidth,
-                                             kHeight, GDT_Byte, 0, 0, nullptr),
+    unsigned char* start = const_cast<unsigned char*>(values.data()) + w.y * kWidth + w.x;
+    ASSERT_EQ(ds->GetRasterBand(1)->RasterIO(GF_Write, 0, 0, w.width, w.height, start, w.width,
+                                             w.height, GDT_Byte, 1, kWidth, nullptr),
               CE_None);
 }
 
 // Scene s: ortho value 10 * (s + 1); visibility seen, hidden (with probability `hidden`) or
-// outside (with probability 0.1).
+// outside (with probability 0.1). With windows, scene s lies on windows[s] (outside it the
+// visibility says outside) and is written twice: padded to the grid (the job returned) and
+// cropped to its window ("sceneN_window_*.tif").
 RecoveryJob MakeScenes(const TempDir& dir, int count, double hidden, unsigned seed,
-                       std::vector<std::vector<unsigned char>>& visibility) {
+                       std::vector<std::vector<unsigned char>>& visibility,
+                       const std::vector<Window>& windows = {}) {
     std::mt19937 random(seed);
     std::uniform_real_distribution<double> draw(0.0, 1.0);
     RecoveryJob job;
     visibility.clear();
     for (int s = 0; s < count; ++s) {
         const std::string name = "scene" + std::to_string(s);
+        const Window w = windows.empty() ? Window() : windows[s];
         std::vector<unsigned char> vis(kWidth * kHeight);
-        for (auto& v : vis) {
+        for (int k = 0; k < kWidth * kHeight; ++k) {
             const double d = draw(random);
-            v = d < hidden         ? VISIBILITY_HIDDEN
-                : d < hidden + 0.1 ? VISIBILITY_OUTSIDE
-                                   : VISIBILITY_SEEN;
+            const int x = k % kWidth, y = k / kWidth;
+            const bool inside = x >= w.x && x < w.x + w.width && y >= w.y && y < w.y + w.height;
+            vis[k] = !inside || (d >= hidden && d < hidden + 0.1) ? VISIBILITY_OUTSIDE
+                     : d < hidden                                 ? VISIBILITY_HIDDEN
+                                                                  : VISIBILITY_SEEN;
         }
+        const std::vector<unsigned char> ortho(vis.size(), static_cast<unsigned char>(10 * (s + 1)));
         WriteBand(dir.File(name + "_vis.tif"), vis);
-        WriteBand(dir.File(name + "_ortho.tif"),
-                  std::vector<unsigned char>(vis.size(), static_cast<unsigned char>(10 * (s + 1))));
+        WriteBand(dir.File(name + "_ortho.tif"), ortho);
+        if (!windows.empty()) {
+            WriteBand(dir.File(name + "_window_vis.tif"), vis, w);
+            WriteBand(dir.File(name + "_window_ortho.tif"), ortho, w);
+        }
         RecoveryScene scene;
         scene.orthoPath = dir.File(name + "_ortho.tif");
         scene.visibilityPath = dir.File(name + "_vis.tif");
@@ -209,6 +237,7 @@ RecoveryJob MakeScenes(const TempDir& dir, int count, double hidden, unsigned se
     job.mosaicPath = dir.File("mosaic.tif");
     job.sourcePath = dir.File("source.tif");
     job.tileSize = 16;
+    job.seamlines = false, job.blendWidth = 0, job.balance = RecoveryJob::Balance::None;
     return job;
 }
 
@@ -302,6 +331,116 @@ TEST(RecoveryChoice, ThreadsShareEachScenesFilesAndAreCappedByTheWork) {
 #if !defined(_WIN32)
     setrlimit(RLIMIT_NOFILE, &saved);
 #endif
+}
+
+// Scenes on windows of the grid (the pixel-error neighbourhood meeting the windows' edges) give
+// the mosaic of the same scenes padded to the whole grid; each tile reads only the scenes whose
+// window meets it; without a grid the mosaic is the union of the windows; a scene off the
+// lattice is refused, naming both files.
+TEST(RecoveryWindows, ScenesOnWindowsGiveTheMosaicOfTheScenesPaddedToTheGrid) {
+    using synthetic::kHeight;
+    using synthetic::kWidth;
+    const std::vector<synthetic::Window> windows = {
+        {3, 2, 37, 28}, {25, 10, 40, 38}, {5, 20, 30, 28}, {44, 0, 21, 12}};
+    TempDir dir;
+    std::vector<std::vector<unsigned char>> visibility;
+    RecoveryJob padded = synthetic::MakeScenes(dir, 4, 0.03, 11, visibility, windows);
+    const int errors[] = {2, 0, 3, 1};
+    for (size_t s = 0; s < padded.scenes.size(); ++s)
+        padded.scenes[s].dbmPixelError = errors[s];
+    ASSERT_TRUE(OcclusionRecovery().Recover(padded).completed);
+    const auto source = ReadBand(padded.sourcePath), mosaic = ReadBand(padded.mosaicPath);
+    ASSERT_EQ(source, synthetic::ExpectedSource(padded, visibility));
+
+    RecoveryJob cropped = padded;
+    for (size_t s = 0; s < cropped.scenes.size(); ++s) {
+        const std::string name = "scene" + std::to_string(s) + "_window_";
+        cropped.scenes[s].orthoPath = dir.File(name + "ortho.tif");
+        cropped.scenes[s].visibilityPath = dir.File(name + "vis.tif");
+    }
+    cropped.mosaicPath = dir.File("cropped.tif");
+    cropped.sourcePath = dir.File("cropped_source.tif");
+    cropped.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(
+        synthetic::kLeft, synthetic::kTop, synthetic::kPixel, synthetic::kPixel);
+    cropped.pixels = kWidth, cropped.lines = kHeight;
+    const TorthoRecoveryResult result = OcclusionRecovery().Recover(cropped);
+    ASSERT_TRUE(result.completed);
+    EXPECT_EQ(ReadBand(cropped.sourcePath), source);
+    EXPECT_EQ(ReadBand(cropped.mosaicPath), mosaic);
+    unsigned long long reads = 0;  // tiles of 16 times the windows meeting each
+    for (int ty = 0; ty < kHeight; ty += 16)
+        for (int tx = 0; tx < kWidth; tx += 16)
+            for (const auto& w : windows)
+                reads += w.x < tx + 16 && tx < w.x + w.width && w.y < ty + 16 && ty < w.y + w.height;
+    EXPECT_EQ(result.sceneReads, reads);
+    EXPECT_LT(reads, 20u * windows.size());
+
+    // The union of the windows: pixels 3 to 64, lines 0 to 47.
+    cropped.pixels = cropped.lines = 0;
+    ASSERT_TRUE(OcclusionRecovery().Recover(cropped).completed);
+    {
+        std::unique_ptr<GDALDataset> ds(GDALDataset::Open(cropped.sourcePath.c_str()));
+        ASSERT_TRUE(ds);
+        ASSERT_EQ(ds->GetRasterXSize(), 62);
+        ASSERT_EQ(ds->GetRasterYSize(), 48);
+        double gt[6];
+        ASSERT_EQ(ds->GetGeoTransform(gt), CE_None);
+        EXPECT_DOUBLE_EQ(gt[0], synthetic::kLeft + 3 * synthetic::kPixel);
+        EXPECT_DOUBLE_EQ(gt[3], synthetic::kTop);
+    }
+    const auto unionSource = ReadBand(cropped.sourcePath);
+    for (int y = 0; y < 48; ++y)
+        for (int x = 0; x < 62; ++x)
+            ASSERT_EQ(unionSource[y * 62 + x], source[y * kWidth + x + 3]) << x << ", " << y;
+
+    synthetic::WriteBand(dir.File("shifted.tif"), visibility[1], windows[1], 0.25);
+    cropped.scenes[1].orthoPath = dir.File("shifted.tif");
+    try {
+        OcclusionRecovery().Recover(cropped);
+        ADD_FAILURE() << "no exception";
+    } catch (const kestrel::DataException& e) {
+        const std::string what = e.what();
+        EXPECT_NE(what.find("shifted.tif"), std::string::npos) << what;
+        EXPECT_NE(what.find("scene0_window_ortho.tif"), std::string::npos) << what;
+    }
+}
+
+// A regions raster names each pixel's scene; where that scene does not see the pixel, and where
+// the raster says 0, the first-ranked scene fills it. A value that names no scene is refused,
+// naming the raster.
+TEST(RecoveryRegions, TheRegionsRasterChoosesWhereItsSceneSees) {
+    TempDir dir;
+    std::vector<std::vector<unsigned char>> visibility;
+    RecoveryJob job = synthetic::MakeScenes(dir, 3, 0.05, 5, visibility);
+    for (auto& scene : job.scenes)
+        scene.dbmPixelError = 1;
+    std::vector<unsigned char> regions(visibility[0].size());
+    for (size_t k = 0; k < regions.size(); ++k)
+        regions[k] = static_cast<unsigned char>((k % synthetic::kWidth / 20 + k / synthetic::kWidth / 10) % 4);
+    synthetic::WriteBand(dir.File("regions.tif"), regions);
+    job.regionsPath = dir.File("regions.tif");
+    ASSERT_TRUE(OcclusionRecovery().Recover(job).completed);
+    auto expected = synthetic::ExpectedSource(job, visibility);
+    size_t named = 0;
+    for (size_t k = 0; k < expected.size(); ++k)
+        if (regions[k] > 0 && visibility[regions[k] - 1][k] == VISIBILITY_SEEN)
+            expected[k] = regions[k], ++named;
+    EXPECT_GT(named, expected.size() / 2);
+    const auto source = ReadBand(job.sourcePath), mosaic = ReadBand(job.mosaicPath);
+    ASSERT_EQ(source, expected);
+    for (size_t k = 0; k < source.size(); ++k)
+        ASSERT_EQ(mosaic[k], 10 * source[k]) << k;
+
+    regions[30 * synthetic::kWidth + 7] = 4;
+    synthetic::WriteBand(dir.File("regions.tif"), regions);
+    try {
+        OcclusionRecovery().Recover(job);
+        ADD_FAILURE() << "no exception";
+    } catch (const kestrel::DataException& e) {
+        EXPECT_NE(std::string(e.what()).find("regions.tif holds 4 at pixel 7, line 30"),
+                  std::string::npos)
+            << e.what();
+    }
 }
 
 }  // namespace

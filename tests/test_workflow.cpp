@@ -332,6 +332,8 @@ TEST(Workflow, SampleCityEndToEnd) {
             EXPECT_GE(window.row, 0);
             EXPECT_LE(window.column + window.width, width);
             EXPECT_LE(window.row + window.height, height);
+            EXPECT_LE(window.width, (maxX - minX) / grid[1] + 16);
+            EXPECT_LE(window.height, (maxY - minY) / grid[1] + 16);
             ASSERT_NE(ds->GetSpatialRef(), nullptr);
             EXPECT_STREQ(ds->GetSpatialRef()->GetAuthorityCode(nullptr), "32632");
         }
@@ -706,6 +708,11 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
              ReplaceInFile(dir.File("sample/master.txt"), "HIGH;1", "HIGH;2");
          },
          {}, "scene west changed", true},
+        {"an area of interest that changes no scene's window",
+         [&] { args.insert(args.end(), {"--te", "514848", "5033845", "515008", "5033989"}); },
+         {}, "--te changed", true},
+        {"an area of interest that clips one scene's window",
+         [&] { args[args.size() - 2] = "514985"; }, {"west"}, "window changed", true},
         {"a lost output",
          [&] { std::filesystem::remove(dir.Path() / "out/north_vis.png"); },
          {"north"}, dir.File("out/north_vis.png") + " is missing", false},

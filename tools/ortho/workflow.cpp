@@ -788,8 +788,6 @@ void Workflow::MakeGrid() {
             outside.push_back(scene.line);
             continue;
         }
-        // Until recovery takes orthos on windows of its grid, each scene's window is all of it.
-        scene.window = grid_;
         scene.hasWindow = true;
         const auto cell = CellOffset(grid_, scene.window);
         windows.push_back({scene.line, cell[0], cell[1], scene.window.pixels, scene.window.lines,

@@ -226,6 +226,9 @@ struct KESTREL_API RecoveryJob {
     // `scenes`, 0 none), edited seamlines burnt in, say. Empty: chosen by seamlines that avoid
     // raised objects. Where a region's scene does not see the ground the best other scene fills.
     std::string regionsPath;
+    // False: no seamlines; each pixel takes the scene that ranks first there (clear view, lower
+    // radiometric level, steeper line of sight, listed first), as before seamlines.
+    bool seamlines = true;
     // Ground heights without raised objects (a DTM), in the surface's datum, for the seam cost;
     // null: estimated from the surface.
     dem::IElevationSource* ground = nullptr;
@@ -242,6 +245,8 @@ struct TorthoRecoveryResult {
     bool completed = false;
     unsigned long long filled = 0;    // pixels that came from a scene
     unsigned long long unfilled = 0;  // pixels that no scene sees
+    // Scene tiles the composition read: the mosaic's tiles times the scenes meeting each.
+    unsigned long long sceneReads = 0;
     // The balance applied, per scene and channel: value * gain + offset.
     std::vector<std::vector<double>> gain, offset;
 };

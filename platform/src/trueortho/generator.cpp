@@ -635,16 +635,23 @@ void Survey(const TorthoJob& job, Plan& plan, Worker& w, const RunControl& contr
                       "True ortho: the surface model has no height anywhere on the output grid");
 
     // The line of sight on a 17 x 17 lattice: the extension for tiles whose own corners tell
-    // nothing, and whether any ground reaches the image.
-    const int n = 17;
+    // nothing, and whether any ground reaches the image. A grid that the lattice misses (a thin
+    // sliver of the image, where an area of interest clips a scene's window) is looked at again
+    // on every pixel centre, up to 256 x 256 of them, before it is refused.
     int inside = 0;
     Extension global;
-    for (int a = 0; a < n; ++a)
-        for (int b = 0; b < n; ++b) {
-            bool inImage = false;
-            global.Add(plan, w, job.pixels * (a + 0.5) / n, job.lines * (b + 0.5) / n, &inImage);
-            inside += inImage;
-        }
+    const auto look = [&](unsigned int columns, unsigned int rows) {
+        for (unsigned int a = 0; a < columns; ++a)
+            for (unsigned int b = 0; b < rows; ++b) {
+                bool inImage = false;
+                global.Add(plan, w, job.pixels * (a + 0.5) / columns,
+                           job.lines * (b + 0.5) / rows, &inImage);
+                inside += inImage;
+            }
+    };
+    look(17, 17);
+    if (inside == 0)
+        look(std::min(job.pixels, 256u), std::min(job.lines, 256u));
     if (inside == 0)
         KESTREL_THROW(DataException,
                       FormatString("True ortho: the math model projects the output grid outside "

@@ -1,0 +1,423 @@
+// Occlusion recovery's inputs: scene windows on the mosaic grid, their spatial index, and the
+// reading of one scene over a rectangle (seen pixels, the pixel-error test, viewing angles).
+#include "recoverygrid.h"
+
+#include <kestrel/exception.h>
+
+#include <gdal_priv.h>
+
+#include <algorithm>
+#include <cmath>
+
+namespace kestrel {
+namespace processes {
+namespace trueortho {
+
+namespace {
+
+// Angles are computed on a coarser lattice and interpolated: they change slowly.
+constexpr int kAngleStep = 16;
+// Grids share a lattice when their pixel sizes agree to this share of a pixel per pixel and
+// their origins lie this share of a pixel from a whole number of pixels apart.
+constexpr double kSizeTolerance = 1e-7;
+constexpr double kOriginTolerance = 1e-3;
+
+// Whole pixels (dx, dy) from grid `ref`'s origin to grid gt's, or false when gt is not on ref's
+// lattice.
+bool LatticeOffset(const std::array<double, 6>& ref, const std::array<double, 6>& gt, int& dx,
+                   int& dy) {
+    const double pixel = std::max(std::fabs(ref[1]) + std::fabs(ref[2]), 1e-12);
+    for (int k : {1, 2, 4, 5})
+        if (!(std::fabs(gt[k] - ref[k]) <= kSizeTolerance * pixel))
+            return false;
+    const double det = ref[1] * ref[5] - ref[2] * ref[4];
+    if (!(std::fabs(det) > 0))
+        return false;
+    const double ex = gt[0] - ref[0], ey = gt[3] - ref[3];
+    const double p = (ref[5] * ex - ref[2] * ey) / det, l = (-ref[4] * ex + ref[1] * ey) / det;
+    if (!(std::fabs(p) < 1e9 && std::fabs(l) < 1e9))
+        return false;
+    dx = static_cast<int>(std::lround(p)), dy = static_cast<int>(std::lround(l));
+    return std::fabs(p - dx) <= kOriginTolerance && std::fabs(l - dy) <= kOriginTolerance;
+}
+
+std::string Describe(const std::array<double, 6>& gt) {
+    return FormatString("origin %.6f, %.6f, pixel %.9g x %.9g", gt[0], gt[3], gt[1], gt[5]);
+}
+
+// Tangent of the angle between the vertical and the line of sight at a ground point: the
+// horizontal distance the line of sight travels per metre of height.
+float OffNadir(const mathmodel::IMathModel& model, const ogc::cs::CoordinateTransformation* toModel,
+               double x, double y, double h) {
+    double gx[4] = {x, x + 1, x, x}, gy[4] = {y, y, y + 1, y}, gz[4] = {h, h, h, h + 1};
+    double c[4], r[4];
+    bool ok[4];
+    if (toModel != nullptr && !toModel->Transform(4, gx, gy))
+        return kUnknownAngle;
+    model.GroundToImage(4, gx, gy, gz, c, r, ok);
+    if (!(ok[0] && ok[1] && ok[2] && ok[3]))
+        return kUnknownAngle;
+    const double a = c[1] - c[0], b = c[2] - c[0], d = r[1] - r[0], e = r[2] - r[0];
+    const double det = a * e - b * d;
+    if (!(std::fabs(det) > 1e-15))
+        return kUnknownAngle;
+    const double dc = c[3] - c[0], dr = r[3] - r[0];
+    const double dx = (e * dc - b * dr) / det, dy = (-d * dc + a * dr) / det;
+    return static_cast<float>(std::hypot(dx, dy));
+}
+
+// The viewing angles of a scene over a rectangle, interpolated from a lattice.
+void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScene& scene,
+            const ogc::cs::CoordinateTransformation* toModel, const Rect& r,
+            std::vector<float>& out) {
+    out.assign(r.Size(), kUnknownAngle);
+    if (scene.model == nullptr || job.surface == nullptr)
+        return;
+    const int tw = r.width, th = r.height;
+    const int nx = (tw + kAngleStep - 1) / kAngleStep + 1,
+              ny = (th + kAngleStep - 1) / kAngleStep + 1;
+    std::vector<float> lattice(static_cast<size_t>(nx) * ny);
+    const auto& g = grid.geoTransform;
+    for (int b = 0; b < ny; ++b)
+        for (int a = 0; a < nx; ++a) {
+            const double p = r.x + std::min(a * kAngleStep, tw - 1) + 0.5;
+            const double l = r.y + std::min(b * kAngleStep, th - 1) + 0.5;
+            const double x = g[0] + p * g[1] + l * g[2], y = g[3] + p * g[4] + l * g[5];
+            double h;
+            lattice[static_cast<size_t>(b) * nx + a] =
+                job.surface->GetHeight(x, y, h) ? OffNadir(*scene.model, toModel, x, y, h)
+                                                : kUnknownAngle;
+        }
+    // Between lattice nodes, which stand every kAngleStep pixels and on the last one.
+    auto cell = [](int i, int size, int& node, double& f) {
+        node = i / kAngleStep;
+        const int p0 = std::min(node * kAngleStep, size - 1);
+        const int p1 = std::min((node + 1) * kAngleStep, size - 1);
+        f = p1 > p0 ? static_cast<double>(i - p0) / (p1 - p0) : 0.0;
+    };
+    for (int j = 0; j < th; ++j) {
+        int b;
+        double fy;
+        cell(j, th, b, fy);
+        for (int i = 0; i < tw; ++i) {
+            int a;
+            double fx;
+            cell(i, tw, a, fx);
+            const size_t k = static_cast<size_t>(b) * nx + a;
+            const float q[4] = {lattice[k], lattice[k + 1], lattice[k + nx], lattice[k + nx + 1]};
+            if (std::isinf(q[0]) || std::isinf(q[1]) || std::isinf(q[2]) || std::isinf(q[3]))
+                continue;  // unknown
+            out[static_cast<size_t>(j) * tw + i] = static_cast<float>(
+                (1 - fy) * ((1 - fx) * q[0] + fx * q[1]) + fy * ((1 - fx) * q[2] + fx * q[3]));
+        }
+    }
+}
+
+}  // namespace
+
+Rect Rect::Intersect(const Rect& o) const {
+    const int x0 = std::max(x, o.x), y0 = std::max(y, o.y);
+    const int x1 = std::min(x + width, o.x + o.width), y1 = std::min(y + height, o.y + o.height);
+    return {x0, y0, std::max(0, x1 - x0), std::max(0, y1 - y0)};
+}
+
+void SharedRaster::Read(const std::vector<int>& bands, const Rect& r, float* buffer) {
+    if (r.Intersect(window).Empty())
+        return;
+    std::lock_guard<std::mutex> lock(mutex);
+    if (!dataset) {
+        dataset = OpenRaster(path, role);
+        if (dataset->GetRasterXSize() != window.width || dataset->GetRasterYSize() != window.height)
+            KESTREL_THROW(DataException,
+                          FormatString("Occlusion recovery: the %s %s changed during the run "
+                                       "(%d x %d pixels, was %d x %d)",
+                                       role, path.c_str(), dataset->GetRasterXSize(),
+                                       dataset->GetRasterYSize(), window.width, window.height));
+    }
+    if (pool != nullptr)
+        pool->Touch(*this);
+    ReadWindow(*dataset, path, bands, r.x - window.x, r.y - window.y, r.width, r.height, buffer);
+}
+
+void RasterPool::Touch(SharedRaster& raster) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (raster.listed_)
+        order_.splice(order_.begin(), order_, raster.place_);
+    else
+        order_.push_front(&raster), raster.listed_ = true, raster.place_ = order_.begin();
+    // Close the least recently read rasters that no thread holds (never waiting for one).
+    for (auto it = std::prev(order_.end()); order_.size() > capacity_ && it != order_.begin();) {
+        SharedRaster& old = **it;
+        const auto previous = std::prev(it);
+        std::unique_lock<std::mutex> held(old.mutex, std::try_to_lock);
+        if (held.owns_lock()) {
+            old.dataset.reset();
+            old.listed_ = false;
+            order_.erase(it);
+        }
+        it = previous;
+    }
+}
+
+std::vector<std::size_t> RecoveryGrid::ScenesMeeting(const Rect& r) const {
+    const Rect in = r.Intersect(Whole());
+    std::vector<std::size_t> scenes;
+    if (in.Empty())
+        return scenes;
+    const int bx0 = in.x / kBucket, bx1 = (in.x + in.width - 1) / kBucket;
+    const int by0 = in.y / kBucket, by1 = (in.y + in.height - 1) / kBucket;
+    for (int by = by0; by <= by1; ++by)
+        for (int bx = bx0; bx <= bx1; ++bx)
+            for (const std::uint32_t s : buckets[static_cast<size_t>(by) * bucketsX + bx])
+                if (!windows[s].Intersect(in).Empty())
+                    scenes.push_back(s);
+    std::sort(scenes.begin(), scenes.end());
+    scenes.erase(std::unique(scenes.begin(), scenes.end()), scenes.end());
+    return scenes;
+}
+
+std::unique_ptr<SharedRaster> RecoveryGrid::OpenOnGrid(const std::string& path,
+                                                       const char* role) const {
+    auto raster = std::make_unique<SharedRaster>();
+    raster->dataset = OpenRaster(path, role);
+    raster->path = path;
+    raster->role = role;
+    raster->window = {0, 0, raster->dataset->GetRasterXSize(), raster->dataset->GetRasterYSize()};
+    std::array<double, 6> gt{};
+    if (raster->dataset->GetGeoTransform(gt.data()) == CE_None &&
+        !LatticeOffset(geoTransform, gt, raster->window.x, raster->window.y))
+        KESTREL_THROW(DataException,
+                      FormatString("Occlusion recovery: the %s %s (%s) is not on the mosaic's "
+                                   "grid (%s)",
+                                   role, path.c_str(), Describe(gt).c_str(),
+                                   Describe(geoTransform).c_str()));
+    return raster;
+}
+
+RecoveryGrid InspectScenes(const RecoveryJob& job) {
+    if (job.scenes.empty())
+        KESTREL_THROW(DataException, "Occlusion recovery: no scenes given");
+    if ((job.pixels == 0) != (job.lines == 0))
+        KESTREL_THROW(DataException,
+                      FormatString("Occlusion recovery: a mosaic grid of %u x %u pixels; give "
+                                   "both sizes, or neither for the union of the scenes",
+                                   job.pixels, job.lines));
+    RecoveryGrid grid;
+    std::array<double, 6> lattice{};  // the first scene's grid
+    std::vector<Rect> raw;            // windows relative to the first scene
+    for (size_t s = 0; s < job.scenes.size(); ++s) {
+        const RecoveryScene& scene = job.scenes[s];
+        if (scene.dbmPixelError < 0 || scene.dbmPixelError > 1000)
+            KESTREL_THROW(DataException,
+                          FormatString("Occlusion recovery: scene %zu (%s) has DBM pixel error "
+                                       "%d; expected 0 to 1000",
+                                       s + 1, scene.orthoPath.c_str(), scene.dbmPixelError));
+        grid.halo = std::max(grid.halo, scene.dbmPixelError);
+        grid.orthos.push_back(std::make_unique<SharedRaster>());
+        grid.visibilities.push_back(std::make_unique<SharedRaster>());
+        SharedRaster& orthoFile = *grid.orthos.back();
+        SharedRaster& visibilityFile = *grid.visibilities.back();
+        orthoFile.path = scene.orthoPath, visibilityFile.path = scene.visibilityPath;
+        orthoFile.role = "ortho", visibilityFile.role = "visibility index";
+        orthoFile.pool = visibilityFile.pool = grid.pool.get();
+        orthoFile.dataset = OpenRaster(scene.orthoPath, orthoFile.role);
+        visibilityFile.dataset = OpenRaster(scene.visibilityPath, visibilityFile.role);
+        GDALDataset& ortho = *orthoFile.dataset;
+        GDALDataset& visibility = *visibilityFile.dataset;
+        std::array<double, 6> gt{};
+        const bool georeferenced = ortho.GetGeoTransform(gt.data()) == CE_None;
+        GDALRasterBand* first = ortho.GetRasterBand(1);
+        if (!georeferenced || first == nullptr)
+            KESTREL_THROW(DataException,
+                          FormatString("Occlusion recovery: %s has no %s", scene.orthoPath.c_str(),
+                                       georeferenced ? "channels" : "georeferencing"));
+        const int pixels = ortho.GetRasterXSize(), lines = ortho.GetRasterYSize();
+        const OGRSpatialReference* srs = ortho.GetSpatialRef();
+        Rect window{0, 0, pixels, lines};
+        if (s == 0) {
+            lattice = gt;
+            grid.bands = ortho.GetRasterCount();
+            grid.type = first->GetRasterDataType();
+            if (srs != nullptr)
+                grid.crs = std::make_unique<ogc::cs::ICRS>(*srs);
+            int has = 0;
+            grid.noData = first->GetNoDataValue(&has);
+            grid.hasNoData = has != 0;
+        } else {
+            const std::string& firstPath = job.scenes[0].orthoPath;
+            const bool sameCrs = (srs == nullptr) == !grid.crs &&
+                                 (srs == nullptr || grid.crs->IsSame(ogc::cs::ICRS(*srs)));
+            if (!sameCrs)
+                KESTREL_THROW(DataException,
+                              FormatString("Occlusion recovery: %s is not in the CRS of %s; the "
+                                           "orthos of one image set share one CRS",
+                                           scene.orthoPath.c_str(), firstPath.c_str()));
+            if (!LatticeOffset(lattice, gt, window.x, window.y))
+                KESTREL_THROW(DataException,
+                              FormatString("Occlusion recovery: %s (%s) is not on the grid of "
+                                           "%s (%s); the orthos of one image set share one "
+                                           "pixel size, with origins a whole number of pixels "
+                                           "apart",
+                                           scene.orthoPath.c_str(), Describe(gt).c_str(),
+                                           firstPath.c_str(), Describe(lattice).c_str()));
+            if (ortho.GetRasterCount() != grid.bands || first->GetRasterDataType() != grid.type)
+                KESTREL_THROW(DataException,
+                              FormatString("Occlusion recovery: %s has %d channels of %s, but %s "
+                                           "has %d of %s",
+                                           scene.orthoPath.c_str(), ortho.GetRasterCount(),
+                                           GDALGetDataTypeName(first->GetRasterDataType()),
+                                           firstPath.c_str(), grid.bands,
+                                           GDALGetDataTypeName(grid.type)));
+        }
+        if (visibility.GetRasterXSize() != pixels || visibility.GetRasterYSize() != lines)
+            KESTREL_THROW(
+                DataException,
+                FormatString("Occlusion recovery: the visibility index %s (%d x %d) "
+                             "does not match its ortho %s (%d x %d)",
+                             scene.visibilityPath.c_str(), visibility.GetRasterXSize(),
+                             visibility.GetRasterYSize(), scene.orthoPath.c_str(), pixels, lines));
+        raw.push_back(window);
+        // Opened again when read.
+        orthoFile.dataset.reset(), visibilityFile.dataset.reset();
+    }
+
+    // The mosaic grid: the job's, on the scenes' lattice, or the union of their windows.
+    int mx = 0, my = 0;
+    if (job.pixels > 0) {
+        const std::array<double, 6>& gt = job.geocoding.GetGeoTransform();
+        if (!LatticeOffset(lattice, gt, mx, my))
+            KESTREL_THROW(DataException,
+                          FormatString("Occlusion recovery: the mosaic grid (%s) is not on the "
+                                       "grid of the orthos (%s of %s)",
+                                       Describe(gt).c_str(), Describe(lattice).c_str(),
+                                       job.scenes[0].orthoPath.c_str()));
+        grid.geoTransform = gt;
+        grid.pixels = job.pixels, grid.lines = job.lines;
+    } else {
+        long long x0 = raw[0].x, y0 = raw[0].y, x1 = x0 + raw[0].width, y1 = y0 + raw[0].height;
+        for (const Rect& w : raw) {
+            x0 = std::min<long long>(x0, w.x), y0 = std::min<long long>(y0, w.y);
+            x1 = std::max<long long>(x1, w.x + w.width), y1 = std::max<long long>(y1, w.y + w.height);
+        }
+        if (x1 - x0 > 4000000000LL || y1 - y0 > 4000000000LL)
+            KESTREL_THROW(DataException, "Occlusion recovery: the scenes span a grid of more "
+                                         "than 4e9 pixels across");
+        mx = static_cast<int>(x0), my = static_cast<int>(y0);
+        grid.geoTransform = lattice;
+        grid.geoTransform[0] = lattice[0] + mx * lattice[1] + my * lattice[2];
+        grid.geoTransform[3] = lattice[3] + mx * lattice[4] + my * lattice[5];
+        grid.pixels = static_cast<unsigned int>(x1 - x0);
+        grid.lines = static_cast<unsigned int>(y1 - y0);
+    }
+    for (size_t s = 0; s < raw.size(); ++s) {
+        Rect w = raw[s];
+        w.x -= mx, w.y -= my;
+        grid.orthos[s]->window = grid.visibilities[s]->window = w;
+        grid.windows.push_back(w.Intersect(grid.Whole()));
+    }
+
+    grid.bucketsX = static_cast<int>((grid.pixels + RecoveryGrid::kBucket - 1) / RecoveryGrid::kBucket);
+    grid.bucketsY = static_cast<int>((grid.lines + RecoveryGrid::kBucket - 1) / RecoveryGrid::kBucket);
+    grid.buckets.resize(static_cast<size_t>(grid.bucketsX) * grid.bucketsY);
+    for (size_t s = 0; s < grid.windows.size(); ++s) {
+        const Rect& w = grid.windows[s];
+        if (w.Empty())
+            continue;
+        for (int by = w.y / RecoveryGrid::kBucket; by <= (w.y + w.height - 1) / RecoveryGrid::kBucket; ++by)
+            for (int bx = w.x / RecoveryGrid::kBucket; bx <= (w.x + w.width - 1) / RecoveryGrid::kBucket; ++bx)
+                grid.buckets[static_cast<size_t>(by) * grid.bucketsX + bx].push_back(
+                    static_cast<std::uint32_t>(s));
+    }
+    return grid;
+}
+
+SceneReader::SceneReader(const RecoveryJob& job, const RecoveryGrid& grid) : job_(job), grid_(grid) {
+    toModel_.resize(job.scenes.size());
+    for (size_t s = 0; s < job.scenes.size(); ++s) {
+        const mathmodel::IMathModel* model = job.scenes[s].model;
+        if (model != nullptr && model->GetCRS() != nullptr && grid.crs &&
+            !model->GetCRS()->IsSame(*grid.crs))
+            toModel_[s] =
+                std::make_unique<ogc::cs::CoordinateTransformation>(*grid.crs, *model->GetCRS());
+    }
+}
+
+bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
+                       SceneTile& out) const {
+    const int e = job_.scenes[s].dbmPixelError;
+    const Rect border = r.Grown(e);
+    scratch.visibility.assign(border.Size(), VISIBILITY_OUTSIDE);
+    grid_.visibilities[s]->Read({1}, border, scratch.visibility.data());
+    out.scene = s;
+    bool seesAny = false;
+    for (int j = 0; j < r.height && !seesAny; ++j) {
+        const float* line = scratch.visibility.data() + static_cast<size_t>(j + e) * border.width + e;
+        for (int i = 0; i < r.width && !seesAny; ++i)
+            seesAny = line[i] == VISIBILITY_SEEN;
+    }
+    if (!seesAny)
+        return false;
+    MarkNearHidden(scratch.visibility, r.width, r.height, e, scratch.counts, out.state);
+    for (int j = 0; j < r.height; ++j) {
+        const float* line = scratch.visibility.data() + static_cast<size_t>(j + e) * border.width + e;
+        unsigned char* state = out.state.data() + static_cast<size_t>(j) * r.width;
+        for (int i = 0; i < r.width; ++i)
+            state[i] = line[i] != VISIBILITY_SEEN ? kNotSeen : state[i] ? kUnclear : kClear;
+    }
+    if (values) {
+        std::vector<int> bands(grid_.bands);
+        for (int b = 0; b < grid_.bands; ++b)
+            bands[b] = b + 1;
+        out.values.assign(r.Size() * grid_.bands, static_cast<float>(grid_.noData));
+        grid_.orthos[s]->Read(bands, r, out.values.data());
+    }
+    if (angles) {
+        scratch.toModel.resize(toModel_.size());
+        if (toModel_[s] && !scratch.toModel[s])
+            scratch.toModel[s] = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel_[s]);
+        Angles(job_, grid_, job_.scenes[s], scratch.toModel[s].get(), r, out.angle);
+    }
+    return true;
+}
+
+// Counts of hidden pixels slide along each row and then down each column, so the cost per pixel
+// does not depend on e.
+void MarkNearHidden(const std::vector<float>& vis, int tw, int th, int e,
+                    std::vector<int>& rowCounts, std::vector<unsigned char>& near) {
+    const int span = 2 * e + 1, vw = tw + 2 * e, vh = th + 2 * e;
+    auto hidden = [](float v) { return v == VISIBILITY_HIDDEN ? 1 : 0; };
+    // rowCounts[r * tw + i]: hidden pixels of border row r in columns i to i + 2e.
+    rowCounts.assign(static_cast<size_t>(vh) * tw, 0);
+    for (int r = 0; r < vh; ++r) {
+        const float* line = vis.data() + static_cast<size_t>(r) * vw;
+        int* counts = rowCounts.data() + static_cast<size_t>(r) * tw;
+        int count = 0;
+        for (int c = 0; c < span - 1; ++c)
+            count += hidden(line[c]);
+        for (int i = 0; i < tw; ++i) {
+            count += hidden(line[i + span - 1]);
+            counts[i] = count;
+            count -= hidden(line[i]);
+        }
+    }
+    // Then over rows j to j + 2e of those counts.
+    std::vector<int> column(tw, 0);
+    for (int r = 0; r < span - 1; ++r)
+        for (int i = 0; i < tw; ++i)
+            column[i] += rowCounts[static_cast<size_t>(r) * tw + i];
+    near.assign(static_cast<size_t>(tw) * th, 0);
+    for (int j = 0; j < th; ++j) {
+        const int* entering = rowCounts.data() + static_cast<size_t>(j + span - 1) * tw;
+        const int* leaving = rowCounts.data() + static_cast<size_t>(j) * tw;
+        unsigned char* out = near.data() + static_cast<size_t>(j) * tw;
+        for (int i = 0; i < tw; ++i) {
+            column[i] += entering[i];
+            out[i] = column[i] > 0;
+            column[i] -= leaving[i];
+        }
+    }
+}
+
+}  // namespace trueortho
+}  // namespace processes
+}  // namespace kestrel

@@ -1,0 +1,183 @@
+// Occlusion recovery's inputs: the scenes' orthos and visibility indexes on windows of the
+// mosaic grid, a spatial index of those windows, and one scene read over a rectangle of the grid.
+#pragma once
+
+#include <kestrel/trueortho.h>
+
+#include "balance.h"
+#include "rasterfiles.h"
+#include "seams.h"
+
+#include <gdal.h>
+
+#include <algorithm>
+#include <array>
+#include <cmath>
+#include <cstddef>
+#include <cstdint>
+#include <limits>
+#include <list>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+namespace kestrel {
+namespace processes {
+namespace trueortho {
+
+// A rectangle of the mosaic grid, in pixels; it may reach outside the grid.
+struct Rect {
+    int x = 0, y = 0, width = 0, height = 0;
+    std::size_t Size() const { return static_cast<std::size_t>(width) * height; }
+    bool Empty() const { return width <= 0 || height <= 0; }
+    Rect Intersect(const Rect& o) const;
+    Rect Grown(int border) const {
+        return {x - border, y - border, width + 2 * border, height + 2 * border};
+    }
+};
+
+class RasterPool;
+
+// A raster of the run, shared by the threads: opened when read, and closed again by its pool
+// when too many are open. GDAL datasets serve one thread at a time, hence the lock.
+struct SharedRaster {
+    std::string path;
+    const char* role = "raster";
+    Rect window;  // where it lies on the mosaic grid
+    RasterPool* pool = nullptr;  // null: stays open
+    std::mutex mutex;
+    DatasetPtr dataset;  // while open
+    // Reads bands over `r` (mosaic pixels) into buffer (r.width x r.height per band); parts
+    // outside the raster keep what the buffer holds.
+    void Read(const std::vector<int>& bands, const Rect& r, float* buffer);
+
+  private:
+    friend class RasterPool;
+    bool listed_ = false;
+    std::list<SharedRaster*>::iterator place_;
+};
+
+// Keeps at most about `capacity` rasters open, closing the least recently read one that no
+// thread is reading, so that open files and their memory do not grow with the number of
+// scenes.
+class RasterPool {
+  public:
+    explicit RasterPool(std::size_t capacity) : capacity_(capacity) {}
+    // Marks `raster` (whose lock the caller holds) as just read.
+    void Touch(SharedRaster& raster);
+
+  private:
+    std::mutex mutex_;
+    std::list<SharedRaster*> order_;  // most recently read first
+    std::size_t capacity_;
+};
+
+struct RecoveryGrid {
+    unsigned int pixels = 0, lines = 0;
+    int bands = 0;
+    GDALDataType type = GDT_Unknown;
+    std::array<double, 6> geoTransform{};
+    std::unique_ptr<ogc::cs::ICRS> crs;
+    bool hasNoData = false;
+    double noData = 0;  // the first scene's
+    int halo = 0;       // the largest pixel error
+    // Rasters open at once: the scenes' working set on most surveys, a few tens of MB.
+    static constexpr std::size_t kOpenRasters = 128;
+    std::unique_ptr<RasterPool> pool = std::make_unique<RasterPool>(kOpenRasters);
+    std::vector<std::unique_ptr<SharedRaster>> orthos, visibilities;
+    // The scenes' windows clipped to the grid (empty when a scene lies outside it).
+    std::vector<Rect> windows;
+
+    Rect Whole() const { return {0, 0, static_cast<int>(pixels), static_cast<int>(lines)}; }
+    // The scenes whose window meets r, in the job's order.
+    std::vector<std::size_t> ScenesMeeting(const Rect& r) const;
+    // Opens a raster that must lie on the grid's lattice (a mask, the regions); throws naming it.
+    std::unique_ptr<SharedRaster> OpenOnGrid(const std::string& path, const char* role) const;
+
+    // The spatial index: square buckets of kBucket pixels, each listing the scenes whose window
+    // meets it. A query visits the buckets under its rectangle, so its cost grows with the
+    // rectangle's area times the overlap, not with the number of scenes.
+    static constexpr int kBucket = 256;
+    int bucketsX = 0, bucketsY = 0;
+    std::vector<std::vector<std::uint32_t>> buckets;
+};
+
+// Opens every scene for the whole run, checks that they lie on one lattice with one channel
+// count and data type, and lays out the mosaic grid (the job's, or the union of the windows).
+RecoveryGrid InspectScenes(const RecoveryJob& job);
+
+// One scene over a rectangle of the mosaic grid.
+struct SceneTile {
+    std::size_t scene = 0;
+    // Per pixel: kNotSeen, kClear (seen, no hidden pixel within the pixel error) or kUnclear.
+    std::vector<unsigned char> state;
+    std::vector<float> angle;   // tangent of the off-nadir angle (infinity: unknown), if asked
+    std::vector<float> values;  // `bands` planes, if asked
+};
+enum : unsigned char { kNotSeen = 0, kClear = 1, kUnclear = 2 };
+
+constexpr float kUnknownAngle = std::numeric_limits<float>::infinity();
+
+// Reads scenes over rectangles; Read may be called from several threads, each with its own
+// Scratch.
+class SceneReader {
+  public:
+    struct Scratch {
+        std::vector<float> visibility;
+        std::vector<int> counts;
+        std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;
+    };
+    SceneReader(const RecoveryJob& job, const RecoveryGrid& grid);
+    // Fills `out` for scene s over r; false (values and angles not read) when the scene sees
+    // no pixel of r.
+    bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
+              SceneTile& out) const;
+
+  private:
+    const RecoveryJob& job_;
+    const RecoveryGrid& grid_;
+    std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel_;
+};
+
+// Marks the pixels of a w x h rectangle that have a hidden pixel within e pixels (a square
+// neighbourhood); `vis` is the rectangle with a border of e pixels.
+void MarkNearHidden(const std::vector<float>& vis, int w, int h, int e,
+                    std::vector<int>& rowCounts, std::vector<unsigned char>& near);
+
+// Values as the mosaic's data type holds them: rounded and clamped for integer types.
+class ValueRange {
+  public:
+    explicit ValueRange(GDALDataType type = GDT_Float32);
+    float operator()(double v) const {
+        if (integer_)
+            v = std::round(v);
+        return static_cast<float>(std::min(hi_, std::max(lo_, v)));
+    }
+    // A value that is not `noData`, the nearest one inside the range when it is.
+    float Besides(float v, double noData) const;
+
+  private:
+    bool integer_;
+    double lo_, hi_;
+};
+
+// Metres per pixel of the grid (near enough on a geographic one).
+double PixelMetres(const RecoveryGrid& grid);
+
+// Per pair of scenes whose windows meet, the pixels both see clearly, decimated on a lattice so
+// that a pair gives at most about kPairSamples, and all pairs together about kTotalSamples
+// (but a pair at least kFewestSamples), so that the samples' memory stays within some 25 MB
+// however many scenes there are.
+constexpr double kPairSamples = 20000, kTotalSamples = 1e6, kFewestSamples = 1000;
+std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const RecoveryGrid& grid,
+                                           const SceneReader& reader, unsigned int threads,
+                                           RunControl& control);
+
+// The seam solver's view of the scenes (costs, balanced brightness, raised heights).
+std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job, const RecoveryGrid& grid,
+                                           const SceneReader& reader, const BalanceFit& fit);
+
+}  // namespace trueortho
+}  // namespace processes
+}  // namespace kestrel

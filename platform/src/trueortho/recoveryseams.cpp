@@ -1,0 +1,294 @@
+// What occlusion recovery hands the colour balance (samples where scenes overlap) and the seam
+// solver (costs, brightness and raised heights over windows of the mosaic grid).
+#include "recoverygrid.h"
+#include "runcontrol.h"
+
+#include <algorithm>
+#include <cmath>
+#include <tuple>
+#include <unordered_map>
+
+namespace kestrel {
+namespace processes {
+namespace trueortho {
+
+namespace {
+
+// The data cost of a scene at a pixel it sees: the tangent of its off-nadir angle (capped at
+// kSteepest; kUnknownAngleCost where the angle is unknown, after every known one), plus
+// kLevelStep per radiometric difference level, so that a lower level is always preferred where
+// it sees, plus kUnclearCost where a hidden pixel of the scene lies within its DBM pixel error
+// (above any difference of level, as in the choice without seamlines).
+constexpr float kSteepest = 9.0f;  // about 84 degrees off nadir
+constexpr float kUnknownAngleCost = 10.0f;
+constexpr float kLevelStep = 100.0f;
+constexpr float kUnclearCost = 1000.0f;
+// Ground estimated from the surface: a morphological opening with a square of this half-side,
+// wider than most buildings are deep, so that its floor is the ground between them.
+constexpr double kGroundRadius = 20.0;  // metres
+constexpr int kMaxGroundRadius = 256;   // cells
+
+float PixelCost(const SceneTile& tile, size_t p, int level) {
+    const float angle = tile.angle[p];
+    return (std::isinf(angle) ? kUnknownAngleCost : std::min(angle, kSteepest)) +
+           kLevelStep * static_cast<float>(level) + (tile.state[p] == kUnclear ? kUnclearCost : 0);
+}
+
+class RecoverySeamSource : public SeamSource {
+  public:
+    RecoverySeamSource(const RecoveryJob& job, const RecoveryGrid& grid, const SceneReader& reader,
+                       const BalanceFit& fit)
+        : job_(job), grid_(grid), reader_(reader), fit_(fit) {}
+
+    // Cells x0 to x0 + width - 1 (and y0 to y0 + height - 1) of factor x factor pixels. A cell is
+    // forbidden to a scene that sees under half of its pixels; otherwise its cost is the mean
+    // pixel cost over the pixels it sees, plus kUnclearCost times the share it does not see.
+    SeamWindow Read(int x0, int y0, int width, int height, int factor) override {
+        SeamWindow window;
+        window.width = width, window.height = height;
+        const size_t cells = static_cast<size_t>(width) * height;
+        const Rect pixels{x0 * factor, y0 * factor, width * factor, height * factor};
+        const Rect in = pixels.Intersect(grid_.Whole());
+        SceneReader::Scratch scratch;
+        SceneTile tile;
+        std::vector<unsigned int> seen;
+        // One scene at a time, in chunks of about 256 pixels across: the sums of its pixel costs
+        // and brightness per cell go straight into the window's arrays.
+        const int chunk = std::max(factor, 256 / factor * factor);
+        for (const size_t s : grid_.ScenesMeeting(in)) {
+            const Rect sceneIn = in.Intersect(grid_.windows[s]);
+            std::vector<float> cost, grey;
+            const int level = job_.scenes[s].radiometricLevel;
+            for (int cy = in.y; cy < in.y + in.height; cy += chunk)
+                for (int cx = in.x; cx < in.x + in.width; cx += chunk) {
+                    const Rect part = Rect{cx, cy, chunk, chunk}.Intersect(sceneIn);
+                    if (part.Empty() || !reader_.Read(s, part, true, true, scratch, tile))
+                        continue;
+                    if (cost.empty())
+                        seen.assign(cells, 0), cost.assign(cells, 0.0f), grey.assign(cells, 0.0f);
+                    for (int j = 0; j < part.height; ++j)
+                        for (int i = 0; i < part.width; ++i) {
+                            const size_t p = static_cast<size_t>(j) * part.width + i;
+                            if (tile.state[p] == kNotSeen)
+                                continue;
+                            const size_t c =
+                                static_cast<size_t>((part.y + j - pixels.y) / factor) * width +
+                                (part.x + i - pixels.x) / factor;
+                            ++seen[c];
+                            cost[c] += PixelCost(tile, p, level);
+                            double sum = 0;
+                            for (int b = 0; b < grid_.bands; ++b)
+                                sum += fit_.gain[s][b] * tile.values[part.Size() * b + p] +
+                                       fit_.offset[s][b];
+                            grey[c] += static_cast<float>(sum / grid_.bands);
+                        }
+                }
+            if (cost.empty())
+                continue;
+            bool any = false;
+            for (int cy = 0; cy < height; ++cy)
+                for (int cx = 0; cx < width; ++cx) {
+                    const size_t c = static_cast<size_t>(cy) * width + cx;
+                    const size_t total =
+                        Rect{pixels.x + cx * factor, pixels.y + cy * factor, factor, factor}
+                            .Intersect(in)
+                            .Size();
+                    if (seen[c] == 0 || 2 * static_cast<size_t>(seen[c]) < total) {
+                        cost[c] = kForbidden, grey[c] = 0;
+                        continue;
+                    }
+                    cost[c] = cost[c] / seen[c] +
+                              kUnclearCost * static_cast<float>(total - seen[c]) / total;
+                    grey[c] /= seen[c];
+                    any = true;
+                }
+            if (!any)
+                continue;
+            window.scenes.push_back(s);
+            window.cost.push_back(std::move(cost));
+            window.grey.push_back(std::move(grey));
+        }
+        window.raised = Raised(x0, y0, width, height, factor);
+        return window;
+    }
+
+  private:
+    // Heights at the centres of cells [x0, x0 + width) x [y0, y0 + height); NaN where none.
+    std::vector<float> Heights(const dem::IElevationSource& source, int x0, int y0, int width,
+                               int height, int factor) const {
+        const size_t cells = static_cast<size_t>(width) * height;
+        std::vector<double> x(cells), y(cells), h(cells);
+        const auto& g = grid_.geoTransform;
+        for (int j = 0; j < height; ++j)
+            for (int i = 0; i < width; ++i) {
+                const double p = (x0 + i + 0.5) * factor, l = (y0 + j + 0.5) * factor;
+                const size_t c = static_cast<size_t>(j) * width + i;
+                x[c] = g[0] + p * g[1] + l * g[2], y[c] = g[3] + p * g[4] + l * g[5];
+            }
+        source.GetHeights(cells, x.data(), y.data(), h.data());
+        return std::vector<float>(h.begin(), h.end());
+    }
+
+    // Metres the surface stands above the ground: against the job's ground when given, else
+    // against the surface's opening over the window with a margin of the opening's radius.
+    std::vector<float> Raised(int x0, int y0, int width, int height, int factor) const {
+        if (job_.surface == nullptr)
+            return {};
+        if (job_.ground != nullptr) {
+            std::vector<float> raised = Heights(*job_.surface, x0, y0, width, height, factor);
+            const std::vector<float> ground = Heights(*job_.ground, x0, y0, width, height, factor);
+            for (size_t c = 0; c < raised.size(); ++c) {
+                const float d = raised[c] - ground[c];
+                raised[c] = std::isfinite(d) ? std::max(0.0f, d) : 0.0f;
+            }
+            return raised;
+        }
+        const int radius = std::min(
+            kMaxGroundRadius,
+            static_cast<int>(std::ceil(kGroundRadius / (PixelMetres(grid_) * factor))));
+        const int w = width + 2 * radius, h = height + 2 * radius;
+        const std::vector<float> opened =
+            RaisedHeights(Heights(*job_.surface, x0 - radius, y0 - radius, w, h, factor), w, h,
+                          radius);
+        std::vector<float> raised(static_cast<size_t>(width) * height);
+        for (int j = 0; j < height; ++j)
+            std::copy_n(opened.begin() + static_cast<size_t>(j + radius) * w + radius, width,
+                        raised.begin() + static_cast<size_t>(j) * width);
+        return raised;
+    }
+
+    const RecoveryJob& job_;
+    const RecoveryGrid& grid_;
+    const SceneReader& reader_;
+    const BalanceFit& fit_;
+};
+
+}  // namespace
+
+double PixelMetres(const RecoveryGrid& grid) {
+    const double size = std::hypot(grid.geoTransform[1], grid.geoTransform[4]);
+    // Metres per degree on a geographic grid, near enough for a seam cost.
+    return grid.crs && grid.crs->IsGeographic() ? size * 111320.0 : size;
+}
+
+ValueRange::ValueRange(GDALDataType type) : integer_(GDALDataTypeIsInteger(type) != 0) {
+    lo_ = GDALAdjustValueToDataType(type, -1e300, nullptr, nullptr);
+    hi_ = GDALAdjustValueToDataType(type, 1e300, nullptr, nullptr);
+}
+
+float ValueRange::Besides(float v, double noData) const {
+    if (v != static_cast<float>(noData))
+        return v;
+    const double step = integer_ ? 1.0 : std::max(1e-6, std::fabs(noData) * 1e-6);
+    return static_cast<float>(noData + step <= hi_ ? noData + step : noData - step);
+}
+
+std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const RecoveryGrid& grid,
+                                           const SceneReader& reader, unsigned int threads,
+                                           RunControl& control) {
+    // The pairs of scenes whose windows meet, each with its sampling stride.
+    struct Pair {
+        size_t a, b;
+        int stride;
+    };
+    std::vector<Pair> pairs;
+    std::unordered_map<unsigned long long, size_t> index;
+    const unsigned long long count = job.scenes.size();
+    for (size_t a = 0; a < grid.windows.size(); ++a)
+        for (const size_t b : grid.ScenesMeeting(grid.windows[a])) {
+            if (b <= a)
+                continue;
+            index[a * count + b] = pairs.size();
+            pairs.push_back({a, b, 1});
+        }
+    if (pairs.empty())
+        return {};
+    const double budget = std::min(kPairSamples, std::max(kFewestSamples, kTotalSamples / pairs.size()));
+    for (Pair& pair : pairs) {
+        const double area =
+            static_cast<double>(grid.windows[pair.a].Intersect(grid.windows[pair.b]).Size());
+        pair.stride = std::max(1, static_cast<int>(std::ceil(std::sqrt(area / budget))));
+    }
+
+    // Tiles of the grid; each thread keeps its samples per tile and pair, put in order after.
+    struct Chunk {
+        size_t tile, pair;
+        std::vector<float> a, b;
+    };
+    const int side = RecoveryGrid::kBucket;
+    const unsigned int tilesX = (grid.pixels + side - 1) / side;
+    const size_t tiles = static_cast<size_t>(tilesX) * ((grid.lines + side - 1) / side);
+    struct Worker {
+        SceneReader::Scratch scratch;
+        std::vector<SceneTile> scenes;
+        std::vector<Chunk> chunks;
+    };
+    std::vector<Worker> workers(std::max(1u, threads));
+    control.RunTiles(tiles, static_cast<unsigned int>(workers.size()), "Colour balance",
+                     [&](unsigned int thread, size_t t) {
+        Worker& w = workers[thread];
+        const Rect r = Rect{static_cast<int>(t % tilesX) * side,
+                            static_cast<int>(t / tilesX) * side, side, side}
+                           .Intersect(grid.Whole());
+        const std::vector<size_t> meeting = grid.ScenesMeeting(r);
+        if (meeting.size() < 2)
+            return;
+        size_t n = 0;
+        for (const size_t s : meeting) {
+            if (w.scenes.size() <= n)
+                w.scenes.emplace_back();
+            n += reader.Read(s, r, true, false, w.scratch, w.scenes[n]) ? 1 : 0;
+        }
+        for (size_t k = 0; k < n; ++k)
+            for (size_t l = k + 1; l < n; ++l) {
+                const SceneTile &a = w.scenes[k], &b = w.scenes[l];
+                const auto found = index.find(a.scene * count + b.scene);
+                if (found == index.end())
+                    continue;
+                const int stride = pairs[found->second].stride;
+                Chunk chunk{t, found->second, {}, {}};
+                const int j0 = (stride - r.y % stride) % stride;
+                const int i0 = (stride - r.x % stride) % stride;
+                for (int j = j0; j < r.height; j += stride)
+                    for (int i = i0; i < r.width; i += stride) {
+                        const size_t p = static_cast<size_t>(j) * r.width + i;
+                        if (a.state[p] != kClear || b.state[p] != kClear)
+                            continue;
+                        for (int band = 0; band < grid.bands; ++band) {
+                            chunk.a.push_back(a.values[r.Size() * band + p]);
+                            chunk.b.push_back(b.values[r.Size() * band + p]);
+                        }
+                    }
+                if (!chunk.a.empty())
+                    w.chunks.push_back(std::move(chunk));
+            }
+    });
+    std::vector<Chunk> chunks;
+    for (Worker& w : workers)
+        std::move(w.chunks.begin(), w.chunks.end(), std::back_inserter(chunks));
+    std::sort(chunks.begin(), chunks.end(), [](const Chunk& x, const Chunk& y) {
+        return std::tie(x.pair, x.tile) < std::tie(y.pair, y.tile);
+    });
+    std::vector<OverlapSamples> overlaps;
+    for (Chunk& chunk : chunks) {
+        if (overlaps.empty() || overlaps.back().a != pairs[chunk.pair].a ||
+            overlaps.back().b != pairs[chunk.pair].b) {
+            overlaps.emplace_back();
+            overlaps.back().a = pairs[chunk.pair].a, overlaps.back().b = pairs[chunk.pair].b;
+        }
+        auto& o = overlaps.back();
+        o.valuesA.insert(o.valuesA.end(), chunk.a.begin(), chunk.a.end());
+        o.valuesB.insert(o.valuesB.end(), chunk.b.begin(), chunk.b.end());
+        std::vector<float>().swap(chunk.a), std::vector<float>().swap(chunk.b);
+    }
+    return overlaps;
+}
+
+std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job, const RecoveryGrid& grid,
+                                           const SceneReader& reader, const BalanceFit& fit) {
+    return std::make_unique<RecoverySeamSource>(job, grid, reader, fit);
+}
+
+}  // namespace trueortho
+}  // namespace processes
+}  // namespace kestrel
