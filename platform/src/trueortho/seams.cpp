@@ -220,7 +220,7 @@ namespace {
 
 // Minimises the energy from a start: per cell a label (fixed cells: theirs), or -1 for the
 // cheapest allowed one, also where the label given is not allowed. Expands every scene, or
-// only those of the start (where the start comes from a solution at a coarser level).
+// only those of the start and of the fixed cells (where the start comes from a coarser level).
 std::vector<int> Solve(const SeamWindow& window, const SeamParams& params, std::vector<int> labels,
                        bool everyScene) {
     CheckWindow(window);
@@ -230,7 +230,9 @@ std::vector<int> Solve(const SeamWindow& window, const SeamParams& params, std::
     std::vector<bool> present(static_cast<std::size_t>(scenes), everyScene);
     for (std::size_t c = 0; c < cells; ++c) {
         if (!energy.Free(c)) {
+            // A fixed neighbour's scene may go on into the free cells.
             labels[c] = window.fixed[c];
+            present[static_cast<std::size_t>(labels[c])] = true;
             continue;
         }
         if (labels[c] < 0 || !Allowed(energy.Data(c, labels[c]))) {
