@@ -1,12 +1,14 @@
 // Occlusion recovery on synthetic scenes: N x N three-channel orthos whose visibility indexes
 // hide rectangles (about a tenth of each scene), on one thread, for DBM pixel errors from 1 to
-// 64 pixels and for 4 and 16 scenes. Time and peak memory of each run, in a child process of
+// 64 pixels and for 4 and 16 scenes, the choice per pixel. Time and peak memory of each run, in a child process of
 // its own so that its peak memory is its own.
 //
 // --windows: scenes of 256 x 256 pixels on windows 128 pixels apart (each pixel in 4 scenes)
-// over grids of 512 to 2048 pixels across (9 to 225 scenes), the choice per pixel and the full
-// pipeline (balance, seamlines, blending): time per megapixel and peak memory should not grow
-// with the number of scenes.
+// over grids of 512 to 2048 pixels across (9 to 225 scenes), the choice per pixel ("per
+// pixel"), the full pipeline (balance, seamlines, blending: "full") and, up to 1024, the choice
+// per pixel on the same scenes padded to the whole grid as sparse GeoTIFFs ("padded", every
+// scene read for every tile). Time per megapixel and peak memory should not grow with the
+// number of scenes. GDAL's block cache is held to 64 MB so that peak memory is recovery's own.
 //
 //   bench_recovery [SIZE]                      default: 512
 //   bench_recovery --windows
@@ -39,19 +41,24 @@ using Clock = std::chrono::steady_clock;
 constexpr int kMaxScenes = 16;
 
 constexpr int kWindow = 256, kStep = 128;
+constexpr int kPaddedGrid = 1024;  // scenes also padded to the grid up to this size
 
+// A size x size raster at pixel (x, y) of the grid; with `padded`, a sparse GeoTIFF of the whole
+// padded x padded grid holding it (blocks outside it are not written and read as 0).
 void WriteRaster(const std::string& path, int size, int bands,
-                 const std::vector<unsigned char>& values, int x = 0, int y = 0) {
+                 const std::vector<unsigned char>& values, int x = 0, int y = 0, int padded = 0) {
     GDALDriver* gtiff = GetGDALDriverManager()->GetDriverByName("GTiff");
-    const char* options[] = {"TILED=YES", nullptr};
-    std::unique_ptr<GDALDataset> ds(gtiff->Create(path.c_str(), size, size, bands, GDT_Byte,
+    const char* options[] = {"TILED=YES", "SPARSE_OK=TRUE", nullptr};
+    const int side = padded > 0 ? padded : size;
+    std::unique_ptr<GDALDataset> ds(gtiff->Create(path.c_str(), side, side, bands, GDT_Byte,
                                                   const_cast<char**>(options)));
-    double gt[6] = {500000 + 0.5 * x, 0.5, 0, 4100000 - 0.5 * y, 0, -0.5};
+    const int ox = padded > 0 ? 0 : x, oy = padded > 0 ? 0 : y;
+    double gt[6] = {500000 + 0.5 * ox, 0.5, 0, 4100000 - 0.5 * oy, 0, -0.5};
     ds->SetGeoTransform(gt);
     for (int b = 1; b <= bands; ++b)
         ds->GetRasterBand(b)->SetNoDataValue(0);
-    if (ds->RasterIO(GF_Write, 0, 0, size, size, const_cast<unsigned char*>(values.data()), size,
-                     size, GDT_Byte, bands, nullptr, 0, 0, 0, nullptr) != CE_None)
+    if (ds->RasterIO(GF_Write, x - ox, y - oy, size, size, const_cast<unsigned char*>(values.data()),
+                     size, size, GDT_Byte, bands, nullptr, 0, 0, 0, nullptr) != CE_None)
         std::exit(1);
 }
 
@@ -86,19 +93,28 @@ void MakeWindows(const std::string& dir, int grid) {
                 const int gx = x + static_cast<int>(p % kWindow), gy = y + static_cast<int>(p / kWindow);
                 ortho[k] = static_cast<unsigned char>(gain * (60 + (gx + gy) % 100));
             }
-            WriteRaster(name + "_vis.tif", kWindow, 1, Visibility(random, kWindow), x, y);
+            const std::vector<unsigned char> vis = Visibility(random, kWindow);
+            WriteRaster(name + "_vis.tif", kWindow, 1, vis, x, y);
             WriteRaster(name + "_ortho.tif", kWindow, 3, ortho, x, y);
+            if (grid <= kPaddedGrid) {
+                WriteRaster(name + "_padded_vis.tif", kWindow, 1, vis, x, y, grid);
+                WriteRaster(name + "_padded_ortho.tif", kWindow, 3, ortho, x, y, grid);
+            }
         }
 }
 
-int RunWindows(const std::string& dir, int grid, bool pipeline) {
+// mode 0: the choice per pixel; 1: the full pipeline; 2: the choice per pixel on the scenes
+// padded to the grid.
+int RunWindows(const std::string& dir, int grid, int mode) {
+    const bool pipeline = mode == 1;
+    const std::string kind = mode == 2 ? "_padded_" : "_";
     kestrel::processes::RecoveryJob job;
     for (int y = 0; y + kWindow <= grid; y += kStep)
         for (int x = 0; x + kWindow <= grid; x += kStep) {
             const std::string name = dir + "/scene" + std::to_string(x) + "_" + std::to_string(y);
             kestrel::processes::RecoveryScene scene;
-            scene.orthoPath = name + "_ortho.tif";
-            scene.visibilityPath = name + "_vis.tif";
+            scene.orthoPath = name + kind + "ortho.tif";
+            scene.visibilityPath = name + kind + "vis.tif";
             scene.dbmPixelError = 2;
             job.scenes.push_back(scene);
         }
@@ -110,6 +126,7 @@ int RunWindows(const std::string& dir, int grid, bool pipeline) {
     }
     kestrel::processes::GeneratorSettings settings;
     settings.threadCount = 1;
+    GDALSetCacheMax64(64 << 20);
     const auto start = Clock::now();
     const auto result = kestrel::processes::OcclusionRecovery(settings).Recover(job);
     std::printf("%.3f %.1f %zu\n", std::chrono::duration<double>(Clock::now() - start).count(),
@@ -120,23 +137,26 @@ int RunWindows(const std::string& dir, int grid, bool pipeline) {
 int Windows(const char* self) {
     std::printf("scenes of %d x %d pixels every %d pixels (4 over each pixel), one thread\n",
                 kWindow, kWindow, kStep);
-    std::printf("%6s %7s %9s %10s %12s %9s\n", "grid", "scenes", "pipeline", "seconds",
+    std::printf("%6s %7s %9s %10s %12s %9s\n", "grid", "scenes", "run", "seconds",
                 "s per Mpx", "peak MB");
     for (const int grid : {512, 1024, 2048}) {
         const std::string dir =
             benchsupport::ScratchDir("recovery-windows-" + std::to_string(grid)).string();
-        if (!std::filesystem::exists(dir + "/scene0_0_ortho.tif"))
+        if (!std::filesystem::exists(dir + "/scene0_0_ortho.tif") ||
+            (grid <= kPaddedGrid && !std::filesystem::exists(dir + "/scene0_0_padded_ortho.tif")))
             MakeWindows(dir, grid);
-        for (const int pipeline : {0, 1}) {
+        for (const int mode : {2, 0, 1}) {
+            if (mode == 2 && grid > kPaddedGrid)
+                continue;
             const std::string command = std::string("\"") + self + "\" --run-windows \"" + dir +
-                                        "\" " + std::to_string(grid) + " " + std::to_string(pipeline);
+                                        "\" " + std::to_string(grid) + " " + std::to_string(mode);
             std::unique_ptr<FILE, int (*)(FILE*)> pipe(popen(command.c_str(), "r"), pclose);
             double seconds = 0, megabytes = 0;
             size_t scenes = 0;
             if (!pipe || std::fscanf(pipe.get(), "%lf %lf %zu", &seconds, &megabytes, &scenes) != 3)
                 return 1;
-            std::printf("%6d %7zu %9s %10.3f %12.3f %9.1f\n", grid, scenes,
-                        pipeline ? "full" : "per pixel", seconds,
+            const char* kinds[] = {"per pixel", "full", "padded"};
+            std::printf("%6d %7zu %9s %10.3f %12.3f %9.1f\n", grid, scenes, kinds[mode], seconds,
                         seconds / (static_cast<double>(grid) * grid / 1e6), megabytes);
         }
     }
@@ -165,6 +185,8 @@ int RunOnce(const std::string& dir, int scenes, int error) {
     }
     job.mosaicPath = dir + "/mosaic.tif";
     job.sourcePath = dir + "/source.tif";
+    job.seamlines = false, job.blendWidth = 0;  // the choice per pixel
+    job.balance = kestrel::processes::RecoveryJob::Balance::None;
     kestrel::processes::GeneratorSettings settings;
     settings.threadCount = 1;
     const auto start = Clock::now();
@@ -181,7 +203,7 @@ int main(int argc, char** argv) {
     if (argc == 5 && std::string(argv[1]) == "--run")
         return RunOnce(argv[2], std::atoi(argv[3]), std::atoi(argv[4]));
     if (argc == 5 && std::string(argv[1]) == "--run-windows")
-        return RunWindows(argv[2], std::atoi(argv[3]), std::atoi(argv[4]) != 0);
+        return RunWindows(argv[2], std::atoi(argv[3]), std::atoi(argv[4]));
     if (argc == 2 && std::string(argv[1]) == "--windows")
         return Windows(argv[0]);
     const int size = argc > 1 ? std::atoi(argv[1]) : 512;

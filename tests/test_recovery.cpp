@@ -10,6 +10,7 @@
 #include <gdal_priv.h>
 
 #include <algorithm>
+#include <cmath>
 #include <filesystem>
 #include <memory>
 #include <random>
@@ -440,6 +441,68 @@ TEST(RecoveryRegions, TheRegionsRasterChoosesWhereItsSceneSees) {
         EXPECT_NE(std::string(e.what()).find("regions.tif holds 4 at pixel 7, line 30"),
                   std::string::npos)
             << e.what();
+    }
+}
+
+// Two scenes of one texture t, the second exposed 1.2 t + 5, on overlapping windows: balanced,
+// the whole mosaic (seamlines, blending) is one linear function of t within rounding; without
+// the balance it is not. Progress over the three steps only goes forward.
+TEST(RecoveryBalance, TwoExposuresMakeOneMosaicWithoutAStep) {
+    using synthetic::kWidth;
+    TempDir dir;
+    const std::vector<synthetic::Window> windows = {{0, 0, 45, 50}, {25, 0, 45, 50}};
+    std::vector<double> texture(kWidth * synthetic::kHeight);
+    for (size_t k = 0; k < texture.size(); ++k)
+        texture[k] = 40 + (k % kWidth * 7 + k / kWidth * 13) % 120;
+    RecoveryJob job;
+    for (int s = 0; s < 2; ++s) {
+        std::vector<unsigned char> ortho(texture.size());
+        for (size_t k = 0; k < ortho.size(); ++k)
+            ortho[k] = static_cast<unsigned char>(std::lround(s == 0 ? texture[k] : 1.2 * texture[k] + 5));
+        const std::string name = "exposure" + std::to_string(s);
+        synthetic::WriteBand(dir.File(name + "_ortho.tif"), ortho, windows[s]);
+        synthetic::WriteBand(dir.File(name + "_vis.tif"),
+                             std::vector<unsigned char>(ortho.size(), VISIBILITY_SEEN), windows[s]);
+        RecoveryScene scene;
+        scene.orthoPath = dir.File(name + "_ortho.tif");
+        scene.visibilityPath = dir.File(name + "_vis.tif");
+        job.scenes.push_back(scene);
+    }
+    job.mosaicPath = dir.File("mosaic.tif");
+    job.sourcePath = dir.File("source.tif");
+    job.tileSize = 16;
+    for (const auto balance : {RecoveryJob::Balance::GainOffset, RecoveryJob::Balance::None}) {
+        job.balance = balance;
+        std::vector<double> fractions;
+        OcclusionRecovery recovery;
+        recovery.SetProgress(
+            [](double fraction, const char*, void* data) {
+                static_cast<std::vector<double>*>(data)->push_back(fraction);
+                return true;
+            },
+            &fractions);
+        const TorthoRecoveryResult result = recovery.Recover(job);
+        ASSERT_TRUE(result.completed);
+        EXPECT_TRUE(std::is_sorted(fractions.begin(), fractions.end()));
+        EXPECT_EQ(fractions.back(), 1.0);
+        ASSERT_EQ(result.gain.size(), 2u);
+        const auto mosaic = ReadBand(job.mosaicPath);
+        // The least-squares line of the mosaic against t, and the largest residual.
+        double n = 0, st = 0, sm = 0, stt = 0, stm = 0;
+        for (size_t k = 0; k < mosaic.size(); ++k)
+            n += 1, st += texture[k], sm += mosaic[k], stt += texture[k] * texture[k],
+                stm += texture[k] * mosaic[k];
+        const double a = (n * stm - st * sm) / (n * stt - st * st), b = (sm - a * st) / n;
+        double worst = 0;
+        for (size_t k = 0; k < mosaic.size(); ++k)
+            worst = std::max(worst, std::fabs(mosaic[k] - (a * texture[k] + b)));
+        if (balance == RecoveryJob::Balance::None) {
+            EXPECT_GT(worst, 10);
+            EXPECT_EQ(result.gain[1][0], 1.0);
+        } else {
+            EXPECT_LE(worst, 1.5);
+            EXPECT_NEAR(result.gain[0][0] / result.gain[1][0], 1.2, 0.01);
+        }
     }
 }
 

@@ -357,10 +357,19 @@ TEST(ChooseRegions, TilesMeetAlongOneSeamAroundRaisedGround) {
     params.tile = 64;
 
     // Every pixel handed once, in windows of at most a tile; the same on any number of threads.
+    // Progress rises over the passes to the end of the run's span.
     auto choose = [&](unsigned int threads) {
         std::vector<std::uint16_t> labels(static_cast<std::size_t>(pixels) * lines, 0xffff);
         int windows = 0;
-        RunControl control(nullptr, nullptr, nullptr);
+        std::vector<double> fractions;
+        RunControl control(
+            nullptr,
+            [](double fraction, const char*, void* data) {
+                static_cast<std::vector<double>*>(data)->push_back(fraction);
+                return true;
+            },
+            &fractions);
+        control.SetSpan(0.5, 0.25);
         ChooseRegions(source, pixels, lines, params, threads, control,
                       [&](int x0, int y0, int w, int h, const std::vector<std::uint16_t>& out) {
                           ++windows;
@@ -375,6 +384,10 @@ TEST(ChooseRegions, TilesMeetAlongOneSeamAroundRaisedGround) {
                               }
                       });
         EXPECT_EQ(windows, 5 * 4);
+        EXPECT_TRUE(std::is_sorted(fractions.begin(), fractions.end()));
+        EXPECT_EQ(fractions.front(), 0.5);
+        EXPECT_DOUBLE_EQ(fractions.back(), 0.75);
+        EXPECT_EQ(control.SpanStart(), 0.5);
         return labels;
     };
     const std::vector<std::uint16_t> labels = choose(2);

@@ -47,7 +47,8 @@ struct Composition {
 struct Worker {
     SceneReader::Scratch scratch;
     std::vector<SceneTile> scenes;
-    std::vector<int> slot;  // per job scene: its index among the tile's scenes, or -1
+    std::vector<int> sceneSlot;  // per job scene: its index among the tile's scenes, or -1
+    std::vector<int> slot;       // per tile scene: its index among those holding a region
     std::vector<float> regions, mask, blended;
     trueortho::BlendTile blend;
 };
@@ -101,7 +102,7 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
             return;
         if (w.scenes.size() <= n)
             w.scenes.emplace_back();
-        n += c.reader.Read(s, r, true, true, w.scratch, w.scenes[n]) ? 1 : 0;
+        n += c.reader.Read(s, r, false, true, w.scratch, w.scenes[n]) ? 1 : 0;
     }
 
     // Regions: the raster's scene where it sees the pixel, else the first ranked.
@@ -110,9 +111,11 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
     for (size_t p = 0; p < size; ++p)
         labels[p] = FirstRanked(job, w.scenes, n, p);
     if (c.regions != nullptr) {
-        w.slot.assign(job.scenes.size(), -1);
+        // Set for the tile's scenes only, and reset after, so that a tile costs nothing per
+        // scene of the job.
+        w.sceneSlot.resize(job.scenes.size(), -1);
         for (size_t k = 0; k < n; ++k)
-            w.slot[w.scenes[k].scene] = static_cast<int>(k);
+            w.sceneSlot[w.scenes[k].scene] = static_cast<int>(k);
         w.regions.assign(size, 0.0f);
         c.regions->Read({1}, r, w.regions.data());
         for (size_t p = 0; p < size; ++p) {
@@ -128,10 +131,12 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
                                            r.x + static_cast<int>(p % r.width),
                                            r.y + static_cast<int>(p / r.width),
                                            job.scenes.size()));
-            const int k = w.slot[static_cast<size_t>(v) - 1];
+            const int k = w.sceneSlot[static_cast<size_t>(v) - 1];
             if (k >= 0 && w.scenes[k].state[p] != trueortho::kNotSeen)
                 labels[p] = k;
         }
+        for (size_t k = 0; k < n; ++k)
+            w.sceneSlot[w.scenes[k].scene] = -1;
     }
     if (c.mask != nullptr) {
         // Outside the mask (and outside its raster) the pixels stay empty.
@@ -142,33 +147,48 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
                 labels[p] = -1;
     }
 
-    // The balance, then the blend.
+    // The scenes that hold a region here (the others weigh nothing in the blend): their
+    // values, balanced.
     trueortho::BlendTile& blend = w.blend;
     blend.width = r.width, blend.height = r.height, blend.border = c.border, blend.bands = bands;
-    blend.scenes.resize(n);
-    blend.values.resize(n);
-    blend.seen.resize(n);
+    w.slot.assign(n, -1);
+    for (const int label : labels)
+        if (label >= 0)
+            w.slot[label] = 0;
+    size_t used = 0;
+    for (size_t k = 0; k < n; ++k)
+        if (w.slot[k] == 0)
+            w.slot[k] = static_cast<int>(used++);
+    for (int& label : labels)
+        if (label >= 0)
+            label = w.slot[label];
+    blend.scenes.resize(used);
+    blend.values.resize(used);
+    blend.seen.resize(used);
     for (size_t k = 0; k < n; ++k) {
-        SceneTile& scene = w.scenes[k];
-        blend.scenes[k] = scene.scene;
-        blend.seen[k].resize(size);
+        if (w.slot[k] < 0)
+            continue;
+        const size_t u = static_cast<size_t>(w.slot[k]);
+        const SceneTile& scene = w.scenes[k];
+        blend.scenes[u] = scene.scene;
+        std::vector<unsigned char>& seen = blend.seen[u];
+        seen.resize(size);
         for (size_t p = 0; p < size; ++p)
-            blend.seen[k][p] = scene.state[p] != trueortho::kNotSeen;
+            seen[p] = scene.state[p] != trueortho::kNotSeen;
+        std::vector<float>& values = blend.values[u];
+        c.reader.ReadValues(scene.scene, r, values);
         for (int b = 0; b < bands; ++b) {
             const double gain = c.fit.gain[scene.scene][b], offset = c.fit.offset[scene.scene][b];
             if (gain == 1 && offset == 0)
                 continue;
-            float* v = scene.values.data() + size * b;
+            float* v = values.data() + size * b;
             for (size_t p = 0; p < size; ++p)
-                if (blend.seen[k][p])
+                if (seen[p])
                     v[p] = c.range(gain * v[p] + offset);
         }
-        blend.values[k].swap(scene.values);
     }
     const float noData = static_cast<float>(c.grid.noData);
     trueortho::BlendRegions(blend, c.blend, static_cast<int>(job.blendWidth), noData, w.blended);
-    for (size_t k = 0; k < n; ++k)
-        blend.values[k].swap(w.scenes[k].values);
 
     gobs::Raster mosaic(t.width, t.height, bands, datasources::DataType::Float32,
                         gobs::Raster::Initial::Unset);
@@ -300,6 +320,8 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
         : job.balance == RecoveryJob::Balance::Gain ? trueortho::BalanceMode::Gain
                                                     : trueortho::BalanceMode::GainOffset;
     std::vector<trueortho::OverlapSamples> overlaps;
+    // Progress: a fifth for the balance, two for the regions, two for the composition.
+    control.SetSpan(0.0, 0.2);
     if (balance != trueortho::BalanceMode::None && job.scenes.size() > 1)
         overlaps = trueortho::GatherOverlaps(job, grid, reader, threads, control);
     if (control.Stopped())
@@ -310,6 +332,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
 
     // 2. The regions: the job's raster, seamlines, or none (the first-ranked scene per pixel).
     ScratchFile scratch;
+    control.SetSpan(0.2, 0.4);
     if (!regions && job.seamlines) {
         regions = ChooseSeamlines(job, grid, reader, fit, threads, control, scratch);
         if (control.Stopped())
@@ -338,6 +361,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
                                   trueortho::ValueRange(grid.type),
                                   mosaic.get(),
                                   source.get()};
+    control.SetSpan(0.6, 0.4);
     std::vector<TorthoRecoveryResult> counts(threads);
     std::vector<Worker> workers(threads);
     control.RunTiles(tiles, threads, "Occlusion recovery", [&](unsigned int thread, size_t index) {

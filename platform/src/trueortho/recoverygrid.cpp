@@ -364,13 +364,8 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
         for (int i = 0; i < r.width; ++i)
             state[i] = line[i] != VISIBILITY_SEEN ? kNotSeen : state[i] ? kUnclear : kClear;
     }
-    if (values) {
-        std::vector<int> bands(grid_.bands);
-        for (int b = 0; b < grid_.bands; ++b)
-            bands[b] = b + 1;
-        out.values.assign(r.Size() * grid_.bands, static_cast<float>(grid_.noData));
-        grid_.orthos[s]->Read(bands, r, out.values.data());
-    }
+    if (values)
+        ReadValues(s, r, out.values);
     if (angles) {
         scratch.toModel.resize(toModel_.size());
         if (toModel_[s] && !scratch.toModel[s])
@@ -378,6 +373,14 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
         Angles(job_, grid_, job_.scenes[s], scratch.toModel[s].get(), r, out.angle);
     }
     return true;
+}
+
+void SceneReader::ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const {
+    std::vector<int> bands(grid_.bands);
+    for (int b = 0; b < grid_.bands; ++b)
+        bands[b] = b + 1;
+    values.assign(r.Size() * grid_.bands, static_cast<float>(grid_.noData));
+    grid_.orthos[s]->Read(bands, r, values.data());
 }
 
 // Counts of hidden pixels slide along each row and then down each column, so the cost per pixel

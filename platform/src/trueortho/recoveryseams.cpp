@@ -89,10 +89,12 @@ class RecoverySeamSource : public SeamSource {
             for (int cy = 0; cy < height; ++cy)
                 for (int cx = 0; cx < width; ++cx) {
                     const size_t c = static_cast<size_t>(cy) * width + cx;
-                    const size_t total =
-                        Rect{pixels.x + cx * factor, pixels.y + cy * factor, factor, factor}
-                            .Intersect(in)
-                            .Size();
+                    // The cell's pixels inside the grid (fewer at its right and bottom edges).
+                    const int left = pixels.x + cx * factor, top = pixels.y + cy * factor;
+                    const int across = std::min(left + factor, in.x + in.width) - std::max(left, in.x);
+                    const int down = std::min(top + factor, in.y + in.height) - std::max(top, in.y);
+                    const size_t total = static_cast<size_t>(std::max(0, across)) *
+                                         static_cast<size_t>(std::max(0, down));
                     if (seen[c] == 0 || 2 * static_cast<size_t>(seen[c]) < total) {
                         cost[c] = kForbidden, grey[c] = 0;
                         continue;

@@ -27,7 +27,7 @@ void RunControl::RunTiles(std::size_t count, unsigned int threads, const char* m
     std::size_t done = 0;
     std::exception_ptr failure;
     std::mutex failureMutex;
-    if (progress_ != nullptr && !progress_(0.0, message, userData_))
+    if (progress_ != nullptr && !progress_(spanStart_, message, userData_))
         cancelled_ = true, stop_ = true;
     auto run = [&](unsigned int thread) {
         for (std::size_t index; !Stopped() && (index = next++) < count;) {
@@ -45,7 +45,8 @@ void RunControl::RunTiles(std::size_t count, unsigned int threads, const char* m
             std::lock_guard<std::mutex> lock(progressMutex_);
             ++done;
             if (progress_ != nullptr &&
-                !progress_(static_cast<double>(done) / count, message, userData_))
+                !progress_(spanStart_ + spanShare_ * static_cast<double>(done) / count, message,
+                           userData_))
                 cancelled_ = true, stop_ = true;
         }
     };

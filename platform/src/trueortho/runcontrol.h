@@ -29,7 +29,14 @@ class RunControl {
     void RunTiles(std::size_t count, unsigned int threads, const char* message,
                   const std::function<void(unsigned int thread, std::size_t index)>& work);
 
+    // Later runs report their progress within [start, start + share] of the whole, for a run
+    // of several steps.
+    void SetSpan(double start, double share) { spanStart_ = start, spanShare_ = share; }
+    double SpanStart() const { return spanStart_; }
+    double SpanShare() const { return spanShare_; }
+
   private:
+    double spanStart_ = 0, spanShare_ = 1;
     const bool* cancel_;
     ProgressFunc progress_;
     void* userData_;

@@ -28,6 +28,8 @@ constexpr int kMinFactor = 4;
 constexpr std::size_t kMaxCoarseCells = std::size_t{16} << 20;
 // Coarse cells either side of a coarse seam left free at full resolution.
 constexpr int kBand = 3;
+// The share of the progress the coarse pass takes.
+constexpr double kCoarseShare = 0.2;
 
 std::size_t Cells(const SeamWindow& w) {
     return static_cast<std::size_t>(w.width) * static_cast<std::size_t>(w.height);
@@ -397,8 +399,10 @@ struct TileEdges {
 class RegionChooser {
   public:
     RegionChooser(SeamSource& source, unsigned int pixels, unsigned int lines,
-                  const SeamParams& params)
+                  const SeamParams& params, const RunControl& control)
         : source_(source),
+          spanStart_(control.SpanStart()),
+          spanShare_(control.SpanShare()),
           params_(params),
           tile_(std::max(16, params.tile)),
           factor_(CoarseFactor(pixels, lines, params.pixelSize)),
@@ -416,7 +420,7 @@ class RegionChooser {
     void SolveCoarse(unsigned int threads, RunControl& control) {
         const int margin = tile_ / 16;
         ByColour(
-            blocks_, threads, control, "Choosing seamlines (coarse)",
+            blocks_, threads, control, "Choosing seamlines (coarse)", 0.0, kCoarseShare,
             [&](int colour, std::size_t, const Chessboard::Square& core) {
                 const Chessboard::Square win = blocks_.Widened(core, colour == 0 ? margin : 1);
                 SeamWindow window = Read(win, factor_);
@@ -440,7 +444,7 @@ class RegionChooser {
         std::vector<TileEdges> edges(static_cast<std::size_t>(fine_.Across()) * fine_.Down());
         std::mutex sinkMutex;
         ByColour(
-            fine_, threads, control, "Choosing seamlines",
+            fine_, threads, control, "Choosing seamlines", kCoarseShare, 1.0,
             [&](int colour, std::size_t square, const Chessboard::Square& core) {
                 const Chessboard::Square win = fine_.Widened(core, colour);
                 SeamWindow window = Read(win, 1);
@@ -470,11 +474,14 @@ class RegionChooser {
     }
 
   private:
-    // work(colour, index, square) for the squares of one colour, then of the other, on threads.
+    // work(colour, index, square) for the squares of one colour, then of the other, on threads,
+    // their progress from `from` to `to` of the run's span.
     template <typename Work>
-    static void ByColour(const Chessboard& board, unsigned int threads, RunControl& control,
-                         const char* message, Work work) {
+    void ByColour(const Chessboard& board, unsigned int threads, RunControl& control,
+                  const char* message, double from, double to, Work work) const {
         for (int colour = 0; colour < 2 && !control.Stopped(); ++colour) {
+            const double half = (to - from) / 2;
+            control.SetSpan(spanStart_ + spanShare_ * (from + colour * half), spanShare_ * half);
             const std::vector<std::size_t> squares = board.Squares(colour);
             control.RunTiles(squares.size(), threads, message, [&](unsigned int, std::size_t i) {
                 work(colour, squares[i], board.Get(squares[i]));
@@ -586,6 +593,7 @@ class RegionChooser {
     }
 
     SeamSource& source_;
+    const double spanStart_, spanShare_;  // the run's progress span, shared by the passes
     const SeamParams params_;
     SeamParams coarseParams_;
     const int tile_, factor_, cw_, ch_;
@@ -604,10 +612,12 @@ void ChooseRegions(SeamSource& source, unsigned int pixels, unsigned int lines,
     if (!(params.pixelSize > 0))
         KESTREL_THROW(DataException, "seamlines: pixel size " + std::to_string(params.pixelSize) +
                                          " m is not positive");
-    RegionChooser chooser(source, pixels, lines, params);
+    const double spanStart = control.SpanStart(), spanShare = control.SpanShare();
+    RegionChooser chooser(source, pixels, lines, params, control);
     chooser.SolveCoarse(threads, control);
     if (!control.Stopped())
         chooser.Refine(threads, control, sink);
+    control.SetSpan(spanStart, spanShare);
 }
 
 }  // namespace trueortho
