@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <cfloat>
 #include <cmath>
 #include <cstdio>
 #include <cstring>
@@ -208,6 +209,74 @@ CityOptions BenchCity(unsigned int imageSize) {
     return o;
 }
 
+CityOptions BlockCity(unsigned int rows, unsigned int cols, unsigned int imageSize, double gsd) {
+    if (rows == 0 || cols == 0 || imageSize == 0 || !(gsd > 0))
+        KESTREL_THROW(DataException, "Sample block: rows, columns, image size and GSD must be positive");
+    CityOptions o;
+    o.south = 5033700.0;  // with west, a whole multiple of 1.5 m: of the DSM pixel and the GSD
+    o.dsmPixel = 0.5;
+    o.slopeX = 0.01, o.slopeY = -0.005;
+    const double footprint = imageSize * gsd, base = 0.4 * footprint, spacing = 0.7 * footprint;
+    const double margin = 0.1 * footprint;
+    auto whole = [](double v) { return 1.5 * std::ceil(v / 1.5); };
+    o.sizeX = whole((cols - 1) * base + footprint + 2 * margin);
+    o.sizeY = whole((rows - 1) * spacing + footprint + 2 * margin);
+    // City blocks 60 m wide between the texture's north-south streets (at whole multiples of 60
+    // m from the west edge), three lots across and one every 20 m northwards; some lots empty.
+    auto snap = [&](double v) { return o.dsmPixel * std::round(v / o.dsmPixel); };
+    for (double y = 2; y + 20 <= o.sizeY; y += 20)
+        for (double x = 6; x + 16 <= o.sizeX; x += std::fmod(x, 60.0) > 37 ? 28 : 16) {
+            const std::uint64_t key = static_cast<std::uint64_t>(x * 7919 + y * 104729);
+            if (Hash01(key) < 0.15)
+                continue;
+            const double w = 8 + 6 * Hash01(key + 1), d = 8 + 8 * Hash01(key + 2);
+            const double x0 = snap(x + (14 - w) * Hash01(key + 3)), y0 = snap(y + (16 - d) * Hash01(key + 4));
+            const double u = Hash01(key + 5);
+            const double height = Hash01(key + 6) < 0.06 ? 30 + 20 * u : 3 + 21 * u * u;
+            o.buildings.push_back({x0, y0, snap(x0 + w), snap(y0 + d), std::round(height)});
+        }
+    for (unsigned int r = 0; r < rows; ++r)
+        for (unsigned int c = 0; c < cols; ++c) {
+            char name[32];
+            std::snprintf(name, sizeof name, "r%02uc%02u", r + 1, c + 1);
+            CameraSpec camera{name, r % 2 == 0 ? 90.0 : 270.0, 0.0, 1.2 * footprint,
+                              imageSize, imageSize, gsd};
+            camera.targetX = margin + footprint / 2 + c * base;
+            camera.targetY = margin + footprint / 2 + r * spacing;
+            o.cameras.push_back(camera);
+        }
+    return o;
+}
+
+double ExposureGain(const CityOptions& options, std::size_t index) {
+    const double u = Hash01(options.seed * 0x9e3779b97f4a7c15ULL + 1000003u * (index + 1));
+    return 1.0 + options.exposureSpread / 100.0 * (2 * u - 1);
+}
+
+std::vector<Building> PerturbedBuildings(const CityOptions& options) {
+    std::vector<Building> buildings = options.buildings;
+    if (options.dsmError == 0)
+        return buildings;
+    const double px = options.dsmPixel;
+    for (std::size_t k = 0; k < buildings.size(); ++k) {
+        Building& b = buildings[k];
+        double* edges[4] = {&b.x0, &b.y0, &b.x1, &b.y1};
+        for (int e = 0; e < 4; ++e) {
+            const std::uint64_t key = options.seed * 0xbf58476d1ce4e5b9ULL + 4 * k + e;
+            const double pixels =
+                1 + std::min<double>(options.dsmError - 1, std::floor(Hash01(key) * options.dsmError));
+            const double outward = e < 2 ? -1 : 1;
+            *edges[e] += (Hash01(key + 0x51ed27) < 0.5 ? outward : -outward) * pixels * px;
+        }
+        // At least one pixel wide: a moved edge does not pass the opposite one.
+        if (b.x1 - b.x0 < px)
+            b.x1 = b.x0 + px;
+        if (b.y1 - b.y0 < px)
+            b.y1 = b.y0 + px;
+    }
+    return buildings;
+}
+
 // ---------------------------------------------------------------------------------------------
 // Surface
 
@@ -247,6 +316,30 @@ Dsm::Dsm(const CityOptions& options) : options_(options) {
     }
     const auto range = std::minmax_element(posts_.begin(), posts_.end());
     minHeight_ = *range.first, maxHeight_ = *range.second;
+    // The highest post of each block, then of the 3 x 3 blocks around it.
+    blocksX_ = (width_ + kBlock - 1) / kBlock, blocksY_ = (height_ + kBlock - 1) / kBlock;
+    std::vector<float> own(static_cast<size_t>(blocksX_) * blocksY_, -FLT_MAX);
+    for (unsigned int j = 0; j < height_; ++j)
+        for (unsigned int i = 0; i < width_; ++i) {
+            float& m = own[(j / kBlock) * blocksX_ + i / kBlock];
+            m = std::max(m, posts_[static_cast<size_t>(j) * width_ + i]);
+        }
+    blockMax_.assign(own.size(), -FLT_MAX);
+    for (unsigned int bj = 0; bj < blocksY_; ++bj)
+        for (unsigned int bi = 0; bi < blocksX_; ++bi)
+            for (unsigned int nj = bj > 0 ? bj - 1 : 0; nj <= std::min(bj + 1, blocksY_ - 1); ++nj)
+                for (unsigned int ni = bi > 0 ? bi - 1 : 0; ni <= std::min(bi + 1, blocksX_ - 1);
+                     ++ni)
+                    blockMax_[bj * blocksX_ + bi] =
+                        std::max(blockMax_[bj * blocksX_ + bi], own[nj * blocksX_ + ni]);
+}
+
+float Dsm::NearbyMax(double x, double y) const {
+    const double fx = (x - options_.west) / options_.dsmPixel;
+    const double fy = (options_.south + options_.sizeY - y) / options_.dsmPixel;
+    const auto bi = static_cast<unsigned int>(std::min(std::max(fx, 0.0), width_ - 1.0)) / kBlock;
+    const auto bj = static_cast<unsigned int>(std::min(std::max(fy, 0.0), height_ - 1.0)) / kBlock;
+    return blockMax_[static_cast<size_t>(bj) * blocksX_ + bi];
 }
 
 double Dsm::Ground(double x, double y) const {
@@ -291,6 +384,11 @@ bool Dsm::Intersect(const Vec3& origin, const Vec3& dir, Vec3& hit) const {
         const double x = origin[0] + tt * dir[0], y = origin[1] + tt * dir[1];
         return origin[2] + tt * dir[2] - HeightAt(x, y);
     };
+    // Steps of half a DSM pixel across the ground (so that no wall is stepped over), or longer
+    // ones while the ray stays above everything within (kBlock - 1) pixels.
+    const double across = std::sqrt(dir[0] * dir[0] + dir[1] * dir[1]);
+    const double fine = across > 0 ? step / across : HUGE_VAL;
+    const double reach = across > 0 ? (kBlock - 1) * options_.dsmPixel / across : HUGE_VAL;
     double previous = t;
     for (;;) {
         const double x = origin[0] + t * dir[0], y = origin[1] + t * dir[1];
@@ -298,13 +396,16 @@ bool Dsm::Intersect(const Vec3& origin, const Vec3& dir, Vec3& hit) const {
             return false;
         if (above(t) <= 0)
             break;
-        if (origin[2] + t * dir[2] < minHeight_ - 1)
+        const double z = origin[2] + t * dir[2];
+        if (z < minHeight_ - 1)
             return false;
         previous = t;
-        t += step;
+        const double clearance = z - NearbyMax(x, y);
+        t += std::max(fine, clearance > 0 ? std::min(clearance / -dir[2], reach) : 0.0);
     }
+    // To a tenth of a millimetre along the ray.
     double lo = previous, hi = t;
-    for (int k = 0; k < 30; ++k) {
+    for (int k = 0; k < 60 && hi - lo > 1e-4; ++k) {
         const double mid = 0.5 * (lo + hi);
         (above(mid) > 0 ? lo : hi) = mid;
     }
@@ -342,15 +443,18 @@ void WriteDsm(const Dsm& dsm, const std::string& path) {
 
 FrameCamera::FrameCamera(const CameraSpec& spec, const Dsm& dsm) : spec_(spec) {
     const CityOptions& o = dsm.Options();
-    const double cx = o.west + o.sizeX / 2, cy = o.south + o.sizeY / 2;
+    const double cx = o.west + (std::isnan(spec.targetX) ? o.sizeX / 2 : spec.targetX);
+    const double cy = o.south + (std::isnan(spec.targetY) ? o.sizeY / 2 : spec.targetY);
     const Vec3 target = {cx, cy, dsm.Ground(cx, cy)};
     const double az = spec.azimuthDegrees * kPi / 180, tilt = spec.offNadirDegrees * kPi / 180;
     const double horizontal = spec.altitude * std::tan(tilt);
     const Vec3 centre = {target[0] + horizontal * std::sin(az),
                          target[1] + horizontal * std::cos(az), target[2] + spec.altitude};
-    // Axes in the local map frame at the centre: looking at the target, no roll.
+    // Axes in the local map frame at the centre: looking at the target, no roll; straight down,
+    // the top of the image towards the azimuth.
     const Vec3 forward = Normalised(Sub(target, centre));
-    const Vec3 right = Normalised(Cross(forward, {0.0, 0.0, 1.0}));
+    const Vec3 right = tilt == 0.0 ? Vec3{std::cos(az), -std::sin(az), 0.0}
+                                   : Normalised(Cross(forward, {0.0, 0.0, 1.0}));
     const Vec3 down = Cross(forward, right);
     intrinsics_.width = spec.width, intrinsics_.height = spec.height;
     intrinsics_.fx = intrinsics_.fy = spec.altitude / std::cos(tilt) / spec.groundSampleDistance;
@@ -538,7 +642,7 @@ std::array<std::uint8_t, 3> Texture(const Dsm& dsm, double x, double y, double z
     const double e = 0.05 * dsm.Options().dsmPixel;
     const double gx = (dsm.HeightAt(x + e, y) - dsm.HeightAt(x - e, y)) / (2 * e);
     const double gy = (dsm.HeightAt(x, y + e) - dsm.HeightAt(x, y - e)) / (2 * e);
-    if (std::hypot(gx, gy) > 1.5) {  // a wall: horizontal courses
+    if (gx * gx + gy * gy > 1.5 * 1.5) {  // a wall: horizontal courses
         const double v = 95 + 25 * std::sin(z * 1.9 + phase) + 10 * std::sin((x + y) * 0.7);
         return {ToByte(v), ToByte(v - 5), ToByte(v - 10)};
     }
@@ -560,32 +664,13 @@ std::array<std::uint8_t, 3> Texture(const Dsm& dsm, double x, double y, double z
 
 namespace {
 
-void RenderImage(const FrameCamera& camera, const Dsm& dsm, const Rpc& rpc, const std::string& path,
-                 std::uint64_t seed, unsigned int threads) {
-    const unsigned int w = camera.Spec().width, h = camera.Spec().height;
-    std::vector<std::uint8_t> pixels(static_cast<size_t>(w) * h * 3, 0);
+// Runs rowWork(row) for rows 0 .. rows - 1 on `threads` threads (0: the hardware's count).
+template <typename RowWork>
+void ForEachRow(unsigned int rows, unsigned int threads, const RowWork& rowWork) {
     std::atomic<unsigned int> nextRow{0};
     auto work = [&] {
-        std::vector<double> cols(w), rows(w), origins(3 * w), dirs(3 * w);
-        for (unsigned int c = 0; c < w; ++c)
-            cols[c] = c + 0.5;
-        for (unsigned int r; (r = nextRow++) < h;) {
-            std::fill(rows.begin(), rows.end(), r + 0.5);
-            camera.Rays(w, cols.data(), rows.data(), origins.data(), dirs.data());
-            for (unsigned int c = 0; c < w; ++c) {
-                const Vec3 o = {origins[3 * c], origins[3 * c + 1], origins[3 * c + 2]};
-                const Vec3 d = {dirs[3 * c], dirs[3 * c + 1], dirs[3 * c + 2]};
-                Vec3 hit;
-                if (std::isnan(d[0]) || !dsm.Intersect(o, d, hit))
-                    continue;  // off the surface model: background 0
-                const auto rgb = Texture(dsm, hit[0], hit[1], hit[2], seed);
-                std::uint8_t* p = &pixels[(static_cast<size_t>(r) * w + c) * 3];
-                // 0 is kept for the background.
-                p[0] = std::max<std::uint8_t>(rgb[0], 1);
-                p[1] = std::max<std::uint8_t>(rgb[1], 1);
-                p[2] = std::max<std::uint8_t>(rgb[2], 1);
-            }
-        }
+        for (unsigned int r; (r = nextRow++) < rows;)
+            rowWork(r);
     };
     if (threads == 0)
         threads = std::max(1u, std::thread::hardware_concurrency());
@@ -595,51 +680,148 @@ void RenderImage(const FrameCamera& camera, const Dsm& dsm, const Rpc& rpc, cons
     work();
     for (auto& t : pool)
         t.join();
+}
 
+// Writes width x height pixel-interleaved RGB bytes as a tiled GeoTIFF with no-data 0 (DEFLATE
+// when georeferenced: the ideal image is large and mostly smooth); the metadata items
+// (NAME=VALUE) go into the given domain.
+void WriteRgb(const std::string& path, const std::vector<std::uint8_t>& pixels, unsigned int w,
+              unsigned int h, const std::array<double, 6>* geoTransform, const ICRS* crs,
+              std::vector<std::string> metadata, const char* domain) {
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
-    const char* options[] = {"TILED=YES", "INTERLEAVE=PIXEL", "PHOTOMETRIC=RGB", nullptr};
+    const char* options[] = {"TILED=YES", "INTERLEAVE=PIXEL", "PHOTOMETRIC=RGB",
+                             geoTransform != nullptr ? "COMPRESS=DEFLATE" : nullptr, nullptr};
     DatasetPtr ds(driver->Create(path.c_str(), static_cast<int>(w), static_cast<int>(h), 3,
                                  GDT_Byte, const_cast<char**>(options)));
     if (!ds)
         KESTREL_THROW(DataException, FormatString("%s: cannot create the image: %s", path.c_str(),
                                                   CPLGetLastErrorMsg()));
-    std::vector<std::string> items = rpc.ToMetadata();
-    std::vector<char*> list;
-    for (auto& s : items)
-        list.push_back(&s[0]);
-    list.push_back(nullptr);
-    ds->SetMetadata(list.data(), "RPC");
+    if (geoTransform != nullptr) {
+        std::array<double, 6> gt = *geoTransform;
+        ds->SetGeoTransform(gt.data());
+    }
+    if (crs != nullptr)
+        ds->SetSpatialRef(&crs->GetSpatialReference());
+    if (!metadata.empty()) {
+        std::vector<char*> list;
+        for (auto& item : metadata)
+            list.push_back(&item[0]);
+        list.push_back(nullptr);
+        ds->SetMetadata(list.data(), domain);
+    }
     for (int b = 1; b <= 3; ++b)
         ds->GetRasterBand(b)->SetNoDataValue(0);
     int bands[] = {1, 2, 3};
-    CheckWrite(ds->RasterIO(GF_Write, 0, 0, static_cast<int>(w), static_cast<int>(h), pixels.data(),
-                            static_cast<int>(w), static_cast<int>(h), GDT_Byte, 3, bands, 3,
-                            3 * static_cast<GSpacing>(w), 1, nullptr),
+    CheckWrite(ds->RasterIO(GF_Write, 0, 0, static_cast<int>(w), static_cast<int>(h),
+                            const_cast<std::uint8_t*>(pixels.data()), static_cast<int>(w),
+                            static_cast<int>(h), GDT_Byte, 3, bands, 3, 3 * static_cast<GSpacing>(w),
+                            1, nullptr),
                path);
     ds.reset();
 }
 
+// A texture colour times the exposure gain, kept off 0 (the background and no-data value).
+void PutColour(std::uint8_t* p, const std::array<std::uint8_t, 3>& rgb, double gain) {
+    for (int k = 0; k < 3; ++k)
+        p[k] = std::max<std::uint8_t>(gain == 1.0 ? rgb[k] : ToByte(rgb[k] * gain), 1);
+}
+
+void RenderImage(const FrameCamera& camera, const Dsm& dsm, const Rpc& rpc, const std::string& path,
+                 std::uint64_t seed, double gain, unsigned int threads) {
+    const unsigned int w = camera.Spec().width, h = camera.Spec().height;
+    std::vector<std::uint8_t> pixels(static_cast<size_t>(w) * h * 3, 0);
+    ForEachRow(h, threads, [&](unsigned int r) {
+        std::vector<double> cols(w), rows(w, r + 0.5), origins(3 * w), dirs(3 * w);
+        for (unsigned int c = 0; c < w; ++c)
+            cols[c] = c + 0.5;
+        camera.Rays(w, cols.data(), rows.data(), origins.data(), dirs.data());
+        for (unsigned int c = 0; c < w; ++c) {
+            const Vec3 o = {origins[3 * c], origins[3 * c + 1], origins[3 * c + 2]};
+            const Vec3 d = {dirs[3 * c], dirs[3 * c + 1], dirs[3 * c + 2]};
+            Vec3 hit;
+            if (std::isnan(d[0]) || !dsm.Intersect(o, d, hit))
+                continue;  // off the surface model: background 0
+            PutColour(&pixels[(static_cast<size_t>(r) * w + c) * 3],
+                      Texture(dsm, hit[0], hit[1], hit[2], seed), gain);
+        }
+    });
+    WriteRgb(path, pixels, w, h, nullptr, nullptr, rpc.ToMetadata(), "RPC");
+}
+
+void WriteText(const std::string& path, const std::string& text, const char* what) {
+    std::ofstream out(path, std::ios::binary);
+    if (!(out << text).flush())
+        KESTREL_THROW(DataException, FormatString("%s: cannot write the %s", path.c_str(), what));
+}
+
+std::string JsonString(const std::string& s) {
+    std::string out = "\"";
+    for (const char c : s) {
+        if (c == '"' || c == '\\')
+            out += '\\', out += c;
+        else if (static_cast<unsigned char>(c) < 0x20)
+            out += FormatString("\\u%04x", c);
+        else
+            out += c;
+    }
+    return out + "\"";
+}
+
 }  // namespace
+
+std::vector<std::uint8_t> RenderIdeal(const Dsm& dsm, const std::array<double, 6>& gt,
+                                      unsigned int width, unsigned int height, std::uint64_t seed,
+                                      unsigned int threads) {
+    std::vector<std::uint8_t> pixels(static_cast<size_t>(width) * height * 3, 0);
+    const CityOptions& o = dsm.Options();
+    ForEachRow(height, threads, [&](unsigned int r) {
+        for (unsigned int c = 0; c < width; ++c) {
+            const double x = gt[0] + (c + 0.5) * gt[1] + (r + 0.5) * gt[2];
+            const double y = gt[3] + (c + 0.5) * gt[4] + (r + 0.5) * gt[5];
+            if (x < o.west || x > o.west + o.sizeX || y < o.south || y > o.south + o.sizeY)
+                continue;
+            PutColour(&pixels[(static_cast<size_t>(r) * width + c) * 3],
+                      Texture(dsm, x, y, dsm.HeightAt(x, y), seed), 1.0);
+        }
+    });
+    return pixels;
+}
 
 Sample MakeSample(const std::string& directory, const CityOptions& options, unsigned int threads) {
     GDALAllRegister();
+    if (!(options.exposureSpread >= 0 && options.exposureSpread < 100))
+        KESTREL_THROW(DataException,
+                      FormatString("Sample city: the exposure spread must be from 0 to under 100 "
+                                   "per cent, not %g",
+                                   options.exposureSpread));
     const Dsm dsm(options);
+    const ICRS crs(options.crs);
     Sample sample;
     sample.dsmPath = directory + "/dsm.tif";
-    WriteDsm(dsm, sample.dsmPath);
-    const ICRS crs(options.crs);
+    sample.trueDsmPath = sample.dsmPath;
+    if (options.dsmError > 0) {
+        CityOptions handed = options;
+        handed.buildings = PerturbedBuildings(options);
+        WriteDsm(Dsm(handed), sample.dsmPath);
+        sample.trueDsmPath = directory + "/dsm_true.tif";
+    }
+    WriteDsm(dsm, sample.trueDsmPath);
     for (size_t i = 0; i < options.cameras.size(); ++i) {
         SampleImage image;
         image.camera = std::make_unique<FrameCamera>(options.cameras[i], dsm);
         const Rpc rpc =
             FitRpc(*image.camera, crs, dsm.MinHeight(), dsm.MaxHeight(), &image.rpcMaxResidual);
         image.path = directory + "/" + options.cameras[i].name + ".tif";
-        RenderImage(*image.camera, dsm, rpc, image.path, options.seed, threads);
+        image.gain = ExposureGain(options, i);
+        RenderImage(*image.camera, dsm, rpc, image.path, options.seed, image.gain, threads);
         image.cameraPath = kestrel::mathmodel::CameraSideFile(image.path);
         kestrel::mathmodel::WriteCameraFile(image.cameraPath, image.camera->Intrinsics(),
                                             image.camera->Pose());
         sample.images.push_back(std::move(image));
     }
+    auto fileName = [](const std::string& path) {
+        return std::filesystem::path(path).filename().string();
+    };
     // The same cameras as an exterior-orientation table, each row naming its image's side file
     // as its interior orientation.
     {
@@ -648,29 +830,63 @@ Sample MakeSample(const std::string& directory, const CityOptions& options, unsi
             const auto& c = image.camera->Pose().centre;
             const auto opk = kestrel::mathmodel::OpkFromRotation(image.camera->Pose().rotation);
             table += FormatString("%s %.6f %.6f %.6f %.12f %.12f %.12f %s\n",
-                                  std::filesystem::path(image.path).filename().string().c_str(),
-                                  c[0], c[1], c[2], opk[0], opk[1], opk[2],
-                                  std::filesystem::path(image.cameraPath).filename().string().c_str());
+                                  fileName(image.path).c_str(), c[0], c[1], c[2], opk[0], opk[1],
+                                  opk[2], fileName(image.cameraPath).c_str());
         }
-        std::ofstream out(directory + "/cameras.txt", std::ios::binary);
-        if (!(out << table).flush())
-            KESTREL_THROW(DataException, FormatString("%s/cameras.txt: cannot write the table",
-                                                      directory.c_str()));
+        WriteText(directory + "/cameras.txt", table, "exterior-orientation table");
+    }
+    // The ideal image on a grid of whole pixels from the DSM's north-west corner.
+    std::string idealGrid = "null";
+    if (options.idealPixel > 0) {
+        const auto w = static_cast<unsigned int>(std::ceil(options.sizeX / options.idealPixel - 1e-9));
+        const auto h = static_cast<unsigned int>(std::ceil(options.sizeY / options.idealPixel - 1e-9));
+        const std::array<double, 6> gt = {options.west, options.idealPixel, 0.0,
+                                          options.south + options.sizeY, 0.0, -options.idealPixel};
+        sample.idealPath = directory + "/ideal.tif";
+        WriteRgb(sample.idealPath, RenderIdeal(dsm, gt, w, h, options.seed, threads), w, h, &gt,
+                 &crs, {}, nullptr);
+        idealGrid = FormatString("{\"width\": %u, \"height\": %u, \"geotransform\": [%.17g, "
+                                 "%.12g, 0, %.12g, 0, %.12g]}",
+                                 w, h, gt[0], gt[1], gt[3], gt[5]);
+    }
+    // What made the sample, for benchmarks and measurements.
+    {
+        std::string notes = "{\n";
+        notes += FormatString("  \"crs\": %s,\n  \"seed\": %llu,\n", JsonString(options.crs).c_str(),
+                              static_cast<unsigned long long>(options.seed));
+        notes += FormatString("  \"exposure_spread\": %.17g,\n  \"dsm_error\": %u,\n",
+                              options.exposureSpread, options.dsmError);
+        notes += FormatString("  \"dsm_pixel\": %.12g,\n  \"buildings\": %zu,\n", options.dsmPixel,
+                              options.buildings.size());
+        notes += "  \"dsm\": " + JsonString(fileName(sample.dsmPath)) +
+                 ",\n  \"dsm_true\": " + JsonString(fileName(sample.trueDsmPath)) + ",\n";
+        notes += "  \"ideal\": " +
+                 (sample.idealPath.empty() ? std::string("null") : JsonString(fileName(sample.idealPath))) +
+                 ",\n  \"ideal_grid\": " + idealGrid + ",\n  \"images\": [";
+        for (size_t i = 0; i < sample.images.size(); ++i) {
+            const SampleImage& image = sample.images[i];
+            notes += FormatString("%s\n    {\"name\": %s, \"image\": %s, \"gain\": %.17g, "
+                                  "\"gsd\": %.12g, \"rpc_max_residual\": %.6g}",
+                                  i ? "," : "", JsonString(options.cameras[i].name).c_str(),
+                                  JsonString(fileName(image.path)).c_str(), image.gain,
+                                  options.cameras[i].groundSampleDistance, image.rpcMaxResidual);
+        }
+        notes += "\n  ]\n}\n";
+        sample.notesPath = directory + "/sample.json";
+        WriteText(sample.notesPath, notes, "sample notes");
     }
     // The master parameter file: fili; dbic; mmseg; dbiw; srcBgd; edgeClip; radioDif; dbmPxErr;
-    // role. The radiometric levels differ so that the fill order shows.
-    sample.masterPath = directory + "/master.txt";
-    std::ofstream master(sample.masterPath, std::ios::binary);
-    master << "!MFILE sample city: fili;dbic;mmseg;dbiw;srcBgd;edgeClip;radioDif;dbmPxErr;role\n";
+    // role. The radiometric levels differ so that the fill order shows. Written last: a sample
+    // with its master file is whole.
+    std::string master =
+        "!MFILE sample city: fili;dbic;mmseg;dbiw;srcBgd;edgeClip;radioDif;dbmPxErr;role\n";
     const char* levels[] = {"LOW", "LOW", "MODERATE", "HIGH"};
     // The images lie beside the master file: their names alone, so that the directory can be
     // moved and read from any working directory.
     for (size_t i = 0; i < sample.images.size(); ++i)
-        master << options.cameras[i].name << ".tif;1,2,3;0;;0;0;" << levels[i % 4]
-               << ";1;ORTHO\n";
-    if (!master.flush())
-        KESTREL_THROW(DataException,
-                      FormatString("%s: cannot write the master file", sample.masterPath.c_str()));
+        master += options.cameras[i].name + ".tif;1,2,3;0;;0;0;" + levels[i % 4] + ";1;ORTHO\n";
+    sample.masterPath = directory + "/master.txt";
+    WriteText(sample.masterPath, master, "master file");
     return sample;
 }
 

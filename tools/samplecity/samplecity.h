@@ -10,6 +10,7 @@
 
 #include <array>
 #include <cstdint>
+#include <limits>
 #include <memory>
 #include <string>
 #include <vector>
@@ -27,14 +28,18 @@ struct Building {
     double height;
 };
 
-// A frame camera that looks at the scene centre from a side.
+// A frame camera that looks at a ground point (the scene centre unless given) from a side. Seen
+// straight down (off nadir 0), the azimuth is where the top of the image points.
 struct CameraSpec {
     std::string name;        // the image is <name>.tif
-    double azimuthDegrees;   // direction from the scene centre to the camera, from north
+    double azimuthDegrees;   // direction from the target to the camera, from north
     double offNadirDegrees;  // angle between the viewing direction and the vertical
-    double altitude;         // metres above the scene's ground at its centre
+    double altitude;         // metres above the ground at the target
     unsigned int width, height;
-    double groundSampleDistance;  // metres per pixel at the scene centre
+    double groundSampleDistance;  // metres per pixel at the target
+    // The target in metres from the west and south edges of the scene; NaN: the scene centre.
+    double targetX = std::numeric_limits<double>::quiet_NaN();
+    double targetY = std::numeric_limits<double>::quiet_NaN();
 };
 
 struct CityOptions {
@@ -46,7 +51,17 @@ struct CityOptions {
     double slopeX = 0.0, slopeY = 0.0;          // gentle terrain: metres of rise per metre
     std::vector<Building> buildings;
     std::vector<CameraSpec> cameras;
-    std::uint64_t seed = 7;  // varies the texture
+    std::uint64_t seed = 7;  // varies the texture, the exposures and the DSM's errors
+    // Each image's exposure: its colours times a gain drawn within 1 +- exposureSpread / 100
+    // (ExposureGain); 0: every gain is 1.
+    double exposureSpread = 0.0;
+    // The DSM handed to the workflow (dsm.tif) has every building edge moved in or out by 1 to
+    // dsmError DSM pixels (PerturbedBuildings); the images are rendered from the true one,
+    // written as dsm_true.tif. 0: dsm.tif is the true DSM.
+    unsigned int dsmError = 0;
+    // > 0: also write ideal.tif, the texture seen from straight above on a grid of this pixel
+    // size over the DSM's extent (RenderIdeal).
+    double idealPixel = 0.0;
 };
 
 // The default sample: a block of buildings of 6 to 30 m on gently sloping ground, four images
@@ -59,6 +74,21 @@ CityOptions BoxScene(double boxHeight, const std::vector<double>& azimuths,
 // A large town for benchmarks: one image of imageSize x imageSize pixels at 0.5 m, seen 20
 // degrees off nadir from 2500 m, over a 1 m DSM 1.2 times the image's width, with a building every 40 m.
 CityOptions BenchCity(unsigned int imageSize);
+
+// An aerial block: rows flight strips (west to east, one way and back) of cols nadir frame
+// images each, imageSize pixels square at gsd metres, with 60 % forward and 30 % side overlap,
+// flown at 1.2 times an image's ground width; over a DSM of 0.5 m that covers every image with
+// a margin: city blocks between north-south streets, buildings of 3 to 24 m and a few towers of
+// 30 to 50 m, on gently sloping ground.
+CityOptions BlockCity(unsigned int rows, unsigned int cols, unsigned int imageSize = 1000,
+                      double gsd = 0.15);
+
+// The exposure gain of image `index` (seeded; 1 when options.exposureSpread is 0).
+double ExposureGain(const CityOptions& options, std::size_t index);
+// The buildings of the DSM handed to the workflow: options.buildings with each edge moved by 1
+// to options.dsmError DSM pixels, in or out (seeded), keeping every building at least one pixel
+// wide; the buildings themselves when dsmError is 0.
+std::vector<Building> PerturbedBuildings(const CityOptions& options);
 
 // The surface model as a grid, bilinear between posts at cell centres.
 class Dsm {
@@ -83,9 +113,16 @@ class Dsm {
     const CityOptions& Options() const { return options_; }
 
   private:
+    // The highest post of the 3 x 3 blocks around the one holding (x, y): no surface point within
+    // (kBlock - 1) DSM pixels of (x, y) is higher.
+    float NearbyMax(double x, double y) const;
+
+    static constexpr unsigned int kBlock = 8;
     CityOptions options_;
     unsigned int width_, height_;
     std::vector<float> posts_;
+    std::vector<float> blockMax_;  // per block of kBlock x kBlock posts: the 3 x 3 blocks' max
+    unsigned int blocksX_ = 0, blocksY_ = 0;
     std::vector<int> buildingIds_;  // per post: index + 1 of its building, 0 for ground
     double minHeight_, maxHeight_;
 };
@@ -145,21 +182,34 @@ Rpc FitRpc(const FrameCamera& camera, const kestrel::ogc::cs::ICRS& crs, double 
 std::array<std::uint8_t, 3> Texture(const Dsm& dsm, double x, double y, double z,
                                     std::uint64_t seed);
 
+// The texture seen from straight above (walls not seen) at the centres of a grid of width x
+// height pixels with the given geotransform: RGB bytes, pixel-interleaved, row by row; 0 off the
+// DSM. What a perfect true ortho of the sample shows, with every exposure gain 1.
+std::vector<std::uint8_t> RenderIdeal(const Dsm& dsm, const std::array<double, 6>& geoTransform,
+                                      unsigned int width, unsigned int height, std::uint64_t seed,
+                                      unsigned int threads = 0);
+
 struct SampleImage {
     std::string path;        // the GeoTIFF with its RPCs
     std::string cameraPath;  // its camera side file
     double rpcMaxResidual;  // pixels
+    double gain = 1.0;      // its exposure gain (ExposureGain)
     std::unique_ptr<FrameCamera> camera;
 };
 
 struct Sample {
-    std::string dsmPath;
+    std::string dsmPath;      // the DSM for the workflow
+    std::string trueDsmPath;  // the DSM the images were rendered from (dsmPath without errors)
+    std::string idealPath;    // ideal.tif, empty unless options.idealPixel > 0
+    std::string notesPath;    // sample.json: what made the sample, each image's gain
     std::string masterPath;
     std::vector<SampleImage> images;
 };
 
-// Writes the DSM (dsm.tif), the images (<camera name>.tif) with their cameras
-// (<camera name>.camera.json) and master.txt into an existing directory. threads: rendering threads (0: the hardware's count).
+// Writes the DSM (dsm.tif, and dsm_true.tif when options.dsmError > 0), the images (<camera
+// name>.tif) with their cameras (<camera name>.camera.json), cameras.txt, master.txt, ideal.tif
+// when options.idealPixel > 0, and sample.json (the options that made the sample, each image's
+// exposure gain, the ideal image's grid) into an existing directory. threads: rendering threads (0: the hardware's count).
 Sample MakeSample(const std::string& directory, const CityOptions& options,
                   unsigned int threads = 0);
 

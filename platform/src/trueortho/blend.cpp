@@ -1,27 +1,468 @@
-// Blending across seams. For now every pixel takes its region's value.
+// Blending across seams.
+//
+// Feather: a scene's weight at a pixel falls linearly with the pixel's signed distance to the
+// seam of the scene's region, from 1 at blendWidth / 2 inside to 0 at blendWidth / 2 outside,
+// times 0 where the scene does not see the ground. Distances are exact Euclidean ones, so a
+// pixel's result does not depend on the tiling. Only pixels within reach of another region are
+// blended; the rest copy their region's value.
+//
+// Multiband: the scenes' Laplacian pyramids blended level by level with the Gaussian pyramids of
+// their region masks (Burt and Adelson), as differences from the hard mosaic, so that pixels far
+// from every seam keep their region's value exactly.
 #include "blend.h"
+
+#include <kestrel/exception.h>
+
+#include <algorithm>
+#include <cmath>
+#include <cstdint>
+#include <limits>
+#include <numeric>
 
 namespace kestrel {
 namespace processes {
 namespace trueortho {
 
-int BlendBorder(BlendMode, int blendWidth) { return blendWidth; }
+namespace {
 
-void BlendRegions(const BlendTile& tile, BlendMode, int, float noData, std::vector<float>& out) {
+// A squared distance out of reach.
+constexpr std::int32_t kFar = std::numeric_limits<std::int32_t>::max();
+
+void CheckTile(const BlendTile& tile, int blendWidth) {
+    if (blendWidth < 0)
+        KESTREL_THROW(DataException, FormatString("Blending: blend width %d is negative", blendWidth));
+    const int inner = std::min(tile.width, tile.height) - 2 * tile.border;
+    if (tile.border < 0 || inner < 0 || tile.bands < 1)
+        KESTREL_THROW(DataException,
+                      FormatString("Blending: a tile of %d x %d pixels with a border of %d and %d "
+                                   "bands is impossible",
+                                   tile.width, tile.height, tile.border, tile.bands));
+    const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
+    const std::size_t n = tile.scenes.size();
+    if (tile.labels.size() != full || tile.values.size() != n || tile.seen.size() != n)
+        KESTREL_THROW(DataException,
+                      FormatString("Blending: the tile's labels (%zu) or its scenes' values (%zu) "
+                                   "and visibility (%zu) do not match its %zu pixels and %zu scenes",
+                                   tile.labels.size(), tile.values.size(), tile.seen.size(), full,
+                                   n));
+    for (std::size_t k = 0; k < n; ++k)
+        if (tile.values[k].size() != full * tile.bands || tile.seen[k].size() != full)
+            KESTREL_THROW(DataException,
+                          FormatString("Blending: scene %zu of the tile has %zu values and %zu "
+                                       "visibility flags instead of %zu and %zu",
+                                       tile.scenes[k], tile.values[k].size(), tile.seen[k].size(),
+                                       full * tile.bands, full));
+    for (const int label : tile.labels)
+        if (label < -1 || label >= static_cast<int>(n))
+            KESTREL_THROW(DataException,
+                          FormatString("Blending: region label %d is not one of the tile's %zu "
+                                       "scenes",
+                                       label, n));
+}
+
+// The indices into tile.scenes of the scenes that have region pixels in the window, in the
+// order of the job's scenes, so that sums run in the same order in every tile.
+std::vector<int> ScenesWithRegions(const BlendTile& tile, int x0, int y0) {
+    std::vector<char> present(tile.scenes.size(), 0);
+    for (int y = y0; y < tile.height; ++y) {
+        const int* row = tile.labels.data() + static_cast<std::size_t>(y) * tile.width;
+        for (int x = x0; x < tile.width; ++x)
+            if (row[x] >= 0)
+                present[row[x]] = 1;
+    }
+    std::vector<int> order;
+    for (std::size_t k = 0; k < present.size(); ++k)
+        if (present[k])
+            order.push_back(static_cast<int>(k));
+    std::sort(order.begin(), order.end(),
+              [&](int a, int b) { return tile.scenes[a] < tile.scenes[b]; });
+    return order;
+}
+
+// Every inner pixel its region's value; noData where no region.
+void HardSeams(const BlendTile& tile, float noData, std::vector<float>& out) {
     const int b = tile.border, w = tile.width - 2 * b, h = tile.height - 2 * b;
     const std::size_t plane = static_cast<std::size_t>(w) * h;
     const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
-    out.assign(plane * tile.bands, noData);
+    out.resize(plane * tile.bands);
+    std::vector<const float*> scene(tile.scenes.size());
+    for (int band = 0; band < tile.bands; ++band) {
+        for (std::size_t k = 0; k < scene.size(); ++k)
+            scene[k] = tile.values[k].data() + full * band;
+        for (int j = 0; j < h; ++j) {
+            const std::size_t start = static_cast<std::size_t>(j + b) * tile.width + b;
+            const int* label = tile.labels.data() + start;
+            float* o = out.data() + plane * band + static_cast<std::size_t>(j) * w;
+            for (int i = 0; i < w; ++i)
+                o[i] = label[i] < 0 ? noData : scene[label[i]][start + i];
+        }
+    }
+}
+
+// ---- Feather -------------------------------------------------------------------------------
+
+// Squared distances from each pixel of the tile to the nearest pixel labelled `label`: exact
+// where the distance is below `reach`, kFar where it is not. Column distances first, then the
+// lower envelope of parabolas along each row (Felzenszwalb and Huttenlocher).
+class RegionDistance {
+  public:
+    void Compute(const BlendTile& tile, int label, int reach, std::vector<std::int32_t>& d2) {
+        const int w = tile.width, h = tile.height;
+        column_.resize(static_cast<std::size_t>(w) * h);
+        for (int y = 0; y < h; ++y) {
+            const int* lab = tile.labels.data() + static_cast<std::size_t>(y) * w;
+            int* g = column_.data() + static_cast<std::size_t>(y) * w;
+            if (y == 0)
+                for (int x = 0; x < w; ++x)
+                    g[x] = lab[x] == label ? 0 : reach;
+            else
+                for (int x = 0; x < w; ++x)
+                    g[x] = lab[x] == label ? 0 : std::min(g[x - w] + 1, reach);
+        }
+        for (int y = h - 2; y >= 0; --y) {
+            int* g = column_.data() + static_cast<std::size_t>(y) * w;
+            const int* below = g + w;
+            for (int x = 0; x < w; ++x)
+                g[x] = std::min(g[x], below[x] + 1);
+        }
+        d2.resize(static_cast<std::size_t>(w) * h);
+        const std::int32_t cap = reach * reach;
+        for (int y = 0; y < h; ++y)
+            Row(column_.data() + static_cast<std::size_t>(y) * w, w, reach, cap,
+                d2.data() + static_cast<std::size_t>(y) * w);
+    }
+
+  private:
+    // One row: g holds column distances (reach: out of reach). Inside a run of zeros only the
+    // run's ends can be nearest to a pixel outside it, so only they enter the envelope.
+    void Row(const int* g, int w, int reach, std::int32_t cap, std::int32_t* d2) {
+        sites_.clear();
+        for (int x = 0; x < w; ++x)
+            if (g[x] < reach && !(g[x] == 0 && x > 0 && x + 1 < w && g[x - 1] == 0 && g[x + 1] == 0))
+                sites_.push_back(x);
+        if (sites_.empty()) {
+            std::fill(d2, d2 + w, kFar);
+            return;
+        }
+        const auto f = [&](int q) { return static_cast<double>(g[q]) * g[q]; };
+        envelope_.assign(sites_.size(), 0);
+        bounds_.assign(sites_.size() + 1, 0.0);
+        std::size_t k = 0;
+        envelope_[0] = sites_[0];
+        bounds_[0] = -std::numeric_limits<double>::infinity();
+        bounds_[1] = std::numeric_limits<double>::infinity();
+        for (std::size_t i = 1; i < sites_.size(); ++i) {
+            const int q = sites_[i];
+            const auto meet = [&](int v) {
+                return ((f(q) + static_cast<double>(q) * q) - (f(v) + static_cast<double>(v) * v)) /
+                       (2.0 * (q - v));
+            };
+            double s = meet(envelope_[k]);
+            while (s <= bounds_[k])  // bounds_[0] is -infinity
+                s = meet(envelope_[--k]);
+            ++k;
+            envelope_[k] = q;
+            bounds_[k] = s;
+            bounds_[k + 1] = std::numeric_limits<double>::infinity();
+        }
+        k = 0;
+        for (int x = 0; x < w; ++x) {
+            while (bounds_[k + 1] < x)
+                ++k;
+            const int v = envelope_[k];
+            const std::int32_t d = (x - v) * (x - v) + g[v] * g[v];
+            d2[x] = g[x] == 0 ? 0 : d < cap ? d : kFar;
+        }
+    }
+
+    std::vector<int> column_, sites_, envelope_;
+    std::vector<double> bounds_;
+};
+
+// Reused from tile to tile by each thread.
+struct FeatherBuffers {
+    RegionDistance distance;
+    std::vector<std::vector<std::int32_t>> d2;
+};
+
+void Feather(const BlendTile& tile, const std::vector<int>& order, int blendWidth, float noData,
+             std::vector<float>& out) {
+    // Hard seams first: only pixels within reach of another region change.
+    HardSeams(tile, noData, out);
+    // A scene takes part at a pixel up to blendWidth / 2 + 1/2 pixels outside its region (the
+    // seam lies half a pixel from the centres of the pixels beside it): 4 d^2 < (W + 1)^2.
+    const std::int64_t limit = static_cast<std::int64_t>(blendWidth + 1) * (blendWidth + 1);
+    const auto inReach = [limit](std::int32_t squared) {
+        return 4 * static_cast<std::int64_t>(squared) < limit;
+    };
+    thread_local FeatherBuffers buffers;
+    std::vector<std::vector<std::int32_t>>& d2 = buffers.d2;
+    d2.resize(std::max(d2.size(), tile.scenes.size()));
+    for (const int k : order)
+        buffers.distance.Compute(tile, k, blendWidth / 2 + 1, d2[k]);
+
+    const int b = tile.border, w = tile.width - 2 * b, h = tile.height - 2 * b;
+    const std::size_t plane = static_cast<std::size_t>(w) * h;
+    const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
+    const float width = static_cast<float>(blendWidth);
+    // The weight of a scene d pixels (centre to centre) from its region, and of the region's own
+    // scene d pixels from the nearest other region.
+    const auto outside = [&](std::int32_t squared) {
+        return (width + 1.0f - 2.0f * std::sqrt(static_cast<float>(squared))) / (2.0f * width);
+    };
+    const auto inside = [&](std::int32_t squared) {
+        return std::min(1.0f, (width - 1.0f + 2.0f * std::sqrt(static_cast<float>(squared))) /
+                                  (2.0f * width));
+    };
+    std::vector<float> weight(tile.scenes.size());
     for (int j = 0; j < h; ++j)
         for (int i = 0; i < w; ++i) {
             const std::size_t p = static_cast<std::size_t>(j + b) * tile.width + i + b;
             const int label = tile.labels[p];
             if (label < 0)
                 continue;
-            for (int band = 0; band < tile.bands; ++band)
-                out[plane * band + static_cast<std::size_t>(j) * w + i] =
-                    tile.values[label][full * band + p];
+            std::int32_t nearest = kFar;
+            for (const int k : order)
+                if (k != label && d2[k][p] < nearest)
+                    nearest = d2[k][p];
+            if (!inReach(nearest))
+                continue;
+            int contributors = 0, last = label;
+            float sum = 0.0f;
+            for (const int k : order) {
+                float wk = 0.0f;
+                if (tile.seen[k][p])
+                    wk = k == label ? inside(nearest) : inReach(d2[k][p]) ? outside(d2[k][p]) : 0.0f;
+                weight[k] = wk;
+                if (wk > 0.0f)
+                    ++contributors, last = k, sum += wk;
+            }
+            const std::size_t o = static_cast<std::size_t>(j) * w + i;
+            for (int band = 0; band < tile.bands; ++band) {
+                float v = tile.values[last][full * band + p];
+                if (contributors > 1) {
+                    v = 0.0f;
+                    for (const int k : order)
+                        if (weight[k] > 0.0f)
+                            v += weight[k] * tile.values[k][full * band + p];
+                    v /= sum;
+                }
+                out[plane * band + o] = v;
+            }
         }
+}
+
+// ---- Multiband -----------------------------------------------------------------------------
+
+// Pyramid levels below full resolution: the coarsest level's cells are about blendWidth pixels
+// wide, so that the lowest frequencies are blended over about that width.
+int Levels(int blendWidth) {
+    int levels = 0;
+    while ((2 << levels) <= blendWidth && levels < 10)
+        ++levels;
+    return levels;
+}
+
+// The border of a multiband tile in cells of the coarsest level, besides one cell that aligning
+// the pyramid to the grid may cost: what a pixel's result depends on beyond it is below float
+// rounding in the tests (2 cells leave differences of a few hundredths of a grey level).
+constexpr int kMultibandBorderCells = 3;
+
+struct Plane {
+    int w = 0, h = 0;
+    std::vector<float> v;
+    Plane() = default;
+    Plane(int width, int height, float value = 0.0f)
+        : w(width), h(height), v(static_cast<std::size_t>(width) * height, value) {}
+    float& at(int x, int y) { return v[static_cast<std::size_t>(y) * w + x]; }
+    float at(int x, int y) const { return v[static_cast<std::size_t>(y) * w + x]; }
+};
+
+// The next level of a Gaussian pyramid: the 5-tap binomial kernel, every second pixel, edges
+// repeated.
+Plane Reduce(const Plane& src) {
+    const int w = (src.w + 1) / 2, h = (src.h + 1) / 2;
+    Plane rows(w, src.h), dst(w, h);
+    const auto cx = [&](int x) { return std::min(std::max(x, 0), src.w - 1); };
+    const auto cy = [&](int y) { return std::min(std::max(y, 0), src.h - 1); };
+    for (int y = 0; y < src.h; ++y)
+        for (int i = 0; i < w; ++i) {
+            const int x = 2 * i;
+            rows.at(i, y) = (src.at(cx(x - 2), y) + src.at(cx(x + 2), y) +
+                             4.0f * (src.at(cx(x - 1), y) + src.at(cx(x + 1), y)) +
+                             6.0f * src.at(x, y)) *
+                            (1.0f / 16.0f);
+        }
+    for (int j = 0; j < h; ++j) {
+        const int y = 2 * j;
+        const float* r0 = &rows.v[static_cast<std::size_t>(cy(y - 2)) * w];
+        const float* r1 = &rows.v[static_cast<std::size_t>(cy(y - 1)) * w];
+        const float* r2 = &rows.v[static_cast<std::size_t>(y) * w];
+        const float* r3 = &rows.v[static_cast<std::size_t>(cy(y + 1)) * w];
+        const float* r4 = &rows.v[static_cast<std::size_t>(cy(y + 2)) * w];
+        float* d = &dst.v[static_cast<std::size_t>(j) * w];
+        for (int i = 0; i < w; ++i)
+            d[i] = (r0[i] + r4[i] + 4.0f * (r1[i] + r3[i]) + 6.0f * r2[i]) * (1.0f / 16.0f);
+    }
+    return dst;
+}
+
+// A level brought up to the size of the level above: the same kernel on the doubled lattice.
+Plane Expand(const Plane& src, int w, int h) {
+    Plane cols(w, src.h), dst(w, h);
+    const auto cx = [&](int i) { return std::min(std::max(i, 0), src.w - 1); };
+    for (int y = 0; y < src.h; ++y)
+        for (int x = 0; x < w; ++x) {
+            const int i = x / 2;
+            cols.at(x, y) = x % 2 == 0 ? (src.at(cx(i - 1), y) + 6.0f * src.at(cx(i), y) +
+                                          src.at(cx(i + 1), y)) *
+                                             0.125f
+                                       : (src.at(cx(i), y) + src.at(cx(i + 1), y)) * 0.5f;
+        }
+    for (int y = 0; y < h; ++y) {
+        const int j = y / 2;
+        const auto row = [&](int r) {
+            return &cols.v[static_cast<std::size_t>(std::min(std::max(r, 0), src.h - 1)) * w];
+        };
+        float* d = &dst.v[static_cast<std::size_t>(y) * w];
+        if (y % 2 == 0) {
+            const float *a = row(j - 1), *m = row(j), *c = row(j + 1);
+            for (int x = 0; x < w; ++x)
+                d[x] = (a[x] + 6.0f * m[x] + c[x]) * 0.125f;
+        } else {
+            const float *m = row(j), *c = row(j + 1);
+            for (int x = 0; x < w; ++x)
+                d[x] = (m[x] + c[x]) * 0.5f;
+        }
+    }
+    return dst;
+}
+
+std::vector<Plane> Gaussian(Plane base, int levels) {
+    std::vector<Plane> pyramid;
+    pyramid.push_back(std::move(base));
+    for (int k = 0; k < levels; ++k)
+        pyramid.push_back(Reduce(pyramid.back()));
+    return pyramid;
+}
+
+void Multiband(const BlendTile& tile, int blendWidth, float noData, std::vector<float>& out) {
+    const int levels = Levels(blendWidth), cell = 1 << levels;
+    // The window of the tile whose origin lies on a multiple of `cell` on the mosaic grid, so
+    // that every tile builds the same pyramid.
+    const auto skip = [&](int origin) { return ((tile.border - origin) % cell + cell) % cell; };
+    const int sx = skip(tile.x0), sy = skip(tile.y0);
+    const int w = tile.width - sx, h = tile.height - sy;
+    const std::vector<int> order = ScenesWithRegions(tile, sx, sy);
+    if (order.size() < 2) {
+        HardSeams(tile, noData, out);
+        return;
+    }
+    const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
+    const auto at = [&](int x, int y) {
+        return static_cast<std::size_t>(y + sy) * tile.width + x + sx;
+    };
+
+    // The hard mosaic, and the sum of the scenes' weights per level.
+    std::vector<Plane> hard(tile.bands, Plane(w, h));
+    for (int y = 0; y < h; ++y)
+        for (int x = 0; x < w; ++x) {
+            const int label = tile.labels[at(x, y)];
+            if (label >= 0)
+                for (int band = 0; band < tile.bands; ++band)
+                    hard[band].at(x, y) = tile.values[label][full * band + at(x, y)];
+        }
+    std::vector<Plane> total;
+    std::vector<std::vector<Plane>> blended(tile.bands);
+    for (const int k : order) {
+        Plane mask(w, h);
+        for (int y = 0; y < h; ++y)
+            for (int x = 0; x < w; ++x)
+                mask.at(x, y) = tile.labels[at(x, y)] == k && tile.seen[k][at(x, y)] ? 1.0f : 0.0f;
+        const std::vector<Plane> weights = Gaussian(std::move(mask), levels);
+        if (total.empty())
+            total = weights;
+        else
+            for (int l = 0; l <= levels; ++l)
+                for (std::size_t i = 0; i < total[l].v.size(); ++i)
+                    total[l].v[i] += weights[l].v[i];
+        for (int band = 0; band < tile.bands; ++band) {
+            // The scene's difference from the hard mosaic, 0 where it does not see the ground.
+            Plane difference(w, h);
+            for (int y = 0; y < h; ++y)
+                for (int x = 0; x < w; ++x) {
+                    const std::size_t p = at(x, y);
+                    if (tile.seen[k][p] && tile.labels[p] >= 0)
+                        difference.at(x, y) = tile.values[k][full * band + p] - hard[band].at(x, y);
+                }
+            std::vector<Plane> laplacian = Gaussian(std::move(difference), levels);
+            for (int l = 0; l < levels; ++l) {
+                const Plane up = Expand(laplacian[l + 1], laplacian[l].w, laplacian[l].h);
+                for (std::size_t i = 0; i < up.v.size(); ++i)
+                    laplacian[l].v[i] -= up.v[i];
+            }
+            std::vector<Plane>& sum = blended[band];
+            if (sum.empty())
+                for (const Plane& level : laplacian)
+                    sum.emplace_back(level.w, level.h);
+            for (int l = 0; l <= levels; ++l)
+                for (std::size_t i = 0; i < sum[l].v.size(); ++i)
+                    sum[l].v[i] += weights[l].v[i] * laplacian[l].v[i];
+        }
+    }
+
+    const int b = tile.border, iw = tile.width - 2 * b, ih = tile.height - 2 * b;
+    const std::size_t plane = static_cast<std::size_t>(iw) * ih;
+    out.assign(plane * tile.bands, noData);
+    for (int band = 0; band < tile.bands; ++band) {
+        std::vector<Plane>& sum = blended[band];
+        for (int l = 0; l <= levels; ++l)
+            for (std::size_t i = 0; i < sum[l].v.size(); ++i)
+                sum[l].v[i] = total[l].v[i] > 1e-6f ? sum[l].v[i] / total[l].v[i] : 0.0f;
+        Plane collapsed = std::move(sum[levels]);
+        for (int l = levels - 1; l >= 0; --l) {
+            Plane up = Expand(collapsed, sum[l].w, sum[l].h);
+            for (std::size_t i = 0; i < up.v.size(); ++i)
+                up.v[i] += sum[l].v[i];
+            collapsed = std::move(up);
+        }
+        for (int j = 0; j < ih; ++j)
+            for (int i = 0; i < iw; ++i) {
+                const int x = i + b - sx, y = j + b - sy;
+                if (tile.labels[at(x, y)] >= 0)
+                    out[plane * band + static_cast<std::size_t>(j) * iw + i] =
+                        hard[band].at(x, y) + collapsed.at(x, y);
+            }
+    }
+}
+
+}  // namespace
+
+int BlendBorder(BlendMode mode, int blendWidth) {
+    if (blendWidth <= 0)
+        return 0;
+    if (mode == BlendMode::Feather)
+        return blendWidth / 2 + 1;
+    const int levels = Levels(blendWidth);
+    return levels == 0 ? 0 : (kMultibandBorderCells + 1) << levels;
+}
+
+void BlendRegions(const BlendTile& tile, BlendMode mode, int blendWidth, float noData,
+                  std::vector<float>& out) {
+    CheckTile(tile, blendWidth);
+    if (blendWidth == 0 || (mode == BlendMode::Multiband && Levels(blendWidth) == 0)) {
+        HardSeams(tile, noData, out);
+        return;
+    }
+    if (mode == BlendMode::Multiband) {
+        Multiband(tile, blendWidth, noData, out);
+        return;
+    }
+    const std::vector<int> order = ScenesWithRegions(tile, 0, 0);
+    if (order.size() < 2)
+        HardSeams(tile, noData, out);
+    else
+        Feather(tile, order, blendWidth, noData, out);
 }
 
 }  // namespace trueortho
