@@ -4,6 +4,7 @@
 #include "program.h"
 
 #include <gdal_priv.h>
+#include <ogr_spatialref.h>
 
 #include <array>
 #include <filesystem>
@@ -57,6 +58,29 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
     const std::string absent = dir.File("absent.tif");
     fs::create_directories(dir.File("taken"));
     WriteFile(dir.File("taken/master.txt"), "mine.tif\n");
+    // Vector files that are no seamline layer: another layer's name, points, no scene field.
+    const auto layer = [&](const std::string& file, const std::string& name,
+                           const std::string& geometry, const std::string& properties) {
+        return WriteFile(dir.File(file), R"({"type": "FeatureCollection", "name": ")" + name +
+                                             R"(", "features": [{"type": "Feature", )"
+                                             R"("properties": )" + properties +
+                                             R"(, "geometry": )" + geometry + "}]}");
+    };
+    const std::string square =
+        R"({"type": "Polygon", "coordinates": [[[0, 0], [1, 0], [1, 1], [0, 0]]]})";
+    const std::string cutline = layer("cut.geojson", "cut", square, R"({"scene": "a"})");
+    const std::string points = layer("points.geojson", "seamlines",
+                                     R"({"type": "Point", "coordinates": [0, 0]})", R"({"scene": "a"})");
+    const std::string unnamed = layer("unnamed.geojson", "seamlines", square, R"({"name": "a"})");
+    // Ground heights above mean sea level, as the file's CRS says.
+    const std::string msl = WriteImage(dir.File("msl.tif"));
+    {
+        GDALDataset* raster = GDALDataset::Open(msl.c_str(), GDAL_OF_RASTER | GDAL_OF_UPDATE);
+        OGRSpatialReference crs;
+        crs.SetFromUserInput("EPSG:32632+5773");
+        raster->SetSpatialRef(&crs);
+        GDALClose(raster);
+    }
     const std::string out = dir.File("out");
     const std::string textNotImage = ": a text file (a master parameter file?), not an image";
     const CommandLine cases[] = {
@@ -99,6 +123,18 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--te", "0", "0", "1", "1", "--te-srs", "EPSG:99999"}, "--te-srs: "},
         {{master}, {"--cutline", absent}, "--cutline: " + absent + ": cannot be opened"},
         {{master}, {"--cutline", master}, "--cutline: " + master + ": cannot be opened"},
+        {{master}, {"--seamlines", absent}, "--seamlines: " + absent + ": cannot be opened"},
+        {{master}, {"--seamlines", cutline}, "no layer \"seamlines\" (layers: cut)"},
+        {{master}, {"--seamlines", points}, "layer \"seamlines\": holds Point geometries"},
+        {{master}, {"--seamlines", unnamed}, "has no field \"scene\""},
+        {{master}, {"--dtm", absent}, "--dtm: " + absent + ": not found"},
+        {{master}, {"--dtm", master}, "--dtm: " + master + ": cannot be opened as a raster"},
+        {{master},
+         {"--dtm", msl, "--elevref", "ELLIPS"},
+         "--dtm " + msl + ": the file says the heights are \"EGM96 height\""},
+        {{master}, {"--blend-width", "wide"}, "--blend-width: \"wide\" is not a whole number"},
+        {{master}, {"--blend", "gauss"}, "--blend: \"gauss\" is not one of feather, multiband"},
+        {{master}, {"--balance", "mean"}, "--balance: \"mean\" is not one of gain, gain-offset"},
         {{master}, {"--frobnicate"}, "unknown option"},
         {{master}, {"--dem"}, "--dem needs a value"},
         // A master file where images are expected, and the reverse, said plainly.
@@ -155,6 +191,8 @@ TEST(OrthoCommandLine, ValuesThatHelpListsAreAccepted) {
         {"--srs", "EPSG:4326"},    {"--proc", "CPU:2"},           {"--elunits", "FOOT"},
         {"--co", "COMPRESS=JPEG"}, {"--co", "QUALITY=90"},        {"--co", "BLOCKSIZE=256"},
         {"--tr", "0.5", "0.25"},   {"--te", "9", "45", "9.1", "45.1", "--te-srs", "EPSG:4326"},
+        {"--blend", "multiband"},  {"--balance", "gain"},         {"--balance", "none"},
+        {"--blend-width", "0"},
     };
     for (const auto& option : accepted) {
         SCOPED_TRACE(option[0] + " " + option[1]);

@@ -6,6 +6,7 @@
 
 #include <cpl_json.h>
 #include <cpl_string.h>
+#include <gdal_alg.h>
 #include <gdal_priv.h>
 #include <ogrsf_frmts.h>
 
@@ -708,6 +709,9 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
              ReplaceInFile(dir.File("sample/master.txt"), "HIGH;1", "HIGH;2");
          },
          {}, "scene west changed", true},
+        {"the colour balance, which only the mosaic reads",
+         [&] { args.insert(args.end(), {"--balance", "none"}); },
+         {}, "--balance changed: gain-offset -> none", true},
         {"an area of interest that changes no scene's window",
          [&] { args.insert(args.end(), {"--te", "514848", "5033845", "515008", "5033989"}); },
          {}, "--te changed", true},
@@ -742,6 +746,166 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
             EXPECT_NE(mosaicReason.find(step.reason), std::string::npos) << mosaicReason;
         }
     }
+}
+
+// Pixels of the raster's grid whose centre lies in the shape: 1, else 0.
+std::vector<unsigned char> Burnt(GDALDataset& grid, OGRGeometry& shape) {
+    GDALDriver* memory = GetGDALDriverManager()->GetDriverByName("MEM");
+    Dataset burnt(memory->Create("", grid.GetRasterXSize(), grid.GetRasterYSize(), 1, GDT_Byte,
+                                 nullptr));
+    double geo[6];
+    EXPECT_EQ(grid.GetGeoTransform(geo), CE_None);
+    burnt->SetGeoTransform(geo);
+    int band = 1;
+    double one = 1.0;
+    OGRGeometryH handle = OGRGeometry::ToHandle(&shape);
+    EXPECT_EQ(GDALRasterizeGeometries(GDALDataset::ToHandle(burnt.get()), 1, &band, 1, &handle,
+                                      nullptr, nullptr, &one, nullptr, nullptr, nullptr),
+              CE_None);
+    return ReadBytes(*burnt);
+}
+
+// DIR/seamlines.gpkg holds the mosaic's regions: burnt back by gdal_rasterize, scene by scene,
+// it is the source raster. An edited copy (one vertex of a polygon dragged outward) handed back
+// with --seamlines makes the mosaic again, not the scenes, and the mosaic changes only between
+// the old and the new edge (its source there) and within the blend band around them.
+TEST(Workflow, EditedSeamlinesChangeTheMosaicThereAlone) {
+    TempDir dir;
+    std::vector<std::string> args = MakeSample(dir);
+    constexpr int kBlend = 4;
+    args.insert(args.end(), {"--blend-width", std::to_string(kBlend)});
+    ASSERT_EQ(Ortho(args, dir).status, 0);
+    Dataset source = Open(dir.File("out/mosaic_source.tif"));
+    ASSERT_TRUE(source);
+    const std::vector<unsigned char> sourceBefore = ReadBytes(*source);
+    const int width = source->GetRasterXSize(), height = source->GetRasterYSize();
+    CPLJSONDocument summary;
+    ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
+    const CPLJSONArray scenes = summary.GetRoot().GetArray("mosaic_scenes");
+    EXPECT_EQ(summary.GetRoot().GetObj("balance").GetInteger("blend_width"), kBlend);
+    EXPECT_EQ(summary.GetRoot().GetObj("balance").GetArray("scenes").Size(), scenes.Size());
+
+    // The oracle: an empty copy of the source raster's grid, each scene's polygons burnt in.
+    const Result blank = RunProgram(
+        "gdal_translate", {"-q", "-scale", "0", "255", "0", "0", dir.File("out/mosaic_source.tif"),
+                           dir.File("burnt.tif")},
+        dir);
+    ASSERT_EQ(blank.status, 0) << blank.err;
+    for (int k = 1; k <= scenes.Size(); ++k) {
+        const Result burn = RunProgram(
+            "gdal_rasterize", {"-q", "-l", "seamlines", "-where",
+                               "scene = '" + scenes[k - 1].ToString() + "'", "-burn",
+                               std::to_string(k), dir.File("out/seamlines.gpkg"),
+                               dir.File("burnt.tif")},
+            dir);
+        ASSERT_EQ(burn.status, 0) << burn.err;
+    }
+    Dataset burnt = Open(dir.File("burnt.tif"));
+    ASSERT_TRUE(burnt);
+    EXPECT_EQ(ReadBytes(*burnt), sourceBefore);
+
+    // Later features win where polygons overlap: the largest region, dragged last, one vertex
+    // moved 6 m (6 pixels) away from its centre into another scene's region.
+    std::filesystem::copy_file(dir.File("out/seamlines.gpkg"), dir.File("edited.gpkg"));
+    double geo[6];
+    ASSERT_EQ(source->GetGeoTransform(geo), CE_None);
+    std::vector<unsigned char> between;
+    {
+        Dataset edited(GDALDataset::Open(dir.File("edited.gpkg").c_str(),
+                                         GDAL_OF_VECTOR | GDAL_OF_UPDATE, nullptr, nullptr));
+        ASSERT_TRUE(edited);
+        OGRLayer* layer = edited->GetLayerByName("seamlines");
+        ASSERT_NE(layer, nullptr);
+        std::unique_ptr<OGRFeature> largest;
+        while (OGRFeature* feature = layer->GetNextFeature()) {
+            std::unique_ptr<OGRFeature> owned(feature);
+            if (!largest || owned->GetGeometryRef()->toPolygon()->get_Area() >
+                                largest->GetGeometryRef()->toPolygon()->get_Area())
+                largest = std::move(owned);
+        }
+        ASSERT_TRUE(largest);
+        ASSERT_EQ(layer->DeleteFeature(largest->GetFID()), OGRERR_NONE);
+        largest->SetFID(OGRNullFID);
+        auto* polygon = dynamic_cast<OGRPolygon*>(largest->GetGeometryRef());
+        ASSERT_NE(polygon, nullptr);
+        const std::unique_ptr<OGRGeometry> old(polygon->clone());
+        OGRPoint centre;
+        ASSERT_EQ(polygon->Centroid(&centre), OGRERR_NONE);
+        OGRLinearRing* ring = polygon->getExteriorRing();
+        bool moved = false;
+        for (int i = 1; i + 1 < ring->getNumPoints() && !moved; ++i) {
+            const double dx = ring->getX(i) - centre.getX(), dy = ring->getY(i) - centre.getY();
+            const double x = ring->getX(i) + 6 * dx / std::hypot(dx, dy);
+            const double y = ring->getY(i) + 6 * dy / std::hypot(dx, dy);
+            const int u = static_cast<int>(std::floor((x - geo[0]) / geo[1]));
+            const int v = static_cast<int>(std::floor((y - geo[3]) / geo[5]));
+            // Inside, away from the mosaic's edges.
+            if (u < 16 || v < 16 || u + 16 >= width || v + 16 >= height)
+                continue;
+            const unsigned char there = sourceBefore[static_cast<std::size_t>(v) * width + u];
+            if (there == 0 || scenes[there - 1].ToString() == largest->GetFieldAsString("scene"))
+                continue;
+            ring->setPoint(i, x, y);
+            moved = true;
+        }
+        ASSERT_TRUE(moved);
+        ASSERT_EQ(layer->CreateFeature(largest.get()), OGRERR_NONE);
+        const std::vector<unsigned char> a = Burnt(*source, *old);
+        between = Burnt(*source, *polygon);
+        for (std::size_t i = 0; i < between.size(); ++i)
+            between[i] = between[i] != a[i];
+    }
+    ASSERT_GT(std::count(between.begin(), between.end(), 1), 5);
+    // The band where blending may change the mosaic: within the blend width of those pixels.
+    std::vector<unsigned char> band(between.size(), 0);
+    for (int y = 0; y < height; ++y)
+        for (int x = 0; x < width; ++x) {
+            if (!between[static_cast<std::size_t>(y) * width + x])
+                continue;
+            for (int v = std::max(0, y - kBlend - 1); v <= std::min(height - 1, y + kBlend + 1); ++v)
+                for (int u = std::max(0, x - kBlend - 1); u <= std::min(width - 1, x + kBlend + 1); ++u)
+                    band[static_cast<std::size_t>(v) * width + u] = 1;
+        }
+    source.reset();
+
+    Dataset mosaicBefore = Open(dir.File("out/mosaic.tif"));
+    ASSERT_TRUE(mosaicBefore);
+    const std::vector<unsigned char> pixelsBefore = ReadBytes(*mosaicBefore);
+    mosaicBefore.reset();
+    const auto times = ModifiedTimes(dir.Path() / "out");
+    args.insert(args.end(), {"--seamlines", dir.File("edited.gpkg")});
+    const Result rerun = Ortho(args, dir);
+    ASSERT_EQ(rerun.status, 0) << rerun.err;
+    for (const auto& scene : SceneStates(dir))
+        EXPECT_EQ(scene.second.first, "complete") << scene.first;
+    const auto after = ModifiedTimes(dir.Path() / "out");
+    for (const auto& file : times) {
+        if (file.first.find("mosaic") == std::string::npos && file.first != "seamlines.gpkg" &&
+            file.first != "footprints.gpkg") {
+            EXPECT_EQ(after.at(file.first), file.second) << file.first;
+        }
+    }
+    ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
+    EXPECT_NE(summary.GetRoot().GetString("mosaic_reason").find("--seamlines changed"),
+              std::string::npos);
+
+    source = Open(dir.File("out/mosaic_source.tif"));
+    Dataset mosaic = Open(dir.File("out/mosaic.tif"));
+    ASSERT_TRUE(source && mosaic);
+    const std::vector<unsigned char> sourceAfter = ReadBytes(*source);
+    const std::vector<unsigned char> pixelsAfter = ReadBytes(*mosaic);
+    std::size_t movedSource = 0, strayedSource = 0, strayedPixels = 0;
+    for (std::size_t i = 0; i < sourceAfter.size(); ++i) {
+        if (sourceAfter[i] != sourceBefore[i])
+            ++(between[i] ? movedSource : strayedSource);
+        if (pixelsAfter[i] != pixelsBefore[i] && !band[i])
+            ++strayedPixels;
+    }
+    EXPECT_GT(movedSource, 0u);
+
+
+    EXPECT_EQ(strayedSource, 0u);
+    EXPECT_EQ(strayedPixels, 0u);
 }
 
 // Images of 4 pixels: one scene's footprint has 3 corners. It fails on its own, saying so, and

@@ -1,5 +1,6 @@
 #include "manifest.h"
 
+#include "steps.h"
 #include "summary.h"
 
 #include <cpl_error.h>
@@ -30,6 +31,11 @@ std::string Number(double value) {
 std::string AbsolutePath(const std::string& path) {
     std::error_code ec;
     return fs::absolute(path, ec).lexically_normal().string();
+}
+
+// A file option's value: the file however the command line names it; empty when not given.
+std::string FilePath(const std::string& file) {
+    return file.empty() ? std::string() : AbsolutePath(file);
 }
 
 std::string Joined(const std::vector<float>& values) {
@@ -123,6 +129,21 @@ const std::vector<PixelOption>& PixelOptions() {
     return options;
 }
 
+const std::vector<PixelOption>& MosaicOptions() {
+    static const std::vector<PixelOption> options = {
+        {"--cutline", false, [](const Options& o) { return FilePath(o.cutline); }},
+        {"--seamlines", false, [](const Options& o) { return FilePath(o.seamlines); }},
+        {"--dtm", false, [](const Options& o) { return FilePath(o.dtm); }},
+        {"--blend-width", false,
+         [](const Options& o) {
+             return std::to_string(BlendWidth(o));
+         }},
+        {"--blend", false, [](const Options& o) { return o.blend; }},
+        {"--balance", false, [](const Options& o) { return o.balance; }},
+    };
+    return options;
+}
+
 std::string FileIdentity::Compared() const {
     return std::to_string(size) + " bytes, hash " + hash +
            (sampled ? " of samples, modified " + modified : std::string());
@@ -205,6 +226,11 @@ void Manifest::SetFile(const std::string& role, const std::string& path,
                        const FileIdentity& identity) {
     Set(role + " " + path, identity.Compared(),
         identity.sampled || identity.modified.empty() ? "" : "modified " + identity.modified);
+}
+
+std::string Manifest::Note(const std::string& what) const {
+    const auto entry = entries_.find(what);
+    return entry == entries_.end() ? std::string() : entry->second.note;
 }
 
 std::string Manifest::ToJson(const std::string& output) const {

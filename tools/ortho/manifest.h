@@ -25,6 +25,9 @@ struct PixelOption {
     std::string (*value)(const Options& options);
 };
 const std::vector<PixelOption>& PixelOptions();
+// The options that change the mosaic alone (cutline, seamlines, blending, balance), recorded in
+// mosaic_manifest.json only: a change makes the mosaic again and keeps the scenes.
+const std::vector<PixelOption>& MosaicOptions();
 
 // A file's identity: its size, its content hash, its last change. Files up to 1 MiB are hashed
 // whole and compared by size and content; larger ones by their size, a hash of 16 blocks of
@@ -53,6 +56,9 @@ class Manifest {
     void Set(const std::string& what, const std::string& value, const std::string& note = "",
              bool showValue = true);
     void SetFile(const std::string& role, const std::string& path, const FileIdentity& identity);
+
+    // The note of an entry; empty when there is none.
+    std::string Note(const std::string& what) const;
 
     std::string ToJson(const std::string& output) const;
     // False when the file is absent or not a manifest.

@@ -72,6 +72,18 @@ void ParseLines(const std::string& text, Options& options) {
                          " is an empty slice (A:B runs lines A to B-1, counted from 0)");
 }
 
+// value when it is one of the words, else a UsageError listing them.
+std::string OneOf(const std::string& option, const std::string& value,
+                  const std::vector<std::string>& words) {
+    std::string listed;
+    for (const std::string& word : words) {
+        if (value == word)
+            return value;
+        listed += (listed.empty() ? "" : ", ") + word;
+    }
+    throw UsageError(option + ": " + Quoted(value) + " is not one of " + listed);
+}
+
 }  // namespace
 
 Options ParseOptions(const std::vector<std::string>& args) {
@@ -150,6 +162,16 @@ Options ParseOptions(const std::vector<std::string>& args) {
             options.extentSrs = take();
         } else if (name == "--cutline") {
             options.cutline = take();
+        } else if (name == "--blend-width") {
+            options.blendWidth = ParseCount(name, take());
+        } else if (name == "--blend") {
+            options.blend = OneOf(name, take(), {"feather", "multiband"});
+        } else if (name == "--balance") {
+            options.balance = OneOf(name, take(), {"gain", "gain-offset", "none"});
+        } else if (name == "--seamlines") {
+            options.seamlines = take();
+        } else if (name == "--dtm") {
+            options.dtm = take();
         } else if (name == "--resample") {
             options.resample = take();
         } else if (name == "--proc") {
@@ -270,6 +292,20 @@ Output:
                       ...; each takes the options its driver knows (with tif the orthos are
                       GeoTIFFs, the mosaic a COG); one that neither knows is refused
 
+Mosaic (only the mosaic is made again when these change):
+  --dtm PATH          ground heights without buildings (a raster, in the surface's datum and
+                      unit), for seamlines that keep off raised objects (default: estimated
+                      from the surface model)
+  --seamlines FILE    make the mosaic from these regions: the polygon layer "seamlines" (any
+                      OGR format), as DIR/seamlines.gpkg holds it and edited in a GIS, say; each
+                      feature's field "scene" names the scene its pixels come from, later
+                      features win where polygons overlap, and pixels no polygon covers are
+                      filled as without --seamlines
+  --blend-width N     blend the two scenes across each seam over N mosaic pixels (default 16;
+                      0: hard seams)
+  --blend METHOD      feather (default) or multiband (Laplacian pyramid)
+  --balance METHOD    colour balance per scene and channel: gain, gain-offset (default) or none
+
 Running:
   --jobs N, -j N      scenes run at the same time (default 1)
   --lines A:B         only lines A to B-1 of the preparation file (from 0; "A:" to the end,
@@ -285,7 +321,8 @@ Running:
 Outputs in DIR: master.txt (when images were given), prep.txt and imgset.txt (derived
 parameter files); per scene NAME_ortho.tif, NAME_vis.tif, NAME.xml (scene description, with
 TOSceneDesc_Document.dtd), NAME_footprint.gpkg and NAME_manifest.json (what made them);
-footprints.gpkg (one layer per scene), mosaic.tif, mosaic_source.tif, mosaic_manifest.json;
+footprints.gpkg (one layer per scene), mosaic.tif, mosaic_source.tif, seamlines.gpkg (the
+mosaic's regions, for --seamlines), mosaic_manifest.json;
 PNG quicklooks with world files (NAME_vis.png, mosaic.png, mosaic_source.png and its legend
 mosaic_source_legend.json); summary.json (summary-A-B.json for a slice).
 

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <array>
+#include <optional>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -42,6 +43,14 @@ struct Options {
     // --cutline FILE: a polygon layer (the first of the file, in any OGR format); mosaic pixels
     // whose centre lies outside it are left empty, as gdalwarp's -cutline.
     std::string cutline;
+    // The mosaic's seams, blending and colour balance. These change the mosaic alone.
+    std::optional<unsigned int> blendWidth;  // --blend-width: mosaic pixels; unset: the default
+    std::string blend = "feather";            // --blend: feather or multiband
+    std::string balance = "gain-offset";      // --balance: gain, gain-offset or none
+    // --seamlines FILE: the polygon layer "seamlines" (as DIR/seamlines.gpkg holds it) gives
+    // each mosaic pixel its scene; empty: seamlines chosen by the recovery.
+    std::string seamlines;
+    std::string dtm;  // --dtm: ground heights (a raster) for the seam cost; empty: estimated
     std::string resample = "bilinear";
     std::string proc;            // PROC text of the generator
     std::string format = "tif";  // file type of the ortho and visibility rasters

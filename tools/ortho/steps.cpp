@@ -1,6 +1,7 @@
 #include "steps.h"
 
 #include "files.h"
+#include "seamlines.h"
 
 #include <kestrel/trueortho.h>
 #include <silvan/parserfactory.h>
@@ -29,32 +30,25 @@
 
 namespace ortho {
 
-namespace {
+GdalErrors::GdalErrors() {
+    GDALAllRegister();
+    CPLPushErrorHandler(CPLQuietErrorHandler);
+    CPLErrorReset();
+}
 
-// GDAL's errors inside the tool: collected quietly while the object lives, then cleared.
-class GdalErrors {
-  public:
-    GdalErrors() {
-        GDALAllRegister();
-        CPLPushErrorHandler(CPLQuietErrorHandler);
-        CPLErrorReset();
-    }
-    ~GdalErrors() {
-        CPLErrorReset();
-        CPLPopErrorHandler();
-    }
-    GdalErrors(const GdalErrors&) = delete;
-    GdalErrors& operator=(const GdalErrors&) = delete;
-    std::string Reason() const {
-        const char* message = CPLGetLastErrorMsg();
-        return message != nullptr && *message != '\0' ? message : "unknown reason";
-    }
-};
+GdalErrors::~GdalErrors() {
+    CPLErrorReset();
+    CPLPopErrorHandler();
+}
 
-struct DatasetClose {
-    void operator()(GDALDataset* dataset) const { GDALClose(dataset); }
-};
-using DatasetPtr = std::unique_ptr<GDALDataset, DatasetClose>;
+std::string GdalErrors::Reason() const {
+    const char* message = CPLGetLastErrorMsg();
+    return message != nullptr && *message != '\0' ? message : "unknown reason";
+}
+
+void DatasetClose::operator()(GDALDataset* dataset) const {
+    GDALClose(dataset);
+}
 
 [[noreturn]] void FailFile(const std::string& path, const std::string& what,
                            const GdalErrors& errors) {
@@ -80,7 +74,24 @@ OGRSpatialReference GridSrs(const Grid& grid) {
     return srs;
 }
 
-}  // namespace
+DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const GdalErrors& errors,
+                            GDALDataType type) {
+    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
+    const char* createOptions[] = {"TILED=YES", "COMPRESS=DEFLATE", "SPARSE_OK=YES", nullptr};
+    RemoveFile(path);
+    DatasetPtr raster(driver == nullptr
+                          ? nullptr
+                          : driver->Create(path.c_str(), static_cast<int>(grid.pixels),
+                                           static_cast<int>(grid.lines), 1, type,
+                                           const_cast<char**>(createOptions)));
+    if (!raster)
+        FailFile(path, "cannot be created", errors);
+    std::array<double, 6> geoTransform = grid.geoTransform;
+    raster->SetGeoTransform(geoTransform.data());
+    const OGRSpatialReference srs = GridSrs(grid);
+    raster->SetSpatialRef(&srs);
+    return raster;
+}
 
 double Grid::PixelSize() const {
     return std::hypot(geoTransform[1], geoTransform[4]);
@@ -400,6 +411,18 @@ void CheckSurfaceFile(const std::string& option, const std::string& path) {
         throw UsageError(option + ": " + path + ": not found");
 }
 
+// A file (not a directory of tiles) that GDAL cannot open as a raster.
+void CheckRasterFile(const std::string& path) {
+    std::error_code ec;
+    if (path.empty() || std::filesystem::is_directory(path, ec))
+        return;
+    GdalErrors errors;
+    DatasetPtr raster(
+        GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY, nullptr, nullptr));
+    if (!raster)
+        throw UsageError("--dtm: " + path + ": cannot be opened as a raster: " + errors.Reason());
+}
+
 void CheckOutputCrs(const std::string& text) {
     if (text.empty())
         return;
@@ -556,6 +579,8 @@ std::vector<std::string> CheckOptions(Options& options) {
     CheckSurfaceFile("--dem", options.dem);
     CheckSurfaceFile("--tin", options.tin);
     CheckSurfaceFile("--cameras", options.cameras);
+    CheckSurfaceFile("--dtm", options.dtm);
+    CheckOption("--dtm", [&] { CheckRasterFile(options.dtm); });
     CheckOption("--cameras-srs", [&] {
         if (!options.camerasSrs.empty())
             kestrel::ogc::cs::ICRS{options.camerasSrs};
@@ -572,6 +597,8 @@ std::vector<std::string> CheckOptions(Options& options) {
     });
     if (!options.cutline.empty())
         CheckCutline(options.cutline);
+    if (!options.seamlines.empty())
+        CheckSeamlines(options.seamlines);
     CheckOption("--resample", [&] { options.resample = CheckResampling(options.resample); });
     CheckOption("--of", [&] { CheckFileType(options.format); });
     CheckOption("--co", [&] { CheckCreationOptions(options); });
@@ -587,12 +614,13 @@ std::vector<std::string> CheckOptions(Options& options) {
 
 namespace {
 
-// The datum and unit to open the surface with, from its file and the options.
-kestrel::dem::SurfaceHeights ResolveSurface(const Options& options) {
+// The datum and unit to open the heights of path (given by option) with, from its file and the
+// options.
+kestrel::dem::SurfaceHeights ResolveHeights(const Options& options, const std::string& path,
+                                            const std::string& option) {
     kestrel::ogc::cs::DatumType declared = kestrel::ogc::cs::DatumMSL;
     if (!options.elevref.empty())
         declared = GetVertDatum(options.elevref);
-    const std::string& path = options.dem.empty() ? options.tin : options.dem;
     try {
         return kestrel::dem::ResolveSurfaceHeights(path,
                                                    options.elevref.empty() ? nullptr : &declared,
@@ -604,28 +632,27 @@ kestrel::dem::SurfaceHeights ResolveSurface(const Options& options) {
         std::string message = e.what();
         if (message.compare(0, path.size(), path) != 0)
             message = path + ": " + message;
-        KESTREL_THROW(kestrel::DataException,
-                      (options.dem.empty() ? "--tin " : "--dem ") + message);
+        KESTREL_THROW(kestrel::DataException, option + " " + message);
     }
 }
 
-}  // namespace
-
-void CheckSurface(const Options& options) {
-    if (options.dem.empty() && options.tin.empty())
+void CheckHeights(const Options& options, const std::string& path, const std::string& option) {
+    if (path.empty())
         return;
     try {
-        ResolveSurface(options);
+        ResolveHeights(options, path, option);
     } catch (const kestrel::FileException&) {
-        // A file that cannot be read fails where the surface is opened, naming it.
+        // A file that cannot be read fails where the heights are opened, naming it.
     } catch (const kestrel::Exception& e) {
         throw UsageError(e.what());
     }
 }
 
-std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
-    const Options& options, const kestrel::mathmodel::IMathModel* model) {
-    const kestrel::dem::SurfaceHeights heights = ResolveSurface(options);
+// Heights of a raster (rasterOnly) or of a raster or TIN, corrected as the surface's.
+std::unique_ptr<kestrel::dem::IElevationSource> OpenHeights(
+    const Options& options, const std::string& path, const std::string& option, bool raster,
+    const kestrel::mathmodel::IMathModel* model) {
+    const kestrel::dem::SurfaceHeights heights = ResolveHeights(options, path, option);
     double offset = 0.0, scale = 1.0;
     GetElFactor(options.elfactor, offset, scale);
     // The unit once: the declared one where the file says none (the source applies the file's).
@@ -636,24 +663,47 @@ std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
         GetVertDatum(options.elevref) == kestrel::ogc::cs::DatumMathModel &&
         modelDatum != heights.file.datum) {
         KESTREL_THROW(kestrel::DataException,
-                      (options.dem.empty() ? "--tin " + options.tin : "--dem " + options.dem) +
-                          ": its CRS says the heights are \"" + heights.file.name +
+                      option + " " + path + ": its CRS says the heights are \"" +
+                          heights.file.name +
                           "\", which is not the math model's vertical datum, as --elevref "
                           "MATHMODEL declares: leave --elevref out to follow the file");
     }
-    if (!options.dem.empty()) {
+    if (raster) {
         // The first band; no-data as the raster declares it.
         return std::unique_ptr<kestrel::dem::IElevationSource>(
-            GetDem(options.dem, 0, offset, scale, std::numeric_limits<float>::quiet_NaN(), datum,
+            GetDem(path, 0, offset, scale, std::numeric_limits<float>::quiet_NaN(), datum,
                    modelDatum));
     }
     // The first layer holding triangles or 3-D points.
     std::unique_ptr<kestrel::dem::IElevationSource> tin(
-        GetDbm(options.tin, 0, offset, scale, datum, modelDatum));
+        GetDbm(path, 0, offset, scale, datum, modelDatum));
     if (!tin)
-        KESTREL_THROW(kestrel::FileNotFoundException, options.tin,
+        KESTREL_THROW(kestrel::FileNotFoundException, path,
                       "cannot be opened as a TIN: no layer of triangles or 3-D points");
     return tin;
+}
+
+}  // namespace
+
+void CheckSurface(const Options& options) {
+    if (options.dem.empty() && options.tin.empty())
+        return;
+    CheckHeights(options, options.dem.empty() ? options.tin : options.dem,
+                 options.dem.empty() ? "--tin" : "--dem");
+    CheckHeights(options, options.dtm, "--dtm");
+}
+
+std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
+    const Options& options, const kestrel::mathmodel::IMathModel* model) {
+    return options.dem.empty() ? OpenHeights(options, options.tin, "--tin", false, model)
+                               : OpenHeights(options, options.dem, "--dem", true, model);
+}
+
+std::unique_ptr<kestrel::dem::IElevationSource> OpenGround(
+    const Options& options, const kestrel::mathmodel::IMathModel* model) {
+    if (options.dtm.empty())
+        return nullptr;
+    return OpenHeights(options, options.dtm, "--dtm", true, model);
 }
 
 std::string SurfaceHoles(const Options& options, const Grid& grid) {
@@ -962,19 +1012,7 @@ DatasetPtr OpenCutline(const std::string& path, const GdalErrors& errors) {
 void BurnCutline(const std::string& cutline, const Grid& grid, const std::string& path) {
     GdalErrors errors;
     DatasetPtr vector = OpenCutline(cutline, errors);
-    GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
-    const char* createOptions[] = {"TILED=YES", "COMPRESS=DEFLATE", "SPARSE_OK=YES", nullptr};
-    RemoveFile(path);
-    DatasetPtr mask(driver == nullptr ? nullptr
-                                      : driver->Create(path.c_str(), static_cast<int>(grid.pixels),
-                                                       static_cast<int>(grid.lines), 1, GDT_Byte,
-                                                       const_cast<char**>(createOptions)));
-    if (!mask)
-        FailFile(path, "cannot be created", errors);
-    std::array<double, 6> geoTransform = grid.geoTransform;
-    mask->SetGeoTransform(geoTransform.data());
-    const OGRSpatialReference srs = GridSrs(grid);
-    mask->SetSpatialRef(&srs);
+    DatasetPtr mask = CreateGridRaster(grid, path, errors);
     int band = 1;
     double burn = 1.0;
     OGRLayerH layer = OGRLayer::ToHandle(vector->GetLayer(0));
@@ -1027,9 +1065,14 @@ void CopyRaster(const std::string& from, const std::string& to, const std::strin
 
 }  // namespace
 
-void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes, const Grid& grid,
-                   const std::string& mosaic, const std::string& source,
-                   const StepProgress& progress) {
+unsigned int BlendWidth(const Options& options) {
+    return options.blendWidth ? *options.blendWidth : kestrel::processes::RecoveryJob().blendWidth;
+}
+
+MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes,
+                           const std::vector<std::string>& others, const Grid& grid,
+                           const std::string& mosaic, const std::string& source,
+                           const StepProgress& progress) {
     std::vector<std::unique_ptr<kestrel::mathmodel::IMathModel>> models;
     kestrel::processes::RecoveryJob job;
     for (const RecoveryScene& scene : scenes) {
@@ -1042,22 +1085,30 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
         input.model = models.back().get();
         job.scenes.push_back(input);
     }
-    // Heights for the viewing angles, in the models' datum.
-    const std::unique_ptr<kestrel::dem::IElevationSource> surface =
-        OpenSurface(options, models.empty() ? nullptr : models.front().get());
-    job.surface = surface.get();
     job.geocoding = kestrel::ogc::cs::GeocodingInfo(grid.geoTransform);
     job.pixels = grid.pixels;
     job.lines = grid.lines;
+    // Heights for the viewing angles and the seam cost, in the models' datum.
+    const kestrel::mathmodel::IMathModel* model = models.empty() ? nullptr : models.front().get();
+    const std::unique_ptr<kestrel::dem::IElevationSource> surface = OpenSurface(options, model);
+    job.surface = surface.get();
+    const std::unique_ptr<kestrel::dem::IElevationSource> ground = OpenGround(options, model);
+    job.ground = ground.get();
+    job.blendWidth = BlendWidth(options);
+    using Job = kestrel::processes::RecoveryJob;
+    job.blend = options.blend == "multiband" ? Job::Blend::Multiband : Job::Blend::Feather;
+    job.balance = options.balance == "none"   ? Job::Balance::None
+                  : options.balance == "gain" ? Job::Balance::Gain
+                                              : Job::Balance::GainOffset;
     // Files beside the mosaic under temporary names, removed whatever happens: the burnt
-    // cutline, and the lossless mosaic that a lossy type is copied from.
+    // cutline and regions, and the lossless mosaic that a lossy type is copied from.
     struct Removed {
         std::string path;
         ~Removed() {
             if (!path.empty())
                 RemoveFile(path);
         }
-    } mask, lossless;
+    } mask, regions, lossless;
     // A lossy type: recovery writes GeoTIFFs (the source raster stays one), and the mosaic is
     // copied into the type.
     const std::string format = MosaicFormat(options);
@@ -1077,6 +1128,16 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
         BurnCutline(options.cutline, grid, mask.path);
         job.maskPath = mask.path;
     }
+    MosaicResult result;
+    if (!options.seamlines.empty()) {
+        std::vector<SeamlineScene> named;
+        for (const RecoveryScene& scene : scenes)
+            named.push_back({scene.name, scene.masterLine, scene.ortho, scene.source});
+        regions.path = mosaic + ".regions.tif";
+        BurnSeamlines(options.seamlines, named, others, grid, regions.path,
+                      result.seamlinesSkipped);
+        job.regionsPath = regions.path;
+    }
 
     RecoveryProcess process(options.proc, job, progress);
     process.Execute();
@@ -1084,6 +1145,9 @@ void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& sce
         KESTREL_THROW(kestrel::DataException, "occlusion recovery was cancelled");
     if (lossy)
         CopyRaster(lossless.path, mosaic, format, OptionText("", options.creationOptions));
+    result.gain = process.Result().gain;
+    result.offset = process.Result().offset;
+    return result;
 }
 
 void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid,

@@ -9,13 +9,17 @@
 #include <silvan/polygon.h>
 #include <silvan/toimgsetparser.h>
 
+#include <gdal.h>
+
 #include <array>
 #include <functional>
 #include <memory>
 #include <string>
 #include <vector>
 
+class GDALDataset;
 class OGRGeometry;
+class OGRSpatialReference;
 
 namespace ortho {
 
@@ -63,10 +67,10 @@ std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options
 std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options,
                                                           const SceneInput& scene);
 
-// Checks what the surface model's file says of its heights (vertical datum and unit) against
-// --elevref and --elunits, without reading the heights: a contradiction throws, naming the file
-// and the option. Where the file says nothing, the options hold (MSL and metres by default).
-// Throws UsageError; a file that cannot be read is left to OpenSurface.
+// Checks what the surface model's file (and --dtm's) says of its heights (vertical datum and
+// unit) against --elevref and --elunits, without reading the heights: a contradiction throws,
+// naming the file and the option. Where the file says nothing, the options hold (MSL and metres
+// by default). Throws UsageError; a file that cannot be read is left to OpenSurface.
 void CheckSurface(const Options& options);
 
 // The surface model of the options (--dem or --tin) with the heights corrected and delivered in
@@ -74,6 +78,9 @@ void CheckSurface(const Options& options);
 // --elevref MATHMODEL over a file that says its datum, the check that the model's datum is that
 // one. The caller owns it.
 std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
+    const Options& options, const kestrel::mathmodel::IMathModel* model);
+// The ground heights of --dtm, opened and corrected as the surface model; null without --dtm.
+std::unique_ptr<kestrel::dem::IElevationSource> OpenGround(
     const Options& options, const kestrel::mathmodel::IMathModel* model);
 
 // One line for the log: how many posts of the raster surface model under the grid have no
@@ -155,6 +162,8 @@ struct RecoveryScene {
     std::string visibility;
     RadiometricDiff radioDif = RadioDifAny;
     int dbmPxErr = 0;
+    std::string name;  // NAME of NAME_ortho.tif, as the seamline layer names the scene
+    unsigned int masterLine = 0;
 };
 
 // The GDAL format of the mosaic: a Cloud Optimized GeoTIFF when --of is a GeoTIFF type, the
@@ -169,12 +178,28 @@ std::string ClassRasterType(const std::string& type);
 // UsageError naming the option.
 void CheckCutline(const std::string& path);
 
-// Fills the hidden ground of each scene from the others into the mosaic, and records in
-// source which scene each mosaic pixel came from; with --cutline, pixels outside it are left
-// empty (the cutline is burnt into a temporary raster beside the mosaic, removed after).
-void RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes,
-                   const Grid& grid, const std::string& mosaic, const std::string& source,
-                   const StepProgress& progress);
+// The blend width of the mosaic: --blend-width, else the recovery's default.
+unsigned int BlendWidth(const Options& options);
+
+// What the mosaic step did besides writing the rasters.
+struct MosaicResult {
+    // The colour balance applied, per scene (in the order given) and channel:
+    // value * gain + offset.
+    std::vector<std::vector<double>> gain, offset;
+    // Scenes of the master file that --seamlines names but that are not mosaicked in this run
+    // (failed, outside the area of interest, not in the image set): their polygons are left out.
+    std::vector<std::string> seamlinesSkipped;
+};
+
+// Fills the hidden ground of each scene from the others into the mosaic on the common grid,
+// and records in source which scene each mosaic pixel came from; with --cutline, pixels
+// outside it are left empty; with --seamlines, the layer's regions (burnt onto the grid)
+// choose each pixel's scene, others (the master file's other scenes) may be named in it.
+// Cutline and regions are burnt into temporary rasters beside the mosaic, removed after.
+MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes,
+                           const std::vector<std::string>& others, const Grid& grid,
+                           const std::string& mosaic, const std::string& source,
+                           const StepProgress& progress);
 
 // Copies each scene's footprint layer into one GeoPackage, one layer per scene named after it.
 struct FootprintLayer {
@@ -191,6 +216,32 @@ enum class Quicklook { Image, Visibility, SourceIndex };
 void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook kind);
 // The colour of a value of the source raster in its quicklook, "#rrggbb".
 std::string SourceColour(unsigned int value);
+
+// GDAL's errors inside the tool: collected quietly while the object lives, then cleared.
+class GdalErrors {
+  public:
+    GdalErrors();
+    ~GdalErrors();
+    GdalErrors(const GdalErrors&) = delete;
+    GdalErrors& operator=(const GdalErrors&) = delete;
+    std::string Reason() const;
+};
+
+struct DatasetClose {
+    void operator()(GDALDataset* dataset) const;
+};
+using DatasetPtr = std::unique_ptr<GDALDataset, DatasetClose>;
+
+// Throws FileAccessException naming the path, what failed and GDAL's reason.
+[[noreturn]] void FailFile(const std::string& path, const std::string& what,
+                           const GdalErrors& errors);
+// A new, empty GeoPackage at path (an older file there removed).
+DatasetPtr CreateVector(const std::string& path, const GdalErrors& errors);
+// The grid's CRS, axes in GIS order (easting, northing).
+OGRSpatialReference GridSrs(const Grid& grid);
+// A working one-band GeoTIFF on the grid, all 0 (tiled, sparse), for layers burnt in.
+DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const GdalErrors& errors,
+                            GDALDataType type = GDT_Byte);
 
 // text with A-Z lower-cased, whatever the locale.
 std::string Lower(std::string text);

@@ -50,11 +50,11 @@ void AppendUtf8(std::string& out, unsigned int code) {
     }
 }
 
-std::string Number(double value) {
+std::string Number(double value, const char* format = "%.3f") {
     if (!std::isfinite(value))
         return "null";
     char text[32];
-    std::snprintf(text, sizeof text, "%.3f", value);
+    std::snprintf(text, sizeof text, format, value);
     return text;
 }
 
@@ -172,6 +172,31 @@ std::string LegendJson(const std::vector<std::string>& scenes,
     return out.str();
 }
 
+std::string BalanceJson(const MosaicBalance& balance) {
+    std::ostringstream out;
+    const auto list = [&](const std::vector<std::vector<double>>& values, std::size_t scene) {
+        out << "[";
+        if (scene < values.size()) {
+            for (std::size_t c = 0; c < values[scene].size(); ++c)
+                out << (c ? ", " : "") << Number(values[scene][c], "%.6g");
+        }
+        out << "]";
+    };
+    out << "{\"method\": " << JsonString(balance.method) << ", \"blend\": "
+        << JsonString(balance.blend) << ", \"blend_width\": " << balance.blendWidth
+        << ", \"seamlines\": " << PathOrNull(balance.seamlines) << ", \"scenes\": [";
+    for (std::size_t i = 0; i < balance.scenes.size(); ++i) {
+        out << (i ? ", " : "") << "{\"scene\": " << JsonString(balance.scenes[i])
+            << ", \"gain\": ";
+        list(balance.gain, i);
+        out << ", \"offset\": ";
+        list(balance.offset, i);
+        out << "}";
+    }
+    out << "]}";
+    return out.str();
+}
+
 std::string ToJson(const RunSummary& summary) {
     std::ostringstream out;
     out << "{\n  \"master\": " << JsonString(summary.master)
@@ -201,6 +226,8 @@ std::string ToJson(const RunSummary& summary) {
     out << "],\n";
     out << "  \"mosaic_legend\": " << LegendJson(summary.mosaicScenes, summary.mosaicColours)
         << ",\n";
+    out << "  \"seamlines\": " << PathOrNull(summary.seamlines) << ",\n";
+    out << "  \"balance\": " << (summary.balance.empty() ? "null" : summary.balance) << ",\n";
     out << "  \"footprints\": " << PathOrNull(summary.footprints) << ",\n";
     out << "  \"quicklooks\": [";
     for (std::size_t i = 0; i < summary.quicklooks.size(); ++i)

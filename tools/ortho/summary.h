@@ -32,6 +32,9 @@ struct RunSummary {
     // The colour of each value in the source raster's quicklook: [0] for 0, [k] for value k.
     std::vector<std::string> mosaicColours;
     std::string mosaicReason;  // why the mosaic was made in this run; empty: kept
+    std::string seamlines;  // the mosaic's regions as polygons (seamlines.gpkg)
+    // The mosaic's seams, blending and colour balance, as BalanceJson writes them; empty: null.
+    std::string balance;
     std::string footprints;
     std::vector<std::string> quicklooks;
     std::vector<std::string> errors;  // failures outside the scenes
@@ -45,6 +48,20 @@ std::string ToJson(const RunSummary& summary);
 // "colour": "#282828"}, then {"value": k, "scene": scenes[k-1], "colour": colours[k]}.
 std::string LegendJson(const std::vector<std::string>& scenes,
                        const std::vector<std::string>& colours);
+
+// How the mosaic was put together: its seamlines, blending and colour balance.
+struct MosaicBalance {
+    std::string method;  // --balance
+    std::string blend;   // --blend
+    unsigned int blendWidth = 0;
+    std::string seamlines;  // the --seamlines file; empty: chosen by the recovery
+    std::vector<std::string> scenes;
+    std::vector<std::vector<double>> gain, offset;  // per scene and channel
+};
+// One line: {"method": "gain-offset", "blend": "feather", "blend_width": 16, "seamlines": null,
+// "scenes": [{"scene": "north", "gain": [1.02, ...], "offset": [-1.5, ...]}, ...]}; a scene
+// for which the recovery reported no balance has empty lists.
+std::string BalanceJson(const MosaicBalance& balance);
 
 // A JSON string of any bytes, valid UTF-8: control characters escaped, and each byte that is
 // not part of valid UTF-8 written as the lone surrogate \udcXX (Python's "surrogateescape"),

@@ -3,6 +3,7 @@
 #include "files.h"
 #include "inputs.h"
 #include "interrupt.h"
+#include "seamlines.h"
 
 #include <silvan/parserfactory.h>
 #include <silvan/tomfileparser.h>
@@ -333,6 +334,12 @@ int Workflow::Run() {
     try {
         auto step = Clock::now();
         Prepare();
+        if (!options_.seamlines.empty()) {
+            std::vector<std::string> names;
+            for (const Scene& scene : scenes_)
+                names.push_back(scene.name);
+            CheckSeamlineScenes(options_.seamlines, names);
+        }
         summary_.timings.emplace_back("prepare", SecondsSince(step));
         const bool anyScene =
             std::any_of(scenes_.begin(), scenes_.end(), [](const Scene& s) { return s.inSlice; });
@@ -556,6 +563,7 @@ std::vector<std::pair<std::string, std::string>> Workflow::RunOutputs() const {
             {QuicklookName(outDir_, "mosaic", f), "the mosaic's quicklook"},
             {QuicklookName(outDir_, "mosaic_source", c), "the source raster's quicklook"},
             {Join(outDir_, "mosaic_source_legend.json"), "the source quicklook's legend"},
+            {Join(outDir_, "seamlines.gpkg"), "the mosaic's seamlines"},
             {Join(outDir_, "mosaic_manifest.json"), "the mosaic's record of inputs"}};
     if (options_.hasLines)
         outputs.emplace_back(Join(outDir_, SummaryName()), "the slice's summary");
@@ -573,6 +581,14 @@ void Workflow::CheckOutputsSpareInputs(const std::vector<std::string>& sources) 
         read(file, "the surface model");
     if (!options_.cutline.empty())
         read(options_.cutline, "the cutline");
+    // Each run writes DIR/seamlines.gpkg anew: an edited one is handed back as a copy.
+    if (!options_.seamlines.empty())
+        read(options_.seamlines, "the --seamlines layer (hand back an edited copy of "
+                                 "seamlines.gpkg, which each run writes anew)");
+    if (!options_.dtm.empty()) {
+        for (const std::string& file : FilesOf(options_.dtm))
+            read(file, "the ground model");
+    }
     std::vector<std::pair<std::string, std::string>> outputs = RunOutputs();
     std::set<std::string> names;
     const fs::path masterDir = fs::absolute(options_.master).parent_path();
@@ -1025,6 +1041,7 @@ void Workflow::Recover() {
     const std::vector<std::string> quicklooks = {QuicklookName(outDir_, "mosaic", ext),
                                                  QuicklookName(outDir_, "mosaic_source", classes)};
     const std::string legend = Join(outDir_, "mosaic_source_legend.json");
+    const std::string seamlines = Join(outDir_, "seamlines.gpkg");
 
     // The mosaic is made from the scenes' outputs, so from what made them, and from the
     // image set's values and the options.
@@ -1036,11 +1053,17 @@ void Workflow::Recover() {
     for (const PixelOption& option : PixelOptions())
         made.Set(option.name, option.value(options_));
     made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
-    // The cutline changes the mosaic alone, not the scenes.
-    made.Set("--cutline",
-             options_.cutline.empty() ? "" : fs::absolute(options_.cutline).lexically_normal().string());
+    // Cutline, seamlines, ground, blending and balance change the mosaic alone, not the scenes.
+    for (const PixelOption& option : MosaicOptions())
+        made.Set(option.name, option.value(options_));
     if (!options_.cutline.empty())
         made.SetFile("cutline file", options_.cutline, Identity(options_.cutline));
+    if (!options_.seamlines.empty())
+        made.SetFile("seamlines file", options_.seamlines, Identity(options_.seamlines));
+    if (!options_.dtm.empty()) {
+        for (const std::string& file : FilesOf(options_.dtm))
+            made.SetFile("ground file", file, Identity(file));
+    }
     for (const Scene& scene : scenes_) {
         if (scene.status != "done" && scene.status != "complete")
             continue;
@@ -1054,8 +1077,16 @@ void Workflow::Recover() {
         if (!scene.inImageSet)
             continue;
         inputs.push_back({scene.id, scene.input.source, scene.input.mmseg, scene.ortho,
-                          scene.visibility, scene.radioDif, scene.dbmPxErr});
+                          scene.visibility, scene.radioDif, scene.dbmPxErr, scene.name,
+                          scene.masterLine});
         mosaicScenes.push_back(scene.name);
+    }
+    // The master file's scenes that are not mosaicked, which an edited layer may still name.
+    std::vector<std::string> others;
+    for (const Scene& scene : scenes_) {
+        if (!scene.name.empty() &&
+            std::find(mosaicScenes.begin(), mosaicScenes.end(), scene.name) == mosaicScenes.end())
+            others.push_back(scene.name);
     }
     // The source quicklook's colours: value k stands for mosaicScenes[k-1].
     std::vector<std::string> colours;
@@ -1066,7 +1097,8 @@ void Workflow::Recover() {
 
     std::vector<std::string> outputs = {footprints};
     if (!inputs.empty())
-        outputs.insert(outputs.end(), {mosaic, source, quicklooks[0], quicklooks[1], legend});
+        outputs.insert(outputs.end(),
+                       {mosaic, source, quicklooks[0], quicklooks[1], legend, seamlines});
     std::string reason;
     Manifest earlier;
     if (options_.overwrite)
@@ -1079,8 +1111,10 @@ void Workflow::Recover() {
         if (reason.empty() && !FileExists(output))
             reason = output + " is missing";
     }
+    std::string balance;
     if (reason.empty()) {
         progress_.Info("mosaic and footprints are up to date");
+        balance = earlier.Note("--balance");
     } else {
         if (reason != "not made before")
             progress_.Info("mosaic and footprints made again: " + reason);
@@ -1098,14 +1132,36 @@ void Workflow::Recover() {
             progress_.Begin("recovery");
             const auto start = Clock::now();
             try {
-                RecoverMosaic(options_, inputs, grid_, PartName(mosaic), PartName(source),
-                              [this](double fraction) {
-                                  progress_.Update("recovery", fraction, "mosaic");
-                                  return !Interrupted();
-                              });
+                const MosaicResult result = RecoverMosaic(
+                    options_, inputs, others, grid_, PartName(mosaic), PartName(source),
+                    [this](double fraction) {
+                        progress_.Update("recovery", fraction, "mosaic");
+                        return !Interrupted();
+                    });
+                for (const std::string& name : result.seamlinesSkipped)
+                    progress_.Info("warning: --seamlines: the polygons of scene " + name +
+                                   " are left out: it is not mosaicked in this run");
                 Publish(PartName(mosaic), mosaic);
                 Publish(PartName(source), source);
                 AddStep("occlusion recovery", SecondsSince(start));
+                step = Clock::now();
+                std::vector<SeamlineScene> named;
+                for (const RecoveryScene& scene : inputs)
+                    named.push_back({scene.name, scene.masterLine, scene.ortho, scene.source});
+                WriteSeamlines(source, named, grid_, PartName(seamlines));
+                Publish(PartName(seamlines), seamlines);
+                AddStep("seamlines", SecondsSince(step));
+                MosaicBalance applied;
+                applied.method = options_.balance;
+                applied.blend = options_.blend;
+                applied.blendWidth = BlendWidth(options_);
+                applied.seamlines = options_.seamlines;
+                applied.scenes = mosaicScenes;
+                applied.gain = result.gain;
+                applied.offset = result.offset;
+                balance = BalanceJson(applied);
+                // Recorded, not compared: what a rerun that keeps the mosaic reports.
+                made.Set("--balance", options_.balance, balance);
                 step = Clock::now();
                 WriteQuicklook(mosaic, PartName(quicklooks[0]), Quicklook::Image);
                 Publish(PartName(quicklooks[0]), quicklooks[0]);
@@ -1115,7 +1171,8 @@ void Workflow::Recover() {
                 AddStep("mosaic quicklooks", SecondsSince(step));
                 ThrowIfInterrupted();
             } catch (const std::exception& e) {
-                for (const std::string& path : {mosaic, source, quicklooks[0], quicklooks[1]})
+                for (const std::string& path :
+                     {mosaic, source, quicklooks[0], quicklooks[1], seamlines})
                     RemoveFile(PartName(path));
                 progress_.End("recovery", false, SecondsSince(start), Explain(e));
                 ThrowIfInterrupted();
@@ -1132,6 +1189,8 @@ void Workflow::Recover() {
         summary_.mosaicScenes = mosaicScenes;
         summary_.mosaicColours = colours;
         summary_.quicklooks = quicklooks;
+        summary_.seamlines = seamlines;
+        summary_.balance = balance;
     }
 }
 
