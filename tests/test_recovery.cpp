@@ -91,14 +91,19 @@ samplecity::CityOptions OppositeViews::options;
 samplecity::GridSurface* OppositeViews::surface = nullptr;
 samplecity::RpcModel* OppositeViews::models[2] = {nullptr, nullptr};
 
-// Without seamlines and with them (blended across the seams), each scene fills the other's
-// hidden strip with its own values: a scene's weight is zero where it does not see the ground.
+// Without seamlines and with them (blended across the seams; the ground estimated or given),
+// each scene fills the other's hidden strip with its own values: a scene's weight is zero where
+// it does not see the ground.
 TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
-    for (const bool seamlines : {false, true}) {
-        SCOPED_TRACE(seamlines ? "seamlines" : "first-ranked scene per pixel");
+    for (const int variant : {0, 1, 2}) {
+        const bool seamlines = variant > 0;
+        SCOPED_TRACE(variant == 0   ? "first-ranked scene per pixel"
+                     : variant == 1 ? "seamlines, ground from the surface"
+                                    : "seamlines, ground given");
         RecoveryJob job = Job(1, 1, 1, true);
         job.seamlines = seamlines;
         job.blendWidth = seamlines ? 16 : 0;
+        job.ground = variant == 2 ? surface : nullptr;
         const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
         ASSERT_TRUE(result.completed);
         const auto vis1 = Visibility(0), vis2 = Visibility(1);
@@ -308,11 +313,12 @@ TEST(RecoveryChoice, PixelErrorNeighbourhoodMatchesTheRuleAtEveryPixel) {
 }
 
 // Many scenes on many threads under a small limit of open files, and a thread count far beyond
-// the work: each scene's rasters are opened once, and threads are capped by the tiles.
+// the work: the threads share each scene's rasters, more scenes than stay open at once (closed
+// and opened again as tiles need them), and threads are capped by the tiles.
 TEST(RecoveryChoice, ThreadsShareEachScenesFilesAndAreCappedByTheWork) {
     TempDir dir;
     std::vector<std::vector<unsigned char>> visibility;
-    const RecoveryJob job = synthetic::MakeScenes(dir, 40, 0.01, 7, visibility);
+    const RecoveryJob job = synthetic::MakeScenes(dir, 70, 0.01, 7, visibility);
     const auto expected = synthetic::ExpectedSource(job, visibility);
 #if !defined(_WIN32)
     rlimit saved{};
@@ -504,6 +510,32 @@ TEST(RecoveryBalance, TwoExposuresMakeOneMosaicWithoutAStep) {
             EXPECT_NEAR(result.gain[0][0] / result.gain[1][0], 1.2, 0.01);
         }
     }
+}
+
+// A pixel a scene sees whose value is the no-data value is filled with the nearest other value,
+// not left for empty.
+TEST(RecoveryChoice, ASeenPixelAtTheNoDataValueStaysFilled) {
+    TempDir dir;
+    std::vector<std::vector<unsigned char>> visibility;
+    RecoveryJob job = synthetic::MakeScenes(dir, 1, 0.0, 3, visibility);
+    std::vector<unsigned char> ortho(visibility[0].size(), 10);
+    ortho[0] = ortho[1] = 0;
+    visibility[0][0] = visibility[0][1] = VISIBILITY_SEEN;
+    visibility[0][2] = VISIBILITY_OUTSIDE;
+    synthetic::WriteBand(job.scenes[0].orthoPath, ortho);
+    synthetic::WriteBand(job.scenes[0].visibilityPath, visibility[0]);
+    const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
+    ASSERT_TRUE(result.completed);
+    const auto mosaic = ReadBand(job.mosaicPath), source = ReadBand(job.sourcePath);
+    EXPECT_EQ(mosaic[0], 1);
+    EXPECT_EQ(mosaic[1], 1);
+    EXPECT_EQ(source[0], 1);
+    EXPECT_EQ(mosaic[2], 0);
+    EXPECT_EQ(source[2], 0);
+    size_t seen = 0;
+    for (const unsigned char v : visibility[0])
+        seen += v == VISIBILITY_SEEN;
+    EXPECT_EQ(result.filled, seen);
 }
 
 }  // namespace

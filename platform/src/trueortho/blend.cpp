@@ -79,38 +79,45 @@ std::vector<int> ScenesWithRegions(const BlendTile& tile, int x0, int y0) {
     return order;
 }
 
+// One band of the window of w x h pixels at (x0, y0) of the tile, each pixel its region's value,
+// `fill` where no region, into out (w x h).
+void RegionValues(const BlendTile& tile, int x0, int y0, int w, int h, int band, float fill,
+                  float* out) {
+    const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
+    std::vector<const float*> scene(tile.scenes.size());
+    for (std::size_t k = 0; k < scene.size(); ++k)
+        scene[k] = tile.values[k].data() + full * band;
+    for (int j = 0; j < h; ++j) {
+        const std::size_t start = static_cast<std::size_t>(j + y0) * tile.width + x0;
+        const int* label = tile.labels.data() + start;
+        float* o = out + static_cast<std::size_t>(j) * w;
+        for (int i = 0; i < w; ++i)
+            o[i] = label[i] < 0 ? fill : scene[label[i]][start + i];
+    }
+}
+
 // Every inner pixel its region's value; noData where no region.
 void HardSeams(const BlendTile& tile, float noData, std::vector<float>& out) {
     const int b = tile.border, w = tile.width - 2 * b, h = tile.height - 2 * b;
     const std::size_t plane = static_cast<std::size_t>(w) * h;
-    const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
     out.resize(plane * tile.bands);
-    std::vector<const float*> scene(tile.scenes.size());
-    for (int band = 0; band < tile.bands; ++band) {
-        for (std::size_t k = 0; k < scene.size(); ++k)
-            scene[k] = tile.values[k].data() + full * band;
-        for (int j = 0; j < h; ++j) {
-            const std::size_t start = static_cast<std::size_t>(j + b) * tile.width + b;
-            const int* label = tile.labels.data() + start;
-            float* o = out.data() + plane * band + static_cast<std::size_t>(j) * w;
-            for (int i = 0; i < w; ++i)
-                o[i] = label[i] < 0 ? noData : scene[label[i]][start + i];
-        }
-    }
+    for (int band = 0; band < tile.bands; ++band)
+        RegionValues(tile, b, b, w, h, band, noData, out.data() + plane * band);
 }
 
 // ---- Feather -------------------------------------------------------------------------------
 
-// Squared distances from each pixel of the tile to the nearest pixel labelled `label`: exact
-// where the distance is below `reach`, kFar where it is not. Column distances first, then the
-// lower envelope of parabolas along each row (Felzenszwalb and Huttenlocher).
+// Squared distances from each pixel of a window of the tile to the nearest pixel of the window
+// labelled `label`: exact where the distance is below `reach`, kFar where it is not. Column
+// distances first, then the lower envelope of parabolas along each row (Felzenszwalb and
+// Huttenlocher).
 class RegionDistance {
   public:
-    void Compute(const BlendTile& tile, int label, int reach, std::vector<std::int32_t>& d2) {
-        const int w = tile.width, h = tile.height;
+    void Compute(const BlendTile& tile, int x0, int y0, int w, int h, int label, int reach,
+                 std::vector<std::int32_t>& d2) {
         column_.resize(static_cast<std::size_t>(w) * h);
         for (int y = 0; y < h; ++y) {
-            const int* lab = tile.labels.data() + static_cast<std::size_t>(y) * w;
+            const int* lab = tile.labels.data() + static_cast<std::size_t>(y0 + y) * tile.width + x0;
             int* g = column_.data() + static_cast<std::size_t>(y) * w;
             if (y == 0)
                 for (int x = 0; x < w; ++x)
@@ -179,10 +186,40 @@ class RegionDistance {
     std::vector<double> bounds_;
 };
 
+// Feather works on blocks of the inner tile, each with the pixels within reach around it.
+constexpr int kBlock = 64;
+
+// One bit per scene (scenes from the 64th on share the last).
+std::uint64_t SceneBit(int k) { return std::uint64_t{1} << std::min(k, 63); }
+
+// The scenes whose regions meet each block of kBlock x kBlock pixels of the whole tile.
+std::vector<std::uint64_t> BlockScenes(const BlendTile& tile, int blocksX, int blocksY) {
+    std::vector<std::uint64_t> bits(static_cast<std::size_t>(blocksX) * blocksY, 0);
+    for (int y = 0; y < tile.height; ++y) {
+        const int* label = tile.labels.data() + static_cast<std::size_t>(y) * tile.width;
+        std::uint64_t* row = bits.data() + static_cast<std::size_t>(y / kBlock) * blocksX;
+        for (int bx = 0; bx < blocksX; ++bx) {
+            int previous = -1;
+            for (int x = bx * kBlock; x < std::min((bx + 1) * kBlock, tile.width); ++x)
+                if (label[x] != previous) {
+                    previous = label[x];
+                    if (previous >= 0)
+                        row[bx] |= SceneBit(previous);
+                }
+        }
+    }
+    return bits;
+}
+
 // Reused from tile to tile by each thread.
 struct FeatherBuffers {
     RegionDistance distance;
     std::vector<std::vector<std::int32_t>> d2;
+    std::vector<float> weight;
+};
+
+struct Rect {
+    int x0, y0, x1, y1;
 };
 
 void Feather(const BlendTile& tile, const std::vector<int>& order, int blendWidth, float noData,
@@ -191,19 +228,11 @@ void Feather(const BlendTile& tile, const std::vector<int>& order, int blendWidt
     HardSeams(tile, noData, out);
     // A scene takes part at a pixel up to blendWidth / 2 + 1/2 pixels outside its region (the
     // seam lies half a pixel from the centres of the pixels beside it): 4 d^2 < (W + 1)^2.
+    const int reach = blendWidth / 2 + 1;
     const std::int64_t limit = static_cast<std::int64_t>(blendWidth + 1) * (blendWidth + 1);
     const auto inReach = [limit](std::int32_t squared) {
         return 4 * static_cast<std::int64_t>(squared) < limit;
     };
-    thread_local FeatherBuffers buffers;
-    std::vector<std::vector<std::int32_t>>& d2 = buffers.d2;
-    d2.resize(std::max(d2.size(), tile.scenes.size()));
-    for (const int k : order)
-        buffers.distance.Compute(tile, k, blendWidth / 2 + 1, d2[k]);
-
-    const int b = tile.border, w = tile.width - 2 * b, h = tile.height - 2 * b;
-    const std::size_t plane = static_cast<std::size_t>(w) * h;
-    const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
     const float width = static_cast<float>(blendWidth);
     // The weight of a scene d pixels (centre to centre) from its region, and of the region's own
     // scene d pixels from the nearest other region.
@@ -214,51 +243,87 @@ void Feather(const BlendTile& tile, const std::vector<int>& order, int blendWidt
         return std::min(1.0f, (width - 1.0f + 2.0f * std::sqrt(static_cast<float>(squared))) /
                                   (2.0f * width));
     };
-    std::vector<float> weight(tile.scenes.size());
-    for (int j = 0; j < h; ++j)
-        for (int i = 0; i < w; ++i) {
-            const std::size_t p = static_cast<std::size_t>(j + b) * tile.width + i + b;
-            const int label = tile.labels[p];
-            if (label < 0)
+
+    const int blocksX = (tile.width + kBlock - 1) / kBlock, blocksY = (tile.height + kBlock - 1) / kBlock;
+    const std::vector<std::uint64_t> blockScenes = BlockScenes(tile, blocksX, blocksY);
+    thread_local FeatherBuffers buffers;
+    std::vector<std::vector<std::int32_t>>& d2 = buffers.d2;
+    d2.resize(std::max(d2.size(), tile.scenes.size()));
+    std::vector<float>& weight = buffers.weight;
+    weight.resize(tile.scenes.size());
+
+    const int b = tile.border, w = tile.width - 2 * b, h = tile.height - 2 * b;
+    const std::size_t plane = static_cast<std::size_t>(w) * h;
+    const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
+    for (int by = 0; by < h; by += kBlock)
+        for (int bx = 0; bx < w; bx += kBlock) {
+            // The block in tile coordinates, and the window of the pixels within reach of it.
+            const Rect block{b + bx, b + by, b + std::min(bx + kBlock, w), b + std::min(by + kBlock, h)};
+            const Rect near{std::max(block.x0 - reach, 0), std::max(block.y0 - reach, 0),
+                            std::min(block.x1 + reach, tile.width),
+                            std::min(block.y1 + reach, tile.height)};
+            std::uint64_t present = 0;
+            for (int y = near.y0 / kBlock; y <= (near.y1 - 1) / kBlock; ++y)
+                for (int x = near.x0 / kBlock; x <= (near.x1 - 1) / kBlock; ++x)
+                    present |= blockScenes[static_cast<std::size_t>(y) * blocksX + x];
+            if ((present & (present - 1)) == 0)  // one region at most: hard seams are right
                 continue;
-            std::int32_t nearest = kFar;
+            const int nw = near.x1 - near.x0, nh = near.y1 - near.y0;
             for (const int k : order)
-                if (k != label && d2[k][p] < nearest)
-                    nearest = d2[k][p];
-            if (!inReach(nearest))
-                continue;
-            int contributors = 0, last = label;
-            float sum = 0.0f;
-            for (const int k : order) {
-                float wk = 0.0f;
-                if (tile.seen[k][p])
-                    wk = k == label ? inside(nearest) : inReach(d2[k][p]) ? outside(d2[k][p]) : 0.0f;
-                weight[k] = wk;
-                if (wk > 0.0f)
-                    ++contributors, last = k, sum += wk;
-            }
-            const std::size_t o = static_cast<std::size_t>(j) * w + i;
-            for (int band = 0; band < tile.bands; ++band) {
-                float v = tile.values[last][full * band + p];
-                if (contributors > 1) {
-                    v = 0.0f;
+                if (present & SceneBit(k))
+                    buffers.distance.Compute(tile, near.x0, near.y0, nw, nh, k, reach, d2[k]);
+                else
+                    d2[k].assign(static_cast<std::size_t>(nw) * nh, kFar);
+            for (int y = block.y0; y < block.y1; ++y)
+                for (int x = block.x0; x < block.x1; ++x) {
+                    const std::size_t p = static_cast<std::size_t>(y) * tile.width + x;
+                    const std::size_t q = static_cast<std::size_t>(y - near.y0) * nw + x - near.x0;
+                    const int label = tile.labels[p];
+                    if (label < 0)
+                        continue;
+                    std::int32_t nearest = kFar;
                     for (const int k : order)
-                        if (weight[k] > 0.0f)
-                            v += weight[k] * tile.values[k][full * band + p];
-                    v /= sum;
+                        if (k != label && d2[k][q] < nearest)
+                            nearest = d2[k][q];
+                    if (!inReach(nearest))
+                        continue;
+                    int contributors = 0, last = label;
+                    float sum = 0.0f;
+                    for (const int k : order) {
+                        float wk = 0.0f;
+                        if (tile.seen[k][p])
+                            wk = k == label ? inside(nearest)
+                                            : inReach(d2[k][q]) ? outside(d2[k][q]) : 0.0f;
+                        weight[k] = wk;
+                        if (wk > 0.0f)
+                            ++contributors, last = k, sum += wk;
+                    }
+                    const std::size_t o = static_cast<std::size_t>(y - b) * w + x - b;
+                    for (int band = 0; band < tile.bands; ++band) {
+                        float v = tile.values[last][full * band + p];
+                        if (contributors > 1) {
+                            v = 0.0f;
+                            for (const int k : order)
+                                if (weight[k] > 0.0f)
+                                    v += weight[k] * tile.values[k][full * band + p];
+                            v /= sum;
+                        }
+                        out[plane * band + o] = v;
+                    }
                 }
-                out[plane * band + o] = v;
-            }
         }
 }
 
 // ---- Multiband -----------------------------------------------------------------------------
 
-// Pyramid levels below full resolution: the coarsest level's cells are about blendWidth pixels
-// wide, so that the lowest frequencies are blended over about that width.
+// Pyramid levels below full resolution: log2 of the blend width, less one (at least one), so
+// that a step between two scenes changes from 10 % to 90 % over about the width (1 % to 99 %
+// over about twice it).
 int Levels(int blendWidth) {
-    int levels = 0;
-    while ((2 << levels) <= blendWidth && levels < 10)
+    if (blendWidth < 2)
+        return 0;
+    int levels = 1;
+    while ((4 << levels) <= blendWidth && levels < 10)
         ++levels;
     return levels;
 }
@@ -285,14 +350,26 @@ Plane Reduce(const Plane& src) {
     Plane rows(w, src.h), dst(w, h);
     const auto cx = [&](int x) { return std::min(std::max(x, 0), src.w - 1); };
     const auto cy = [&](int y) { return std::min(std::max(y, 0), src.h - 1); };
-    for (int y = 0; y < src.h; ++y)
-        for (int i = 0; i < w; ++i) {
+    // Columns whose taps all lie inside: 2 <= 2i and 2i + 2 < src.w.
+    const int first = std::min(1, w), last = std::max(first, std::min(w, (src.w - 1) / 2));
+    for (int y = 0; y < src.h; ++y) {
+        const float* in = &src.v[static_cast<std::size_t>(y) * src.w];
+        float* r = &rows.v[static_cast<std::size_t>(y) * w];
+        const auto tap = [&](int i) {
             const int x = 2 * i;
-            rows.at(i, y) = (src.at(cx(x - 2), y) + src.at(cx(x + 2), y) +
-                             4.0f * (src.at(cx(x - 1), y) + src.at(cx(x + 1), y)) +
-                             6.0f * src.at(x, y)) *
-                            (1.0f / 16.0f);
+            r[i] = (in[cx(x - 2)] + in[cx(x + 2)] + 4.0f * (in[cx(x - 1)] + in[cx(x + 1)]) +
+                    6.0f * in[x]) *
+                   (1.0f / 16.0f);
+        };
+        for (int i = 0; i < first; ++i)
+            tap(i);
+        for (int i = first; i < last; ++i) {
+            const float* c = in + 2 * i;
+            r[i] = (c[-2] + c[2] + 4.0f * (c[-1] + c[1]) + 6.0f * c[0]) * (1.0f / 16.0f);
         }
+        for (int i = last; i < w; ++i)
+            tap(i);
+    }
     for (int j = 0; j < h; ++j) {
         const int y = 2 * j;
         const float* r0 = &rows.v[static_cast<std::size_t>(cy(y - 2)) * w];
@@ -311,14 +388,27 @@ Plane Reduce(const Plane& src) {
 Plane Expand(const Plane& src, int w, int h) {
     Plane cols(w, src.h), dst(w, h);
     const auto cx = [&](int i) { return std::min(std::max(i, 0), src.w - 1); };
-    for (int y = 0; y < src.h; ++y)
-        for (int x = 0; x < w; ++x) {
+    // Columns whose taps all lie inside: 1 <= x / 2 and x / 2 + 1 < src.w.
+    const int first = std::min(2, w), last = std::max(first, std::min(w, 2 * (src.w - 1)));
+    for (int y = 0; y < src.h; ++y) {
+        const float* in = &src.v[static_cast<std::size_t>(y) * src.w];
+        float* c = &cols.v[static_cast<std::size_t>(y) * w];
+        const auto tap = [&](int x) {
             const int i = x / 2;
-            cols.at(x, y) = x % 2 == 0 ? (src.at(cx(i - 1), y) + 6.0f * src.at(cx(i), y) +
-                                          src.at(cx(i + 1), y)) *
-                                             0.125f
-                                       : (src.at(cx(i), y) + src.at(cx(i + 1), y)) * 0.5f;
+            c[x] = x % 2 == 0 ? (in[cx(i - 1)] + 6.0f * in[cx(i)] + in[cx(i + 1)]) * 0.125f
+                              : (in[cx(i)] + in[cx(i + 1)]) * 0.5f;
+        };
+        for (int x = 0; x < first; ++x)
+            tap(x);
+        int x = first;
+        for (; x + 1 < last; x += 2) {
+            const float* m = in + x / 2;
+            c[x] = (m[-1] + 6.0f * m[0] + m[1]) * 0.125f;
+            c[x + 1] = (m[0] + m[1]) * 0.5f;
         }
+        for (; x < w; ++x)
+            tap(x);
+    }
     for (int y = 0; y < h; ++y) {
         const int j = y / 2;
         const auto row = [&](int r) {
@@ -365,20 +455,19 @@ void Multiband(const BlendTile& tile, int blendWidth, float noData, std::vector<
 
     // The hard mosaic, and the sum of the scenes' weights per level.
     std::vector<Plane> hard(tile.bands, Plane(w, h));
-    for (int y = 0; y < h; ++y)
-        for (int x = 0; x < w; ++x) {
-            const int label = tile.labels[at(x, y)];
-            if (label >= 0)
-                for (int band = 0; band < tile.bands; ++band)
-                    hard[band].at(x, y) = tile.values[label][full * band + at(x, y)];
-        }
+    for (int band = 0; band < tile.bands; ++band)
+        RegionValues(tile, sx, sy, w, h, band, 0.0f, hard[band].v.data());
     std::vector<Plane> total;
     std::vector<std::vector<Plane>> blended(tile.bands);
     for (const int k : order) {
         Plane mask(w, h);
-        for (int y = 0; y < h; ++y)
+        for (int y = 0; y < h; ++y) {
+            const int* label = &tile.labels[at(0, y)];
+            const unsigned char* seen = &tile.seen[k][at(0, y)];
+            float* m = &mask.at(0, y);
             for (int x = 0; x < w; ++x)
-                mask.at(x, y) = tile.labels[at(x, y)] == k && tile.seen[k][at(x, y)] ? 1.0f : 0.0f;
+                m[x] = label[x] == k && seen[x] ? 1.0f : 0.0f;
+        }
         const std::vector<Plane> weights = Gaussian(std::move(mask), levels);
         if (total.empty())
             total = weights;
@@ -389,12 +478,15 @@ void Multiband(const BlendTile& tile, int blendWidth, float noData, std::vector<
         for (int band = 0; band < tile.bands; ++band) {
             // The scene's difference from the hard mosaic, 0 where it does not see the ground.
             Plane difference(w, h);
-            for (int y = 0; y < h; ++y)
-                for (int x = 0; x < w; ++x) {
-                    const std::size_t p = at(x, y);
-                    if (tile.seen[k][p] && tile.labels[p] >= 0)
-                        difference.at(x, y) = tile.values[k][full * band + p] - hard[band].at(x, y);
-                }
+            for (int y = 0; y < h; ++y) {
+                const int* label = &tile.labels[at(0, y)];
+                const unsigned char* seen = &tile.seen[k][at(0, y)];
+                const float* value = &tile.values[k][full * band + at(0, y)];
+                const float* region = &hard[band].at(0, y);
+                float* d = &difference.at(0, y);
+                for (int x = 0; x < w; ++x)
+                    d[x] = seen[x] && label[x] >= 0 ? value[x] - region[x] : 0.0f;
+            }
             std::vector<Plane> laplacian = Gaussian(std::move(difference), levels);
             for (int l = 0; l < levels; ++l) {
                 const Plane up = Expand(laplacian[l + 1], laplacian[l].w, laplacian[l].h);
@@ -411,14 +503,18 @@ void Multiband(const BlendTile& tile, int blendWidth, float noData, std::vector<
         }
     }
 
+    // Where no scene weighs anything, no level adds anything.
+    for (Plane& level : total)
+        for (float& t : level.v)
+            t = t > 1e-6f ? 1.0f / t : 0.0f;
     const int b = tile.border, iw = tile.width - 2 * b, ih = tile.height - 2 * b;
     const std::size_t plane = static_cast<std::size_t>(iw) * ih;
-    out.assign(plane * tile.bands, noData);
+    out.resize(plane * tile.bands);
     for (int band = 0; band < tile.bands; ++band) {
         std::vector<Plane>& sum = blended[band];
         for (int l = 0; l <= levels; ++l)
             for (std::size_t i = 0; i < sum[l].v.size(); ++i)
-                sum[l].v[i] = total[l].v[i] > 1e-6f ? sum[l].v[i] / total[l].v[i] : 0.0f;
+                sum[l].v[i] *= total[l].v[i];
         Plane collapsed = std::move(sum[levels]);
         for (int l = levels - 1; l >= 0; --l) {
             Plane up = Expand(collapsed, sum[l].w, sum[l].h);
@@ -426,13 +522,15 @@ void Multiband(const BlendTile& tile, int blendWidth, float noData, std::vector<
                 up.v[i] += sum[l].v[i];
             collapsed = std::move(up);
         }
-        for (int j = 0; j < ih; ++j)
-            for (int i = 0; i < iw; ++i) {
-                const int x = i + b - sx, y = j + b - sy;
-                if (tile.labels[at(x, y)] >= 0)
-                    out[plane * band + static_cast<std::size_t>(j) * iw + i] =
-                        hard[band].at(x, y) + collapsed.at(x, y);
-            }
+        for (int j = 0; j < ih; ++j) {
+            const int y = j + b - sy;
+            const int* label = &tile.labels[at(b - sx, y)];
+            const float* region = &hard[band].at(b - sx, y);
+            const float* change = &collapsed.at(b - sx, y);
+            float* o = out.data() + plane * band + static_cast<std::size_t>(j) * iw;
+            for (int i = 0; i < iw; ++i)
+                o[i] = label[i] < 0 ? noData : region[i] + change[i];
+        }
     }
 }
 
