@@ -401,6 +401,16 @@ TEST(Workflow, SampleCityEndToEnd) {
         EXPECT_EQ(legend[k].GetString("scene"), names[k - 1]);
         EXPECT_EQ(legend[k].GetString("colour").size(), 7u);
     }
+    // The balance applied: a gain and an offset per scene and channel, in the scenes' order.
+    const CPLJSONObject balance = summaryFile.GetRoot().GetObj("balance");
+    EXPECT_EQ(balance.GetString("method"), "gain-offset");
+    ASSERT_EQ(balance.GetArray("scenes").Size(), static_cast<int>(names.size()));
+    for (int k = 0; k < balance.GetArray("scenes").Size(); ++k) {
+        const CPLJSONObject scene = balance.GetArray("scenes")[k];
+        EXPECT_EQ(scene.GetString("scene"), names[k]);
+        EXPECT_EQ(scene.GetArray("gain").Size(), 3);
+        EXPECT_EQ(scene.GetArray("offset").Size(), 3);
+    }
 
     // The footprints: one layer per scene, named after it, one polygon each.
     Dataset footprints = Open(dir.File("out/footprints.gpkg"), GDAL_OF_VECTOR);
@@ -427,6 +437,11 @@ TEST(Workflow, SampleCityEndToEnd) {
     const std::string rerun = ReadFile(dir.File("out/summary.json"));
     EXPECT_EQ(rerun.find("\"status\": \"done\""), std::string::npos) << rerun;
     EXPECT_NE(rerun.find("\"status\": \"complete\""), std::string::npos);
+    // The kept mosaic's balance is still reported.
+    CPLJSONDocument kept;
+    ASSERT_TRUE(kept.Load(dir.File("out/summary.json")));
+    EXPECT_EQ(kept.GetRoot().GetObj("balance").Format(CPLJSONObject::PrettyFormat::Plain),
+              balance.Format(CPLJSONObject::PrettyFormat::Plain));
 }
 
 // The sample's images run through their cameras twice: found beside each image (camera side

@@ -40,9 +40,10 @@ void ForEachSample(const OverlapSamples& overlap, int c, int bands, F f) {
 }
 
 bool HasSample(const OverlapSamples& overlap, int c, int bands) {
-    bool any = false;
-    ForEachSample(overlap, c, bands, [&](double, double) { any = true; });
-    return any;
+    for (std::size_t i = c; i < overlap.valuesA.size(); i += bands)
+        if (std::isfinite(overlap.valuesA[i]) && std::isfinite(overlap.valuesB[i]))
+            return true;
+    return false;
 }
 
 std::vector<Group> GroupsOf(std::size_t scenes, const std::vector<OverlapSamples>& overlaps, int c,
