@@ -70,9 +70,15 @@ void Blend(benchmark::State& state, BlendMode mode, int width) {
                                                 benchmark::Counter::kIsIterationInvariantRate);
 }
 
-void Hard(benchmark::State& state) { Blend(state, BlendMode::Feather, 0); }
-void Feather(benchmark::State& state) { Blend(state, BlendMode::Feather, kWidth); }
-void Multiband(benchmark::State& state) { Blend(state, BlendMode::Multiband, kWidth); }
+void Hard(benchmark::State& state) {
+    Blend(state, BlendMode::Feather, 0);
+}
+void Feather(benchmark::State& state) {
+    Blend(state, BlendMode::Feather, kWidth);
+}
+void Multiband(benchmark::State& state) {
+    Blend(state, BlendMode::Multiband, kWidth);
+}
 
 BENCHMARK(Hard)->Arg(1)->Arg(4)->Unit(benchmark::kMillisecond);
 BENCHMARK(Feather)->Arg(1)->Arg(2)->Arg(3)->Arg(4)->Unit(benchmark::kMillisecond);

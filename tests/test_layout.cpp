@@ -3,6 +3,7 @@
 // checked against gdalwarp.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <array>
 #include <cmath>
 #include <cstdio>
@@ -15,6 +16,7 @@
 #include <kestrel/dem.h>
 #include <kestrel/elevation.h>
 #include <kestrel/exception.h>
+#include <kestrel/mathmodel.h>
 #include <kestrel/orthoutils.h>
 #include <silvan/utils.h>
 
@@ -478,6 +480,26 @@ TEST(Layout, ZeroPixelSizeTakesTheSourceResolution) {
     const auto& g = layout.geocoding.GetGeoTransform();
     EXPECT_NEAR(std::remainder(g[0], layout.pixelWidth), 0.0, 1e-6);
     EXPECT_NEAR(std::remainder(g[3], layout.pixelHeight), 0.0, 1e-6);
+}
+
+// A nadir frame camera whose centre ray is plumb, 90.2 m above flat ground: the layout lies on
+// the ground (75 m across), not at the height of 0 that a model blind to heights would take.
+TEST(Layout, PlumbCentreRayOfANadirCameraMeetsTheTerrain) {
+    kestrel::mathmodel::CameraIntrinsics lens;
+    lens.width = lens.height = 500;
+    lens.fx = lens.fy = 600;
+    lens.cx = lens.cy = 249.5;
+    kestrel::mathmodel::CameraPose pose;
+    pose.crs = "EPSG:32632";
+    pose.centre = {514845, 5033745, 340.225};
+    pose.rotation = {6.123233995736766e-17, -1, 0, -1, -6.123233995736766e-17, 0, 0, 0, -1};
+    const auto model = kestrel::mathmodel::MakeFrameCameraModel(lens, pose, "nadir");
+    const FunctionTerrain flat([](double, double) { return 250.0; }, 514700, 5033600, 515000,
+                               5033900);
+    const auto layout = kestrel::orthoutils::ComputeLayout(*model, &flat, {});
+    const auto xs = std::minmax_element(layout.borderX.begin(), layout.borderX.end());
+    EXPECT_NEAR(*xs.second - *xs.first, 75.0, 0.5);
+    EXPECT_NEAR(layout.pixelWidth, 0.15, 0.005);
 }
 
 // Over a DSM with a 30 m box building across the image's border, every border ray meets the

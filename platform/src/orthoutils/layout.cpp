@@ -443,18 +443,25 @@ Layout ComputeLayout(const mathmodel::IMathModel& model, const dem::IElevationSo
     Layout layout;
     std::vector<double> gx(n), gy(n), gh(n, request.flatHeight);
     // Does the ground position depend on the height at all (not for a geotransform or GCPs)?
+    // Asked at the centre and at the corners: a nadir camera's centre ray may be plumb.
     bool heightMatters = false;
     {
-        const double cp[2] = {width / 2.0, width / 2.0}, cl[2] = {height / 2.0, height / 2.0};
-        const double ch[2] = {request.flatHeight, request.flatHeight + 100.0};
-        double cx[2], cy[2];
-        bool ok[2];
-        model.ImageToGround(2, cp, cl, ch, cx, cy, ok);
+        const double w = width, h = height;
+        const double at[5][2] = {{w / 2, h / 2}, {0, 0}, {w, 0}, {0, h}, {w, h}};
+        double cp[10], cl[10], ch[10], cx[10], cy[10];
+        bool ok[10];
+        for (int k = 0; k < 10; ++k) {
+            cp[k] = at[k / 2][0], cl[k] = at[k / 2][1];
+            ch[k] = request.flatHeight + (k % 2 == 0 ? 0.0 : 100.0);
+        }
+        model.ImageToGround(10, cp, cl, ch, cx, cy, ok);
         if (!ok[0] || !ok[1]) {
             KESTREL_THROW(DataException,
                           "The math model cannot place the image centre on the ground");
         }
-        heightMatters = std::hypot(cx[1] - cx[0], cy[1] - cy[0]) > 0.0;
+        for (int k = 0; k < 10; k += 2)
+            heightMatters = heightMatters || (ok[k] && ok[k + 1] &&
+                                              std::hypot(cx[k + 1] - cx[k], cy[k + 1] - cy[k]) > 0.0);
     }
     if (terrain == nullptr || !heightMatters) {
         std::unique_ptr<bool[]> ok(new bool[n]);

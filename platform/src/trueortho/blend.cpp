@@ -17,7 +17,6 @@
 #include <cmath>
 #include <cstdint>
 #include <limits>
-#include <numeric>
 
 namespace kestrel {
 namespace processes {
@@ -30,7 +29,8 @@ constexpr std::int32_t kFar = std::numeric_limits<std::int32_t>::max();
 
 void CheckTile(const BlendTile& tile, int blendWidth) {
     if (blendWidth < 0)
-        KESTREL_THROW(DataException, FormatString("Blending: blend width %d is negative", blendWidth));
+        KESTREL_THROW(DataException,
+                      FormatString("Blending: blend width %d is negative", blendWidth));
     const int inner = std::min(tile.width, tile.height) - 2 * tile.border;
     if (tile.border < 0 || inner < 0 || tile.bands < 1)
         KESTREL_THROW(DataException,
@@ -40,11 +40,11 @@ void CheckTile(const BlendTile& tile, int blendWidth) {
     const std::size_t full = static_cast<std::size_t>(tile.width) * tile.height;
     const std::size_t n = tile.scenes.size();
     if (tile.labels.size() != full || tile.values.size() != n || tile.seen.size() != n)
-        KESTREL_THROW(DataException,
-                      FormatString("Blending: the tile's labels (%zu) or its scenes' values (%zu) "
-                                   "and visibility (%zu) do not match its %zu pixels and %zu scenes",
-                                   tile.labels.size(), tile.values.size(), tile.seen.size(), full,
-                                   n));
+        KESTREL_THROW(
+            DataException,
+            FormatString("Blending: the tile's labels (%zu) or its scenes' values (%zu) "
+                         "and visibility (%zu) do not match its %zu pixels and %zu scenes",
+                         tile.labels.size(), tile.values.size(), tile.seen.size(), full, n));
     for (std::size_t k = 0; k < n; ++k)
         if (tile.values[k].size() != full * tile.bands || tile.seen[k].size() != full)
             KESTREL_THROW(DataException,
@@ -117,7 +117,8 @@ class RegionDistance {
                  std::vector<std::int32_t>& d2) {
         column_.resize(static_cast<std::size_t>(w) * h);
         for (int y = 0; y < h; ++y) {
-            const int* lab = tile.labels.data() + static_cast<std::size_t>(y0 + y) * tile.width + x0;
+            const int* lab =
+                tile.labels.data() + static_cast<std::size_t>(y0 + y) * tile.width + x0;
             int* g = column_.data() + static_cast<std::size_t>(y) * w;
             if (y == 0)
                 for (int x = 0; x < w; ++x)
@@ -145,7 +146,8 @@ class RegionDistance {
     void Row(const int* g, int w, int reach, std::int32_t cap, std::int32_t* d2) {
         sites_.clear();
         for (int x = 0; x < w; ++x)
-            if (g[x] < reach && !(g[x] == 0 && x > 0 && x + 1 < w && g[x - 1] == 0 && g[x + 1] == 0))
+            if (g[x] < reach &&
+                !(g[x] == 0 && x > 0 && x + 1 < w && g[x - 1] == 0 && g[x + 1] == 0))
                 sites_.push_back(x);
         if (sites_.empty()) {
             std::fill(d2, d2 + w, kFar);
@@ -189,8 +191,11 @@ class RegionDistance {
 // Feather works on blocks of the inner tile, each with the pixels within reach around it.
 constexpr int kBlock = 64;
 
-// One bit per scene (scenes from the 64th on share the last).
-std::uint64_t SceneBit(int k) { return std::uint64_t{1} << std::min(k, 63); }
+// One bit per scene; scenes from the 64th on share the last two, so that a block they meet is
+// always worked on.
+std::uint64_t SceneBit(int k) {
+    return k < 63 ? std::uint64_t{1} << k : std::uint64_t{3} << 62;
+}
 
 // The scenes whose regions meet each block of kBlock x kBlock pixels of the whole tile.
 std::vector<std::uint64_t> BlockScenes(const BlendTile& tile, int blocksX, int blocksY) {
@@ -240,11 +245,12 @@ void Feather(const BlendTile& tile, const std::vector<int>& order, int blendWidt
         return (width + 1.0f - 2.0f * std::sqrt(static_cast<float>(squared))) / (2.0f * width);
     };
     const auto inside = [&](std::int32_t squared) {
-        return std::min(1.0f, (width - 1.0f + 2.0f * std::sqrt(static_cast<float>(squared))) /
-                                  (2.0f * width));
+        return std::min(
+            1.0f, (width - 1.0f + 2.0f * std::sqrt(static_cast<float>(squared))) / (2.0f * width));
     };
 
-    const int blocksX = (tile.width + kBlock - 1) / kBlock, blocksY = (tile.height + kBlock - 1) / kBlock;
+    const int blocksX = (tile.width + kBlock - 1) / kBlock,
+              blocksY = (tile.height + kBlock - 1) / kBlock;
     const std::vector<std::uint64_t> blockScenes = BlockScenes(tile, blocksX, blocksY);
     thread_local FeatherBuffers buffers;
     std::vector<std::vector<std::int32_t>>& d2 = buffers.d2;
@@ -258,7 +264,8 @@ void Feather(const BlendTile& tile, const std::vector<int>& order, int blendWidt
     for (int by = 0; by < h; by += kBlock)
         for (int bx = 0; bx < w; bx += kBlock) {
             // The block in tile coordinates, and the window of the pixels within reach of it.
-            const Rect block{b + bx, b + by, b + std::min(bx + kBlock, w), b + std::min(by + kBlock, h)};
+            const Rect block{b + bx, b + by, b + std::min(bx + kBlock, w),
+                             b + std::min(by + kBlock, h)};
             const Rect near{std::max(block.x0 - reach, 0), std::max(block.y0 - reach, 0),
                             std::min(block.x1 + reach, tile.width),
                             std::min(block.y1 + reach, tile.height)};
@@ -292,8 +299,9 @@ void Feather(const BlendTile& tile, const std::vector<int>& order, int blendWidt
                     for (const int k : order) {
                         float wk = 0.0f;
                         if (tile.seen[k][p])
-                            wk = k == label ? inside(nearest)
-                                            : inReach(d2[k][q]) ? outside(d2[k][q]) : 0.0f;
+                            wk = k == label          ? inside(nearest)
+                                 : inReach(d2[k][q]) ? outside(d2[k][q])
+                                                     : 0.0f;
                         weight[k] = wk;
                         if (wk > 0.0f)
                             ++contributors, last = k, sum += wk;

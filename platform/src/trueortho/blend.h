@@ -37,8 +37,8 @@ KESTREL_API int BlendBorder(BlendMode mode, int blendWidth);
 // The blended inner tile ((width - 2 border) x (height - 2 border), `bands` planes) into out;
 // pixels whose label is -1 take noData. blendWidth 0: every pixel its region's value. Throws
 // DataException for a negative width or arrays that do not match the tile's size.
-KESTREL_API void BlendRegions(const BlendTile& tile, BlendMode mode, int blendWidth,
-                              float noData, std::vector<float>& out);
+KESTREL_API void BlendRegions(const BlendTile& tile, BlendMode mode, int blendWidth, float noData,
+                              std::vector<float>& out);
 
 }  // namespace trueortho
 }  // namespace processes
