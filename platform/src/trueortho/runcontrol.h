@@ -32,6 +32,8 @@ class RunControl {
     // Later runs report their progress within [start, start + share] of the whole, for a run
     // of several steps.
     void SetSpan(double start, double share) { spanStart_ = start, spanShare_ = share; }
+    double SpanStart() const { return spanStart_; }
+    double SpanShare() const { return spanShare_; }
 
   private:
     double spanStart_ = 0, spanShare_ = 1;

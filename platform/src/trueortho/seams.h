@@ -26,9 +26,12 @@ struct SeamWindow {
     // The scenes that may take cells here (indices into the recovery job's scenes) and, for
     // each of them, per cell:
     std::vector<std::size_t> scenes;
-    // the data cost (>= 0; kForbidden where the scene does not see the ground), and
+    // the data cost (>= 0; kForbidden where the scene does not see the ground), of the order of
+    // 1 (e.g. the tangent of the view's angle off the vertical, more near occlusion edges); per
+    // full-resolution pixel also in a reduced window (the mean over the cell's pixels), and
     std::vector<std::vector<float>> cost;
-    // the scene's brightness after balancing, for the colour-disagreement part of the seam term.
+    // the scene's brightness after balancing, for the colour-disagreement part of the seam term
+    // (grey levels; not read where the scene's cost is kForbidden). Empty: no colour term.
     std::vector<std::vector<float>> grey;
     // Metres the surface stands above the ground (0 where unknown); empty: all 0.
     std::vector<float> raised;
@@ -36,19 +39,36 @@ struct SeamWindow {
     std::vector<int> fixed;
 };
 
+// The seam term between two neighbouring cells labelled with different scenes a and b is
+//   (seamWeight + raisedWeight * max(raised_p, raised_q)
+//    + colourWeight * (|grey_a(p) - grey_b(p)| + |grey_a(q) - grey_b(q)|)) / pixelSize,
+// so that the weights are costs per metre of seam against data costs per square metre: a
+// survey at 0.1 m and one at 0.5 m put their seams in the same places.
 struct SeamParams {
     double pixelSize = 1.0;      // metres per full-resolution pixel
-    float seamWeight = 1.0f;     // cost of a seam between two cells on open ground
-    float raisedWeight = 4.0f;   // added per metre the surface stands above the ground
-    float colourWeight = 0.05f;  // added per grey level the two scenes disagree
+    float seamWeight = 0.5f;     // per metre of seam on open ground
+    float raisedWeight = 2.0f;   // added per metre the surface stands above the ground
+    float colourWeight = 0.05f;  // added per grey level the two scenes disagree (on each side)
+    int tile = 512;              // cells per side of the windows read and solved (>= 16)
 };
 
 // The labels of a window: per cell an index into window.scenes, -1 where every cost is
-// kForbidden.
+// kForbidden. Never a scene whose cost is kForbidden while another is allowed; fixed cells keep
+// their label.
 KESTREL_API std::vector<int> SolveSeams(const SeamWindow& window, const SeamParams& params);
 
+// The energy SolveSeams minimises: data costs of the free cells plus the seam terms.
+KESTREL_API double SeamEnergy(const SeamWindow& window, const SeamParams& params,
+                              const std::vector<int>& labels);
+
+// The reduction factor of ChooseRegions' coarse pass over a grid of pixels x lines of
+// pixelSize metres.
+KESTREL_API int CoarseFactor(unsigned int pixels, unsigned int lines, double pixelSize);
+
 // What the region chooser reads: a window of the mosaic grid in which each cell stands for
-// factor x factor pixels (factor 1: full resolution). May be called from several threads.
+// factor x factor pixels (factor 1: full resolution); x0, y0, width and height count such cells
+// (cell (i, j) covers pixels [i factor, (i + 1) factor) x [j factor, (j + 1) factor), clipped
+// to the grid). At most params.tile + 2 cells on a side. May be called from several threads.
 class SeamSource {
   public:
     virtual ~SeamSource() = default;
@@ -63,8 +83,8 @@ using LabelSink =
 // Chooses the regions over a grid of pixels x lines and hands them to `sink`, with memory
 // bounded independently of the grid's size.
 KESTREL_API void ChooseRegions(SeamSource& source, unsigned int pixels, unsigned int lines,
-                               const SeamParams& params, unsigned int threads,
-                               RunControl& control, const LabelSink& sink);
+                               const SeamParams& params, unsigned int threads, RunControl& control,
+                               const LabelSink& sink);
 
 // Metres the surface stands above the ground under it, from surface heights alone: the heights
 // minus their morphological opening with a square of side 2 radius + 1 cells. NaN is no height
