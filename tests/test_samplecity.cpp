@@ -121,6 +121,7 @@ TEST(SampleBlock, OrthosMatchTheIdealImageAndTheDsmErrorStaysAtEdges) {
     EXPECT_EQ(untouched, 0u);
 }
 
+#ifdef SILVAN_MAKE_SAMPLE_EXE
 // A value that cannot be used stops the command with status 2 and a message naming the option
 // and the value, before anything is written.
 TEST(SampleBlock, BadOptionValuesAreRefusedByName) {
@@ -140,5 +141,6 @@ TEST(SampleBlock, BadOptionValuesAreRefusedByName) {
     }
     EXPECT_FALSE(std::filesystem::exists(dir.File("out")));
 }
+#endif
 
 }  // namespace

@@ -727,6 +727,27 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         {"the colour balance, which only the mosaic reads",
          [&] { args.insert(args.end(), {"--balance", "none"}); },
          {}, "--balance changed: gain-offset -> none", true},
+        {"seamlines handed back",
+         [&] {
+             std::filesystem::copy_file(dir.File("out/seamlines.gpkg"), dir.File("seams.gpkg"));
+             args.insert(args.end(), {"--seamlines", dir.File("seams.gpkg")});
+         },
+         {}, "--seamlines changed", true},
+        {"a seamline polygon given to another scene",
+         [&] {
+             Dataset seams(GDALDataset::Open(dir.File("seams.gpkg").c_str(),
+                                             GDAL_OF_VECTOR | GDAL_OF_UPDATE, nullptr, nullptr));
+             ASSERT_TRUE(seams);
+             OGRLayer* layer = seams->GetLayerByName("seamlines");
+             ASSERT_NE(layer, nullptr);
+             std::unique_ptr<OGRFeature> feature(layer->GetNextFeature());
+             ASSERT_TRUE(feature);
+             feature->SetField("scene", feature->GetFieldAsString("scene") == std::string("north")
+                                            ? "south"
+                                            : "north");
+             ASSERT_EQ(layer->SetFeature(feature.get()), OGRERR_NONE);
+         },
+         {}, "seamlines file " + dir.File("seams.gpkg") + " changed", true},
         {"an area of interest that changes no scene's window",
          [&] { args.insert(args.end(), {"--te", "514848", "5033845", "515008", "5033989"}); },
          {}, "--te changed", true},
