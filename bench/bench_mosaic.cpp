@@ -5,7 +5,8 @@
 //     the mean brightness step across seams (per pair of scenes meeting at a seam, the mean
 //     difference of their corrected values on both sides of it; weighted by seam length) and
 //     the share of mosaic pixels within 15 grey levels of the mosaic of the same images at one
-//     exposure, unbalanced;
+//     exposure, unbalanced (whose own seam step, views seeing walls and edges differently, is
+//     the floor);
 //   surface error: a surface model whose building edges are moved by up to a pixel, mosaicked
 //     by the per-pixel choice and by seamlines: the share of the seams that crosses a building, and
 //     the share of mosaic pixels more than 15 grey levels from the ideal image (the texture seen
@@ -289,15 +290,18 @@ int main(int argc, char** argv) {
         for (std::size_t s = 0; s < exposed->names.size(); ++s)
             std::printf(" %s %.3f", exposed->names[s].c_str(),
                         samplecity::ExposureGain(exposed->options, s));
-        std::printf("\n%-22s %10s %12s %14s %8s\n", "balance", "seam step", "mean |diff|",
+        std::printf("\n%-26s %10s %12s %16s %8s\n", "balance", "seam step", "mean |diff|",
                     "within 15 of ref", "seconds");
+        const auto [floor, floorAbsolute] = SeamStep(*reference, "o", ref);
+        std::printf("%-26s %10.2f %12.2f %16s %8.2f\n", "(reference, one exposure)", floor,
+                    floorAbsolute, "", ref.seconds);
         for (const auto& [label, balance] :
              {std::make_pair("none", RecoveryJob::Balance::None),
               std::make_pair("gain", RecoveryJob::Balance::Gain),
               std::make_pair("gain-offset", RecoveryJob::Balance::GainOffset)}) {
             const Mosaic m = MakeMosaic(*exposed, "o", balance, true, label);
             const auto [step, absolute] = SeamStep(*exposed, "o", m);
-            std::printf("%-22s %10.2f %12.2f %13.2f%% %8.2f\n", label, step, absolute,
+            std::printf("%-26s %10.2f %12.2f %15.2f%% %8.2f\n", label, step, absolute,
                         100 * (1 - ShareApart(m.values, m.source, ref.values, &ref.source)),
                         m.seconds);
             for (std::size_t s = 0;
