@@ -510,6 +510,26 @@ TEST(RecoveryBalance, TwoExposuresMakeOneMosaicWithoutAStep) {
             EXPECT_NEAR(result.gain[0][0] / result.gain[1][0], 1.2, 0.01);
         }
     }
+    // Orthos of one fine texture a pixel apart (as resampling and misregistration leave them):
+    // the fit still finds the exposures, not a gain of the pixel-to-pixel noise.
+    for (size_t k = 0; k < texture.size(); ++k) {
+        unsigned long long h = (k + 1) * 0x9E3779B97F4A7C15ull;
+        h ^= h >> 31, h *= 0xBF58476D1CE4E5B9ull, h ^= h >> 29;
+        texture[k] = 40 + static_cast<double>(h % 120);
+    }
+    for (int s = 0; s < 2; ++s) {
+        std::vector<unsigned char> ortho(texture.size());
+        for (size_t k = 0; k < ortho.size(); ++k) {
+            const size_t from = s == 0 || (k + 1) % kWidth == 0 ? k : k + 1;
+            ortho[k] = static_cast<unsigned char>(
+                std::lround(s == 0 ? texture[from] : 1.2 * texture[from] + 5));
+        }
+        synthetic::WriteBand(job.scenes[s].orthoPath, ortho, windows[s]);
+    }
+    job.balance = RecoveryJob::Balance::GainOffset;
+    const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
+    ASSERT_TRUE(result.completed);
+    EXPECT_NEAR(result.gain[0][0] / result.gain[1][0], 1.2, 0.03);
 }
 
 // A pixel a scene sees whose value is the no-data value is filled with the nearest other value,

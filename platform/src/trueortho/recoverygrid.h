@@ -158,6 +158,9 @@ class ValueRange {
     }
     // A value that is not `noData`, the nearest one inside the range when it is.
     float Besides(float v, double noData) const;
+    // True for a value at either end of an integer type's range: a clipped (saturated) value
+    // says nothing of the scene's exposure.
+    bool Clipped(float v) const { return integer_ && (v <= lo_ || v >= hi_); }
 
   private:
     bool integer_;
