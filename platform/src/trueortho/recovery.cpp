@@ -329,6 +329,9 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     const trueortho::BalanceFit fit =
         trueortho::FitBalance(job.scenes.size(), grid.bands, overlaps, balance);
     overlaps.clear();
+    // Between the steps, what their threads freed goes back to the system (the next step's
+    // threads would not reuse it).
+    trueortho::ReleaseFreeMemory();
 
     // 2. The regions: the job's raster, seamlines, or none (the first-ranked scene per pixel).
     ScratchFile scratch;
@@ -337,6 +340,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
         regions = ChooseSeamlines(job, grid, reader, fit, threads, control, scratch);
         if (control.Stopped())
             return result;
+        trueortho::ReleaseFreeMemory();
     }
 
     // 3. The composition, tile by tile.
@@ -369,6 +373,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     });
     if (control.Stopped())
         return result;
+    trueortho::ReleaseFreeMemory();
     mosaic->Close();
     source->Close();
     for (const auto& c : counts)
