@@ -477,6 +477,7 @@ class RegionChooser {
                     const std::size_t c = static_cast<std::size_t>(y / factor_) * cw_ + x / factor_;
                     return band_[c] ? 0 : coarse_[c];
                 });
+                Reach(window, win);
                 // The band starts from the coarse labels and may take only their scenes
                 // (and those that see what they do not).
                 const std::vector<int> start = Labels(window, win, [&](int x, int y) {
@@ -597,6 +598,52 @@ class RegionChooser {
     template <typename Held>
     static void Hold(SeamWindow& window, const Chessboard::Square& s, Held held) {
         window.fixed = Labels(window, s, held);
+    }
+
+    // Forbids each band pixel of the window (at s in the grid) the scenes that are not the coarse
+    // label of a cell within kBand + 1 coarse cells, where one of those sees it: the band moves
+    // the seams it lies along, and an expansion of a scene from elsewhere in the window would
+    // make the whole band a graph of long augmenting paths for nothing.
+    void Reach(SeamWindow& window, const Chessboard::Square& s) const {
+        const std::size_t scenes = window.scenes.size();
+        if (scenes < 2 || scenes > 64)
+            return;
+        using Mask = std::uint64_t;
+        const int reach = kBand + 1;
+        const int x0 = std::max(0, s.x0 / factor_ - reach), y0 = std::max(0, s.y0 / factor_ - reach);
+        const int x1 = std::min(cw_, (s.x0 + s.w - 1) / factor_ + reach + 1);
+        const int y1 = std::min(ch_, (s.y0 + s.h - 1) / factor_ + reach + 1);
+        const int w = x1 - x0, h = y1 - y0;
+        std::vector<int> index;  // per 1 + scene, its index in the window or -1
+        for (std::size_t k = 0; k < scenes; ++k) {
+            if (window.scenes[k] + 2 > index.size())
+                index.resize(window.scenes[k] + 2, -1);
+            index[window.scenes[k] + 1] = static_cast<int>(k);
+        }
+        std::vector<Mask> near(static_cast<std::size_t>(w) * h, 0);
+        for (int y = 0; y < h; ++y)
+            for (int x = 0; x < w; ++x) {
+                const std::uint16_t label = Coarse(x0 + x, y0 + y);
+                if (label > 0 && label < index.size() && index[label] >= 0)
+                    near[static_cast<std::size_t>(y) * w + x] = Mask{1} << index[label];
+            }
+        SquareExtreme(near, w, h, reach, Mask{0}, [](Mask a, Mask b) { return a | b; });
+        for (int y = 0; y < s.h; ++y)
+            for (int x = 0; x < s.w; ++x) {
+                const int cx = (s.x0 + x) / factor_, cy = (s.y0 + y) / factor_;
+                if (!band_[static_cast<std::size_t>(cy) * cw_ + cx])
+                    continue;
+                const Mask allowed = near[static_cast<std::size_t>(cy - y0) * w + (cx - x0)];
+                const std::size_t c = static_cast<std::size_t>(y) * s.w + x;
+                bool seen = false;
+                for (std::size_t k = 0; k < scenes && !seen; ++k)
+                    seen = (allowed >> k & 1) && Allowed(window.cost[k][c]);
+                if (!seen)
+                    continue;
+                for (std::size_t k = 0; k < scenes; ++k)
+                    if (!(allowed >> k & 1))
+                        window.cost[k][c] = kForbidden;
+            }
     }
 
     // Coarse cells within kBand cells of a change of coarse label.
