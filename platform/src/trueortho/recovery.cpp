@@ -280,10 +280,10 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
         KESTREL_THROW(DataException, FormatString("Occlusion recovery: tile size %u is outside "
                                                   "16 to 8192",
                                                   job.tileSize));
-    if (job.blendWidth > 4096)
+    if (job.blendWidth > RecoveryJob::kMaxBlendWidth)
         KESTREL_THROW(DataException, FormatString("Occlusion recovery: blend width %u is outside "
-                                                  "0 to 4096 pixels",
-                                                  job.blendWidth));
+                                                  "0 to %u pixels",
+                                                  job.blendWidth, RecoveryJob::kMaxBlendWidth));
     const RecoveryGrid grid = trueortho::InspectScenes(job);
     if (job.surface != nullptr && grid.crs)
         job.surface->SetInputCRS(grid.crs.get());
