@@ -1,5 +1,6 @@
-// The ortho layout on a real RPC image over terrain, checked against gdalwarp, and on frame
-// cameras over a surface with buildings; the metadata that GetOrthoParams's orthos carry over.
+// The ortho layout: what GetOrthoParams hands to the layout functions and makes of their
+// answers (through the layout seam), and the layout itself on a real RPC image over terrain,
+// checked against gdalwarp.
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -21,19 +22,98 @@
 
 #include "rpcscene.h"
 #include "samplecity.h"
-#include "support.h"
+#include "program.h"
 
-#if defined(_WIN32)
-#define popen _popen
-#define pclose _pclose
-#endif
 
 using kestrel::ogc::cs::GeocodingInfo;
 using kestrel::ogc::cs::ICRS;
 using kestrel::tin::Polygon;
+using testsupport::RunCommand;
 using testsupport::TempDir;
 
 namespace {
+
+// Records the calls that reach the layout functions and answers with what the test set.
+class RecordingLayout final : public kestrel::orthoutils::LayoutImpl {
+  public:
+    // What GetLayoutOptions received.
+    std::vector<std::string> strings;
+    int borderSamples = 0;
+    std::string mapCRSName = "(not called)";
+    double pixelWidth = 0, pixelHeight = 0;
+    float flatHeight = 0;
+    kestrel::datasources::IRasterDataset* dataset = nullptr;
+    const kestrel::mathmodel::IMathModel* model = nullptr;
+    std::vector<int> channels;
+    // What it answers.
+    unsigned int linesOut = 0, pixelsOut = 0;
+    bool throwInLayout = false;
+    // What GetSceneFootprint received, and answers.
+    const GeocodingInfo* footprintGeocoding = nullptr;
+    unsigned int footprintPixels = 0, footprintLines = 0;
+    std::vector<double> footprintX, footprintY;
+    std::vector<GDBVertex> ring;
+    // What GetSrcModel received.
+    std::string modelPath, modelUnused = "(not called)";
+    int modelSegment = 0;
+
+    kestrel::mathmodel::IMathModel* GetSrcModel(const std::string& path, const std::string& unused,
+                                                int segment) override {
+        modelPath = path, modelUnused = unused, modelSegment = segment;
+        return nullptr;
+    }
+
+    void GetLayoutOptions(const std::string& a, const std::string& b, const std::string& c,
+                          const std::string& d, int samples, const std::string& alignment,
+                          const ICRS* mapCRS, double& width, double& height,
+                          const kestrel::dem::IRasterDEM*, float flat,
+                          kestrel::datasources::IRasterDataset* raster,
+                          const kestrel::mathmodel::IMathModel* sensor,
+                          const std::vector<int>& channelList, ICRS*& outCRS,
+                          GeocodingInfo*& outGeocoding, unsigned int& lines, unsigned int& pixels,
+                          std::vector<double>& x, std::vector<double>& y, double& low,
+                          double& high) override {
+        strings = {a, b, c, d, alignment};
+        borderSamples = samples;
+        mapCRSName = mapCRS == nullptr ? "(null)" : mapCRS->GetName();
+        pixelWidth = width, pixelHeight = height;
+        width = height = 99.0;  // must not reach GetOrthoParams's caller
+        flatHeight = flat;
+        dataset = raster;
+        model = sensor;
+        channels = channelList;
+        EXPECT_TRUE(x.empty() && y.empty());
+        outCRS = new ICRS("EPSG:32632");
+        outGeocoding = new GeocodingInfo(GeocodingInfo::NorthUp(514000, 5034000, 1, 1));
+        lines = linesOut;
+        pixels = pixelsOut;
+        if (throwInLayout)
+            KESTREL_THROW(kestrel::DataException, "layout refused by the test");
+        x = {1, 2, 3};
+        y = {4, 5, 6};
+        low = high = 0;
+    }
+
+    int GetSceneFootprint(const GeocodingInfo* geocoding, unsigned int pixels, unsigned int lines,
+                          const std::vector<double>& x, const std::vector<double>& y,
+                          GDBVertex*& vertices, int& count) override {
+        EXPECT_EQ(vertices, nullptr);
+        footprintGeocoding = geocoding;
+        footprintPixels = pixels, footprintLines = lines;
+        footprintX = x, footprintY = y;
+        vertices = new GDBVertex[ring.size()];
+        std::copy(ring.begin(), ring.end(), vertices);
+        count = static_cast<int>(ring.size());
+        return count;
+    }
+};
+
+// A dataset that is not a raster: GetOrthoParams's cast must give null.
+class NotARaster final : public kestrel::datasources::IDataset {
+  public:
+    bool IsValid() const override { return true; }
+    std::string GetPath() const override { return "table.csv"; }
+};
 
 struct Outputs {
     ICRS* crs = nullptr;
@@ -47,7 +127,138 @@ struct Outputs {
     }
 };
 
+void Call(Outputs& out, const std::string& mapUnits,
+          kestrel::datasources::IDataset* dataset = nullptr) {
+    GetOrthoParams(5, "EXTENT", mapUnits, 0.5, 0.25, dataset,
+                   reinterpret_cast<kestrel::mathmodel::IMathModel*>(0x10), {3, 1}, nullptr, 12.5f,
+                   out.crs, out.geocoding, out.pixels, out.lines, out.footprint);
+}
+
+std::shared_ptr<RecordingLayout> SquareLayout() {
+    auto layout = std::make_shared<RecordingLayout>();
+    layout->linesOut = 17;
+    layout->pixelsOut = 1000;
+    layout->ring = {{0, 0, 0}, {10, 0, 0}, {10, 10, 0}, {0, 10, 0}, {0, 0, 0}};
+    return layout;
+}
+
 }  // namespace
+
+// The map-units text: empty or beginning with "None" in any case gives no coordinate system;
+// anything else goes to MapunitsToCRS, so "Non" is refused as naming none.
+TEST(GetOrthoParams, MapUnitsNoneInAnyCaseMakesNoCoordinateSystem) {
+    const struct {
+        const char* text;
+        const char* expected;  // the CRS name GetLayoutOptions sees; null: MapunitsToCRS throws
+    } cases[] = {{"", "(null)"},
+                 {"None", "(null)"},
+                 {"nOnE", "(null)"},
+                 {"NONE whatever", "(null)"},
+                 {"EPSG:32632", "WGS 84 / UTM zone 32N"},
+                 {"Non", nullptr},
+                 {" None", nullptr}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.text);
+        auto layout = SquareLayout();
+        kestrel::orthoutils::ScopedLayoutImpl scoped(layout);
+        Outputs out;
+        if (c.expected == nullptr) {
+            EXPECT_THROW(Call(out, c.text), kestrel::DataException);
+            EXPECT_EQ(layout->mapCRSName, "(not called)");
+        } else {
+            Call(out, c.text);
+            EXPECT_EQ(layout->mapCRSName, c.expected);
+        }
+    }
+}
+
+// Arguments reach GetLayoutOptions in their places; lines come back before pixels from it and
+// go to GetSceneFootprint after them, rounded up to blocks of 16 first; the closing vertex of
+// the ring is dropped.
+TEST(GetOrthoParams, RoutesArgumentsAndRoundsToBlocksBeforeTheFootprint) {
+    auto layout = SquareLayout();
+    kestrel::orthoutils::ScopedLayoutImpl scoped(layout);
+    Outputs out;
+    NotARaster table;
+    Call(out, "", &table);
+    EXPECT_EQ(layout->strings, (std::vector<std::string>{"", "", "", "", "EXTENT"}));
+    EXPECT_EQ(layout->borderSamples, 5);
+    EXPECT_EQ(layout->pixelWidth, 0.5);
+    EXPECT_EQ(layout->pixelHeight, 0.25);
+    EXPECT_EQ(layout->flatHeight, 12.5f);
+    EXPECT_EQ(layout->dataset, nullptr);
+    EXPECT_EQ(layout->model, reinterpret_cast<kestrel::mathmodel::IMathModel*>(0x10));
+    EXPECT_EQ(layout->channels, (std::vector<int>{3, 1}));
+
+    EXPECT_EQ(out.pixels, 1008u);
+    EXPECT_EQ(out.lines, 32u);
+    EXPECT_EQ(layout->footprintPixels, 1008u);
+    EXPECT_EQ(layout->footprintLines, 32u);
+    EXPECT_EQ(layout->footprintGeocoding, out.geocoding);
+    EXPECT_EQ(layout->footprintX, (std::vector<double>{1, 2, 3}));
+    EXPECT_EQ(layout->footprintY, (std::vector<double>{4, 5, 6}));
+    ASSERT_NE(out.crs, nullptr);
+    ASSERT_NE(out.footprint, nullptr);
+    ASSERT_EQ(out.footprint->numPoints, 4u);
+    EXPECT_EQ(out.footprint->points[3].x, 0.0);
+    EXPECT_EQ(out.footprint->points[3].y, 10.0);
+    EXPECT_EQ(out.footprint->bbox.max.x, 10.0);
+}
+
+TEST(GetOrthoParams, BlockRuleAndNearDuplicateVertices) {
+    const unsigned int sizes[][2] = {{1000, 1008}, {1001, 1008}, {1024, 1024},
+                                     {16, 16},     {1, 16},      {0, 0}};
+    for (const auto& size : sizes) {
+        auto layout = SquareLayout();
+        layout->pixelsOut = layout->linesOut = size[0];
+        layout->ring = {{0, 0, 0}, {10, 0, 0}, {10, 4e-10, 0}, {10, 10, 0}, {0, 0, 0}};
+        kestrel::orthoutils::ScopedLayoutImpl scoped(layout);
+        Outputs out;
+        Call(out, "");
+        EXPECT_EQ(out.pixels, size[1]) << size[0];
+        EXPECT_EQ(out.lines, size[1]) << size[0];
+        ASSERT_EQ(out.footprint->numPoints, 3u);
+    }
+}
+
+// A failing layout leaves the footprint output alone; a footprint of fewer than two vertices
+// is refused after the sizes were rounded.
+TEST(GetOrthoParams, FailuresLeaveTheFootprintOutputUnchanged) {
+    Polygon<double> sentinel(nullptr, 0);
+    {
+        auto layout = SquareLayout();
+        layout->throwInLayout = true;
+        kestrel::orthoutils::ScopedLayoutImpl scoped(layout);
+        Outputs out;
+        out.footprint = &sentinel;
+        EXPECT_THROW(Call(out, "EPSG:32632"), kestrel::DataException);
+        EXPECT_EQ(out.footprint, &sentinel);
+        out.footprint = nullptr;
+    }
+    for (std::size_t count : {0u, 1u}) {
+        auto layout = SquareLayout();
+        layout->ring.resize(count);
+        kestrel::orthoutils::ScopedLayoutImpl scoped(layout);
+        Outputs out;
+        out.footprint = &sentinel;
+        EXPECT_THROW(Call(out, ""), kestrel::DataException);
+        EXPECT_EQ(out.footprint, &sentinel);
+        EXPECT_EQ(out.pixels, 1008u);
+        EXPECT_EQ(out.lines, 32u);
+        out.footprint = nullptr;
+    }
+}
+
+TEST(GetMathModelAndGetMetaTrans, HandTheirArgumentsOn) {
+    auto layout = SquareLayout();
+    kestrel::orthoutils::ScopedLayoutImpl scoped(layout);
+    EXPECT_EQ(GetMathModel("scene.tif", 2), nullptr);
+    EXPECT_EQ(layout->modelPath, "scene.tif");
+    EXPECT_EQ(layout->modelUnused, "");
+    EXPECT_EQ(layout->modelSegment, 2);
+    std::unique_ptr<kestrel::processes::ortho::OrthoMetadataTransfer> transfer(GetMetaTrans(-9.5));
+    EXPECT_EQ(transfer->GetNoDataValue(), -9.5);
+}
 
 TEST(OrthoMetadataTransfer, CopiesMetadataDescriptionsColoursAndSetsNoData) {
     TempDir dir;
@@ -119,17 +330,6 @@ FunctionTerrain SceneHills() {
                            rpcscene::kDemLeft + rpcscene::kDemSize, rpcscene::kDemTop);
 }
 
-std::string RunCommand(const std::string& command) {
-    std::string out;
-    FILE* pipe = popen((command + " 2>&1").c_str(), "r");
-    if (pipe == nullptr)
-        return out;
-    char buffer[4096];
-    while (std::fgets(buffer, sizeof buffer, pipe) != nullptr)
-        out += buffer;
-    pclose(pipe);
-    return out;
-}
 
 }  // namespace
 
@@ -146,7 +346,7 @@ TEST(Layout, ExtentAgreesWithGdalwarpOverTerrain) {
     const std::string log = RunCommand("gdalwarp -q -rpc -to RPC_DEM=" + demPath +
                                        " -to RPC_DEMINTERPOLATION=bilinear -t_srs EPSG:32632 "
                                        "-tr 1.5 1.5 " +
-                                       image + " " + out);
+                                       image + " " + out + " 2>&1");
     std::unique_ptr<GDALDataset> warped(GDALDataset::Open(out.c_str()));
     ASSERT_NE(warped, nullptr) << log;
     double gt[6];
@@ -199,27 +399,6 @@ TEST(Layout, ExtentAgreesWithGdalwarpOverTerrain) {
                                         layout.footprint->points[i].y, p, l);
         EXPECT_TRUE(p >= -1e-6 && p <= pixels + 1e-6 && l >= -1e-6 && l <= lines + 1e-6)
             << p << " " << l;
-    }
-    // The map units: empty or beginning with "None" in any case choose the scene's zone;
-    // anything else names a CRS, so "Non" is refused.
-    const std::pair<const char*, const char*> units[] = {{"nOnE", "WGS 84 / UTM zone 32N"},
-                                                         {"NONE x", "WGS 84 / UTM zone 32N"},
-                                                         {"EPSG:32633", "WGS 84 / UTM zone 33N"},
-                                                         {"Non", nullptr},
-                                                         {" None", nullptr}};
-    for (const auto& [text, name] : units) {
-        SCOPED_TRACE(text);
-        Outputs other;
-        const auto call = [&, text = text] {
-            GetOrthoParams(0, "EXTENT", text, 1.5, 1.5, nullptr, model.get(), {}, dem.get(), 0.0f,
-                           other.crs, other.geocoding, other.pixels, other.lines, other.footprint);
-        };
-        if (name == nullptr) {
-            EXPECT_THROW(call(), kestrel::DataException);
-        } else {
-            call();
-            EXPECT_EQ(other.crs->GetName(), name);
-        }
     }
 }
 

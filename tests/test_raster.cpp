@@ -563,7 +563,81 @@ TEST(RasterWriter, FailuresNameTheFileAndLeaveNothing) {
 }
 
 // ---------------------------------------------------------------------------------------------
-// Utility functions
+// What the utility functions pass to the raster components
+
+namespace {
+
+// Records the raster components' calls as texts, in order.
+class Recorder : public kestrel::datasources::RasterIOObserver {
+  public:
+    void ReaderCreated(const IRasterReader* reader, const std::string& /*path*/,
+                       const std::vector<unsigned int>& channels) override {
+        Add("reader " + Channels(channels), reader);
+    }
+    void WindowRead(const IRasterReader* reader, unsigned int x, unsigned int y, unsigned int w,
+                    unsigned int h, const Raster* result) override {
+        Add("read " + std::to_string(x) + "," + std::to_string(y) + "," + std::to_string(w) + "," +
+                std::to_string(h),
+            reader);
+        lastRead = result;
+    }
+    void WriterCreated(const IRasterWriter* writer, const std::string& /*path*/,
+                       const std::vector<unsigned int>& channels, const std::string& format,
+                       const std::string& options) override {
+        Add("writer " + Channels(channels) + " " + format + " [" + options + "]", writer);
+    }
+    void FormatNameLookedUp(const std::string& fileType, const std::string& format) override {
+        Add("lookup " + fileType + " " + format, nullptr);
+    }
+    void RasterDeleted(const Raster* raster) override {
+        if (raster == lastRead)
+            Add("deleted the read raster", nullptr);
+    }
+
+    std::vector<std::string> events;
+    std::vector<const void*> subjects;
+    const Raster* lastRead = nullptr;
+
+  private:
+    static std::string Channels(const std::vector<unsigned int>& channels) {
+        std::string text;
+        for (unsigned int c : channels)
+            text += (text.empty() ? "" : ",") + std::to_string(c);
+        return "{" + text + "}";
+    }
+    void Add(const std::string& event, const void* subject) {
+        events.push_back(event);
+        subjects.push_back(subject);
+    }
+};
+
+}  // namespace
+
+TEST(RasterUtils, ReadersAreProbedOnceAtTheFirstPixelAndTheProbeIsDeleted) {
+    TempDir dir;
+    const std::string path = MakeImage(dir, "a.tif", ImageSpec());
+    std::unique_ptr<IDataset> ds(GetRasterDataset(path));
+    auto recorder = std::make_shared<Recorder>();
+    kestrel::datasources::ScopedRasterIOObserver scope(recorder);
+    std::unique_ptr<IRasterReader> onFile(GetRasterReader(path));
+    std::unique_ptr<IRasterReader> onDataset(GetRasterReader(ds.get(), {2, 3}));
+    EXPECT_EQ(recorder->events, (std::vector<std::string>{
+                                    "reader {1,2,3}", "read 0,0,1,1", "deleted the read raster",
+                                    "reader {2,3}", "read 0,0,1,1", "deleted the read raster"}));
+    EXPECT_EQ(recorder->subjects[1], onFile.get());
+    EXPECT_EQ(recorder->subjects[4], onDataset.get());
+}
+
+TEST(RasterUtils, WritersGetTheFormatNameFirstAndNoProbe) {
+    TempDir dir;
+    auto recorder = std::make_shared<Recorder>();
+    kestrel::datasources::ScopedRasterIOObserver scope(recorder);
+    std::unique_ptr<IRasterWriter> typed(GetRasterWriter(dir.File("o.tif"), "TIF", {1, 2}));
+    std::unique_ptr<IRasterWriter> plain(GetRasterWriter(dir.File("p.tif")));
+    EXPECT_EQ(recorder->events, (std::vector<std::string>{
+                                    "lookup TIF GTiff", "writer {1,2} GTiff []", "writer {}  []"}));
+    EXPECT_EQ(dynamic_cast<BasicWriter*>(plain.get())->GetFormatName(), "GTiff");
+}
 
 TEST(RasterUtils, FileTypesNameGdalFormats) {
     const std::vector<std::pair<std::string, std::string>> table = {
