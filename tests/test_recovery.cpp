@@ -14,6 +14,7 @@
 #include <filesystem>
 #include <memory>
 #include <random>
+#include <set>
 #include <tuple>
 
 #if !defined(_WIN32)
@@ -130,6 +131,21 @@ TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
         EXPECT_GT(hidden[0], 1000u);
         EXPECT_GT(hidden[1], 1000u);
         EXPECT_EQ(result.filled + result.unfilled, static_cast<unsigned long long>(kSize) * kSize);
+        if (variant == 1) {
+            // Both scenes see the whole roof: one of them takes it whole, and the seams run
+            // along its outline, not a pixel or two inside the wall behind which that scene's
+            // hidden strip lies. (The ground given here is the surface itself: nothing stands
+            // above it.)
+            const samplecity::Dsm dsm(options);
+            std::set<double> roof;
+            for (size_t k = 0; k < source.size(); ++k) {
+                const double x = options.west + (k % kSize + 0.5) * 0.5;
+                const double y = options.south + options.sizeY - (k / kSize + 0.5) * 0.5;
+                if (dsm.BuildingAt(x, y) != 0)
+                    roof.insert(source[k]);
+            }
+            EXPECT_EQ(roof.size(), 1u);
+        }
     }
 }
 

@@ -85,7 +85,7 @@ class Energy {
             return 0;
         float v = seam_;
         if (!w_.raised.empty())
-            v += raised_ * std::max(Raised(p), Raised(q));
+            v += raised_ * std::min(Raised(p), Raised(q));
         if (!w_.grey.empty())
             v += colour_ * (Disagreement(p, a, b) + Disagreement(q, a, b));
         return v;
@@ -314,6 +314,21 @@ void SquareExtreme(std::vector<T>& grid, int width, int height, int radius, T id
 }
 
 }  // namespace
+
+void SquareFilter(std::vector<float>& grid, int width, int height, int radius, bool highest) {
+    if (width < 0 || height < 0 ||
+        grid.size() != static_cast<std::size_t>(width) * static_cast<std::size_t>(height))
+        KESTREL_THROW(DataException, "square filter: " + std::to_string(grid.size()) +
+                                         " values for a grid of " + std::to_string(width) + " x " +
+                                         std::to_string(height));
+    const float inf = std::numeric_limits<float>::infinity();
+    if (highest)
+        SquareExtreme(grid, width, height, radius, -inf,
+                      [](float a, float b) { return std::max(a, b); });
+    else
+        SquareExtreme(grid, width, height, radius, inf,
+                      [](float a, float b) { return std::min(a, b); });
+}
 
 std::vector<float> RaisedHeights(const std::vector<float>& heights, int width, int height,
                                  int radius) {
