@@ -8,11 +8,13 @@
 //     exposure, unbalanced (whose own seam step, views seeing walls and edges differently, is
 //     the floor);
 //   surface error: a surface model whose building edges are moved by up to a pixel, mosaicked
-//     by the per-pixel choice and by seamlines: the share of the seams that crosses a building, and
-//     the share of mosaic pixels more than 15 grey levels from the ideal image (the texture seen
-//     from straight above); the per-pixel choice on the true surface model beside them.
+//     by the per-pixel choice and by seamlines: the seams on buildings, those crossing roofs and
+//     of these the avoidable ones (Seams), and the share of mosaic pixels more than 15 grey
+//     levels from the ideal image (the texture seen from straight above); the per-pixel choice
+//     on the true surface model beside them.
 //
-//   bench_mosaic [DIR]    work in DIR and keep it (default: a scratch directory)
+//   bench_mosaic [--only exposure|surface] [DIR]
+//     DIR: work in DIR and keep it (default: a scratch directory)
 #include <kestrel/trueortho.h>
 #include <samplecity.h>
 
@@ -232,36 +234,81 @@ double ShareApart(const Raster& mosaic, const Raster& mosaicSource, const Raster
     return apart / both;
 }
 
-// The seams' length (pairs of 4-neighbours that take different scenes), the share of it on a
-// building (both pixels on one) and the share inside one (both pixels more than 1 m inside its
-// outline): a seam along a roof's outline goes around the building, even where the surface's
-// error has put it a pixel inside.
+// The seams (pairs of 4-neighbours that take different scenes) against the true buildings:
+//   length;
+//   on buildings: the share with both pixels on one building (a seam along a roof's outline
+//     counts where the surface's error has put it a pixel inside);
+//   inside buildings: the share with both pixels more than 1 m inside one building's outline;
+//   crossings: seam pairs over a roof, both pixels farther than the surface's error (1 pixel)
+//     from its outline, and the buildings they cross;
+//   avoidable crossings: those over a building whose whole roof (so far from its outline) some
+//     scene sees in its visibility index: that scene could take the roof whole, and the seam go
+//     around it.
 struct SeamFigures {
     double length = 0, onBuildings = 0, insideBuildings = 0;
+    double crossings = 0, avoidable = 0;
+    std::size_t crossed = 0, avoidablyCrossed = 0, buildings = 0;
 };
 
-SeamFigures Seams(const City& city, const Raster& source) {
+SeamFigures Seams(const City& city, const std::string& tag, const Raster& source) {
     const samplecity::Dsm truth(city.options);  // the buildings the images show
-    auto building = [&](std::size_t p, int dx, int dy) {
-        return truth.BuildingAt(
-            city.options.west + (static_cast<double>(p % source.width) + 0.5 + dx) * kPixel,
-            city.options.south + city.options.sizeY -
-                (static_cast<double>(p / source.width) + 0.5 + dy) * kPixel);
+    const int w = source.width, h = source.height;
+    auto building = [&](long x, long y) {
+        if (x < 0 || y < 0 || x >= w || y >= h)
+            return 0;
+        return truth.BuildingAt(city.options.west + (static_cast<double>(x) + 0.5) * kPixel,
+                                city.options.south + city.options.sizeY -
+                                    (static_cast<double>(y) + 0.5) * kPixel);
     };
-    auto inside = [&](std::size_t p) {
-        const int id = building(p, 0, 0);
-        for (const auto& [dx, dy] : {std::pair{-2, 0}, {2, 0}, {0, -2}, {0, 2}})
-            if (building(p, dx, dy) != id)
-                return 0;
-        return id;
+    // Per pixel the building it lies on, and the building it lies on with every pixel within
+    // `margin` (a square) on it too.
+    const std::size_t n = static_cast<std::size_t>(w) * h;
+    std::vector<int> on(n), deep(n), interior(n);
+    for (std::size_t p = 0; p < n; ++p)
+        on[p] = building(static_cast<long>(p % w), static_cast<long>(p / w));
+    auto within = [&](int margin, std::vector<int>& out) {
+        for (std::size_t p = 0; p < n; ++p) {
+            const long x = static_cast<long>(p % w), y = static_cast<long>(p / w);
+            out[p] = on[p];
+            for (int dy = -margin; dy <= margin && out[p]; ++dy)
+                for (int dx = -margin; dx <= margin && out[p]; ++dx)
+                    if (building(x + dx, y + dy) != on[p])
+                        out[p] = 0;
+        }
     };
+    within(2, deep);      // more than 1 m inside
+    within(1, interior);  // farther than the surface's error
+    // The buildings whose interior some scene sees whole.
+    const std::size_t count = city.options.buildings.size();
+    std::vector<bool> seenWhole(count + 1, false);
+    for (std::size_t s = 0; s < city.names.size(); ++s) {
+        const Raster vis = Read(city.Visibility(s, tag));
+        std::vector<bool> whole(count + 1, true);
+        for (std::size_t p = 0; p < n; ++p)
+            if (interior[p] && vis.values[p] != VISIBILITY_SEEN)
+                whole[static_cast<std::size_t>(interior[p])] = false;
+        for (std::size_t b = 1; b <= count; ++b)
+            seenWhole[b] = seenWhole[b] || whole[b];
+    }
     SeamFigures f;
+    std::vector<bool> crossed(count + 1, false);
     ForEachSeam(source, [&](std::size_t p, std::size_t q) {
         f.length += 1;
-        f.onBuildings += building(p, 0, 0) != 0 && building(p, 0, 0) == building(q, 0, 0);
-        f.insideBuildings += inside(p) != 0 && inside(p) == inside(q);
+        f.onBuildings += on[p] != 0 && on[p] == on[q];
+        f.insideBuildings += deep[p] != 0 && deep[p] == deep[q];
+        if (interior[p] != 0 && interior[p] == interior[q]) {
+            const auto b = static_cast<std::size_t>(interior[p]);
+            f.crossings += 1;
+            f.avoidable += seenWhole[b];
+            crossed[b] = true;
+        }
     });
     f.onBuildings /= f.length, f.insideBuildings /= f.length;
+    for (std::size_t b = 1; b <= count; ++b) {
+        f.crossed += crossed[b];
+        f.avoidablyCrossed += crossed[b] && seenWhole[b];
+        f.buildings += seenWhole[b];
+    }
     return f;
 }
 
@@ -275,11 +322,23 @@ std::string Load() {
 
 int main(int argc, char** argv) {
     GDALAllRegister();
-    const std::string dir = argc > 1 ? argv[1] : benchsupport::ScratchDir("mosaic").string();
+    std::string only, given;
+    for (int i = 1; i < argc; ++i) {
+        if (std::string(argv[i]) == "--only" && i + 1 < argc)
+            only = argv[++i];
+        else
+            given = argv[i];
+    }
+    if (!only.empty() && only != "exposure" && only != "surface") {
+        std::fprintf(stderr, "bench_mosaic: --only takes exposure or surface, not %s\n",
+                     only.c_str());
+        return 2;
+    }
+    const std::string dir = !given.empty() ? given : benchsupport::ScratchDir("mosaic").string();
     std::printf("sample city, 4 views, %u hardware threads, 2 used, load %s\n",
                 std::thread::hardware_concurrency(), Load().c_str());
 
-    {
+    if (only != "surface") {
         auto reference = MakeCity(dir + "/exposure0", 0, 0);
         auto exposed = MakeCity(dir + "/exposure20", 20, 0);
         MakeOrthos(*reference, "dsm.tif", "o");
@@ -313,7 +372,7 @@ int main(int argc, char** argv) {
         }
     }
 
-    {
+    if (only != "exposure") {
         auto city = MakeCity(dir + "/dsmerror1", 0, 1);
         MakeOrthos(*city, "dsm_true.tif", "true");
         MakeOrthos(*city, "dsm.tif", "err");
@@ -323,21 +382,24 @@ int main(int argc, char** argv) {
             return 1;
         }
         std::printf("\nsurface model's building edges moved by up to 1 pixel\n");
-        std::printf("%-24s %11s %12s %16s %23s %8s\n", "regions", "seam length", "on buildings",
-                    "inside buildings", "more than 15 from ideal", "seconds");
+        std::printf("%-24s %7s %10s %9s %19s %21s %11s %7s\n", "regions", "seam px",
+                    "on bldgs", "inside", "crossings (bldgs)", "avoidable (of bldgs)",
+                    "> 15 ideal", "seconds");
         for (const auto& [label, tag, seamlines] :
              {std::make_tuple("per pixel, true surface", "true", false),
               std::make_tuple("per pixel", "err", false),
               std::make_tuple("seamlines", "err", true)}) {
             const Mosaic m = MakeMosaic(*city, tag, RecoveryJob::Balance::GainOffset, seamlines,
                                         std::string(tag) + (seamlines ? "_seams" : "_pixel"));
-            const SeamFigures seams = Seams(*city, m.source);
-            std::printf("%-24s %11.0f %11.2f%% %15.2f%% %22.2f%% %8.2f\n", label, seams.length,
-                        100 * seams.onBuildings, 100 * seams.insideBuildings,
+            const SeamFigures seams = Seams(*city, tag, m.source);
+            std::printf("%-24s %7.0f %9.2f%% %8.2f%% %12.0f (%2zu/%zu) %13.0f (%2zu/%2zu) %10.2f%% %7.2f\n",
+                        label, seams.length, 100 * seams.onBuildings, 100 * seams.insideBuildings,
+                        seams.crossings, seams.crossed, city->options.buildings.size(),
+                        seams.avoidable, seams.avoidablyCrossed, seams.buildings,
                         100 * ShareApart(m.values, m.source, ideal, nullptr), m.seconds);
         }
     }
-    if (argc <= 1)
+    if (given.empty())
         std::filesystem::remove_all(dir);
     return 0;
 }

@@ -72,15 +72,21 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
     const std::string points = layer("points.geojson", "seamlines",
                                      R"({"type": "Point", "coordinates": [0, 0]})", R"({"scene": "a"})");
     const std::string unnamed = layer("unnamed.geojson", "seamlines", square, R"({"name": "a"})");
-    // Ground heights above mean sea level, as the file's CRS says.
-    const std::string msl = WriteImage(dir.File("msl.tif"));
-    {
-        GDALDataset* raster = GDALDataset::Open(msl.c_str(), GDAL_OF_RASTER | GDAL_OF_UPDATE);
+    // Ground heights above mean sea level, as the file's CRS says, and an image whose math model
+    // (its geotransform) has ellipsoidal heights.
+    const auto georeferenced = [&](const std::string& file, const char* srs) {
+        const std::string path = WriteImage(dir.File(file));
+        GDALDataset* raster = GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_UPDATE);
         OGRSpatialReference crs;
-        crs.SetFromUserInput("EPSG:32632+5773");
+        crs.SetFromUserInput(srs);
         raster->SetSpatialRef(&crs);
+        double transform[6] = {500000, 1, 0, 5000000, 0, -1};
+        raster->SetGeoTransform(transform);
         GDALClose(raster);
-    }
+        return path;
+    };
+    const std::string msl = georeferenced("msl.tif", "EPSG:32632+5773");
+    const std::string geo = georeferenced("geo.tif", "EPSG:32632");
     const std::string out = dir.File("out");
     const std::string textNotImage = ": a text file (a master parameter file?), not an image";
     const CommandLine cases[] = {
@@ -111,13 +117,15 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--jobs", "two"}, "\"two\" is not a whole"},
         {{master}, {"--lines", "5:5"}, "empty slice"},
         {{master}, {"--lines", "x:2"}, "--lines: \"x\""},
-        {{master}, {"--pixel-size", "-1"}, "is negative"},
+        {{master}, {"--pixel-size", "-1"}, "--pixel-size: \"-1\" is not a positive size"},
+        {{master}, {"--pixel-size", "0"}, "--pixel-size: \"0\" is not a positive size"},
         {{master}, {"--pixel-size", "nan"}, "is not a number"},
         {{master}, {"--tr", "1", "0"}, "--tr: \"0\" is not a positive size"},
         {{master}, {"--tr", "1"}, "--tr needs a value"},
         {{master}, {"--tr", "1", "1", "--pixel-size", "1"}, "give one of them"},
         {{master}, {"--te", "0", "0", "10", "x"}, "--te: \"x\" is not a number"},
         {{master}, {"--te", "10", "0", "0", "10"}, "--te: XMIN must be less than XMAX"},
+        {{master}, {"--te", "0", "0", "1e9", "1", "--tr", "0.1", "1"}, "a grid of 10000000000 x 1"},
         {{master}, {"--te=0,0,1,1"}, "--te takes four values"},
         {{master}, {"--te-srs", "EPSG:4326"}, "--te-srs is the CRS of --te, which is missing"},
         {{master}, {"--te", "0", "0", "1", "1", "--te-srs", "EPSG:99999"}, "--te-srs: "},
@@ -133,6 +141,12 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
          {"--dtm", msl, "--elevref", "ELLIPS"},
          "--dtm " + msl + ": the file says the heights are \"EGM96 height\""},
         {{master}, {"--blend-width", "wide"}, "--blend-width: \"wide\" is not a whole number"},
+        {{master}, {"--blend-width", "5000"}, "--blend-width: \"5000\" is more than 4096"},
+        // Options that hold for the sources' math models, checked on every model.
+        {{geo},
+         {"--dem", msl, "--elevref", "MATHMODEL"},
+         "--elevref: " + geo + ": --dem " + msl + ": its CRS says the heights are \"EGM96"},
+        {{geo}, {"--cameras", master}, "--cameras: " + master + " orients none of the images"},
         {{master}, {"--blend", "gauss"}, "--blend: \"gauss\" is not one of feather, multiband"},
         {{master}, {"--balance", "mean"}, "--balance: \"mean\" is not one of gain, gain-offset"},
         {{master}, {"--frobnicate"}, "unknown option"},

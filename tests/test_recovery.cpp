@@ -14,6 +14,7 @@
 #include <filesystem>
 #include <memory>
 #include <random>
+#include <set>
 #include <tuple>
 
 #if !defined(_WIN32)
@@ -126,10 +127,42 @@ TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
             if (vis1[k] != VISIBILITY_SEEN && vis2[k] != VISIBILITY_SEEN) {
                 EXPECT_EQ(source[k], 0) << k;
             }
+            // Nor does a scene weigh in the other's region within its pixel error of a pixel
+            // it does not see: its values there show the building's edge.
+            const int x = static_cast<int>(k % kSize), y = static_cast<int>(k / kSize);
+            bool near[2] = {false, false};
+            for (int dy = -1; dy <= 1; ++dy)
+                for (int dx = -1; dx <= 1; ++dx) {
+                    const int nx = x + dx, ny = y + dy;
+                    if (nx < 0 || ny < 0 || nx >= static_cast<int>(kSize) || ny >= static_cast<int>(kSize))
+                        continue;
+                    const size_t q = static_cast<size_t>(ny) * kSize + nx;
+                    near[0] = near[0] || vis1[q] == VISIBILITY_HIDDEN;
+                    near[1] = near[1] || vis2[q] == VISIBILITY_HIDDEN;
+                }
+            if (near[0] && source[k] == 2)
+                ASSERT_EQ(mosaic[k], ortho2[k]) << k;
+            if (near[1] && source[k] == 1)
+                ASSERT_EQ(mosaic[k], ortho1[k]) << k;
         }
         EXPECT_GT(hidden[0], 1000u);
         EXPECT_GT(hidden[1], 1000u);
         EXPECT_EQ(result.filled + result.unfilled, static_cast<unsigned long long>(kSize) * kSize);
+        if (variant == 1) {
+            // Both scenes see the whole roof: one of them takes it whole, and the seams run
+            // along its outline, not a pixel or two inside the wall behind which that scene's
+            // hidden strip lies. (The ground given here is the surface itself: nothing stands
+            // above it.)
+            const samplecity::Dsm dsm(options);
+            std::set<double> roof;
+            for (size_t k = 0; k < source.size(); ++k) {
+                const double x = options.west + (k % kSize + 0.5) * 0.5;
+                const double y = options.south + options.sizeY - (k / kSize + 0.5) * 0.5;
+                if (dsm.BuildingAt(x, y) != 0)
+                    roof.insert(source[k]);
+            }
+            EXPECT_EQ(roof.size(), 1u);
+        }
     }
 }
 
@@ -169,6 +202,34 @@ TEST_F(OppositeViews, CancelledOrRefusedRunsLeaveNoOutput) {
     }
     for (const char* name :
          {"mosaic.tif", "source.tif", "mosaic.tif.partial", "source.tif.partial"})
+        EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
+}
+
+// A cancel while the seam step asks for the surface's heights (the ground's opening, in slices)
+// ends the run there: after the slice at hand no height is asked for, nothing is published.
+TEST_F(OppositeViews, CancelWhileSeamsReadHeightsStopsAtTheSlice) {
+    struct Cancelling : samplecity::GridSurface {
+        using GridSurface::GridSurface;
+        bool* flag = nullptr;
+        mutable std::size_t cells = 0;
+        void GetHeights(std::size_t n, const double* x, const double* y,
+                        double* h) const override {
+            GridSurface::GetHeights(n, x, y, h);
+            if (n > 1)  // not a single point's view angle
+                cells += n, *flag = true;
+        }
+    } heights(dir->File("dsm.tif"));
+    bool cancel = false;
+    heights.flag = &cancel;
+    RecoveryJob job = Job(1, 1, 1, true);
+    job.surface = &heights;
+    job.seamlines = true;
+    OcclusionRecovery recovery;
+    recovery.SetCancelFlag(&cancel);
+    EXPECT_FALSE(recovery.Recover(job).completed);
+    EXPECT_GT(heights.cells, 0u);
+    EXPECT_LE(heights.cells, 2u * 4096u);  // a slice on each of two threads at the most
+    for (const char* name : {"mosaic.tif", "source.tif"})
         EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
 }
 

@@ -244,7 +244,8 @@ SeamWindow FieldWindow(const Field& f) {
     return w;
 }
 
-// Per line, the columns where the label changes; and how many seam pairs touch raised cells.
+// Per line, the columns where the label changes; and how many seam pairs lie over raised cells
+// (both cells raised; a seam along a raised block's outline is not over it).
 struct SeamTrace {
     std::vector<std::vector<int>> changes;
     int onRaised = 0;
@@ -260,10 +261,10 @@ SeamTrace Trace(const std::vector<Label>& labels, const std::vector<float>& rais
             const std::size_t c = Index(x, y, width);
             if (x + 1 < width && labels[c] != labels[c + 1]) {
                 t.changes[y].push_back(x);
-                t.onRaised += raised[c] > 0 || raised[c + 1] > 0;
+                t.onRaised += raised[c] > 0 && raised[c + 1] > 0;
             }
             if (y + 1 < height && labels[c] != labels[c + width])
-                t.onRaised += raised[c] > 0 || raised[c + width] > 0;
+                t.onRaised += raised[c] > 0 && raised[c + width] > 0;
         }
     return t;
 }

@@ -11,7 +11,7 @@
 
 #include <kestrel/exception.h>
 
-#include "gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 
 namespace kestrel {
 namespace ogc {

@@ -1,4 +1,4 @@
-#include "gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 
 #include <mutex>
 

@@ -15,7 +15,7 @@
 #include <kestrel/exception.h>
 
 #include "factoryslot.h"
-#include "gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 
 GDBFile::~GDBFile() = default;
 GDBLayer_t::~GDBLayer_t() = default;

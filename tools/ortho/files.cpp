@@ -5,6 +5,8 @@
 #include <kestrel/rasterio.h>
 
 #include <filesystem>
+#include <fstream>
+#include <sstream>
 #include <stdexcept>
 #include <system_error>
 
@@ -141,5 +143,40 @@ RunLock::RunLock(const std::string& directory, bool shared, const std::string& w
 }
 
 RunLock::~RunLock() = default;
+
+std::string ReadText(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    std::ostringstream text;
+    text << in.rdbuf();
+    return text.str();
+}
+
+std::vector<std::pair<unsigned int, std::string>> DataLines(const std::string& path) {
+    std::vector<std::pair<unsigned int, std::string>> lines;
+    std::string text = ReadText(path);
+    if (text.compare(0, 3, "\xEF\xBB\xBF") == 0)
+        text.erase(0, 3);
+    unsigned int number = 0;
+    for (std::size_t start = 0; start < text.size();) {
+        std::size_t end = text.find_first_of("\r\n", start);
+        if (end == std::string::npos)
+            end = text.size();
+        const std::string line = text.substr(start, end - start);
+        ++number;
+        if (!line.empty() && line[0] != '!' &&
+            line.find_first_not_of(" \t") != std::string::npos)
+            lines.emplace_back(number, line);
+        start = end + (text.compare(end, 2, "\r\n") == 0 ? 2 : 1);
+    }
+    return lines;
+}
+
+std::string ResolveSource(const std::string& given, const fs::path& masterDir) {
+    std::error_code ec;
+    fs::path source(given);
+    if (source.is_relative() && (fs::exists(masterDir / source, ec) || !fs::exists(source, ec)))
+        source = masterDir / source;
+    return fs::absolute(source, ec).lexically_normal().string();
+}
 
 }  // namespace ortho

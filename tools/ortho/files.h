@@ -4,8 +4,11 @@
 #include <kestrel/exception.h>
 
 #include <exception>
+#include <filesystem>
 #include <memory>
 #include <string>
+#include <utility>
+#include <vector>
 
 namespace ortho {
 
@@ -51,6 +54,18 @@ class RunLock {
     struct Handle;
     std::unique_ptr<Handle> handle_;
 };
+
+// A file's bytes; empty when it cannot be read.
+std::string ReadText(const std::string& path);
+
+// The data lines of a parameter file with their numbers (from 1): every line but header and
+// comment lines ("!" first) and blank ones, with lines ended by LF, CR LF or CR alone, as the
+// parameter-table reader counts them.
+std::vector<std::pair<unsigned int, std::string>> DataLines(const std::string& path);
+
+// A source as a line names it: relative to the master file's directory when it exists there
+// (or nowhere else), absolute and normalised.
+std::string ResolveSource(const std::string& given, const std::filesystem::path& masterDir);
 
 // This process's identifier.
 long long ProcessId();

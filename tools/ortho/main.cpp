@@ -48,6 +48,7 @@ int ReadCommandLine(int argc, char** argv, ortho::Options& options,
         notes = ortho::CheckOptions(options);
         if (!options.images.empty())
             ortho::PlanImageMaster(options);
+        ortho::CheckModels(options);
         return 0;
     } catch (const ortho::UsageError& e) {
         std::fprintf(stderr, "silvan-ortho: %s\n(silvan-ortho --help shows the usage)\n", e.what());
@@ -60,6 +61,7 @@ int ReadCommandLine(int argc, char** argv, ortho::Options& options,
 }  // namespace
 
 int main(int argc, char** argv) {
+    kestrel::gdalsupport::EnsureRegistered();
     ortho::Options options;
     std::vector<std::string> notes;
     const int read = ReadCommandLine(argc, argv, options, notes);

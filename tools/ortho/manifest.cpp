@@ -195,9 +195,8 @@ std::vector<std::string> DatasetFiles(const std::string& path) {
         return files;
     }
     {
-        GDALAllRegister();
-        CPLErrorStateBackuper keepErrors;
-        CPLErrorHandlerPusher quiet(CPLQuietErrorHandler);
+        kestrel::gdalsupport::EnsureRegistered();
+        kestrel::gdalsupport::ErrorCapture quiet;
         GDALDatasetH dataset =
             GDALOpenEx(path.c_str(), GDAL_OF_RASTER | GDAL_OF_VECTOR | GDAL_OF_READONLY, nullptr,
                        nullptr, nullptr);

@@ -1,5 +1,7 @@
 #include "options.h"
 
+#include <kestrel/trueortho.h>
+
 #include <gdal.h>
 #include <ogr_srs_api.h>
 
@@ -138,8 +140,8 @@ Options ParseOptions(const std::vector<std::string>& args) {
         } else if (name == "--pixel-size") {
             const std::string text = take();
             options.pixelSize = ParseNumber(name, text);
-            if (options.pixelSize < 0.0)
-                throw UsageError(name + ": " + Quoted(text) + " is negative");
+            if (!(options.pixelSize > 0.0))
+                throw UsageError(name + ": " + Quoted(text) + " is not a positive size");
         } else if (name == "--tr") {
             if (hasValue)
                 throw UsageError(name + " takes two values: --tr XRES YRES");
@@ -163,7 +165,13 @@ Options ParseOptions(const std::vector<std::string>& args) {
         } else if (name == "--cutline") {
             options.cutline = take();
         } else if (name == "--blend-width") {
-            options.blendWidth = ParseCount(name, take());
+            const std::string text = take();
+            const unsigned int width = ParseCount(name, text);
+            if (width > kestrel::processes::RecoveryJob::kMaxBlendWidth)
+                throw UsageError(name + ": " + Quoted(text) + " is more than " +
+                                 std::to_string(kestrel::processes::RecoveryJob::kMaxBlendWidth) +
+                                 " pixels");
+            options.blendWidth = width;
         } else if (name == "--blend") {
             options.blend = OneOf(name, take(), {"feather", "multiband"});
         } else if (name == "--balance") {
@@ -302,7 +310,7 @@ Mosaic (only the mosaic is made again when these change):
                       features win where polygons overlap, and pixels no polygon covers are
                       filled as without --seamlines
   --blend-width N     blend the two scenes across each seam over N mosaic pixels (default 16;
-                      0: hard seams)
+                      0: hard seams; at most 4096)
   --blend METHOD      feather (default) or multiband (Laplacian pyramid)
   --balance METHOD    colour balance per scene and channel: gain, gain-offset (default) or none
 

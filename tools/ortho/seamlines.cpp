@@ -29,7 +29,7 @@ bool Areal(OGRwkbGeometryType type) {
 }
 
 // The layer "seamlines" of the file, checked to hold polygons with a CRS and the scene field.
-OGRLayer* OpenLayer(const std::string& path, DatasetPtr& dataset, const GdalErrors& errors) {
+OGRLayer* OpenLayer(const std::string& path, DatasetPtr& dataset, const ErrorCapture& errors) {
     dataset.reset(
         GDALDataset::Open(path.c_str(), GDAL_OF_VECTOR | GDAL_OF_READONLY, nullptr, nullptr));
     if (!dataset)
@@ -59,7 +59,7 @@ using Region = std::unique_ptr<OGRGeometry>;
 
 // Calls use(feature id, scene name, polygon in the layer's CRS) for each feature with a
 // geometry, in the layer's order; a feature whose geometry is not a polygon throws.
-void ForEachRegion(const std::string& path, const GdalErrors& errors,
+void ForEachRegion(const std::string& path, const ErrorCapture& errors,
                    const std::function<void(GIntBig, const std::string&, Region)>& use) {
     DatasetPtr dataset;
     OGRLayer* layer = OpenLayer(path, dataset, errors);
@@ -96,7 +96,7 @@ std::string UnknownScene(const std::string& path, GIntBig fid, const std::string
 
 void WriteSeamlines(const std::string& sourceRaster, const std::vector<SeamlineScene>& scenes,
                     const Grid& grid, const std::string& path) {
-    GdalErrors errors;
+    ErrorCapture errors;
     DatasetPtr source(GDALDataset::Open(sourceRaster.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY,
                                         nullptr, nullptr));
     if (!source)
@@ -153,18 +153,18 @@ void WriteSeamlines(const std::string& sourceRaster, const std::vector<SeamlineS
     if (written->CommitTransaction() != OGRERR_NONE)
         FailFile(path, "cannot be written", errors);
     written.reset();
-    if (CPLGetLastErrorType() == CE_Failure)
+    if (errors.Failed())
         FailFile(path, "cannot be written", errors);
 }
 
 void CheckSeamlines(const std::string& path) {
-    GdalErrors errors;
+    ErrorCapture errors;
     DatasetPtr dataset;
     OpenLayer(path, dataset, errors);
 }
 
 void CheckSeamlineScenes(const std::string& path, const std::vector<std::string>& names) {
-    GdalErrors errors;
+    ErrorCapture errors;
     ForEachRegion(path, errors, [&](GIntBig fid, const std::string& name, Region) {
         if (std::find(names.begin(), names.end(), name) == names.end())
             throw UsageError(UnknownScene(path, fid, name, names));
@@ -174,7 +174,7 @@ void CheckSeamlineScenes(const std::string& path, const std::vector<std::string>
 void BurnSeamlines(const std::string& path, const std::vector<SeamlineScene>& scenes,
                    const std::vector<std::string>& others, const Grid& grid,
                    const std::string& raster, std::vector<std::string>& skipped) {
-    GdalErrors errors;
+    ErrorCapture errors;
     OGRSpatialReference srs = GridSrs(grid);
     std::vector<Region> shapes;
     std::vector<double> values;
@@ -214,7 +214,7 @@ void BurnSeamlines(const std::string& path, const std::vector<SeamlineScene>& sc
                                 nullptr, values.data(), nullptr, nullptr, nullptr) != CE_None)
         FailFile(path, "cannot be burnt into the grid", errors);
     regions->FlushCache();
-    if (CPLGetLastErrorType() == CE_Failure)
+    if (errors.Failed())
         FailFile(raster, "cannot be written", errors);
 }
 

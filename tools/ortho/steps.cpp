@@ -14,6 +14,7 @@
 #include <kestrel/orthoutils.h>
 #include <kestrel/processparams.h>
 #include <kestrel/rasterio.h>
+#include <kestrel/stringlist.h>
 
 #include <cpl_error.h>
 #include <gdal_alg.h>
@@ -30,33 +31,17 @@
 
 namespace ortho {
 
-GdalErrors::GdalErrors() {
-    GDALAllRegister();
-    CPLPushErrorHandler(CPLQuietErrorHandler);
-    CPLErrorReset();
-}
-
-GdalErrors::~GdalErrors() {
-    CPLErrorReset();
-    CPLPopErrorHandler();
-}
-
-std::string GdalErrors::Reason() const {
-    const char* message = CPLGetLastErrorMsg();
-    return message != nullptr && *message != '\0' ? message : "unknown reason";
-}
-
 void DatasetClose::operator()(GDALDataset* dataset) const {
     GDALClose(dataset);
 }
 
 [[noreturn]] void FailFile(const std::string& path, const std::string& what,
-                           const GdalErrors& errors) {
+                           const ErrorCapture& errors) {
     KESTREL_THROW(kestrel::FileAccessException, path, kestrel::FileAccessException::AccessFailed,
                   what + ": " + errors.Reason());
 }
 
-DatasetPtr CreateVector(const std::string& path, const GdalErrors& errors) {
+DatasetPtr CreateVector(const std::string& path, const ErrorCapture& errors) {
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GPKG");
     RemoveFile(path);
     DatasetPtr dataset(
@@ -74,7 +59,7 @@ OGRSpatialReference GridSrs(const Grid& grid) {
     return srs;
 }
 
-DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const GdalErrors& errors,
+DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const ErrorCapture& errors,
                             GDALDataType type) {
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
     const char* createOptions[] = {"TILED=YES", "COMPRESS=DEFLATE", "SPARSE_OK=YES", nullptr};
@@ -131,6 +116,25 @@ std::string Grid::Describe() const {
     return text + name;
 }
 
+namespace {
+
+// The cells of the area as gdalwarp -te -tr makes them (sizes rounded to whole pixels); a
+// message naming --te when they are none or too many.
+std::string AreaGridSize(const Area& a, double width, double height, unsigned int& pixels,
+                         unsigned int& lines) {
+    const double across = std::floor((a[2] - a[0] + width / 2) / width);
+    const double down = std::floor((a[3] - a[1] + height / 2) / height);
+    if (!(across >= 1 && down >= 1 && across <= 1u << 30 && down <= 1u << 30))
+        return kestrel::FormatString("--te: the area of interest makes a grid of %.0f x %.0f "
+                                     "pixels of %g x %g",
+                                     across, down, width, height);
+    pixels = static_cast<unsigned int>(across);
+    lines = static_cast<unsigned int>(down);
+    return std::string();
+}
+
+}  // namespace
+
 Grid CommonGrid(const std::vector<Grid>& grids, const Area* area) {
     if (grids.empty())
         KESTREL_THROW(kestrel::DataException, "no grid to join");
@@ -164,15 +168,9 @@ Grid CommonGrid(const std::vector<Grid>& grids, const Area* area) {
     if (area != nullptr) {
         // gdalwarp -te -tr: the top left corner at XMIN YMAX, sizes rounded to whole pixels.
         const Area& a = *area;
-        const double pixels = std::floor((a[2] - a[0] + step / 2) / step);
-        const double lines = std::floor((a[3] - a[1] + height / 2) / height);
-        if (!(pixels >= 1 && lines >= 1 && pixels <= 1u << 30 && lines <= 1u << 30))
-            KESTREL_THROW(kestrel::DataException,
-                          kestrel::FormatString("--te: the area of interest makes a grid of %.0f "
-                                                "x %.0f pixels of %g x %g",
-                                                pixels, lines, step, height));
-        common.pixels = static_cast<unsigned int>(pixels);
-        common.lines = static_cast<unsigned int>(lines);
+        const std::string refused = AreaGridSize(a, step, height, common.pixels, common.lines);
+        if (!refused.empty())
+            KESTREL_THROW(kestrel::DataException, refused);
         common.geoTransform = {a[0], step, 0.0, a[3], 0.0, g[5]};
         return common;
     }
@@ -190,7 +188,7 @@ Grid CommonGrid(const std::vector<Grid>& grids, const Area* area) {
 }
 
 namespace {
-DatasetPtr OpenCutline(const std::string& path, const GdalErrors& errors);
+DatasetPtr OpenCutline(const std::string& path, const ErrorCapture& errors);
 
 std::unique_ptr<OGRPolygon> Rectangle(double minX, double minY, double maxX, double maxY) {
     OGRLinearRing corners;
@@ -220,7 +218,7 @@ std::unique_ptr<OGRGeometry> FootprintShape(const kestrel::tin::Polygon<double>&
 Area AreaInCrs(const Options& options, const std::string& crs) {
     if (options.extentSrs.empty())
         return options.extent;
-    GdalErrors errors;
+    ErrorCapture errors;
     OGRSpatialReference from;
     from.SetAxisMappingStrategy(OAMS_TRADITIONAL_GIS_ORDER);
     if (from.SetFromUserInput(options.extentSrs.c_str()) != OGRERR_NONE)
@@ -242,7 +240,7 @@ Area AreaInCrs(const Options& options, const std::string& crs) {
 
 AreaOfInterest::AreaOfInterest(const Options& options, const std::string& crs,
                                const Area* area) {
-    GdalErrors errors;
+    ErrorCapture errors;
     if (area != nullptr)
         shape_ = Rectangle((*area)[0], (*area)[1], (*area)[2], (*area)[3]);
     if (options.cutline.empty())
@@ -298,7 +296,7 @@ AreaOfInterest::~AreaOfInterest() = default;
 bool AreaOfInterest::Reaches(const kestrel::tin::Polygon<double>& footprint) const {
     if (!shape_)
         return true;
-    GdalErrors errors;
+    ErrorCapture errors;
     const std::unique_ptr<OGRGeometry> valid = FootprintShape(footprint);
     if (!valid)
         return true;
@@ -310,7 +308,7 @@ bool AreaOfInterest::Reaches(const kestrel::tin::Polygon<double>& footprint) con
 
 bool SceneWindow(const Grid& common, const kestrel::tin::Polygon<double>& footprint,
                  Grid& window) {
-    GdalErrors errors;
+    ErrorCapture errors;
     const auto& g = common.geoTransform;
     const std::unique_ptr<OGRPolygon> rectangle =
         Rectangle(g[0], g[3] + common.lines * g[5], g[0] + common.pixels * g[1], g[3]);
@@ -354,7 +352,7 @@ std::array<long long, 2> CellOffset(const Grid& grid, const Grid& window) {
 }
 
 bool ReadGrid(const std::string& path, Grid& grid) {
-    GdalErrors errors;
+    ErrorCapture errors;
     DatasetPtr dataset(
         GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY, nullptr, nullptr));
     if (!dataset)
@@ -416,7 +414,7 @@ void CheckRasterFile(const std::string& path) {
     std::error_code ec;
     if (path.empty() || std::filesystem::is_directory(path, ec))
         return;
-    GdalErrors errors;
+    ErrorCapture errors;
     DatasetPtr raster(
         GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY, nullptr, nullptr));
     if (!raster)
@@ -452,7 +450,7 @@ std::string CheckResampling(const std::string& method) {
 // A file type whose GDAL driver is in this build and writes files, directly or by copy.
 void CheckFileType(const std::string& type) {
     const std::string format = kestrel::core::FType2FormatName(type);
-    GdalErrors errors;
+    ErrorCapture errors;
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName(format.c_str());
     if (driver == nullptr)
         throw UsageError("--of: " + type + ": GDAL's " + format +
@@ -595,6 +593,15 @@ std::vector<std::string> CheckOptions(Options& options) {
         if (!options.extentSrs.empty())
             kestrel::ogc::cs::ICRS{options.extentSrs};
     });
+    // In the output CRS with the pixel size given, the area's grid is known now.
+    const double width = options.xRes > 0.0 ? options.xRes : options.pixelSize;
+    const double height = options.yRes > 0.0 ? options.yRes : options.pixelSize;
+    unsigned int pixels = 0, lines = 0;
+    if (options.hasExtent && options.extentSrs.empty() && width > 0.0 && height > 0.0) {
+        const std::string refused = AreaGridSize(options.extent, width, height, pixels, lines);
+        if (!refused.empty())
+            throw UsageError(refused);
+    }
     if (!options.cutline.empty())
         CheckCutline(options.cutline);
     if (!options.seamlines.empty())
@@ -636,6 +643,23 @@ kestrel::dem::SurfaceHeights ResolveHeights(const Options& options, const std::s
     }
 }
 
+bool DeclaresMathModel(const Options& options) {
+    return !options.elevref.empty() &&
+           GetVertDatum(options.elevref) == kestrel::ogc::cs::DatumMathModel;
+}
+
+// Why heights whose file says its datum cannot be taken in the math model's datum, as
+// --elevref MATHMODEL declares; empty when they can.
+std::string ModelDatumConflict(const Options& options, const kestrel::dem::SurfaceHeights& heights,
+                               const std::string& path, const std::string& option,
+                               kestrel::ogc::cs::DatumType modelDatum) {
+    if (!heights.file.known || !DeclaresMathModel(options) || modelDatum == heights.file.datum)
+        return std::string();
+    return option + " " + path + ": its CRS says the heights are \"" + heights.file.name +
+           "\", which is not the math model's vertical datum, as --elevref MATHMODEL declares: "
+           "leave --elevref out to follow the file";
+}
+
 void CheckHeights(const Options& options, const std::string& path, const std::string& option) {
     if (path.empty())
         return;
@@ -659,15 +683,9 @@ std::unique_ptr<kestrel::dem::IElevationSource> OpenHeights(
     scale *= heights.unitScale;
     kestrel::ogc::cs::DatumType datum = heights.datum;
     const kestrel::ogc::cs::DatumType modelDatum = GetModelDatum(model);
-    if (heights.file.known && !options.elevref.empty() &&
-        GetVertDatum(options.elevref) == kestrel::ogc::cs::DatumMathModel &&
-        modelDatum != heights.file.datum) {
-        KESTREL_THROW(kestrel::DataException,
-                      option + " " + path + ": its CRS says the heights are \"" +
-                          heights.file.name +
-                          "\", which is not the math model's vertical datum, as --elevref "
-                          "MATHMODEL declares: leave --elevref out to follow the file");
-    }
+    const std::string conflict = ModelDatumConflict(options, heights, path, option, modelDatum);
+    if (!conflict.empty())
+        KESTREL_THROW(kestrel::DataException, conflict);
     if (raster) {
         // The first band; no-data as the raster declares it.
         return std::unique_ptr<kestrel::dem::IElevationSource>(
@@ -691,6 +709,77 @@ void CheckSurface(const Options& options) {
     CheckHeights(options, options.dem.empty() ? options.tin : options.dem,
                  options.dem.empty() ? "--tin" : "--dem");
     CheckHeights(options, options.dtm, "--dtm");
+}
+
+void CheckModels(const Options& options) {
+    const bool mathModel = DeclaresMathModel(options);
+    if (options.cameras.empty() && !mathModel)
+        return;
+    const std::string surface = options.dem.empty() ? options.tin : options.dem;
+    const std::string option = options.dem.empty() ? "--tin" : "--dem";
+    kestrel::dem::SurfaceHeights heights;
+    if (mathModel && !surface.empty()) {
+        try {
+            heights = ResolveHeights(options, surface, option);
+        } catch (const std::exception&) {
+            // Refused by CheckSurface, or left to where the heights are opened.
+        }
+    }
+    if (options.cameras.empty() && !heights.file.known)
+        return;
+    // The sources with their model segments: the images given, or the master file's lines
+    // (source in the first column, segment in the third).
+    struct Source {
+        std::string where, path;
+        int mmseg = 0;
+    };
+    std::vector<Source> sources;
+    for (const std::string& image : options.images)
+        sources.push_back({image, image, 0});
+    if (options.images.empty()) {
+        const std::filesystem::path masterDir =
+            std::filesystem::absolute(options.master).parent_path();
+        for (const auto& line : DataLines(options.master)) {
+            std::vector<std::string> columns;
+            std::istringstream fields(line.second);
+            for (std::string field; std::getline(fields, field, ';');)
+                columns.push_back(TrimWhitespace(field));
+            Source source{options.master + ", line " + std::to_string(line.first),
+                          ResolveSource(columns[0], masterDir), 0};
+            try {
+                if (columns.size() > 2 && !columns[2].empty())
+                    source.mmseg = std::stoi(columns[2]);
+            } catch (const std::exception&) {
+                continue;  // refused, naming the line, where the master file is read
+            }
+            sources.push_back(std::move(source));
+        }
+    }
+    // A camera file that orients none of the images is refused; one image missing from it
+    // fails that scene only. A model whose datum is not the surface file's fails every scene.
+    std::string cameraError;
+    bool oriented = false;
+    for (const Source& source : sources) {
+        std::error_code ec;
+        if (!std::filesystem::exists(source.path, ec))
+            continue;  // the scene fails, naming its source
+        std::unique_ptr<kestrel::mathmodel::IMathModel> model;
+        try {
+            model = OpenModel(options, source.path, source.mmseg);
+        } catch (const std::exception& e) {
+            if (cameraError.empty())
+                cameraError = source.where + ": " + Explain(e);
+            continue;
+        }
+        oriented = true;
+        const std::string conflict =
+            ModelDatumConflict(options, heights, surface, option, GetModelDatum(model.get()));
+        if (!conflict.empty())
+            throw UsageError("--elevref: " + source.where + ": " + conflict);
+    }
+    if (!options.cameras.empty() && !oriented && !cameraError.empty())
+        throw UsageError("--cameras: " + options.cameras + " orients none of the images: " +
+                         cameraError);
 }
 
 std::unique_ptr<kestrel::dem::IElevationSource> OpenSurface(
@@ -984,7 +1073,7 @@ OrthoResult MakeOrtho(const Options& options, const SceneInput& scene, const Gri
 
 void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>& footprint) {
     {
-        GdalErrors errors;
+        ErrorCapture errors;
         CreateVector(path, errors);
     }
     WriteSceneFootprint(path, &footprint);
@@ -992,7 +1081,7 @@ void WriteFootprint(const std::string& path, const kestrel::tin::Polygon<double>
 
 namespace {
 
-DatasetPtr OpenCutline(const std::string& path, const GdalErrors& errors) {
+DatasetPtr OpenCutline(const std::string& path, const ErrorCapture& errors) {
     DatasetPtr dataset(
         GDALDataset::Open(path.c_str(), GDAL_OF_VECTOR | GDAL_OF_READONLY, nullptr, nullptr));
     if (!dataset)
@@ -1010,7 +1099,7 @@ DatasetPtr OpenCutline(const std::string& path, const GdalErrors& errors) {
 
 // The cutline burnt into a Byte raster on the grid: 1 where a pixel's centre lies inside.
 void BurnCutline(const std::string& cutline, const Grid& grid, const std::string& path) {
-    GdalErrors errors;
+    ErrorCapture errors;
     DatasetPtr vector = OpenCutline(cutline, errors);
     DatasetPtr mask = CreateGridRaster(grid, path, errors);
     int band = 1;
@@ -1020,14 +1109,14 @@ void BurnCutline(const std::string& cutline, const Grid& grid, const std::string
                             nullptr, &burn, nullptr, nullptr, nullptr) != CE_None)
         FailFile(cutline, "cannot be burnt into the grid", errors);
     mask->FlushCache();
-    if (CPLGetLastErrorType() == CE_Failure)
+    if (errors.Failed())
         FailFile(path, "cannot be written", errors);
 }
 
 }  // namespace
 
 void CheckCutline(const std::string& path) {
-    GdalErrors errors;
+    ErrorCapture errors;
     OpenCutline(path, errors);
 }
 
@@ -1165,7 +1254,7 @@ MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoverySce
 
 void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid,
                      const std::string& path) {
-    GdalErrors errors;
+    ErrorCapture errors;
     DatasetPtr merged = CreateVector(path, errors);
     OGRSpatialReference srs = GridSrs(grid);
     for (const FootprintLayer& entry : layers) {
@@ -1195,7 +1284,7 @@ void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid
         }
     }
     merged.reset();
-    if (CPLGetLastErrorType() == CE_Failure)
+    if (errors.Failed())
         FailFile(path, "cannot be written", errors);
 }
 
@@ -1217,7 +1306,7 @@ std::string SourceColour(unsigned int value) {
 }
 
 void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook kind) {
-    GdalErrors errors;
+    ErrorCapture errors;
     DatasetPtr source(
         GDALDataset::Open(raster.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY, nullptr, nullptr));
     if (!source)

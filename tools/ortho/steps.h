@@ -5,6 +5,7 @@
 #include "options.h"
 
 #include <kestrel/elevation.h>
+#include <kestrel/gdalsupport.h>
 #include <kestrel/mathmodel.h>
 #include <silvan/polygon.h>
 #include <silvan/toimgsetparser.h>
@@ -72,6 +73,12 @@ std::unique_ptr<kestrel::mathmodel::IMathModel> OpenModel(const Options& options
 // naming the file and the option. Where the file says nothing, the options hold (MSL and metres
 // by default). Throws UsageError; a file that cannot be read is left to OpenSurface.
 void CheckSurface(const Options& options);
+
+// Checks the options that hold for the sources' math models before any work: --elevref MATHMODEL
+// over a surface whose file says its datum (every model must have that datum) and --cameras (it
+// must orient at least one image). Opens every source's model only when one of them is given.
+// Throws UsageError naming the option and the line.
+void CheckModels(const Options& options);
 
 // The surface model of the options (--dem or --tin) with the heights corrected and delivered in
 // the datum of the math model (null: the ellipsoid), after CheckSurface's checks and, for
@@ -236,15 +243,7 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
 // The colour of a value of the source raster in its quicklook, "#rrggbb".
 std::string SourceColour(unsigned int value);
 
-// GDAL's errors inside the tool: collected quietly while the object lives, then cleared.
-class GdalErrors {
-  public:
-    GdalErrors();
-    ~GdalErrors();
-    GdalErrors(const GdalErrors&) = delete;
-    GdalErrors& operator=(const GdalErrors&) = delete;
-    std::string Reason() const;
-};
+using kestrel::gdalsupport::ErrorCapture;
 
 struct DatasetClose {
     void operator()(GDALDataset* dataset) const;
@@ -253,13 +252,13 @@ using DatasetPtr = std::unique_ptr<GDALDataset, DatasetClose>;
 
 // Throws FileAccessException naming the path, what failed and GDAL's reason.
 [[noreturn]] void FailFile(const std::string& path, const std::string& what,
-                           const GdalErrors& errors);
+                           const ErrorCapture& errors);
 // A new, empty GeoPackage at path (an older file there removed).
-DatasetPtr CreateVector(const std::string& path, const GdalErrors& errors);
+DatasetPtr CreateVector(const std::string& path, const ErrorCapture& errors);
 // The grid's CRS, axes in GIS order (easting, northing).
 OGRSpatialReference GridSrs(const Grid& grid);
 // A working one-band GeoTIFF on the grid, all 0 (tiled, sparse), for layers burnt in.
-DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const GdalErrors& errors,
+DatasetPtr CreateGridRaster(const Grid& grid, const std::string& path, const ErrorCapture& errors,
                             GDALDataType type = GDT_Byte);
 
 // text with A-Z lower-cased, whatever the locale.

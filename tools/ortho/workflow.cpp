@@ -56,36 +56,6 @@ std::string About(const std::string& path, const std::string& message) {
     return message.find(path) != std::string::npos ? message : path + ": " + message;
 }
 
-std::string ReadText(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    std::ostringstream text;
-    text << in.rdbuf();
-    return text.str();
-}
-
-// The data lines of a parameter file with their numbers (from 1): every line but header and
-// comment lines ("!" first) and blank ones, with lines ended by LF, CR LF or CR alone, as the
-// parameter-table reader counts them.
-std::vector<std::pair<unsigned int, std::string>> DataLines(const std::string& path) {
-    std::vector<std::pair<unsigned int, std::string>> lines;
-    std::string text = ReadText(path);
-    if (text.compare(0, 3, "\xEF\xBB\xBF") == 0)
-        text.erase(0, 3);
-    unsigned int number = 0;
-    for (std::size_t start = 0; start < text.size();) {
-        std::size_t end = text.find_first_of("\r\n", start);
-        if (end == std::string::npos)
-            end = text.size();
-        const std::string line = text.substr(start, end - start);
-        ++number;
-        if (!line.empty() && line[0] != '!' &&
-            line.find_first_not_of(" \t") != std::string::npos)
-            lines.emplace_back(number, line);
-        start = end + (text.compare(end, 2, "\r\n") == 0 ? 2 : 1);
-    }
-    return lines;
-}
-
 // Writes a derived file through write(partName) and puts it in place, unless the file there
 // already holds the same bytes (so that a rerun changes nothing).
 template <typename Write>
@@ -240,14 +210,6 @@ std::vector<Output> SceneOutputs(const std::string& dir, const std::string& name
 }
 
 // A relative source is taken from the master file's directory, or else from the current one.
-std::string ResolveSource(const std::string& given, const fs::path& masterDir) {
-    std::error_code ec;
-    fs::path source(given);
-    if (source.is_relative() && (fs::exists(masterDir / source, ec) || !fs::exists(source, ec)))
-        source = masterDir / source;
-    return fs::absolute(source, ec).lexically_normal().string();
-}
-
 // What two paths are compared by: the same file however it is named (links, "..", and the
 // letter case on file systems that ignore it).
 std::string SameFileKey(const std::string& path) {

@@ -234,6 +234,7 @@ struct KESTREL_API RecoveryJob {
     dem::IElevationSource* ground = nullptr;
     // Across each seam the two scenes are blended over this many mosaic pixels; 0: hard seams.
     unsigned int blendWidth = 16;
+    static constexpr unsigned int kMaxBlendWidth = 4096;
     enum class Blend { Feather, Multiband };
     Blend blend = Blend::Feather;
     // Per scene and channel a gain (and offset) that makes overlapping scenes agree.

@@ -10,7 +10,7 @@
 #include <kestrel/exception.h>
 #include <kestrel/rasterio.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 
 namespace kestrel {
 namespace core {

@@ -4,7 +4,7 @@
 #include <kestrel/exception.h>
 #include <kestrel/rasterio.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 #include "channelinfo.h"
 #include "gdaldataset.h"
 #include "tiling.h"

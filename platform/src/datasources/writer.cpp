@@ -13,7 +13,7 @@
 #include <kestrel/formats.h>
 #include <kestrel/rasterio.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 #include "channelinfo.h"
 #include "gdaldataset.h"
 #include "tiling.h"

@@ -15,7 +15,7 @@
 
 #include <kestrel/exception.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 #include "griddem.h"
 #include "memoryposts.h"
 

@@ -10,7 +10,7 @@
 
 #include <kestrel/exception.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 #include "rasterdem.h"
 
 namespace kestrel {

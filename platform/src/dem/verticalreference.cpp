@@ -12,7 +12,7 @@
 
 #include <kestrel/exception.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 #include "heightquery.h"
 #include "rasterdem.h"
 #include "tileindex.h"

@@ -17,7 +17,7 @@
 #include <kestrel/file.h>
 #include <kestrel/mathmodel.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 
 namespace kestrel {
 namespace mathmodel {

@@ -8,7 +8,7 @@
 
 #include <kestrel/exception.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 #include "models.h"
 
 namespace kestrel {

@@ -7,7 +7,7 @@
 #include <kestrel/exception.h>
 #include <kestrel/orthoutils.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 
 namespace kestrel {
 namespace processes {

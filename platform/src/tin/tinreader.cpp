@@ -14,7 +14,7 @@
 #include <kestrel/exception.h>
 
 #include "../dem/heightquery.h"
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 
 namespace kestrel {
 namespace tin {

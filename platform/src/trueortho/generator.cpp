@@ -5,7 +5,7 @@
 #include <kestrel/raster.h>
 #include <kestrel/trueortho.h>
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 #include "kernels.h"
 #include "rasterfiles.h"
 #include "runcontrol.h"

@@ -1,6 +1,6 @@
 #include "rasterfiles.h"
 
-#include "../gdalsupport.h"
+#include <kestrel/gdalsupport.h>
 
 #include <kestrel/exception.h>
 

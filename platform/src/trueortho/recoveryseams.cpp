@@ -18,36 +18,49 @@ namespace {
 // kSteepest; kUnknownAngleCost where the angle is unknown, after every known one), plus
 // kLevelStep per radiometric difference level, so that a lower level is always preferred where
 // it sees, plus kUnclearCost where a hidden pixel of the scene lies within its DBM pixel error
-// (above any difference of level, as in the choice without seamlines).
+// (above any difference of level, as in the choice without seamlines) and the pixel stands no
+// more than kExposedRise above the lowest surface within that error: an error of the surface
+// model can expose the ground beside a hidden strip, not the roof above it, whose edge the
+// scene sees as well as the rest of the roof.
 constexpr float kSteepest = 9.0f;  // about 84 degrees off nadir
 constexpr float kUnknownAngleCost = 10.0f;
 constexpr float kLevelStep = 100.0f;
 constexpr float kUnclearCost = 1000.0f;
-// Ground estimated from the surface: a morphological opening with a square of this half-side,
-// wider than most buildings are deep, so that its floor is the ground between them.
-constexpr double kGroundRadius = 20.0;  // metres
+constexpr float kExposedRise = 1.0f;  // metres
+// Ground estimated from the surface: a morphological opening with a square of this half-side.
+// The opening keeps whatever the square fits inside, so its side (61 m) must exceed a building's
+// smaller dimension (at 20 m a block of 50 x 45 m kept its roof as ground, and seams crossed it).
+constexpr double kGroundRadius = 30.0;  // metres
 constexpr int kMaxGroundRadius = 256;   // cells
 constexpr int kBlockRadius = 8;         // blocks of the opening
+constexpr size_t kHeightSlice = 4096;  // cells of surface heights asked at a time
 
-float PixelCost(const SceneTile& tile, size_t p, int level) {
+// `exposable`: the pixel stands no more than kExposedRise above the lowest surface near it.
+float PixelCost(const SceneTile& tile, size_t p, int level, bool exposable) {
     const float angle = tile.angle[p];
     return (std::isinf(angle) ? kUnknownAngleCost : std::min(angle, kSteepest)) +
-           kLevelStep * static_cast<float>(level) + (tile.state[p] == kUnclear ? kUnclearCost : 0);
+           kLevelStep * static_cast<float>(level) +
+           (tile.state[p] == kUnclear && exposable ? kUnclearCost : 0);
 }
 
 class RecoverySeamSource : public SeamSource {
   public:
     RecoverySeamSource(const RecoveryJob& job, const RecoveryGrid& grid, const SceneReader& reader,
-                       const BalanceFit& fit)
-        : job_(job), grid_(grid), reader_(reader), fit_(fit) {}
+                       const BalanceFit& fit, const RunControl& control)
+        : job_(job), grid_(grid), reader_(reader), fit_(fit), control_(control) {}
 
     // Cells x0 to x0 + width - 1 (and y0 to y0 + height - 1) of factor x factor pixels. A cell is
     // forbidden to a scene that sees under half of its pixels; otherwise its cost is the mean
     // pixel cost over the pixels it sees, plus kUnclearCost times the share it does not see.
+    // Raised heights: per cell, the highest within the largest DBM pixel error, so that a seam
+    // priced on the lower side of its pair keeps that error off the raised object's outline.
     SeamWindow Read(int x0, int y0, int width, int height, int factor) override {
         SeamWindow window;
         window.width = width, window.height = height;
         const size_t cells = static_cast<size_t>(width) * height;
+        const Relief relief = ReadRelief(x0, y0, width, height, factor);
+        if (control_.Stopped())
+            return window;
         const Rect pixels{x0 * factor, y0 * factor, width * factor, height * factor};
         const Rect in = pixels.Intersect(grid_.Whole());
         SceneReader::Scratch scratch;
@@ -62,6 +75,8 @@ class RecoverySeamSource : public SeamSource {
             const int level = job_.scenes[s].radiometricLevel;
             for (int cy = in.y; cy < in.y + in.height; cy += chunk)
                 for (int cx = in.x; cx < in.x + in.width; cx += chunk) {
+                    if (control_.Stopped())
+                        return window;  // the scenes read so far, whole
                     const Rect part = Rect{cx, cy, chunk, chunk}.Intersect(sceneIn);
                     if (part.Empty() || !reader_.Read(s, part, true, true, scratch, tile))
                         continue;
@@ -76,7 +91,7 @@ class RecoverySeamSource : public SeamSource {
                                 static_cast<size_t>((part.y + j - pixels.y) / factor) * width +
                                 (part.x + i - pixels.x) / factor;
                             ++seen[c];
-                            cost[c] += PixelCost(tile, p, level);
+                            cost[c] += PixelCost(tile, p, level, relief.rise[c] <= kExposedRise);
                             double sum = 0;
                             for (int b = 0; b < grid_.bands; ++b)
                                 sum += fit_.gain[s][b] * tile.values[part.Size() * b + p] +
@@ -111,16 +126,50 @@ class RecoverySeamSource : public SeamSource {
             window.cost.push_back(std::move(cost));
             window.grey.push_back(std::move(grey));
         }
-        window.raised = Raised(x0, y0, width, height, factor);
+        window.raised = relief.raised;
         return window;
     }
 
   private:
+    // Per cell of a window: the highest raised height within the largest DBM pixel error, and
+    // how far the cell stands above the lowest surface within it (metres; empty without a
+    // surface model).
+    struct Relief {
+        std::vector<float> raised, rise;
+    };
+
+    Relief ReadRelief(int x0, int y0, int width, int height, int factor) const {
+        const size_t cells = static_cast<size_t>(width) * height;
+        Relief relief;
+        relief.rise.assign(cells, 0.0f);
+        if (job_.surface == nullptr)
+            return relief;
+        const int m = (grid_.halo + factor - 1) / factor;
+        const int w = width + 2 * m, h = height + 2 * m;
+        const std::vector<float> raised = Raised(x0 - m, y0 - m, w, h, factor);
+        if (control_.Stopped())
+            return relief;
+        std::vector<float> highest = raised, lowest = raised;
+        SquareFilter(highest, w, h, m, true);
+        SquareFilter(lowest, w, h, m, false);
+        relief.raised.resize(cells);
+        for (int j = 0; j < height; ++j)
+            for (int i = 0; i < width; ++i) {
+                const size_t c = static_cast<size_t>(j) * width + i;
+                const size_t k = static_cast<size_t>(j + m) * w + i + m;
+                relief.raised[c] = (raised[k] + highest[k]) / 2;
+                relief.rise[c] = raised[k] - lowest[k];
+            }
+        return relief;
+    }
+
     // Heights at the centres of cells [x0, x0 + width) x [y0, y0 + height); NaN where none.
+    // Asked in slices of lines (a vertical datum conversion makes them slow), each after a look
+    // at the run's control: once it stops, the rest stay NaN.
     std::vector<float> Heights(const dem::IElevationSource& source, int x0, int y0, int width,
                                int height, int factor) const {
         const size_t cells = static_cast<size_t>(width) * height;
-        std::vector<double> x(cells), y(cells), h(cells);
+        std::vector<double> x(cells), y(cells), h(cells, NAN);
         const auto& g = grid_.geoTransform;
         for (int j = 0; j < height; ++j)
             for (int i = 0; i < width; ++i) {
@@ -128,7 +177,9 @@ class RecoverySeamSource : public SeamSource {
                 const size_t c = static_cast<size_t>(j) * width + i;
                 x[c] = g[0] + p * g[1] + l * g[2], y[c] = g[3] + p * g[4] + l * g[5];
             }
-        source.GetHeights(cells, x.data(), y.data(), h.data());
+        const size_t slice = std::max<size_t>(1, kHeightSlice / std::max(1, width)) * width;
+        for (size_t c = 0; c < cells && !control_.Stopped(); c += slice)
+            source.GetHeights(std::min(slice, cells - c), &x[c], &y[c], &h[c]);
         return std::vector<float>(h.begin(), h.end());
     }
 
@@ -187,6 +238,7 @@ class RecoverySeamSource : public SeamSource {
     const RecoveryGrid& grid_;
     const SceneReader& reader_;
     const BalanceFit& fit_;
+    const RunControl& control_;
 };
 
 }  // namespace
@@ -336,8 +388,9 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
 }
 
 std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job, const RecoveryGrid& grid,
-                                           const SceneReader& reader, const BalanceFit& fit) {
-    return std::make_unique<RecoverySeamSource>(job, grid, reader, fit);
+                                           const SceneReader& reader, const BalanceFit& fit,
+                                           const RunControl& control) {
+    return std::make_unique<RecoverySeamSource>(job, grid, reader, fit, control);
 }
 
 }  // namespace trueortho

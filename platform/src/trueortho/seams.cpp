@@ -18,16 +18,19 @@ namespace trueortho {
 
 namespace {
 
-// Expansion cycles: each lowers the energy less than the one before; a few reach its floor.
+// Expansion cycles: each lowers the energy less than the one before; a few reach its floor. The
+// refinement starts from the coarse labels, already near it.
 constexpr int kMaxCycles = 4;
+constexpr int kRefineCycles = 2;
 // The coarse grid's cells are about kCoarseCell metres and at least kMinFactor pixels on a side,
 // and the whole coarse grid at most kMaxCoarseCells: fine enough to see streets between
 // buildings, coarse enough that the seam term does not dwarf the data term cell by cell.
 constexpr double kCoarseCell = 1.0;
 constexpr int kMinFactor = 4;
 constexpr std::size_t kMaxCoarseCells = std::size_t{16} << 20;
-// Coarse cells either side of a coarse seam left free at full resolution.
-constexpr int kBand = 3;
+// Coarse cells either side of the two along a coarse seam left free at full resolution. On the
+// sample city 1 places the seams as 3 does (bench_mosaic) with half the free pixels.
+constexpr int kBand = 1;
 // The share of the progress the coarse pass takes.
 constexpr double kCoarseShare = 0.2;
 
@@ -85,7 +88,7 @@ class Energy {
             return 0;
         float v = seam_;
         if (!w_.raised.empty())
-            v += raised_ * std::max(Raised(p), Raised(q));
+            v += raised_ * std::min(Raised(p), Raised(q));
         if (!w_.grey.empty())
             v += colour_ * (Disagreement(p, a, b) + Disagreement(q, a, b));
         return v;
@@ -129,29 +132,38 @@ void AddUnary(MaxFlow& g, int node, float e0, float e1) {
     g.AddTerminal(node, e0 - m, e1 - m);
 }
 
+// What the expansions of one window share: the free cells (those that may change label, in
+// raster order), per cell its node in the current graph (-1: none) and the graph.
+struct Expansions {
+    std::vector<std::size_t> free;
+    std::vector<int> node;
+    std::vector<std::size_t> taking;  // the cells that take alpha
+    MaxFlow graph;
+};
+
 // One expansion move: every free cell may keep its label or take alpha, at the least energy.
-// Returns the change of energy it made (<= 0).
+// Returns the change of energy it made (<= 0). Only the free cells are visited, so that a
+// window mostly held to known labels costs little.
 double Expand(const SeamWindow& w, const Energy& energy, int alpha, std::vector<int>& labels,
-              std::vector<int>& node, MaxFlow& graph) {
+              Expansions& x) {
     const int W = w.width, H = w.height;
-    const std::size_t cells = Cells(w);
+    std::vector<int>& node = x.node;
     int nodes = 0;
-    for (std::size_t c = 0; c < cells; ++c) {
-        const bool variable = energy.Free(c) && labels[c] >= 0 && labels[c] != alpha &&
-                              Allowed(energy.Data(c, alpha));
-        node[c] = variable ? nodes++ : -1;
-    }
+    for (const std::size_t c : x.free)
+        if (labels[c] >= 0 && labels[c] != alpha && Allowed(energy.Data(c, alpha)))
+            node[c] = nodes++;
     if (nodes == 0)
         return 0;
+    MaxFlow& graph = x.graph;
     graph.Reset(nodes, 2 * static_cast<std::size_t>(nodes));
-    for (std::size_t c = 0; c < cells; ++c)
-        if (node[c] >= 0)
-            AddUnary(graph, node[c], energy.Data(c, labels[c]), energy.Data(c, alpha));
+    // Per variable cell p its data term and the pairs with its neighbours: with a variable
+    // neighbour q (counted once, from the first of the two) an edge, with a fixed one a unary
+    // term.
     auto pair = [&](std::size_t p, std::size_t q) {
         const int np = node[p], nq = node[q], lp = labels[p], lq = labels[q];
-        if (np < 0 && nq < 0)
-            return;
-        if (np >= 0 && nq >= 0) {
+        if (nq < 0) {
+            AddUnary(graph, np, energy.Pair(p, q, lp, lq), energy.Pair(p, q, alpha, lq));
+        } else if (p < q) {
             // E(keep, keep) = A, E(keep, alpha) = B, E(alpha, keep) = C, E(alpha, alpha) = 0
             // as A + (C - A) x_p - C x_q + (B + C - A) (1 - x_p) x_q. Where the colour term is
             // not a metric, A is lowered to B + C; the move is then checked on the true energy.
@@ -160,50 +172,58 @@ double Expand(const SeamWindow& w, const Energy& energy, int alpha, std::vector<
             AddUnary(graph, np, 0, C - A);
             AddUnary(graph, nq, 0, -C);
             graph.AddEdge(np, nq, B + C - A, 0);
-        } else if (np >= 0) {
-            AddUnary(graph, np, energy.Pair(p, q, lp, lq), energy.Pair(p, q, alpha, lq));
-        } else {
-            AddUnary(graph, nq, energy.Pair(p, q, lp, lq), energy.Pair(p, q, lp, alpha));
         }
     };
-    for (int y = 0; y < H; ++y)
-        for (int x = 0; x < W; ++x) {
-            const std::size_t c = static_cast<std::size_t>(y) * W + x;
-            if (x + 1 < W)
-                pair(c, c + 1);
-            if (y + 1 < H)
-                pair(c, c + W);
-        }
+    for (const std::size_t c : x.free) {
+        if (node[c] < 0)
+            continue;
+        AddUnary(graph, node[c], energy.Data(c, labels[c]), energy.Data(c, alpha));
+        const int cx = static_cast<int>(c % W), cy = static_cast<int>(c / W);
+        if (cx > 0)
+            pair(c, c - 1);
+        if (cx + 1 < W)
+            pair(c, c + 1);
+        if (cy > 0)
+            pair(c, c - W);
+        if (cy + 1 < H)
+            pair(c, c + W);
+    }
     graph.Solve();
 
     // The change of energy, over the cells that take alpha and their neighbours.
-    std::vector<int> next = labels;
-    std::vector<std::size_t> changed;
-    for (std::size_t c = 0; c < cells; ++c)
+    x.taking.clear();
+    for (const std::size_t c : x.free)
         if (node[c] >= 0 && graph.OnSinkSide(node[c]))
-            next[c] = alpha, changed.push_back(c);
+            x.taking.push_back(c);
+    auto next = [&](std::size_t q) {
+        return node[q] >= 0 && graph.OnSinkSide(node[q]) ? alpha : labels[q];
+    };
     double delta = 0;
-    for (std::size_t c : changed) {
+    for (const std::size_t c : x.taking) {
         delta += energy.Data(c, alpha) - energy.Data(c, labels[c]);
-        const int x = static_cast<int>(c % W), y = static_cast<int>(c / W);
+        const int cx = static_cast<int>(c % W), cy = static_cast<int>(c / W);
         auto neighbour = [&](std::size_t q) {
-            // A pair of two changed cells is counted from its first cell.
-            if (next[q] == alpha && labels[q] != alpha && q < c)
+            const int lq = next(q);
+            // A pair of two cells taking alpha is counted from its first cell.
+            if (lq == alpha && labels[q] != alpha && q < c)
                 return;
-            delta += energy.Pair(c, q, alpha, next[q]) - energy.Pair(c, q, labels[c], labels[q]);
+            delta += energy.Pair(c, q, alpha, lq) - energy.Pair(c, q, labels[c], labels[q]);
         };
-        if (x > 0)
+        if (cx > 0)
             neighbour(c - 1);
-        if (x + 1 < W)
+        if (cx + 1 < W)
             neighbour(c + 1);
-        if (y > 0)
+        if (cy > 0)
             neighbour(c - W);
-        if (y + 1 < H)
+        if (cy + 1 < H)
             neighbour(c + W);
     }
+    for (const std::size_t c : x.free)
+        node[c] = -1;
     if (delta >= 0)
         return 0;
-    labels.swap(next);
+    for (const std::size_t c : x.taking)
+        labels[c] = alpha;
     return delta;
 }
 
@@ -249,14 +269,17 @@ std::vector<int> Solve(const SeamWindow& window, const SeamParams& params, std::
     }
     if (scenes < 2)
         return labels;
-    std::vector<int> node(cells);
-    MaxFlow graph;
+    Expansions x;
+    x.node.assign(cells, -1);
+    for (std::size_t c = 0; c < cells; ++c)
+        if (energy.Free(c) && labels[c] >= 0)
+            x.free.push_back(c);
     double total = energy.Total(labels);
-    for (int cycle = 0; cycle < kMaxCycles; ++cycle) {
+    for (int cycle = 0; cycle < (everyScene ? kMaxCycles : kRefineCycles); ++cycle) {
         double gain = 0;
         for (int alpha = 0; alpha < scenes; ++alpha)
             if (present[static_cast<std::size_t>(alpha)])
-                gain -= Expand(window, energy, alpha, labels, node, graph);
+                gain -= Expand(window, energy, alpha, labels, x);
         // Gains below the float terms' rounding are no gains.
         if (gain <= 1e-6 * std::max(1.0, std::fabs(total)))
             break;
@@ -314,6 +337,21 @@ void SquareExtreme(std::vector<T>& grid, int width, int height, int radius, T id
 }
 
 }  // namespace
+
+void SquareFilter(std::vector<float>& grid, int width, int height, int radius, bool highest) {
+    if (width < 0 || height < 0 ||
+        grid.size() != static_cast<std::size_t>(width) * static_cast<std::size_t>(height))
+        KESTREL_THROW(DataException, "square filter: " + std::to_string(grid.size()) +
+                                         " values for a grid of " + std::to_string(width) + " x " +
+                                         std::to_string(height));
+    const float inf = std::numeric_limits<float>::infinity();
+    if (highest)
+        SquareExtreme(grid, width, height, radius, -inf,
+                      [](float a, float b) { return std::max(a, b); });
+    else
+        SquareExtreme(grid, width, height, radius, inf,
+                      [](float a, float b) { return std::min(a, b); });
+}
 
 std::vector<float> RaisedHeights(const std::vector<float>& heights, int width, int height,
                                  int radius) {
@@ -454,6 +492,7 @@ class RegionChooser {
                     const std::size_t c = static_cast<std::size_t>(y / factor_) * cw_ + x / factor_;
                     return band_[c] ? 0 : coarse_[c];
                 });
+                Reach(window, win);
                 // The band starts from the coarse labels and may take only their scenes
                 // (and those that see what they do not).
                 const std::vector<int> start = Labels(window, win, [&](int x, int y) {
@@ -574,6 +613,52 @@ class RegionChooser {
     template <typename Held>
     static void Hold(SeamWindow& window, const Chessboard::Square& s, Held held) {
         window.fixed = Labels(window, s, held);
+    }
+
+    // Forbids each band pixel of the window (at s in the grid) the scenes that are not the coarse
+    // label of a cell within kBand + 1 coarse cells, where one of those sees it: the band moves
+    // the seams it lies along, and an expansion of a scene from elsewhere in the window would
+    // make the whole band a graph of long augmenting paths for nothing.
+    void Reach(SeamWindow& window, const Chessboard::Square& s) const {
+        const std::size_t scenes = window.scenes.size();
+        if (scenes < 2 || scenes > 64)
+            return;
+        using Mask = std::uint64_t;
+        const int reach = kBand + 1;
+        const int x0 = std::max(0, s.x0 / factor_ - reach), y0 = std::max(0, s.y0 / factor_ - reach);
+        const int x1 = std::min(cw_, (s.x0 + s.w - 1) / factor_ + reach + 1);
+        const int y1 = std::min(ch_, (s.y0 + s.h - 1) / factor_ + reach + 1);
+        const int w = x1 - x0, h = y1 - y0;
+        std::vector<int> index;  // per 1 + scene, its index in the window or -1
+        for (std::size_t k = 0; k < scenes; ++k) {
+            if (window.scenes[k] + 2 > index.size())
+                index.resize(window.scenes[k] + 2, -1);
+            index[window.scenes[k] + 1] = static_cast<int>(k);
+        }
+        std::vector<Mask> near(static_cast<std::size_t>(w) * h, 0);
+        for (int y = 0; y < h; ++y)
+            for (int x = 0; x < w; ++x) {
+                const std::uint16_t label = Coarse(x0 + x, y0 + y);
+                if (label > 0 && label < index.size() && index[label] >= 0)
+                    near[static_cast<std::size_t>(y) * w + x] = Mask{1} << index[label];
+            }
+        SquareExtreme(near, w, h, reach, Mask{0}, [](Mask a, Mask b) { return a | b; });
+        for (int y = 0; y < s.h; ++y)
+            for (int x = 0; x < s.w; ++x) {
+                const int cx = (s.x0 + x) / factor_, cy = (s.y0 + y) / factor_;
+                if (!band_[static_cast<std::size_t>(cy) * cw_ + cx])
+                    continue;
+                const Mask allowed = near[static_cast<std::size_t>(cy - y0) * w + (cx - x0)];
+                const std::size_t c = static_cast<std::size_t>(y) * s.w + x;
+                bool seen = false;
+                for (std::size_t k = 0; k < scenes && !seen; ++k)
+                    seen = (allowed >> k & 1) && Allowed(window.cost[k][c]);
+                if (!seen)
+                    continue;
+                for (std::size_t k = 0; k < scenes; ++k)
+                    if (!(allowed >> k & 1))
+                        window.cost[k][c] = kForbidden;
+            }
     }
 
     // Coarse cells within kBand cells of a change of coarse label.

@@ -40,10 +40,14 @@ struct SeamWindow {
 };
 
 // The seam term between two neighbouring cells labelled with different scenes a and b is
-//   (seamWeight + raisedWeight * max(raised_p, raised_q)
+//   (seamWeight + raisedWeight * min(raised_p, raised_q)
 //    + colourWeight * (|grey_a(p) - grey_b(p)| + |grey_a(q) - grey_b(q)|)) / pixelSize,
 // so that the weights are costs per metre of seam against data costs per square metre: a
-// survey at 0.1 m and one at 0.5 m put their seams in the same places.
+// survey at 0.1 m and one at 0.5 m put their seams in the same places. The raised part takes
+// the lower side of the pair: a seam along a raised object's outline (ground on one side) is
+// as cheap as on open ground, one over the object costs its height. (The recovery hands the
+// solver raised heights widened by the surface's pixel error, so that such seams keep that far
+// off the object's outline in the surface model.)
 struct SeamParams {
     double pixelSize = 1.0;      // metres per full-resolution pixel
     float seamWeight = 0.5f;     // per metre of seam on open ground
@@ -85,6 +89,11 @@ using LabelSink =
 KESTREL_API void ChooseRegions(SeamSource& source, unsigned int pixels, unsigned int lines,
                                const SeamParams& params, unsigned int threads, RunControl& control,
                                const LabelSink& sink);
+
+// The highest (or lowest) value within a square of side 2 radius + 1 cells around each cell, in
+// place; O(1) per cell whatever the radius.
+KESTREL_API void SquareFilter(std::vector<float>& grid, int width, int height, int radius,
+                              bool highest);
 
 // Metres the surface stands above the ground under it, from surface heights alone: the heights
 // minus their morphological opening with a square of side 2 radius + 1 cells. NaN is no height

@@ -1,18 +1,21 @@
-// GDAL inside the platform: registration, and GDAL's error reports turned into our exceptions
-// at one place, without leaving GDAL's global error state to callers.
+// GDAL's registration, and GDAL's error reports collected at one place so that callers turn
+// them into exceptions, without leaving GDAL's global error state behind. The platform uses it
+// around every GDAL call; programs that call GDAL themselves use it too.
 #pragma once
 
 #include <string>
+
+#include <kestrel/export.h>
 
 namespace kestrel {
 namespace gdalsupport {
 
 // Registers GDAL's drivers once per process and keeps GDAL quiet on standard error.
-void EnsureRegistered();
+KESTREL_API void EnsureRegistered();
 
 // Collects the errors that GDAL raises on this thread while it lives, instead of printing
 // them; on leaving it restores the previous handler and resets GDAL's error state.
-class ErrorCapture {
+class KESTREL_API ErrorCapture {
   public:
     ErrorCapture();
     ~ErrorCapture();
