@@ -6,17 +6,13 @@
 #include <string>
 #include <vector>
 
-#include <cstdio>
 #include <stdexcept>
 
 #include <cpl_string.h>
 #include <gdal_priv.h>
 #include <ogr_spatialref.h>
 
-#if defined(_WIN32)
-#define popen _popen
-#define pclose _pclose
-#endif
+#include "program.h"
 
 namespace testsupport {
 
@@ -62,20 +58,6 @@ inline void WriteDem(const std::string& path, const Grid& grid, const std::strin
                            0, nullptr) != CE_None)
             throw std::runtime_error("cannot write " + path);
     }
-}
-
-// Runs a command line and returns its standard output.
-inline std::string RunCommand(const std::string& command) {
-    std::string output;
-    FILE* pipe = popen(command.c_str(), "r");
-    if (pipe == nullptr)
-        return output;
-    char buffer[4096];
-    std::size_t n;
-    while ((n = fread(buffer, 1, sizeof buffer, pipe)) > 0)
-        output.append(buffer, n);
-    pclose(pipe);
-    return output;
 }
 
 }  // namespace testsupport

@@ -3,11 +3,15 @@
 
 #include "support.h"
 
+#include <cstdio>
 #include <cstdlib>
 #include <string>
 #include <vector>
 
-#ifndef _WIN32
+#ifdef _WIN32
+#define popen _popen
+#define pclose _pclose
+#else
 #include <sys/wait.h>
 #endif
 
@@ -41,6 +45,19 @@ inline ProgramResult RunProgram(const std::string& program, const std::vector<st
     result.out = ReadFile(out);
     result.err = ReadFile(err);
     return result;
+}
+
+// Runs a shell command line and returns its standard output.
+inline std::string RunCommand(const std::string& command) {
+    std::string output;
+    FILE* pipe = popen(command.c_str(), "r");
+    if (pipe == nullptr)
+        return output;
+    char buffer[4096];
+    for (std::size_t n; (n = std::fread(buffer, 1, sizeof buffer, pipe)) > 0;)
+        output.append(buffer, n);
+    pclose(pipe);
+    return output;
 }
 
 }  // namespace testsupport

@@ -11,6 +11,7 @@ namespace testsupport {
 
 // A raster band read whole, as doubles; empty when the file or band cannot be read.
 inline std::vector<double> ReadBand(const std::string& path, int band = 1) {
+    GDALAllRegister();
     std::unique_ptr<GDALDataset> ds(
         GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
     if (!ds)

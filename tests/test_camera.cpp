@@ -19,10 +19,7 @@
 #include <kestrel/exception.h>
 #include <kestrel/mathmodel.h>
 #include <kestrel/orthoutils.h>
-#include <kestrel/trueortho.h>
-#include <samplecity.h>
 
-#include "rasterread.h"
 #include "support.h"
 
 using kestrel::mathmodel::CameraIntrinsics;
@@ -212,60 +209,6 @@ TEST(FrameCamera, ImageToGroundAndBack) {
                 EXPECT_NEAR(r2[i], row[i], 1e-6) << k.crs << " " << i;
             }
         }
-    }
-}
-
-// The ortho of each sample image through its camera side file equals the ortho through the RPCs
-// fitted to that camera: within a grey level on 99.9 % of the pixels both see, with visibility
-// indexes that agree on 99.9 % of the grid.
-TEST(FrameCamera, SampleOrthoEqualsTheOrthoThroughItsRpcs) {
-    TempDir dir;
-    samplecity::CityOptions options = samplecity::SmallCity();
-    for (auto& c : options.cameras)
-        c.width = c.height = 256;
-    const samplecity::Sample sample = samplecity::MakeSample(dir.Path().string(), options, 2);
-    samplecity::GridSurface surface(sample.dsmPath);
-    const kestrel::ogc::cs::ICRS crs(options.crs);
-    const double pixel = 0.5;
-    const auto size = static_cast<unsigned int>(options.sizeX / pixel);
-    for (const auto& image : sample.images) {
-        ASSERT_TRUE(std::filesystem::exists(image.cameraPath));
-        std::vector<std::vector<double>> bands[2];
-        std::vector<double> visibility[2];
-        for (int way = 0; way < 2; ++way) {
-            // Segment 4: the camera side file; 1: the RPCs.
-            std::unique_ptr<IMathModel> model(GetSrcModel(image.path, "", way == 0 ? 4 : 1));
-            kestrel::processes::TorthoJob job;
-            job.sourcePath = image.path;
-            job.model = model.get();
-            job.surface = &surface;
-            job.crs = &crs;
-            job.geocoding = kestrel::ogc::cs::GeocodingInfo::NorthUp(
-                options.west, options.south + options.sizeY, pixel, pixel);
-            job.pixels = job.lines = size;
-            job.orthoPath = dir.File("ortho" + std::to_string(way) + ".tif");
-            job.visibilityPath = dir.File("vis" + std::to_string(way) + ".tif");
-            ASSERT_TRUE(kestrel::processes::TorthoGenerator().Generate(job).completed);
-            for (int b = 1; b <= 3; ++b)
-                bands[way].push_back(testsupport::ReadBand(job.orthoPath, b));
-            visibility[way] = testsupport::ReadBand(job.visibilityPath);
-        }
-        const std::size_t n = visibility[0].size();
-        ASSERT_EQ(n, static_cast<std::size_t>(size) * size);
-        std::size_t seen = 0, close = 0, agree = 0;
-        for (std::size_t i = 0; i < n; ++i) {
-            agree += visibility[0][i] == visibility[1][i];
-            if (visibility[0][i] != 1 || visibility[1][i] != 1)
-                continue;
-            ++seen;
-            bool within = true;
-            for (int b = 0; b < 3; ++b)
-                within = within && std::fabs(bands[0][b][i] - bands[1][b][i]) <= 1.0;
-            close += within;
-        }
-        EXPECT_GT(seen, n / 4) << image.path;
-        EXPECT_GE(close, 0.999 * seen) << image.path << ": " << close << " of " << seen;
-        EXPECT_GE(agree, 0.999 * n) << image.path << ": " << agree << " of " << n;
     }
 }
 

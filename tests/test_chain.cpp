@@ -259,33 +259,6 @@ TEST(ParserFactory, SceneParserForAMissingFileHoldsTheNameAndNothingRead) {
     EXPECT_EQ(scene->GetSceneFootprint(), nullptr);
 }
 
-TEST(ParserFactory, SceneParserForAWrittenFileIsFilled) {
-    TempDir dir;
-    const std::string name = dir.File("scene.xml");
-    {
-        std::unique_ptr<TOSceneParser> scene(ParserFactory::CreateSceneParser(name));
-        scene->SetSceneFilename("a.tif");
-        scene->SetOrthoFilename("a_ortho.tif");
-        scene->SetVisIdxFilename("a_vis.tif");
-        scene->SetElevMapFilename("a_elev.tif");
-        scene->SetMmseg(3);
-        auto* points = new point2_t<double>[4] {
-            {0, 0}, {10, 0}, {10, 10}, {
-                0, 10
-            }
-        };
-        const Polygon<double> footprint(points, 4);
-        scene->SetSceneFootprint(&footprint);
-        scene->Serialize(false);
-    }
-    std::unique_ptr<TOSceneParser> scene(ParserFactory::CreateSceneParser(name));
-    EXPECT_EQ(scene->GetSceneFilename(), "a.tif");
-    EXPECT_EQ(scene->GetElevMapFilename(), "a_elev.tif");
-    EXPECT_EQ(scene->GetMmseg(), 3);
-    ASSERT_NE(scene->GetSceneFootprint(), nullptr);
-    EXPECT_EQ(scene->GetSceneFootprint()->numPoints, 4u);
-}
-
 TEST(ParserFactory, SceneParserForABrokenFileThrowsAndKeepsNothing) {
     TempDir dir;
     const std::string malformed = WriteFile(dir.File("bad.xml"), "<TOSceneDesc_Document><Sou");

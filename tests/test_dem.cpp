@@ -90,7 +90,7 @@ class Dem : public ::testing::Test {
 
 }  // namespace
 
-TEST_F(Dem, BilinearBetweenPostsWhateverTheCacheOrBatch) {
+TEST_F(Dem, GridOfTheRasterAndBilinearBetweenPostsWhateverTheCacheOrBatch) {
     std::vector<double> x, y;
     RandomPoints(20000, x, y);
     // Preloaded, cached with room for every block, and with room for one block only.
@@ -99,6 +99,12 @@ TEST_F(Dem, BilinearBetweenPostsWhateverTheCacheOrBatch) {
         EXPECT_EQ(dem->GetWidth(), 300u);
         EXPECT_EQ(dem->GetHeight(), 260u);
         EXPECT_EQ(dem->GetVerticalDatum(), DatumMSL);
+        double extent[4];
+        dem->GetExtent(extent[0], extent[1], extent[2], extent[3]);
+        EXPECT_EQ(std::vector<double>(extent, extent + 4),
+                  (std::vector<double>{514000, 5032400, 517000, 5035000}));
+        EXPECT_EQ(dem->GetGeocoding()->GetGeoTransform(), kGrid.Transform());
+        EXPECT_TRUE(dem->GetCRS()->IsSame(ICRS(kCrs)));
         std::vector<double> h(x.size());
         dem->GetHeights(x.size(), x.data(), y.data(), h.data());
         ExpectSurface(x, y, h);
@@ -109,18 +115,6 @@ TEST_F(Dem, BilinearBetweenPostsWhateverTheCacheOrBatch) {
             EXPECT_TRUE(std::isnan(h[k]) || single == h[k]);
         }
     }
-}
-
-TEST_F(Dem, ExtentAndGeocodingAreThoseOfTheRaster) {
-    auto dem = Open(path);
-    double minX, minY, maxX, maxY;
-    dem->GetExtent(minX, minY, maxX, maxY);
-    EXPECT_EQ(minX, 514000);
-    EXPECT_EQ(maxX, 517000);
-    EXPECT_EQ(minY, 5032400);
-    EXPECT_EQ(maxY, 5035000);
-    EXPECT_EQ(dem->GetGeocoding()->GetGeoTransform(), kGrid.Transform());
-    EXPECT_TRUE(dem->GetCRS()->IsSame(ICRS(kCrs)));
 }
 
 TEST_F(Dem, ConcurrentQueriesOnOneObjectAgree) {

@@ -15,30 +15,16 @@
 #include <kestrel/vectorfile.h>
 #include <silvan/utils.h>
 
-#include "support.h"
+#include "program.h"
 
-#if defined(_WIN32)
-#define popen _popen
-#define pclose _pclose
-#endif
 
 using kestrel::tin::Polygon;
 using testsupport::ReadFile;
+using testsupport::RunCommand;
 using testsupport::TempDir;
 
 namespace {
 
-std::string RunCommand(const std::string& command) {
-    std::string out;
-    FILE* pipe = popen((command + " 2>&1").c_str(), "r");
-    if (pipe == nullptr)
-        return out;
-    char buffer[4096];
-    while (std::fgets(buffer, sizeof buffer, pipe) != nullptr)
-        out += buffer;
-    pclose(pipe);
-    return out;
-}
 
 std::unique_ptr<Polygon<double>> Square(unsigned int points = 4) {
     const point2_t<double> corners[] = {

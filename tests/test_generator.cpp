@@ -5,7 +5,7 @@
 #include <samplecity.h>
 
 #include "rasterread.h"
-#include "support.h"
+#include "program.h"
 
 #include <gdal_priv.h>
 
@@ -17,10 +17,6 @@
 #include <memory>
 #include <sstream>
 
-#if defined(_WIN32)
-#define popen _popen
-#define pclose _pclose
-#endif
 
 namespace {
 
@@ -28,20 +24,9 @@ using kestrel::DataException;
 using kestrel::processes::TorthoGenerator;
 using kestrel::processes::TorthoJob;
 using kestrel::processes::TorthoResult;
+using testsupport::RunCommand;
 using testsupport::TempDir;
 
-// Runs a command and returns what it printed.
-std::string RunCommand(const std::string& command) {
-    std::string out;
-    FILE* pipe = popen(command.c_str(), "r");
-    if (pipe == nullptr)
-        return out;
-    char buffer[4096];
-    for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;)
-        out.append(buffer, n);
-    pclose(pipe);
-    return out;
-}
 
 TEST(SampleCity, RpcsAgreeWithTheCameraThroughGdalsTransformer) {
     TempDir dir;

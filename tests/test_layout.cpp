@@ -22,16 +22,13 @@
 
 #include "rpcscene.h"
 #include "samplecity.h"
-#include "support.h"
+#include "program.h"
 
-#if defined(_WIN32)
-#define popen _popen
-#define pclose _pclose
-#endif
 
 using kestrel::ogc::cs::GeocodingInfo;
 using kestrel::ogc::cs::ICRS;
 using kestrel::tin::Polygon;
+using testsupport::RunCommand;
 using testsupport::TempDir;
 
 namespace {
@@ -333,17 +330,6 @@ FunctionTerrain SceneHills() {
                            rpcscene::kDemLeft + rpcscene::kDemSize, rpcscene::kDemTop);
 }
 
-std::string RunCommand(const std::string& command) {
-    std::string out;
-    FILE* pipe = popen((command + " 2>&1").c_str(), "r");
-    if (pipe == nullptr)
-        return out;
-    char buffer[4096];
-    while (std::fgets(buffer, sizeof buffer, pipe) != nullptr)
-        out += buffer;
-    pclose(pipe);
-    return out;
-}
 
 }  // namespace
 
@@ -360,7 +346,7 @@ TEST(Layout, ExtentAgreesWithGdalwarpOverTerrain) {
     const std::string log = RunCommand("gdalwarp -q -rpc -to RPC_DEM=" + demPath +
                                        " -to RPC_DEMINTERPOLATION=bilinear -t_srs EPSG:32632 "
                                        "-tr 1.5 1.5 " +
-                                       image + " " + out);
+                                       image + " " + out + " 2>&1");
     std::unique_ptr<GDALDataset> warped(GDALDataset::Open(out.c_str()));
     ASSERT_NE(warped, nullptr) << log;
     double gt[6];

@@ -125,6 +125,7 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{master}, {"--tr", "1", "1", "--pixel-size", "1"}, "give one of them"},
         {{master}, {"--te", "0", "0", "10", "x"}, "--te: \"x\" is not a number"},
         {{master}, {"--te", "10", "0", "0", "10"}, "--te: XMIN must be less than XMAX"},
+        {{master}, {"--te", "0", "0", "1e9", "1", "--tr", "0.1", "1"}, "a grid of 10000000000 x 1"},
         {{master}, {"--te=0,0,1,1"}, "--te takes four values"},
         {{master}, {"--te-srs", "EPSG:4326"}, "--te-srs is the CRS of --te, which is missing"},
         {{master}, {"--te", "0", "0", "1", "1", "--te-srs", "EPSG:99999"}, "--te-srs: "},

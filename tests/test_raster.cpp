@@ -42,68 +42,48 @@ double Pattern(int x, int y, int b) {
 struct ImageSpec {
     int width = 300;
     int height = 200;
-    std::vector<GDALDataType> types{GDT_Byte, GDT_Byte, GDT_Byte};
     const char* blocks = "TILED=YES";
     bool noData = false;
 };
 
-// A georeferenced GeoTIFF made with GDAL itself (bands of mixed types through a VRT of MEM
-// bands is more than a test needs: mixed types are made as separate GeoTIFF bands in a VRT).
+// A georeferenced three-band Byte GeoTIFF of Pattern, made with GDAL itself.
 std::string MakeImage(const TempDir& dir, const std::string& name, const ImageSpec& spec) {
     GDALAllRegister();
     const std::string path = dir.File(name);
-    std::vector<std::string> parts;
-    for (std::size_t b = 0; b < spec.types.size(); ++b) {
-        const std::string part = spec.types.size() == 1 || spec.types[0] == spec.types[b]
-                                     ? path
-                                     : dir.File(name + ".band" + std::to_string(b + 1) + ".tif");
-        parts.push_back(part);
-    }
-    const bool mixed = std::any_of(spec.types.begin(), spec.types.end(),
-                                   [&](GDALDataType t) { return t != spec.types[0]; });
-    auto make = [&](const std::string& file, int bands, GDALDataType type, int firstBand) {
-        char** options = CSLAddString(nullptr, spec.blocks);
-        GDALDataset* ds = GetGDALDriverManager()->GetDriverByName("GTiff")->Create(
-            file.c_str(), spec.width, spec.height, bands, type, options);
-        CSLDestroy(options);
-        double gt[6] = {500000, 0.5, 0, 4100000, 0, -0.5};
-        ds->SetGeoTransform(gt);
-        OGRSpatialReference srs;
-        srs.importFromEPSG(32632);
-        ds->SetSpatialRef(&srs);
-        std::vector<double> line(spec.width);
-        for (int b = 1; b <= bands; ++b) {
-            GDALRasterBand* band = ds->GetRasterBand(b);
-            if (spec.noData)
-                band->SetNoDataValue(0);
-            for (int y = 0; y < spec.height; ++y) {
-                for (int x = 0; x < spec.width; ++x)
-                    line[x] = Pattern(x, y, firstBand + b - 1);
-                EXPECT_EQ(band->RasterIO(GF_Write, 0, y, spec.width, 1, line.data(), spec.width, 1,
-                                         GDT_Float64, 0, 0, nullptr),
-                          CE_None);
-            }
+    const char* options[] = {spec.blocks, nullptr};
+    GDALDataset* ds = GetGDALDriverManager()->GetDriverByName("GTiff")->Create(
+        path.c_str(), spec.width, spec.height, 3, GDT_Byte, const_cast<char**>(options));
+    double gt[6] = {500000, 0.5, 0, 4100000, 0, -0.5};
+    ds->SetGeoTransform(gt);
+    OGRSpatialReference srs;
+    srs.importFromEPSG(32632);
+    ds->SetSpatialRef(&srs);
+    std::vector<double> line(spec.width);
+    for (int b = 1; b <= 3; ++b) {
+        if (spec.noData)
+            ds->GetRasterBand(b)->SetNoDataValue(0);
+        for (int y = 0; y < spec.height; ++y) {
+            for (int x = 0; x < spec.width; ++x)
+                line[x] = Pattern(x, y, b);
+            EXPECT_EQ(ds->GetRasterBand(b)->RasterIO(GF_Write, 0, y, spec.width, 1, line.data(),
+                                                     spec.width, 1, GDT_Float64, 0, 0, nullptr),
+                      CE_None);
         }
-        GDALClose(ds);
-    };
-    if (!mixed) {
-        make(path, static_cast<int>(spec.types.size()), spec.types[0], 1);
-        return path;
     }
-    // Mixed types: one file per band, gathered by a VRT.
-    const std::string vrt = dir.File(name + ".vrt");
-    std::string xml = "<VRTDataset rasterXSize=\"" + std::to_string(spec.width) +
-                      "\" rasterYSize=\"" + std::to_string(spec.height) + "\">\n";
-    for (std::size_t b = 0; b < spec.types.size(); ++b) {
-        const std::string file = dir.File(name + ".band" + std::to_string(b + 1) + ".tif");
-        make(file, 1, spec.types[b], static_cast<int>(b) + 1);
-        xml += "<VRTRasterBand dataType=\"" + std::string(GDALGetDataTypeName(spec.types[b])) +
-               "\" band=\"" + std::to_string(b + 1) + "\"><SimpleSource><SourceFilename>" + file +
-               "</SourceFilename><SourceBand>1</SourceBand></SimpleSource></VRTRasterBand>\n";
-    }
-    xml += "</VRTDataset>\n";
-    testsupport::WriteFile(vrt, xml);
-    return vrt;
+    GDALClose(ds);
+    return path;
+}
+
+// A VRT whose bands have the types given (no pixels: for what depends on types alone).
+std::string MakeTypedBands(const TempDir& dir, const std::vector<GDALDataType>& types) {
+    GDALAllRegister();
+    const std::string path = dir.File("typed.vrt");
+    GDALDataset* ds = GetGDALDriverManager()->GetDriverByName("VRT")->Create(
+        path.c_str(), 8, 8, 0, GDT_Unknown, nullptr);
+    for (GDALDataType type : types)
+        ds->AddBand(type, nullptr);
+    GDALClose(ds);
+    return path;
 }
 
 }  // namespace
@@ -687,9 +667,7 @@ TEST(RasterUtils, FileTypesNameGdalFormats) {
 
 TEST(RasterUtils, SourceAndOrthoChannelsOfOneDataType) {
     TempDir dir;
-    ImageSpec spec;
-    spec.types = {GDT_Byte, GDT_UInt16, GDT_Byte};
-    std::unique_ptr<IDataset> ds(GetRasterDataset(MakeImage(dir, "mixed", spec)));
+    std::unique_ptr<IDataset> ds(GetRasterDataset(MakeTypedBands(dir, {GDT_Byte, GDT_UInt16, GDT_Byte})));
     std::vector<unsigned int> src{9};
     std::vector<unsigned int> ortho{8, 7};
     GetSrcOrthoChans(ds.get(), {3, 1}, src, ortho);

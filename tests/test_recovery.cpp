@@ -188,6 +188,34 @@ TEST_F(OppositeViews, CancelledOrRefusedRunsLeaveNoOutput) {
         EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
 }
 
+// A cancel while the seam step asks for the surface's heights (the ground's opening, in slices)
+// ends the run there: after the slice at hand no height is asked for, nothing is published.
+TEST_F(OppositeViews, CancelWhileSeamsReadHeightsStopsAtTheSlice) {
+    struct Cancelling : samplecity::GridSurface {
+        using GridSurface::GridSurface;
+        bool* flag = nullptr;
+        mutable std::size_t cells = 0;
+        void GetHeights(std::size_t n, const double* x, const double* y,
+                        double* h) const override {
+            GridSurface::GetHeights(n, x, y, h);
+            if (n > 1)  // not a single point's view angle
+                cells += n, *flag = true;
+        }
+    } heights(dir->File("dsm.tif"));
+    bool cancel = false;
+    heights.flag = &cancel;
+    RecoveryJob job = Job(1, 1, 1, true);
+    job.surface = &heights;
+    job.seamlines = true;
+    OcclusionRecovery recovery;
+    recovery.SetCancelFlag(&cancel);
+    EXPECT_FALSE(recovery.Recover(job).completed);
+    EXPECT_GT(heights.cells, 0u);
+    EXPECT_LE(heights.cells, 2u * 4096u);  // a slice on each of two threads at the most
+    for (const char* name : {"mosaic.tif", "source.tif"})
+        EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
+}
+
 // ---------------------------------------------------------------------------------------------
 // Synthetic scenes: visibility indexes drawn at random, orthos of one value per scene.
 

@@ -3,6 +3,7 @@
 // whole chain: the workflow end to end on a reduced sample city, reruns that make again exactly
 // what changed, interrupts and the run's lock.
 #include "program.h"
+#include "rasterread.h"
 
 #include <cpl_json.h>
 #include <cpl_string.h>
@@ -32,6 +33,7 @@
 
 namespace {
 
+using testsupport::ReadBand;
 using testsupport::ReadFile;
 using testsupport::TempDir;
 using testsupport::WriteFile;
@@ -467,25 +469,15 @@ TEST(Workflow, CamerasFromSideFilesOrFromATable) {
     const Result table = run("table", {"--cameras", dir.File("sample/cameras.txt"),
                                        "--cameras-srs", "EPSG:32632"});
     ASSERT_EQ(table.status, 0) << table.err;
-    for (const char* name : {"north", "east", "south", "west"}) {
-        Dataset a = Open(dir.File(std::string("side/") + name + "_ortho.tif"), GDAL_OF_RASTER);
-        Dataset b = Open(dir.File(std::string("table/") + name + "_ortho.tif"), GDAL_OF_RASTER);
-        ASSERT_TRUE(a && b) << name;
-        const int w = a->GetRasterXSize(), h = a->GetRasterYSize();
-        ASSERT_EQ(w, b->GetRasterXSize());
-        ASSERT_EQ(h, b->GetRasterYSize());
-        std::vector<double> va(static_cast<size_t>(w) * h), vb(va.size());
+    for (const char* name : {"north", "east", "south", "west"})
         for (int band = 1; band <= 3; ++band) {
-            ASSERT_EQ(a->GetRasterBand(band)->RasterIO(GF_Read, 0, 0, w, h, va.data(), w, h,
-                                                       GDT_Float64, 0, 0, nullptr),
-                      CE_None);
-            ASSERT_EQ(b->GetRasterBand(band)->RasterIO(GF_Read, 0, 0, w, h, vb.data(), w, h,
-                                                       GDT_Float64, 0, 0, nullptr),
-                      CE_None);
-            for (size_t i = 0; i < va.size(); ++i)
-                ASSERT_LE(std::fabs(va[i] - vb[i]), 1.0) << name << " band " << band << " " << i;
+            const std::string ortho = std::string("/") + name + "_ortho.tif";
+            const std::vector<double> a = ReadBand(dir.File("side" + ortho), band);
+            const std::vector<double> b = ReadBand(dir.File("table" + ortho), band);
+            ASSERT_TRUE(!a.empty() && a.size() == b.size()) << name;
+            for (size_t i = 0; i < a.size(); ++i)
+                ASSERT_LE(std::fabs(a[i] - b[i]), 1.0) << name << " band " << band << " " << i;
         }
-    }
     // The table loses its first row (after the comment line).
     std::string rows = ReadFile(dir.File("sample/cameras.txt"));
     const size_t first = rows.find('\n') + 1;
@@ -550,6 +542,19 @@ TEST(Workflow, SurfaceOverPartOfTheImagesMakesOrthosOfTheCoveredGround) {
     EXPECT_LE(mosaic->GetRasterYSize(), middle->GetRasterYSize() + 32);
 }
 
+// The two rasters have the same size and geotransform (within tolerance).
+void ExpectSameGrid(const std::string& path, const std::string& reference, double tolerance) {
+    Dataset a = Open(path), b = Open(reference);
+    ASSERT_TRUE(a && b);
+    EXPECT_EQ(a->GetRasterXSize(), b->GetRasterXSize());
+    EXPECT_EQ(a->GetRasterYSize(), b->GetRasterYSize());
+    double ga[6], gb[6];
+    ASSERT_EQ(a->GetGeoTransform(ga), CE_None);
+    ASSERT_EQ(b->GetGeoTransform(gb), CE_None);
+    for (int i = 0; i < 6; ++i)
+        EXPECT_NEAR(ga[i], gb[i], tolerance) << i;
+}
+
 // --te and --tr: the mosaic holds exactly the cells gdalwarp -te -tr makes (not whole blocks,
 // pixels not square, corners not on multiples of the pixel size); scenes whose footprint does
 // not reach the area are skipped and listed so, also when a rerun keeps everything.
@@ -579,17 +584,7 @@ TEST(Workflow, AreaOfInterestIsTheGridGdalwarpMakes) {
                                                   dir.File("warped.tif")},
                                      dir);
     ASSERT_EQ(warped.status, 0) << warped.err;
-    Dataset mosaic = Open(dir.File("out/mosaic.tif"));
-    Dataset reference = Open(dir.File("warped.tif"));
-    ASSERT_TRUE(mosaic && reference);
-    EXPECT_EQ(mosaic->GetRasterXSize(), reference->GetRasterXSize());
-    EXPECT_EQ(mosaic->GetRasterYSize(), reference->GetRasterYSize());
-    double a[6], b[6];
-    ASSERT_EQ(mosaic->GetGeoTransform(a), CE_None);
-    ASSERT_EQ(reference->GetGeoTransform(b), CE_None);
-    for (int i = 0; i < 6; ++i)
-        EXPECT_DOUBLE_EQ(a[i], b[i]) << i;
-    mosaic.reset();
+    ExpectSameGrid(dir.File("out/mosaic.tif"), dir.File("warped.tif"), 0.0);
 
     // --cutline makes the mosaic again (the scenes are kept): filled where the mosaic without it
     // was and gdalwarp -cutline keeps the cell.
@@ -610,8 +605,8 @@ TEST(Workflow, AreaOfInterestIsTheGridGdalwarpMakes) {
                                 dir.File("cut_warped.tif")},
                    dir);
     ASSERT_EQ(cutWarped.status, 0) << cutWarped.err;
-    mosaic = Open(dir.File("out/mosaic.tif"));
-    reference = Open(dir.File("cut_warped.tif"));
+    Dataset mosaic = Open(dir.File("out/mosaic.tif"));
+    Dataset reference = Open(dir.File("cut_warped.tif"));
     Dataset uncut = Open(dir.File("uncut.tif"));
     ASSERT_TRUE(mosaic && reference && uncut);
     const auto filled = [](GDALRasterBand& band) {
@@ -652,15 +647,7 @@ TEST(Workflow, AreaOfInterestIsTheGridGdalwarpMakes) {
         "gdalwarp", {"-q", "-te", area[0], area[1], area[2], area[3], ortho, dir.File("alone.tif")},
         dir);
     ASSERT_EQ(warpedAlone.status, 0) << warpedAlone.err;
-    mosaic = Open(dir.File("alone/mosaic.tif"));
-    reference = Open(dir.File("alone.tif"));
-    ASSERT_TRUE(mosaic && reference);
-    EXPECT_EQ(mosaic->GetRasterXSize(), reference->GetRasterXSize());
-    EXPECT_EQ(mosaic->GetRasterYSize(), reference->GetRasterYSize());
-    ASSERT_EQ(mosaic->GetGeoTransform(a), CE_None);
-    ASSERT_EQ(reference->GetGeoTransform(b), CE_None);
-    for (int i = 0; i < 6; ++i)
-        EXPECT_NEAR(a[i], b[i], 1e-9) << i;
+    ExpectSameGrid(dir.File("alone/mosaic.tif"), dir.File("alone.tif"), 1e-9);
 
     // A cutline that no scene reaches (here, in another CRS) stops the run, saying so.
     WriteFile(cutline, R"({"type": "FeatureCollection", "features": [{"type": "Feature",

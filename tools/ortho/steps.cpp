@@ -116,6 +116,25 @@ std::string Grid::Describe() const {
     return text + name;
 }
 
+namespace {
+
+// The cells of the area as gdalwarp -te -tr makes them (sizes rounded to whole pixels); a
+// message naming --te when they are none or too many.
+std::string AreaGridSize(const Area& a, double width, double height, unsigned int& pixels,
+                         unsigned int& lines) {
+    const double across = std::floor((a[2] - a[0] + width / 2) / width);
+    const double down = std::floor((a[3] - a[1] + height / 2) / height);
+    if (!(across >= 1 && down >= 1 && across <= 1u << 30 && down <= 1u << 30))
+        return kestrel::FormatString("--te: the area of interest makes a grid of %.0f x %.0f "
+                                     "pixels of %g x %g",
+                                     across, down, width, height);
+    pixels = static_cast<unsigned int>(across);
+    lines = static_cast<unsigned int>(down);
+    return std::string();
+}
+
+}  // namespace
+
 Grid CommonGrid(const std::vector<Grid>& grids, const Area* area) {
     if (grids.empty())
         KESTREL_THROW(kestrel::DataException, "no grid to join");
@@ -149,15 +168,9 @@ Grid CommonGrid(const std::vector<Grid>& grids, const Area* area) {
     if (area != nullptr) {
         // gdalwarp -te -tr: the top left corner at XMIN YMAX, sizes rounded to whole pixels.
         const Area& a = *area;
-        const double pixels = std::floor((a[2] - a[0] + step / 2) / step);
-        const double lines = std::floor((a[3] - a[1] + height / 2) / height);
-        if (!(pixels >= 1 && lines >= 1 && pixels <= 1u << 30 && lines <= 1u << 30))
-            KESTREL_THROW(kestrel::DataException,
-                          kestrel::FormatString("--te: the area of interest makes a grid of %.0f "
-                                                "x %.0f pixels of %g x %g",
-                                                pixels, lines, step, height));
-        common.pixels = static_cast<unsigned int>(pixels);
-        common.lines = static_cast<unsigned int>(lines);
+        const std::string refused = AreaGridSize(a, step, height, common.pixels, common.lines);
+        if (!refused.empty())
+            KESTREL_THROW(kestrel::DataException, refused);
         common.geoTransform = {a[0], step, 0.0, a[3], 0.0, g[5]};
         return common;
     }
@@ -580,6 +593,15 @@ std::vector<std::string> CheckOptions(Options& options) {
         if (!options.extentSrs.empty())
             kestrel::ogc::cs::ICRS{options.extentSrs};
     });
+    // In the output CRS with the pixel size given, the area's grid is known now.
+    const double width = options.xRes > 0.0 ? options.xRes : options.pixelSize;
+    const double height = options.yRes > 0.0 ? options.yRes : options.pixelSize;
+    unsigned int pixels = 0, lines = 0;
+    if (options.hasExtent && options.extentSrs.empty() && width > 0.0 && height > 0.0) {
+        const std::string refused = AreaGridSize(options.extent, width, height, pixels, lines);
+        if (!refused.empty())
+            throw UsageError(refused);
+    }
     if (!options.cutline.empty())
         CheckCutline(options.cutline);
     if (!options.seamlines.empty())

@@ -268,7 +268,7 @@ std::unique_ptr<trueortho::SharedRaster> ChooseSeamlines(const RecoveryJob& job,
     auto labels =
         OutputWriter(scratch.path, "GTiff", "", grid, 1, GDT_UInt16, 0.0);
     const std::unique_ptr<trueortho::SeamSource> source =
-        trueortho::MakeSeamSource(job, grid, reader, fit);
+        trueortho::MakeSeamSource(job, grid, reader, fit, control);
     trueortho::SeamParams params;
     params.pixelSize = trueortho::PixelMetres(grid);
     trueortho::ChooseRegions(

@@ -181,9 +181,12 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
                                            const SceneReader& reader, unsigned int threads,
                                            RunControl& control);
 
-// The seam solver's view of the scenes (costs, balanced brightness, raised heights).
+// The seam solver's view of the scenes (costs, balanced brightness, raised heights). Once
+// control stops, a read gives up at its next slice of heights or scene chunk and hands back a
+// window without scenes: the run is being abandoned.
 std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job, const RecoveryGrid& grid,
-                                           const SceneReader& reader, const BalanceFit& fit);
+                                           const SceneReader& reader, const BalanceFit& fit,
+                                           const RunControl& control);
 
 }  // namespace trueortho
 }  // namespace processes

@@ -33,6 +33,7 @@ constexpr float kExposedRise = 1.0f;  // metres
 constexpr double kGroundRadius = 30.0;  // metres
 constexpr int kMaxGroundRadius = 256;   // cells
 constexpr int kBlockRadius = 8;         // blocks of the opening
+constexpr size_t kHeightSlice = 4096;  // cells of surface heights asked at a time
 
 // `exposable`: the pixel stands no more than kExposedRise above the lowest surface near it.
 float PixelCost(const SceneTile& tile, size_t p, int level, bool exposable) {
@@ -45,8 +46,8 @@ float PixelCost(const SceneTile& tile, size_t p, int level, bool exposable) {
 class RecoverySeamSource : public SeamSource {
   public:
     RecoverySeamSource(const RecoveryJob& job, const RecoveryGrid& grid, const SceneReader& reader,
-                       const BalanceFit& fit)
-        : job_(job), grid_(grid), reader_(reader), fit_(fit) {}
+                       const BalanceFit& fit, const RunControl& control)
+        : job_(job), grid_(grid), reader_(reader), fit_(fit), control_(control) {}
 
     // Cells x0 to x0 + width - 1 (and y0 to y0 + height - 1) of factor x factor pixels. A cell is
     // forbidden to a scene that sees under half of its pixels; otherwise its cost is the mean
@@ -58,6 +59,8 @@ class RecoverySeamSource : public SeamSource {
         window.width = width, window.height = height;
         const size_t cells = static_cast<size_t>(width) * height;
         const Relief relief = ReadRelief(x0, y0, width, height, factor);
+        if (control_.Stopped())
+            return window;
         const Rect pixels{x0 * factor, y0 * factor, width * factor, height * factor};
         const Rect in = pixels.Intersect(grid_.Whole());
         SceneReader::Scratch scratch;
@@ -72,6 +75,8 @@ class RecoverySeamSource : public SeamSource {
             const int level = job_.scenes[s].radiometricLevel;
             for (int cy = in.y; cy < in.y + in.height; cy += chunk)
                 for (int cx = in.x; cx < in.x + in.width; cx += chunk) {
+                    if (control_.Stopped())
+                        return window;  // the scenes read so far, whole
                     const Rect part = Rect{cx, cy, chunk, chunk}.Intersect(sceneIn);
                     if (part.Empty() || !reader_.Read(s, part, true, true, scratch, tile))
                         continue;
@@ -142,6 +147,8 @@ class RecoverySeamSource : public SeamSource {
         const int m = (grid_.halo + factor - 1) / factor;
         const int w = width + 2 * m, h = height + 2 * m;
         const std::vector<float> raised = Raised(x0 - m, y0 - m, w, h, factor);
+        if (control_.Stopped())
+            return relief;
         std::vector<float> highest = raised, lowest = raised;
         SquareFilter(highest, w, h, m, true);
         SquareFilter(lowest, w, h, m, false);
@@ -157,10 +164,12 @@ class RecoverySeamSource : public SeamSource {
     }
 
     // Heights at the centres of cells [x0, x0 + width) x [y0, y0 + height); NaN where none.
+    // Asked in slices of lines (a vertical datum conversion makes them slow), each after a look
+    // at the run's control: once it stops, the rest stay NaN.
     std::vector<float> Heights(const dem::IElevationSource& source, int x0, int y0, int width,
                                int height, int factor) const {
         const size_t cells = static_cast<size_t>(width) * height;
-        std::vector<double> x(cells), y(cells), h(cells);
+        std::vector<double> x(cells), y(cells), h(cells, NAN);
         const auto& g = grid_.geoTransform;
         for (int j = 0; j < height; ++j)
             for (int i = 0; i < width; ++i) {
@@ -168,7 +177,9 @@ class RecoverySeamSource : public SeamSource {
                 const size_t c = static_cast<size_t>(j) * width + i;
                 x[c] = g[0] + p * g[1] + l * g[2], y[c] = g[3] + p * g[4] + l * g[5];
             }
-        source.GetHeights(cells, x.data(), y.data(), h.data());
+        const size_t slice = std::max<size_t>(1, kHeightSlice / std::max(1, width)) * width;
+        for (size_t c = 0; c < cells && !control_.Stopped(); c += slice)
+            source.GetHeights(std::min(slice, cells - c), &x[c], &y[c], &h[c]);
         return std::vector<float>(h.begin(), h.end());
     }
 
@@ -227,6 +238,7 @@ class RecoverySeamSource : public SeamSource {
     const RecoveryGrid& grid_;
     const SceneReader& reader_;
     const BalanceFit& fit_;
+    const RunControl& control_;
 };
 
 }  // namespace
@@ -376,8 +388,9 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
 }
 
 std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job, const RecoveryGrid& grid,
-                                           const SceneReader& reader, const BalanceFit& fit) {
-    return std::make_unique<RecoverySeamSource>(job, grid, reader, fit);
+                                           const SceneReader& reader, const BalanceFit& fit,
+                                           const RunControl& control) {
+    return std::make_unique<RecoverySeamSource>(job, grid, reader, fit, control);
 }
 
 }  // namespace trueortho
