@@ -127,6 +127,23 @@ TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
             if (vis1[k] != VISIBILITY_SEEN && vis2[k] != VISIBILITY_SEEN) {
                 EXPECT_EQ(source[k], 0) << k;
             }
+            // Nor does a scene weigh in the other's region within its pixel error of a pixel
+            // it does not see: its values there show the building's edge.
+            const int x = static_cast<int>(k % kSize), y = static_cast<int>(k / kSize);
+            bool near[2] = {false, false};
+            for (int dy = -1; dy <= 1; ++dy)
+                for (int dx = -1; dx <= 1; ++dx) {
+                    const int nx = x + dx, ny = y + dy;
+                    if (nx < 0 || ny < 0 || nx >= static_cast<int>(kSize) || ny >= static_cast<int>(kSize))
+                        continue;
+                    const size_t q = static_cast<size_t>(ny) * kSize + nx;
+                    near[0] = near[0] || vis1[q] == VISIBILITY_HIDDEN;
+                    near[1] = near[1] || vis2[q] == VISIBILITY_HIDDEN;
+                }
+            if (near[0] && source[k] == 2)
+                ASSERT_EQ(mosaic[k], ortho2[k]) << k;
+            if (near[1] && source[k] == 1)
+                ASSERT_EQ(mosaic[k], ortho1[k]) << k;
         }
         EXPECT_GT(hidden[0], 1000u);
         EXPECT_GT(hidden[1], 1000u);

@@ -8,7 +8,7 @@
 //
 // Multiband: the scenes' Laplacian pyramids blended level by level with the Gaussian pyramids of
 // their region masks (Burt and Adelson), as differences from the hard mosaic, so that pixels far
-// from every seam keep their region's value exactly.
+// from every seam keep their region's value exactly, as do pixels no other scene sees.
 #include "blend.h"
 
 #include <kestrel/exception.h>
@@ -517,6 +517,18 @@ void Multiband(const BlendTile& tile, int blendWidth, float noData, std::vector<
             t = t > 1e-6f ? 1.0f / t : 0.0f;
     const int b = tile.border, iw = tile.width - 2 * b, ih = tile.height - 2 * b;
     const std::size_t plane = static_cast<std::size_t>(iw) * ih;
+    // Inner pixels that no scene but their region's sees keep its value: the other scenes'
+    // coarse levels reach into the ground they do not see.
+    std::vector<unsigned char> alone(plane, 1);
+    for (int j = 0; j < ih; ++j)
+        for (int i = 0; i < iw; ++i) {
+            const std::size_t p = static_cast<std::size_t>(j + b) * tile.width + i + b;
+            for (const int k : order)
+                if (k != tile.labels[p] && tile.seen[k][p]) {
+                    alone[static_cast<std::size_t>(j) * iw + i] = 0;
+                    break;
+                }
+        }
     out.resize(plane * tile.bands);
     for (int band = 0; band < tile.bands; ++band) {
         std::vector<Plane>& sum = blended[band];
@@ -535,9 +547,10 @@ void Multiband(const BlendTile& tile, int blendWidth, float noData, std::vector<
             const int* label = &tile.labels[at(b - sx, y)];
             const float* region = &hard[band].at(b - sx, y);
             const float* change = &collapsed.at(b - sx, y);
+            const unsigned char* only = alone.data() + static_cast<std::size_t>(j) * iw;
             float* o = out.data() + plane * band + static_cast<std::size_t>(j) * iw;
             for (int i = 0; i < iw; ++i)
-                o[i] = label[i] < 0 ? noData : region[i] + change[i];
+                o[i] = label[i] < 0 ? noData : only[i] ? region[i] : region[i] + change[i];
         }
     }
 }

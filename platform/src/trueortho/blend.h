@@ -23,7 +23,9 @@ struct BlendTile {
     std::vector<std::size_t> scenes;  // the scenes present (indices into the job's scenes)
     // Per scene: `bands` planes of width x height values (balanced); only read where seen.
     std::vector<std::vector<float>> values;
-    // Per scene: 1 where the scene sees the ground.
+    // Per scene: 1 where the scene sees the ground and may weigh in the blend. Where the
+    // region's own scene does not, the pixel takes the other scenes' blend within reach, else
+    // still its region's value.
     std::vector<std::vector<unsigned char>> seen;
     // Per pixel: the index into `scenes` of the region the pixel belongs to, or -1 for none.
     std::vector<int> labels;
