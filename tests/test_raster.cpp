@@ -404,15 +404,18 @@ TEST(RasterWriter, CogIsTiledCompressedWithAveragedOverviewsAndAMask) {
         EXPECT_FALSE(hasNoData);
         EXPECT_EQ(band->GetMaskFlags(), GMF_PER_DATASET);
         GByte mask[2] = {};
-        band->GetMaskBand()->RasterIO(GF_Read, 15, 10, 2, 1, mask, 2, 1, GDT_Byte, 0, 0, nullptr);
+        ASSERT_EQ(band->GetMaskBand()->RasterIO(GF_Read, 15, 10, 2, 1, mask, 2, 1, GDT_Byte, 0, 0,
+                                                nullptr),
+                  CE_None);
         EXPECT_EQ(mask[0], 0);
         EXPECT_EQ(mask[1], 255);
         EXPECT_EQ(band->GetOverviewCount() > 0, c.overviews);
         if (c.overviews && c.compression == "DEFLATE") {
             // Averaged: the overview pixel is the mean of the four it covers (none of them).
             GByte reduced = 0;
-            band->GetOverview(0)->RasterIO(GF_Read, 12, 5, 1, 1, &reduced, 1, 1, GDT_Byte, 0, 0,
-                                           nullptr);
+            ASSERT_EQ(band->GetOverview(0)->RasterIO(GF_Read, 12, 5, 1, 1, &reduced, 1, 1,
+                                                     GDT_Byte, 0, 0, nullptr),
+                      CE_None);
             double sum = 0;
             for (int y = 10; y < 12; ++y)
                 for (int x = 24; x < 26; ++x)

@@ -1,6 +1,7 @@
 #include "samplecity.h"
 
 #include <kestrel/exception.h>
+#include <kestrel/gdalsupport.h>
 
 #include <gdal_priv.h>
 
@@ -45,19 +46,22 @@ struct GdalDatasetCloser {
 };
 using DatasetPtr = std::unique_ptr<GDALDataset, GdalDatasetCloser>;
 
+using kestrel::gdalsupport::ErrorCapture;
+
 DatasetPtr OpenRaster(const std::string& path) {
     GDALAllRegister();
+    ErrorCapture errors;
     DatasetPtr ds(GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
     if (!ds)
         KESTREL_THROW(DataException, FormatString("%s: cannot open the raster: %s", path.c_str(),
-                                                  CPLGetLastErrorMsg()));
+                                                  errors.Reason().c_str()));
     return ds;
 }
 
-void CheckWrite(CPLErr err, const std::string& path) {
+void CheckWrite(CPLErr err, const std::string& path, const ErrorCapture& errors) {
     if (err != CE_None)
-        KESTREL_THROW(DataException,
-                      FormatString("%s: write failed: %s", path.c_str(), CPLGetLastErrorMsg()));
+        KESTREL_THROW(DataException, FormatString("%s: write failed: %s", path.c_str(),
+                                                  errors.Reason().c_str()));
 }
 
 // The 20 terms in RPC00B order: 1 L P H LP LH PH L2 P2 H2 PLH L3 LP2 LH2 L2P P3 PH2 L2H P2H H3.
@@ -416,6 +420,7 @@ bool Dsm::Intersect(const Vec3& origin, const Vec3& dir, Vec3& hit) const {
 
 void WriteDsm(const Dsm& dsm, const std::string& path) {
     GDALAllRegister();
+    ErrorCapture errors;
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
     const char* options[] = {"TILED=YES", "COMPRESS=DEFLATE", "PREDICTOR=3", nullptr};
     DatasetPtr ds(driver->Create(path.c_str(), static_cast<int>(dsm.Width()),
@@ -423,7 +428,7 @@ void WriteDsm(const Dsm& dsm, const std::string& path) {
                                  const_cast<char**>(options)));
     if (!ds)
         KESTREL_THROW(DataException, FormatString("%s: cannot create the DSM: %s", path.c_str(),
-                                                  CPLGetLastErrorMsg()));
+                                                  errors.Reason().c_str()));
     std::array<double, 6> gt = dsm.GeoTransform();
     ds->SetGeoTransform(gt.data());
     const ICRS crs(dsm.Options().crs);
@@ -434,7 +439,7 @@ void WriteDsm(const Dsm& dsm, const std::string& path) {
                               static_cast<int>(dsm.Height()),
                               const_cast<float*>(dsm.Posts().data()), static_cast<int>(dsm.Width()),
                               static_cast<int>(dsm.Height()), GDT_Float32, 0, 0, nullptr),
-               path);
+               path, errors);
     ds.reset();
 }
 
@@ -688,6 +693,7 @@ void ForEachRow(unsigned int rows, unsigned int threads, const RowWork& rowWork)
 void WriteRgb(const std::string& path, const std::vector<std::uint8_t>& pixels, unsigned int w,
               unsigned int h, const std::array<double, 6>* geoTransform, const ICRS* crs,
               std::vector<std::string> metadata, const char* domain) {
+    ErrorCapture errors;
     GDALDriver* driver = GetGDALDriverManager()->GetDriverByName("GTiff");
     const char* options[] = {"TILED=YES", "INTERLEAVE=PIXEL", "PHOTOMETRIC=RGB",
                              geoTransform != nullptr ? "COMPRESS=DEFLATE" : nullptr, nullptr};
@@ -695,7 +701,7 @@ void WriteRgb(const std::string& path, const std::vector<std::uint8_t>& pixels, 
                                  GDT_Byte, const_cast<char**>(options)));
     if (!ds)
         KESTREL_THROW(DataException, FormatString("%s: cannot create the image: %s", path.c_str(),
-                                                  CPLGetLastErrorMsg()));
+                                                  errors.Reason().c_str()));
     if (geoTransform != nullptr) {
         std::array<double, 6> gt = *geoTransform;
         ds->SetGeoTransform(gt.data());
@@ -716,7 +722,7 @@ void WriteRgb(const std::string& path, const std::vector<std::uint8_t>& pixels, 
                             const_cast<std::uint8_t*>(pixels.data()), static_cast<int>(w),
                             static_cast<int>(h), GDT_Byte, 3, bands, 3, 3 * static_cast<GSpacing>(w),
                             1, nullptr),
-               path);
+               path, errors);
     ds.reset();
 }
 
