@@ -757,9 +757,12 @@ void CheckModels(const Options& options) {
     }
     // A camera file that orients none of the images is refused; one image missing from it
     // fails that scene only. A model whose datum is not the surface file's fails every scene.
+    // The cameras of one file share its CRS: the first one oriented stands for all of them.
     std::string cameraError;
     bool oriented = false;
     for (const Source& source : sources) {
+        if (oriented && !options.cameras.empty())
+            break;
         std::error_code ec;
         if (!std::filesystem::exists(source.path, ec))
             continue;  // the scene fails, naming its source
