@@ -133,6 +133,8 @@ class SceneReader {
     // no pixel of r.
     bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
               SceneTile& out) const;
+    // The angles of out.scene over r, for a tile Read without them.
+    void ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) const;
     // The ortho's `bands` planes over r; no-data outside the scene's raster.
     void ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const;
 
