@@ -408,6 +408,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     trueortho::ReleaseFreeMemory();
     mosaic->Close();
     source->Close();
+    trueortho::ReleaseFreeMemory();
     for (const auto& c : counts)
         result.filled += c.filled, result.unfilled += c.unfilled, result.sceneReads += c.sceneReads;
     result.gain = fit.gain;
