@@ -199,6 +199,22 @@ void MaxFlow::Adopt(int i) {
 }
 
 double MaxFlow::Solve() {
+    // Paths of one arc from a node the source feeds to one that drains to the sink, saturated
+    // before the trees grow: most of a grid's flow, without the trees' bookkeeping.
+    for (std::size_t i = 0; i < nodes_.size(); ++i) {
+        Node& n = nodes_[i];
+        for (int a = n.first; a >= 0 && n.terminal > 0; a = arcs_[a].next) {
+            Node& m = nodes_[static_cast<std::size_t>(arcs_[a].head)];
+            if (m.terminal >= 0 || arcs_[a].residual <= 0)
+                continue;
+            const Capacity b = std::min({n.terminal, -m.terminal, arcs_[a].residual});
+            n.terminal -= b;
+            m.terminal += b;
+            arcs_[a].residual -= b;
+            arcs_[Sister(a)].residual += b;
+            flow_ += b;
+        }
+    }
     for (std::size_t i = 0; i < nodes_.size(); ++i) {
         Node& n = nodes_[i];
         if (n.terminal != 0) {

@@ -97,20 +97,20 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
     const size_t size = r.Size();
     const std::vector<size_t> meeting = c.grid.ScenesMeeting(r);
     counts.sceneReads += meeting.size();
+    // The viewing angles only rank scenes where no region is given: read when needed.
+    const bool angles = c.regions == nullptr;
     size_t n = 0;
     for (const size_t s : meeting) {
         if (control.Stopped())
             return;
         if (w.scenes.size() <= n)
             w.scenes.emplace_back();
-        n += c.reader.Read(s, r, false, true, w.scratch, w.scenes[n]) ? 1 : 0;
+        n += c.reader.Read(s, r, false, angles, w.scratch, w.scenes[n]) ? 1 : 0;
     }
 
     // Regions: the raster's scene where it sees the pixel, else the first ranked.
     std::vector<int>& labels = w.blend.labels;
     labels.assign(size, -1);
-    for (size_t p = 0; p < size; ++p)
-        labels[p] = FirstRanked(job, w.scenes, n, p);
     if (c.regions != nullptr) {
         // Set for the tile's scenes only, and reset after, so that a tile costs nothing per
         // scene of the job.
@@ -138,6 +138,23 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
         }
         for (size_t k = 0; k < n; ++k)
             w.sceneSlot[w.scenes[k].scene] = -1;
+    }
+    bool ranked = angles;
+    for (size_t p = 0; p < size; ++p) {
+        if (labels[p] >= 0)
+            continue;
+        if (!ranked) {
+            // A pixel that some scene sees and no region gives: every scene's angles.
+            bool seen = false;
+            for (size_t k = 0; k < n && !seen; ++k)
+                seen = w.scenes[k].state[p] != trueortho::kNotSeen;
+            if (!seen)
+                continue;
+            for (size_t k = 0; k < n; ++k)
+                c.reader.ReadAngles(r, w.scratch, w.scenes[k]);
+            ranked = true;
+        }
+        labels[p] = FirstRanked(job, w.scenes, n, p);
     }
     if (c.mask != nullptr) {
         // Outside the mask (and outside its raster) the pixels stay empty.
@@ -344,6 +361,9 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     const trueortho::BalanceFit fit =
         trueortho::FitBalance(job.scenes.size(), grid.bands, overlaps, balance);
     overlaps.clear();
+    // Between the steps, what their threads freed goes back to the system (the next step's
+    // threads would not reuse it).
+    trueortho::ReleaseFreeMemory();
 
     // 2. The regions: the job's raster, seamlines, or none (the first-ranked scene per pixel).
     ScratchFile scratch;
@@ -352,6 +372,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
         regions = ChooseSeamlines(job, grid, reader, fit, threads, control, scratch);
         if (control.Stopped())
             return result;
+        trueortho::ReleaseFreeMemory();
     }
 
     // 3. The composition, tile by tile.
@@ -384,6 +405,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     });
     if (control.Stopped())
         return result;
+    trueortho::ReleaseFreeMemory();
     mosaic->Close();
     source->Close();
     for (const auto& c : counts)

@@ -366,13 +366,17 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
     }
     if (values)
         ReadValues(s, r, out.values);
-    if (angles) {
-        scratch.toModel.resize(toModel_.size());
-        if (toModel_[s] && !scratch.toModel[s])
-            scratch.toModel[s] = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel_[s]);
-        Angles(job_, grid_, job_.scenes[s], scratch.toModel[s].get(), r, out.angle);
-    }
+    if (angles)
+        ReadAngles(r, scratch, out);
     return true;
+}
+
+void SceneReader::ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) const {
+    const std::size_t s = out.scene;
+    scratch.toModel.resize(toModel_.size());
+    if (toModel_[s] && !scratch.toModel[s])
+        scratch.toModel[s] = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel_[s]);
+    Angles(job_, grid_, job_.scenes[s], scratch.toModel[s].get(), r, out.angle);
 }
 
 void SceneReader::ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const {

@@ -133,6 +133,8 @@ class SceneReader {
     // no pixel of r.
     bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
               SceneTile& out) const;
+    // The angles of out.scene over r, for a tile Read without them.
+    void ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) const;
     // The ortho's `bands` planes over r; no-data outside the scene's raster.
     void ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const;
 
@@ -172,9 +174,9 @@ double PixelMetres(const RecoveryGrid& grid);
 
 // Per pair of scenes whose windows meet, the pixels both see clearly, decimated on a lattice so
 // that a pair gives at most about kPairSamples, and all pairs together about kTotalSamples
-// (but a pair at least kFewestSamples), so that the samples' memory stays within some 25 MB
-// however many scenes there are.
-constexpr double kPairSamples = 20000, kTotalSamples = 1e6, kFewestSamples = 1000;
+// (but a pair at least kFewestSamples), so that the samples' memory stays within some 6 MB up
+// to some 250 pairs (about 64 scenes of an aerial block) and then grows by 24 kB a pair.
+constexpr double kPairSamples = 20000, kTotalSamples = 2.5e5, kFewestSamples = 1000;
 std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const RecoveryGrid& grid,
                                            const SceneReader& reader, unsigned int threads,
                                            RunControl& control);
