@@ -215,10 +215,10 @@ Dataset Open(const std::string& path, unsigned int flags = GDAL_OF_RASTER) {
     return Dataset(GDALDataset::Open(path.c_str(), flags | GDAL_OF_READONLY, nullptr, nullptr));
 }
 
-std::vector<unsigned char> ReadBytes(GDALDataset& dataset) {
+std::vector<unsigned char> ReadBytes(GDALDataset& dataset, int band = 1) {
     const int w = dataset.GetRasterXSize(), h = dataset.GetRasterYSize();
     std::vector<unsigned char> values(static_cast<std::size_t>(w) * h);
-    EXPECT_EQ(dataset.GetRasterBand(1)->RasterIO(GF_Read, 0, 0, w, h, values.data(), w, h, GDT_Byte,
+    EXPECT_EQ(dataset.GetRasterBand(band)->RasterIO(GF_Read, 0, 0, w, h, values.data(), w, h, GDT_Byte,
                                                  0, 0, nullptr),
               CE_None);
     return values;
@@ -366,7 +366,32 @@ TEST(Workflow, SampleCityEndToEnd) {
     }
     EXPECT_EQ(unfilled, 0u);
     EXPECT_EQ(wrong, 0u);
-    EXPECT_TRUE(Open(dir.File("out/mosaic.png")));
+    // Its picture (the mosaic's size here, drawn in strips of rows): transparent exactly where
+    // the mosaic is empty, grey where the mosaic is, and stretched over 1 to 255.
+    Dataset drawing = Open(dir.File("out/mosaic.png"));
+    ASSERT_TRUE(drawing);
+    ASSERT_EQ(drawing->GetRasterXSize(), width);
+    ASSERT_EQ(drawing->GetRasterYSize(), height);
+    ASSERT_GT(height, 64);  // more than one strip of rows
+    std::vector<std::vector<unsigned char>> drawn, values;
+    for (int b = 1; b <= 4; ++b)
+        drawn.push_back(ReadBytes(*drawing, b));
+    for (int b = 1; b <= 3; ++b)
+        values.push_back(ReadBytes(*mosaic, b));
+    std::size_t misplaced = 0, tinted = 0;
+    unsigned char darkest = 255, brightest = 0;
+    for (std::size_t p = 0; p < from.size(); ++p) {
+        misplaced += (drawn[3][p] == 0) != (from[p] == 0);
+        if (from[p] == 0)
+            continue;
+        tinted += values[0][p] == values[1][p] && values[1][p] == values[2][p] &&
+                  !(drawn[0][p] == drawn[1][p] && drawn[1][p] == drawn[2][p]);
+        darkest = std::min(darkest, drawn[0][p]), brightest = std::max(brightest, drawn[0][p]);
+    }
+    EXPECT_EQ(misplaced, 0u);
+    EXPECT_EQ(tinted, 0u);
+    EXPECT_EQ(darkest, 1);
+    EXPECT_EQ(brightest, 255);
     // A deliverable: a Cloud Optimized GeoTIFF, compressed, with overviews and a mask where no
     // image sees the ground rather than a no-data colour.
     const Result info = RunProgram("gdalinfo", {dir.File("out/mosaic.tif")}, dir);

@@ -7,9 +7,6 @@
 #include "steps.h"
 #include "workflow.h"
 
-#include <cpl_conv.h>
-#include <gdal.h>
-
 #include <cstdio>
 #include <exception>
 #include <string>
@@ -72,10 +69,8 @@ int main(int argc, char** argv) {
         return read < 0 ? 0 : read;
     try {
         // GDAL's block cache would otherwise take up to 5 % of the memory, filled by every
-        // raster a survey reads: held to kCacheBytes unless the user sets GDAL_CACHEMAX.
-        constexpr GIntBig kCacheBytes = 128 << 20;
-        if (CPLGetConfigOption("GDAL_CACHEMAX", nullptr) == nullptr)
-            GDALSetCacheMax64(kCacheBytes);
+        // raster a survey reads.
+        const ortho::BlockCache cache(ortho::kRunCacheBytes);
         ortho::CatchInterrupts();
         ortho::Progress progress(stderr, ortho::IsTerminal(stderr), options.quiet);
         for (const std::string& note : notes)

@@ -1161,6 +1161,18 @@ unsigned int BlendWidth(const Options& options) {
     return options.blendWidth ? *options.blendWidth : kestrel::processes::RecoveryJob().blendWidth;
 }
 
+BlockCache::BlockCache(GIntBig bytes) {
+    if (CPLGetConfigOption("GDAL_CACHEMAX", nullptr) != nullptr)
+        return;
+    before_ = GDALGetCacheMax64();
+    GDALSetCacheMax64(bytes);
+}
+
+BlockCache::~BlockCache() {
+    if (before_ >= 0)
+        GDALSetCacheMax64(before_);
+}
+
 MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoveryScene>& scenes,
                            const std::vector<std::string>& others, const Grid& grid,
                            const std::string& mosaic, const std::string& source,
@@ -1231,6 +1243,7 @@ MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoverySce
         job.regionsPath = regions.path;
     }
 
+    const BlockCache cache(kMosaicCacheBytes);
     RecoveryProcess process(options.proc, job, progress);
     process.Execute();
     if (!process.Result().completed)
@@ -1306,85 +1319,118 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     const double shrink = std::max(1.0, std::max(width, height) / 2048.0);
     const int outWidth = std::max(1, static_cast<int>(width / shrink));
     const int outHeight = std::max(1, static_cast<int>(height / shrink));
-    const std::size_t count = static_cast<std::size_t>(outWidth) * outHeight;
     const int bands = kind == Quicklook::Image ? std::min(3, source->GetRasterCount()) : 1;
 
-    // Pixels at the quicklook's size, every band in one pass over the file, and where they hold
-    // no data.
-    std::vector<double> all(count * static_cast<std::size_t>(bands));
+    // The picture is drawn in strips of rows (read from the raster at the picture's scale), so
+    // that memory holds the picture's bytes and one strip, not every value of the picture.
+    constexpr int kStripRows = 64;
+    const std::size_t stripCount = static_cast<std::size_t>(outWidth) * kStripRows;
+    std::vector<float> strip(stripCount * static_cast<std::size_t>(bands));
+    std::vector<GByte> mask(stripCount), empty(stripCount);
     std::vector<int> bandList(static_cast<std::size_t>(bands));
-    std::vector<const double*> values(static_cast<std::size_t>(bands));
     for (int b = 0; b < bands; ++b)
-        bandList[b] = b + 1, values[b] = all.data() + count * static_cast<std::size_t>(b);
-    if (source->RasterIO(GF_Read, 0, 0, width, height, all.data(), outWidth, outHeight,
-                         GDT_Float64, bands, bandList.data(), 0, 0, 0, nullptr) != CE_None)
-        FailFile(raster, "cannot be read", errors);
-    // Empty where a band's mask says so: its no-data value, or the file's mask band.
-    std::vector<bool> empty(count, false);
-    std::vector<GByte> mask(count);
-    for (int b = 0; b < bands; ++b) {
-        GDALRasterBand* band = source->GetRasterBand(b + 1);
-        const bool masked = band->GetMaskFlags() != GMF_ALL_VALID;
-        if (masked && band->GetMaskBand()->RasterIO(GF_Read, 0, 0, width, height, mask.data(),
-                                                    outWidth, outHeight, GDT_Byte, 0, 0,
-                                                    nullptr) != CE_None)
+        bandList[b] = b + 1;
+    // Reads rows [row, row + rows) of the picture into `strip` (band after band) and marks in
+    // `empty` the pixels a band's mask (its no-data value or the file's mask band) leaves out.
+    auto read = [&](int row, int rows) {
+        const std::size_t count = static_cast<std::size_t>(outWidth) * rows;
+        GDALRasterIOExtraArg window;
+        INIT_RASTERIO_EXTRA_ARG(window);
+        window.bFloatingPointWindowValidity = TRUE;
+        window.dfXOff = 0, window.dfXSize = width;
+        window.dfYOff = static_cast<double>(row) * height / outHeight;
+        window.dfYSize = static_cast<double>(rows) * height / outHeight;
+        const int y0 = static_cast<int>(window.dfYOff);
+        const int y1 = std::min(height, static_cast<int>(std::ceil(window.dfYOff + window.dfYSize)));
+        if (source->RasterIO(GF_Read, 0, y0, width, y1 - y0, strip.data(), outWidth, rows,
+                             GDT_Float32, bands, bandList.data(), 0, 0,
+                             static_cast<GSpacing>(count) * sizeof(float), &window) != CE_None)
             FailFile(raster, "cannot be read", errors);
-        for (std::size_t i = 0; i < count; ++i) {
-            if (std::isnan(values[b][i]) || (masked && mask[i] == 0))
-                empty[i] = true;
-        }
-    }
-
-    // Red, green, blue, alpha.
-    std::vector<std::vector<unsigned char>> rgba(4, std::vector<unsigned char>(count, 0));
-    if (kind == Quicklook::Image) {
-        // One stretch for all bands, so that colours keep their balance: between the 2nd and
-        // 98th percentiles of the values of the pixels with data (selected, not sorted: the
-        // quicklook has millions of them).
-        std::vector<double> data;
-        data.reserve(count * static_cast<std::size_t>(bands));
+        std::fill(empty.begin(), empty.begin() + static_cast<std::ptrdiff_t>(count), GByte{0});
         for (int b = 0; b < bands; ++b) {
+            GDALRasterBand* band = source->GetRasterBand(b + 1);
+            const bool masked = band->GetMaskFlags() != GMF_ALL_VALID;
+            if (masked && band->GetMaskBand()->RasterIO(GF_Read, 0, y0, width, y1 - y0,
+                                                        mask.data(), outWidth, rows, GDT_Byte,
+                                                        0, 0, &window) != CE_None)
+                FailFile(raster, "cannot be read", errors);
+            const float* values = strip.data() + count * static_cast<std::size_t>(b);
             for (std::size_t i = 0; i < count; ++i) {
-                if (!empty[i])
-                    data.push_back(values[b][i]);
+                if (std::isnan(values[i]) || (masked && mask[i] == 0))
+                    empty[i] = 1;
             }
+        }
+        return count;
+    };
+
+    // One stretch for all bands, so that colours keep their balance: between the 2nd and 98th
+    // percentiles of the values with data, taken from every pixel or, on larger pictures, from
+    // pixels evenly spread (at most kStretchSamples values: a few MB).
+    double low = 0, scale = 0;
+    if (kind == Quicklook::Image) {
+        constexpr std::size_t kStretchSamples = std::size_t{1} << 20;
+        const std::size_t pixels = static_cast<std::size_t>(outWidth) * outHeight;
+        const std::size_t stride =
+            std::max<std::size_t>(1, pixels * bands / kStretchSamples + 1);
+        std::vector<float> data;
+        data.reserve(std::min(pixels * bands, kStretchSamples + bands));
+        std::size_t first = 0;  // index in the picture of the strip's first pixel
+        for (int row = 0; row < outHeight; row += kStripRows) {
+            const std::size_t count = read(row, std::min(kStripRows, outHeight - row));
+            for (std::size_t i = (stride - first % stride) % stride; i < count; i += stride) {
+                if (empty[i])
+                    continue;
+                for (int b = 0; b < bands; ++b)
+                    data.push_back(strip[count * static_cast<std::size_t>(b) + i]);
+            }
+            first += count;
         }
         auto percentile = [&data](std::size_t share, double none) {
             if (data.empty())
                 return none;
             const auto at = data.begin() + static_cast<std::ptrdiff_t>(data.size() * share / 100);
             std::nth_element(data.begin(), at, data.end());
-            return *at;
+            return static_cast<double>(*at);
         };
-        const double low = percentile(2, 0.0);
+        low = percentile(2, 0.0);
         const double high = percentile(98, 1.0);
-        const double scale = high > low ? 254.0 / (high - low) : 0.0;
-        for (int b = 0; b < bands; ++b) {
-            for (std::size_t i = 0; i < count; ++i) {
-                const double v = 1.0 + (values[b][i] - low) * scale;
-                const auto byte = static_cast<unsigned char>(std::clamp(v, 1.0, 255.0));
-                for (int c = b; c < (bands == 1 ? 3 : b + 1); ++c)
-                    rgba[c][i] = byte;
-            }
-        }
-    } else {
-        for (std::size_t i = 0; i < count; ++i) {
-            const auto v = static_cast<long long>(std::llround(values[0][i]));
-            const int index = static_cast<int>(((v % kColours) + kColours) % kColours);
-            for (int c = 0; c < 3; ++c)
-                rgba[c][i] = kPalette[index][c];
-        }
+        scale = high > low ? 254.0 / (high - low) : 0.0;
     }
-    for (std::size_t i = 0; i < count; ++i)
-        rgba[3][i] = empty[i] ? 0 : 255;
 
+    // Red, green, blue, alpha, strip by strip into the picture.
     GDALDriver* memory = GetGDALDriverManager()->GetDriverByName("MEM");
     GDALDriver* pngDriver = GetGDALDriverManager()->GetDriverByName("PNG");
     DatasetPtr picture(memory->Create("", outWidth, outHeight, 4, GDT_Byte, nullptr));
-    for (int c = 0; c < 4; ++c) {
-        if (picture->GetRasterBand(c + 1)->RasterIO(GF_Write, 0, 0, outWidth, outHeight,
-                                                    rgba[c].data(), outWidth, outHeight, GDT_Byte,
-                                                    0, 0, nullptr) != CE_None)
+    if (!picture)
+        FailFile(png, "cannot be drawn", errors);
+    std::vector<GByte> rgba(stripCount * 4);
+    for (int row = 0; row < outHeight; row += kStripRows) {
+        const int rows = std::min(kStripRows, outHeight - row);
+        const std::size_t count = read(row, rows);
+        GByte* alpha = rgba.data() + 3 * count;
+        for (std::size_t i = 0; i < count; ++i)
+            alpha[i] = empty[i] ? 0 : 255;
+        if (kind == Quicklook::Image) {
+            for (int b = 0; b < bands; ++b) {
+                const float* values = strip.data() + count * static_cast<std::size_t>(b);
+                for (std::size_t i = 0; i < count; ++i) {
+                    const double v = 1.0 + (values[i] - low) * scale;
+                    const auto byte = static_cast<GByte>(std::clamp(v, 1.0, 255.0));
+                    for (int c = b; c < (bands == 1 ? 3 : b + 1); ++c)
+                        rgba[count * c + i] = byte;
+                }
+            }
+        } else {
+            for (std::size_t i = 0; i < count; ++i) {
+                const auto v = static_cast<long long>(std::llround(strip[i]));
+                const int index = static_cast<int>(((v % kColours) + kColours) % kColours);
+                for (int c = 0; c < 3; ++c)
+                    rgba[count * c + i] = kPalette[index][c];
+            }
+        }
+        if (picture->RasterIO(GF_Write, 0, row, outWidth, rows, rgba.data(), outWidth, rows,
+                              GDT_Byte, 4, nullptr, 0, 0, static_cast<GSpacing>(count),
+                              nullptr) != CE_None)
             FailFile(png, "cannot be drawn", errors);
     }
     picture->GetRasterBand(4)->SetColorInterpretation(GCI_AlphaBand);

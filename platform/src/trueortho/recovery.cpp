@@ -361,6 +361,9 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     const trueortho::BalanceFit fit =
         trueortho::FitBalance(job.scenes.size(), grid.bands, overlaps, balance);
     overlaps.clear();
+    // Between the steps, what their threads freed goes back to the system (the next step's
+    // threads would not reuse it).
+    trueortho::ReleaseFreeMemory();
 
     // 2. The regions: the job's raster, seamlines, or none (the first-ranked scene per pixel).
     ScratchFile scratch;
@@ -369,6 +372,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
         regions = ChooseSeamlines(job, grid, reader, fit, threads, control, scratch);
         if (control.Stopped())
             return result;
+        trueortho::ReleaseFreeMemory();
     }
 
     // 3. The composition, tile by tile.
@@ -401,8 +405,10 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     });
     if (control.Stopped())
         return result;
+    trueortho::ReleaseFreeMemory();
     mosaic->Close();
     source->Close();
+    trueortho::ReleaseFreeMemory();
     for (const auto& c : counts)
         result.filled += c.filled, result.unfilled += c.unfilled, result.sceneReads += c.sceneReads;
     result.gain = fit.gain;

@@ -82,8 +82,11 @@ struct RecoveryGrid {
     bool hasNoData = false;
     double noData = 0;  // the first scene's
     int halo = 0;       // the largest pixel error
-    // Rasters open at once: the scenes' working set on most surveys, a few tens of MB.
-    static constexpr std::size_t kOpenRasters = 128;
+    // Rasters open at once. GDAL holds some 300 kB for each (a tile of all its bands, the
+    // file's buffers): 128 held 40 MB on a block of 64 scenes. A tile reads up to about a dozen
+    // scenes (two rasters each) where the overlap is deepest; a raster closed too early is
+    // opened again, which cost no measurable time on that block.
+    static constexpr std::size_t kOpenRasters = 32;
     std::unique_ptr<RasterPool> pool = std::make_unique<RasterPool>(kOpenRasters);
     std::vector<std::unique_ptr<SharedRaster>> orthos, visibilities;
     // The scenes' windows clipped to the grid (empty when a scene lies outside it).
@@ -174,9 +177,9 @@ double PixelMetres(const RecoveryGrid& grid);
 
 // Per pair of scenes whose windows meet, the pixels both see clearly, decimated on a lattice so
 // that a pair gives at most about kPairSamples, and all pairs together about kTotalSamples
-// (but a pair at least kFewestSamples), so that the samples' memory stays within some 25 MB
-// however many scenes there are.
-constexpr double kPairSamples = 20000, kTotalSamples = 1e6, kFewestSamples = 1000;
+// (but a pair at least kFewestSamples), so that the samples' memory stays within some 6 MB up
+// to some 250 pairs (about 64 scenes of an aerial block) and then grows by 24 kB a pair.
+constexpr double kPairSamples = 20000, kTotalSamples = 2.5e5, kFewestSamples = 1000;
 std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const RecoveryGrid& grid,
                                            const SceneReader& reader, unsigned int threads,
                                            RunControl& control);

@@ -5,9 +5,23 @@
 #include <thread>
 #include <vector>
 
+#if defined(__GLIBC__)
+#include <malloc.h>
+#elif defined(_WIN32)
+#include <malloc.h>
+#endif
+
 namespace kestrel {
 namespace processes {
 namespace trueortho {
+
+void ReleaseFreeMemory() {
+#if defined(__GLIBC__)
+    malloc_trim(0);
+#elif defined(_WIN32)
+    _heapmin();
+#endif
+}
 
 bool RunControl::Stopped() const {
     if (stop_.load(std::memory_order_relaxed))

@@ -45,6 +45,12 @@ class RunControl {
     std::mutex progressMutex_;
 };
 
+// Hands the heap's free pages back to the system. Between steps of many threads: the C library
+// keeps what each thread freed for that thread's later use, and the next step's threads, or
+// the thread that carries on alone, would not reuse it, so the process would hold the largest
+// free memory of every step at once.
+void ReleaseFreeMemory();
+
 }  // namespace trueortho
 }  // namespace processes
 }  // namespace kestrel
