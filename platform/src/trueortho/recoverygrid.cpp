@@ -113,6 +113,17 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
     }
 }
 
+// Sizes a buffer of `planes` planes over r for a raster lying at `window`, filled with `outside`
+// only where the raster does not cover r (the read overwrites the rest).
+void Prepare(std::vector<float>& buffer, const Rect& r, const Rect& window, int planes,
+             float outside) {
+    const std::size_t size = r.Size() * static_cast<std::size_t>(planes);
+    if (r.Intersect(window).Size() == r.Size())
+        buffer.resize(size);
+    else
+        buffer.assign(size, outside);
+}
+
 }  // namespace
 
 Rect Rect::Intersect(const Rect& o) const {
@@ -346,7 +357,7 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
                        SceneTile& out) const {
     const int e = job_.scenes[s].dbmPixelError;
     const Rect border = r.Grown(e);
-    scratch.visibility.assign(border.Size(), VISIBILITY_OUTSIDE);
+    Prepare(scratch.visibility, border, grid_.visibilities[s]->window, 1, VISIBILITY_OUTSIDE);
     grid_.visibilities[s]->Read({1}, border, scratch.visibility.data());
     out.scene = s;
     bool seesAny = false;
@@ -383,7 +394,7 @@ void SceneReader::ReadValues(std::size_t s, const Rect& r, std::vector<float>& v
     std::vector<int> bands(grid_.bands);
     for (int b = 0; b < grid_.bands; ++b)
         bands[b] = b + 1;
-    values.assign(r.Size() * grid_.bands, static_cast<float>(grid_.noData));
+    Prepare(values, r, grid_.orthos[s]->window, grid_.bands, static_cast<float>(grid_.noData));
     grid_.orthos[s]->Read(bands, r, values.data());
 }
 
