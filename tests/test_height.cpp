@@ -260,6 +260,42 @@ TEST(HeightDatums, AgreeWithGdallocationinfoPlusCs2cs) {
     EXPECT_FALSE(std::filesystem::exists(dir.File("out")));
 }
 
+// The change of datum between nodes of its lattice: random points over 120 km of mountains, where
+// the geoid's slope changes most, against cs2cs.
+TEST(HeightDatums, ShiftBetweenLatticeNodesAgreesWithCs2cs) {
+    if (!std::filesystem::exists(kTool))
+        GTEST_SKIP() << "silvan-height is not built";
+    testsupport::TempDir dir;
+    const Grid grid{300000, 3150000, 1000, 120, 120};  // UTM 45N: the Himalaya
+    const std::string file = dir.File("flat.tif");
+    testsupport::WriteDem(file, grid, "EPSG:32645+5773", [](int, int) { return 500.0f; });
+    std::mt19937 random(7);
+    std::uniform_real_distribution<double> across(grid.X(0), grid.X(grid.width - 1));
+    std::uniform_real_distribution<double> down(grid.Y(grid.height - 1), grid.Y(0));
+    std::string points, triples;
+    for (int k = 0; k < 300; ++k) {
+        char text[80];
+        std::snprintf(text, sizeof text, "%.3f %.3f", across(random), down(random));
+        points += std::string(text) + "\n";
+        triples += std::string(text) + " 500\n";
+    }
+    testsupport::WriteFile(dir.File("points.txt"), points);
+    const auto expected = Lines(RunCommand("printf '" + triples +
+                                           "' | cs2cs -f %.6f EPSG:32645+5773 EPSG:4979"));
+    const auto got = Lines(RunCommand("'" + kTool + "' '" + file + "' --to ELLIPS < '" +
+                                      dir.File("points.txt") + "' 2>&1"));
+    ASSERT_EQ(expected.size(), 300u);
+    ASSERT_EQ(got.size(), 300u) << got[0];
+    double worst = 0;
+    for (std::size_t k = 0; k < got.size(); ++k) {
+        std::istringstream in(expected[k]);
+        double a, b, h;
+        in >> a >> b >> h;
+        worst = std::max(worst, std::fabs(std::stod(got[k]) - h));
+    }
+    EXPECT_LT(worst, 1e-3);
+}
+
 TEST_F(Height, BadArgumentsAndLinesAreNamed) {
     const std::string dem = "'" + dir.File("dem.tif") + "'";
     EXPECT_NE(Tool("--help").find("usage: silvan-height DEM"), std::string::npos);

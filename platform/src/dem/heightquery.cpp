@@ -46,6 +46,68 @@ void TransformPool::Transform(std::size_t n, double* x, double* y, double* z) co
 
 // ---------------------------------------------------------------------------------------------
 
+ShiftLattice::ShiftLattice(const TransformPool& vertical, double fromUnit, double toUnit,
+                           double spacing)
+    : vertical_(vertical), fromUnit_(fromUnit), toUnit_(toUnit), spacing_(spacing) {}
+
+const ShiftLattice::Block& ShiftLattice::BlockAt(long long bx, long long by) const {
+    std::lock_guard<std::mutex> lock(mutex_);
+    std::unique_ptr<Block>& block = blocks_[{bx, by}];
+    if (block)
+        return *block;
+    // Each node converted at two heights: the change is taken only where it is the same shift
+    // for both (a geoid model's), else NaN.
+    constexpr int kSide = kBlock + 1;
+    constexpr double kHigh = 1000.0;  // metres
+    std::vector<double> x, y, z;
+    for (int j = 0; j < kSide; ++j)
+        for (int i = 0; i < kSide; ++i)
+            for (const double h : {0.0, kHigh}) {
+                x.push_back(static_cast<double>(bx * kBlock + i) * spacing_);
+                y.push_back(static_cast<double>(by * kBlock + j) * spacing_);
+                z.push_back(h / fromUnit_);
+            }
+    vertical_.Transform(x.size(), x.data(), y.data(), z.data());
+    block = std::make_unique<Block>(static_cast<std::size_t>(kSide) * kSide);
+    for (std::size_t k = 0; k < block->size(); ++k) {
+        const double low = z[2 * k] * toUnit_, high = z[2 * k + 1] * toUnit_ - kHigh;
+        (*block)[k] = std::fabs(high - low) <= 1e-6 ? low : NAN;
+    }
+    return *block;
+}
+
+void ShiftLattice::Shift(const std::vector<std::size_t>& points, const double* x,
+                         const double* y, double* heights, std::vector<std::size_t>& left) const {
+    const Block* block = nullptr;
+    long long blockX = 0, blockY = 0;
+    for (const std::size_t p : points) {
+        const double u = x[p] / spacing_, v = y[p] / spacing_;
+        if (!(std::fabs(u) < 1e15 && std::fabs(v) < 1e15)) {
+            left.push_back(p);
+            continue;
+        }
+        const double fu = std::floor(u), fv = std::floor(v);
+        const auto i = static_cast<long long>(fu), j = static_cast<long long>(fv);
+        // Floor division: the block holding cell (i, j).
+        const long long bx = i >= 0 ? i / kBlock : -((-i + kBlock - 1) / kBlock);
+        const long long by = j >= 0 ? j / kBlock : -((-j + kBlock - 1) / kBlock);
+        if (block == nullptr || bx != blockX || by != blockY)
+            block = &BlockAt(bx, by), blockX = bx, blockY = by;
+        const std::size_t k = static_cast<std::size_t>(j - by * kBlock) * (kBlock + 1) +
+                              static_cast<std::size_t>(i - bx * kBlock);
+        const double a = u - fu, b = v - fv;
+        const Block& n = *block;
+        const double shift = (1 - b) * ((1 - a) * n[k] + a * n[k + 1]) +
+                             b * ((1 - a) * n[k + kBlock + 1] + a * n[k + kBlock + 2]);
+        if (std::isfinite(shift))
+            heights[p] += shift;
+        else
+            left.push_back(p);
+    }
+}
+
+// ---------------------------------------------------------------------------------------------
+
 std::string DatumName(DatumType datum) {
     switch (datum) {
         case ogc::cs::DatumMSL:
@@ -117,6 +179,7 @@ void QueryFrame::SetOutputDatum(DatumType datum) {
                                    "MATHMODEL, 2001 MSL or 2002 ELLIPS)",
                                    name_.c_str(), static_cast<int>(datum)));
     }
+    lattice_.reset();  // it refers to vertical_
     if (datum == datum_) {
         vertical_.reset();
         output_ = datum;
@@ -153,6 +216,12 @@ void QueryFrame::SetOutputDatum(DatumType datum) {
             FormatString("%s: heights cannot be converted from %s to %s: %s", name_.c_str(),
                          DatumName(datum_).c_str(), DatumName(datum).c_str(), e.what()));
     }
+    // Nodes about every 100 m: against PROJ on the steepest changes of the geoid's slope
+    // (EGM96 in the Himalaya) within 1 mm (500 m: within 6 mm).
+    const double spacing = crs_->IsGeographic()
+                               ? 1.0 / 1024.0
+                               : 100.0 / crs_->GetSpatialReference().GetLinearUnits(nullptr);
+    lattice_ = std::make_unique<ShiftLattice>(*vertical_, fromUnit_, toUnit_, spacing);
     output_ = datum;
 }
 
@@ -185,28 +254,27 @@ void QueryFrame::ConvertHeights(std::size_t n, const double* x, const double* y,
                                 double* heights) const {
     if (!vertical_)
         return;
-    // Only points with a height go through PROJ, in chunks that stay in the processor's cache.
+    // Points with a height take the lattice's change; those it cannot say go through PROJ, in
+    // chunks that stay in the processor's cache.
+    std::vector<std::size_t> points, left;
+    for (std::size_t i = 0; i < n; ++i) {
+        if (!std::isnan(heights[i]))
+            points.push_back(i);
+    }
+    lattice_->Shift(points, x, y, heights, left);
     constexpr std::size_t chunk = 4096;
     std::vector<double> cx, cy, cz;
-    std::vector<std::size_t> index;
-    cx.reserve(std::min(n, chunk));
-    cy.reserve(cx.capacity());
-    cz.reserve(cx.capacity());
-    index.reserve(cx.capacity());
-    std::size_t i = 0;
-    while (i < n) {
-        cx.clear(), cy.clear(), cz.clear(), index.clear();
-        for (; i < n && index.size() < chunk; ++i) {
-            if (std::isnan(heights[i]))
-                continue;
-            cx.push_back(x[i]);
-            cy.push_back(y[i]);
-            cz.push_back(heights[i] / fromUnit_);
-            index.push_back(i);
+    for (std::size_t start = 0; start < left.size(); start += chunk) {
+        const std::size_t end = std::min(left.size(), start + chunk);
+        cx.clear(), cy.clear(), cz.clear();
+        for (std::size_t k = start; k < end; ++k) {
+            cx.push_back(x[left[k]]);
+            cy.push_back(y[left[k]]);
+            cz.push_back(heights[left[k]] / fromUnit_);
         }
-        vertical_->Transform(index.size(), cx.data(), cy.data(), cz.data());
-        for (std::size_t k = 0; k < index.size(); ++k)
-            heights[index[k]] = cz[k] * toUnit_;
+        vertical_->Transform(cx.size(), cx.data(), cy.data(), cz.data());
+        for (std::size_t k = start; k < end; ++k)
+            heights[left[k]] = cz[k - start] * toUnit_;
     }
 }
 

@@ -4,9 +4,11 @@
 #pragma once
 
 #include <cstddef>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <kestrel/crs.h>
@@ -35,6 +37,32 @@ class TransformPool {
     const ogc::cs::CoordinateTransformation prototype_;
     mutable std::mutex mutex_;
     mutable std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> idle_;
+};
+
+// The change of vertical datum (metres added to a height) on a lattice of points of the source's
+// own coordinates, interpolated bilinearly between them: a geoid model is a grid of 15' (EGM96)
+// or finer that PROJ interpolates, so that a lattice of a small fraction of that spacing agrees
+// with PROJ to within a millimetre at a small share of its cost. Nodes are computed through PROJ
+// when first needed, in blocks; a node where the change is not a shift of the height alone
+// (or PROJ cannot convert) leaves the points around it to PROJ.
+class ShiftLattice {
+  public:
+    // spacing: between nodes, in the source's own units.
+    ShiftLattice(const TransformPool& vertical, double fromUnit, double toUnit, double spacing);
+    // Adds the change at each point to heights[i] for the points listed in `points`, and lists
+    // in `left` those the lattice cannot say. Thread-safe.
+    void Shift(const std::vector<std::size_t>& points, const double* x, const double* y,
+               double* heights, std::vector<std::size_t>& left) const;
+
+  private:
+    static constexpr int kBlock = 32;  // cells of a block on a side (kBlock + 1 nodes)
+    using Block = std::vector<double>;
+    const Block& BlockAt(long long bx, long long by) const;
+
+    const TransformPool& vertical_;
+    const double fromUnit_, toUnit_, spacing_;
+    mutable std::mutex mutex_;
+    mutable std::map<std::pair<long long, long long>, std::unique_ptr<Block>> blocks_;
 };
 
 // The coordinate systems and datums of one elevation source, and the transformations between
@@ -99,6 +127,7 @@ class QueryFrame {
     std::string name_;
     std::unique_ptr<TransformPool> input_;
     std::unique_ptr<TransformPool> vertical_;
+    std::unique_ptr<ShiftLattice> lattice_;
     double fromUnit_ = 1.0, toUnit_ = 1.0;  // metres per unit of the heights PROJ takes and gives
 };
 
