@@ -19,9 +19,10 @@ namespace trueortho {
 namespace {
 
 // Expansion cycles: each lowers the energy less than the one before; a few reach its floor. The
-// refinement starts from the coarse labels, already near it.
+// refinement starts from the coarse labels, already near it: on the 16-image block a second
+// cycle moved 0.05 % of the pixels for 6 % of the mosaic step's time.
 constexpr int kMaxCycles = 4;
-constexpr int kRefineCycles = 2;
+constexpr int kRefineCycles = 1;
 // The coarse grid's cells are about kCoarseCell metres and at least kMinFactor pixels on a side,
 // and the whole coarse grid at most kMaxCoarseCells: fine enough to see streets between
 // buildings, coarse enough that the seam term does not dwarf the data term cell by cell.
