@@ -330,8 +330,9 @@ TEST_F(Dem, HeightRangeOfAWindow) {
             double low = NAN, high = NAN;
             ASSERT_TRUE(dem->GetHeightRange(*x0, *y0, *x1, *y1, low, high));
             for (double v : h) {
-                if (!std::isnan(v))
+                if (!std::isnan(v)) {
                     EXPECT_TRUE(low <= v && v <= high) << low << " " << v << " " << high;
+                }
             }
             if (c.holdsOutlier) {
                 EXPECT_GE(high, 1e6);

@@ -140,10 +140,12 @@ TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
                     near[0] = near[0] || vis1[q] == VISIBILITY_HIDDEN;
                     near[1] = near[1] || vis2[q] == VISIBILITY_HIDDEN;
                 }
-            if (near[0] && source[k] == 2)
+            if (near[0] && source[k] == 2) {
                 ASSERT_EQ(mosaic[k], ortho2[k]) << k;
-            if (near[1] && source[k] == 1)
+            }
+            if (near[1] && source[k] == 1) {
                 ASSERT_EQ(mosaic[k], ortho1[k]) << k;
+            }
         }
         EXPECT_GT(hidden[0], 1000u);
         EXPECT_GT(hidden[1], 1000u);
