@@ -32,7 +32,10 @@ constexpr float kExposedRise = 1.0f;  // metres
 // smaller dimension (at 20 m a block of 50 x 45 m kept its roof as ground, and seams crossed it).
 constexpr double kGroundRadius = 30.0;  // metres
 constexpr int kMaxGroundRadius = 256;   // cells
-constexpr int kBlockRadius = 8;         // blocks of the opening
+// The ground is estimated once for the whole grid on cells of the coarse pass's size (about a
+// metre: the opening's radius is tens of metres, so the ground is smooth at that scale), at most
+// kMaxGroundCells of them (16 MB).
+constexpr size_t kMaxGroundCells = size_t{4} << 20;
 constexpr size_t kHeightSlice = 4096;  // cells of surface heights asked at a time
 
 // `exposable`: the pixel stands no more than kExposedRise above the lowest surface near it.
@@ -47,7 +50,11 @@ class RecoverySeamSource : public SeamSource {
   public:
     RecoverySeamSource(const RecoveryJob& job, const RecoveryGrid& grid, const SceneReader& reader,
                        const BalanceFit& fit, const RunControl& control)
-        : job_(job), grid_(grid), reader_(reader), fit_(fit), control_(control) {}
+        : job_(job), grid_(grid), reader_(reader), fit_(fit), control_(control) {
+        // Before any window is read: the windows are read from several threads.
+        if (job_.surface != nullptr && job_.ground == nullptr)
+            EstimateGround();
+    }
 
     // Cells x0 to x0 + width - 1 (and y0 to y0 + height - 1) of factor x factor pixels. A cell is
     // forbidden to a scene that sees under half of its pixels; otherwise its cost is the mean
@@ -184,54 +191,78 @@ class RecoverySeamSource : public SeamSource {
     }
 
     // Metres the surface stands above the ground: against the job's ground when given, else
-    // against the surface's opening over the window with a margin of the opening's radius.
+    // against the grid's ground estimate (EstimateGround).
     std::vector<float> Raised(int x0, int y0, int width, int height, int factor) const {
         if (job_.surface == nullptr)
             return {};
-        if (job_.ground != nullptr) {
-            std::vector<float> raised = Heights(*job_.surface, x0, y0, width, height, factor);
-            const std::vector<float> ground = Heights(*job_.ground, x0, y0, width, height, factor);
-            for (size_t c = 0; c < raised.size(); ++c) {
-                const float d = raised[c] - ground[c];
-                raised[c] = std::isfinite(d) ? std::max(0.0f, d) : 0.0f;
-            }
-            return raised;
-        }
-        // The opening runs on blocks of b x b cells, each the lowest height in it, so that its
-        // radius stays within kBlockRadius blocks (its cost grows with the radius); the ground
-        // of a cell is its block's.
-        const int radius = std::min(
-            kMaxGroundRadius,
-            static_cast<int>(std::ceil(kGroundRadius / (PixelMetres(grid_) * factor))));
-        const int b = std::max(1, (radius + kBlockRadius - 1) / kBlockRadius);
-        const int blockRadius = (radius + b - 1) / b;
-        // Blocks from the one holding cell x0 - radius (aligned to the grid's blocks).
-        auto floorDiv = [](int v, int d) { return v >= 0 ? v / d : -((-v + d - 1) / d); };
-        const int bx0 = floorDiv(x0, b) - blockRadius, by0 = floorDiv(y0, b) - blockRadius;
-        const int bx1 = floorDiv(x0 + width - 1, b) + blockRadius + 1;
-        const int by1 = floorDiv(y0 + height - 1, b) + blockRadius + 1;
-        const int bw = bx1 - bx0, bh = by1 - by0;
-        const std::vector<float> fine = Heights(*job_.surface, bx0 * b, by0 * b, bw * b, bh * b, factor);
-        std::vector<float> lowest(static_cast<size_t>(bw) * bh, NAN);
-        for (int j = 0; j < bh * b; ++j)
-            for (int i = 0; i < bw * b; ++i) {
-                const float h = fine[static_cast<size_t>(j) * bw * b + i];
-                float& l = lowest[static_cast<size_t>(j / b) * bw + i / b];
-                if (std::isfinite(h) && !(l <= h))
-                    l = h;
-            }
-        // The opening is the heights less what stands above it.
-        const std::vector<float> above = RaisedHeights(lowest, bw, bh, blockRadius);
-        std::vector<float> raised(static_cast<size_t>(width) * height, 0.0f);
+        std::vector<float> raised = Heights(*job_.surface, x0, y0, width, height, factor);
+        std::vector<float> ground;
+        if (job_.ground != nullptr)
+            ground = Heights(*job_.ground, x0, y0, width, height, factor);
         for (int j = 0; j < height; ++j)
             for (int i = 0; i < width; ++i) {
-                const int fx = x0 + i - bx0 * b, fy = y0 + j - by0 * b;
-                const size_t block = static_cast<size_t>(fy / b) * bw + fx / b;
-                const float ground = lowest[block] - above[block];
-                const float d = fine[static_cast<size_t>(fy) * bw * b + fx] - ground;
-                raised[static_cast<size_t>(j) * width + i] = std::isfinite(d) ? std::max(0.0f, d) : 0.0f;
+                const size_t c = static_cast<size_t>(j) * width + i;
+                const float d = raised[c] - (ground.empty() ? GroundAt((x0 + i + 0.5) * factor,
+                                                                       (y0 + j + 0.5) * factor)
+                                                            : ground[c]);
+                raised[c] = std::isfinite(d) ? std::max(0.0f, d) : 0.0f;
             }
         return raised;
+    }
+
+    // The ground under the whole grid: the surface's opening with a square of half-side
+    // kGroundRadius, on cells of groundFactor_ pixels, each the surface height at its centre.
+    void EstimateGround() {
+        const double pixelMetres = PixelMetres(grid_);
+        const size_t gridPixels = static_cast<size_t>(grid_.pixels) * grid_.lines;
+        groundFactor_ = std::max(
+            CoarseFactor(grid_.pixels, grid_.lines, pixelMetres),
+            static_cast<int>(std::ceil(std::sqrt(static_cast<double>(gridPixels) / kMaxGroundCells))));
+        const int f = groundFactor_;
+        groundWidth_ = static_cast<int>((grid_.pixels + f - 1) / f);
+        groundHeight_ = static_cast<int>((grid_.lines + f - 1) / f);
+        if (groundWidth_ == 0 || groundHeight_ == 0)
+            return;
+        std::vector<float> heights;
+        heights.reserve(static_cast<size_t>(groundWidth_) * groundHeight_);
+        // In bands of lines, so that the coordinates asked stay small.
+        const int band = std::max(1, static_cast<int>(kHeightSlice * 16 / groundWidth_));
+        for (int y = 0; y < groundHeight_ && !control_.Stopped(); y += band) {
+            const std::vector<float> h =
+                Heights(*job_.surface, 0, y, groundWidth_, std::min(band, groundHeight_ - y), f);
+            heights.insert(heights.end(), h.begin(), h.end());
+        }
+        if (control_.Stopped())
+            return;  // no window is read once the run stops
+        const int radius = std::min(
+            kMaxGroundRadius, static_cast<int>(std::ceil(kGroundRadius / (pixelMetres * f))));
+        // The opening is the heights less what stands above it.
+        const std::vector<float> above = RaisedHeights(heights, groundWidth_, groundHeight_, radius);
+        for (size_t c = 0; c < heights.size(); ++c)
+            heights[c] -= above[c];
+        ground_ = std::move(heights);
+    }
+
+    // The ground at pixel coordinates (px, py) of the grid, bilinear between the centres of the
+    // ground cells (nearest would step the ground by a cell's rise on a slope), from the finite
+    // ones among the four; NaN where none is.
+    float GroundAt(double px, double py) const {
+        if (ground_.empty())
+            return NAN;
+        const double u = std::clamp(px / groundFactor_ - 0.5, 0.0, groundWidth_ - 1.0);
+        const double v = std::clamp(py / groundFactor_ - 0.5, 0.0, groundHeight_ - 1.0);
+        const int i = std::min(static_cast<int>(u), std::max(0, groundWidth_ - 2));
+        const int j = std::min(static_cast<int>(v), std::max(0, groundHeight_ - 2));
+        const double fu = u - i, fv = v - j;
+        double sum = 0, weights = 0;
+        for (int dj = 0; dj < 2 && j + dj < groundHeight_; ++dj)
+            for (int di = 0; di < 2 && i + di < groundWidth_; ++di) {
+                const float g = ground_[static_cast<size_t>(j + dj) * groundWidth_ + i + di];
+                const double w = (di ? fu : 1 - fu) * (dj ? fv : 1 - fv);
+                if (std::isfinite(g) && w > 0)
+                    sum += w * g, weights += w;
+            }
+        return weights > 0 ? static_cast<float>(sum / weights) : NAN;
     }
 
     const RecoveryJob& job_;
@@ -239,6 +270,8 @@ class RecoverySeamSource : public SeamSource {
     const SceneReader& reader_;
     const BalanceFit& fit_;
     const RunControl& control_;
+    std::vector<float> ground_;  // groundWidth_ x groundHeight_ cells; empty until estimated
+    int groundFactor_ = 1, groundWidth_ = 0, groundHeight_ = 0;
 };
 
 }  // namespace
