@@ -94,7 +94,7 @@ std::string UnknownScene(const std::string& path, GIntBig fid, const std::string
 
 }  // namespace
 
-void WriteSeamlines(const std::string& sourceRaster, const std::vector<SeamlineScene>& scenes,
+void WriteSeamlines(const std::string& sourceRaster, const std::vector<RecoveryScene>& scenes,
                     const Grid& grid, const std::string& path) {
     ErrorCapture errors;
     DatasetPtr source(GDALDataset::Open(sourceRaster.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY,
@@ -140,7 +140,7 @@ void WriteSeamlines(const std::string& sourceRaster, const std::vector<SeamlineS
         if (value < 1 || static_cast<std::size_t>(value) > scenes.size())
             FailFile(sourceRaster, "holds value " + std::to_string(value) + ", which no scene has",
                      errors);
-        const SeamlineScene& scene = scenes[static_cast<std::size_t>(value) - 1];
+        const RecoveryScene& scene = scenes[static_cast<std::size_t>(value) - 1];
         const std::unique_ptr<OGRFeature> out(OGRFeature::CreateFeature(layer->GetLayerDefn()));
         out->SetField(kSceneField, scene.name.c_str());
         out->SetField("master_line", static_cast<int>(scene.masterLine));
@@ -171,7 +171,7 @@ void CheckSeamlineScenes(const std::string& path, const std::vector<std::string>
     });
 }
 
-void BurnSeamlines(const std::string& path, const std::vector<SeamlineScene>& scenes,
+void BurnSeamlines(const std::string& path, const std::vector<RecoveryScene>& scenes,
                    const std::vector<std::string>& others, const Grid& grid,
                    const std::string& raster, std::vector<std::string>& skipped) {
     ErrorCapture errors;
@@ -180,11 +180,11 @@ void BurnSeamlines(const std::string& path, const std::vector<SeamlineScene>& sc
     std::vector<double> values;
     ForEachRegion(path, errors, [&](GIntBig fid, const std::string& name, Region shape) {
         const auto scene = std::find_if(scenes.begin(), scenes.end(),
-                                        [&](const SeamlineScene& s) { return s.name == name; });
+                                        [&](const RecoveryScene& s) { return s.name == name; });
         if (scene == scenes.end()) {
             if (std::find(others.begin(), others.end(), name) == others.end()) {
                 std::vector<std::string> names = others;
-                for (const SeamlineScene& s : scenes)
+                for (const RecoveryScene& s : scenes)
                     names.push_back(s.name);
                 KESTREL_THROW(kestrel::DataException, UnknownScene(path, fid, name, names));
             }

@@ -122,8 +122,8 @@ namespace {
 // message naming --te when they are none or too many.
 std::string AreaGridSize(const Area& a, double width, double height, unsigned int& pixels,
                          unsigned int& lines) {
-    const double across = std::floor((a[2] - a[0] + width / 2) / width);
-    const double down = std::floor((a[3] - a[1] + height / 2) / height);
+    const double across = WholeCells(a[2] - a[0], width);
+    const double down = WholeCells(a[3] - a[1], height);
     if (!(across >= 1 && down >= 1 && across <= 1u << 30 && down <= 1u << 30))
         return kestrel::FormatString("--te: the area of interest makes a grid of %.0f x %.0f "
                                      "pixels of %g x %g",
@@ -336,13 +336,25 @@ bool SceneWindow(const Grid& common, const kestrel::tin::Polygon<double>& footpr
     const long long y1 = clip(std::ceil((box.MinY - g[3]) / g[5] - 1e-6) + margin, common.lines);
     if (x1 <= x0 || y1 <= y0)
         return false;
-    window = common;
-    window.uncoveredShare = 0.0;
-    window.pixels = static_cast<unsigned int>(x1 - x0);
-    window.lines = static_cast<unsigned int>(y1 - y0);
-    window.geoTransform[0] = g[0] + static_cast<double>(x0) * g[1];
-    window.geoTransform[3] = g[3] + static_cast<double>(y0) * g[5];
+    window = WindowAt(common, x0, y0, static_cast<unsigned int>(x1 - x0),
+                      static_cast<unsigned int>(y1 - y0));
     return true;
+}
+
+Grid WindowAt(const Grid& grid, long long column, long long row, unsigned int pixels,
+              unsigned int lines) {
+    Grid window = grid;
+    window.uncoveredShare = 0.0;
+    window.pixels = pixels;
+    window.lines = lines;
+    const auto& g = grid.geoTransform;
+    window.geoTransform[0] = g[0] + static_cast<double>(column) * g[1];
+    window.geoTransform[3] = g[3] + static_cast<double>(row) * g[5];
+    return window;
+}
+
+double WholeCells(double extent, double size) {
+    return std::floor((extent + size / 2) / size);
 }
 
 std::array<long long, 2> CellOffset(const Grid& grid, const Grid& window) {
@@ -1234,11 +1246,8 @@ MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoverySce
     }
     MosaicResult result;
     if (!options.seamlines.empty()) {
-        std::vector<SeamlineScene> named;
-        for (const RecoveryScene& scene : scenes)
-            named.push_back({scene.name, scene.masterLine, scene.ortho, scene.source});
         regions.path = mosaic + ".regions.tif";
-        BurnSeamlines(options.seamlines, named, others, grid, regions.path,
+        BurnSeamlines(options.seamlines, scenes, others, grid, regions.path,
                       result.seamlinesSkipped);
         job.regionsPath = regions.path;
     }

@@ -143,6 +143,13 @@ bool SceneWindow(const Grid& common, const kestrel::tin::Polygon<double>& footpr
 // Where window's top left cell lies in grid, in whole cells.
 std::array<long long, 2> CellOffset(const Grid& grid, const Grid& window);
 
+// The window of pixels x lines cells whose top left cell is (column, row) of grid.
+Grid WindowAt(const Grid& grid, long long column, long long row, unsigned int pixels,
+              unsigned int lines);
+
+// How many whole cells of `size` an extent holds, rounded as gdalwarp -te -tr rounds them.
+double WholeCells(double extent, double size);
+
 // The grid of an existing raster; false when it cannot be opened as one.
 bool ReadGrid(const std::string& path, Grid& grid);
 

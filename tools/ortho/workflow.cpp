@@ -654,12 +654,7 @@ bool Workflow::UseStoredGrid(const std::string& key) {
         if (!scene.error.empty() || w == byLine.end())
             continue;
         const WindowRecord& r = *w->second;
-        const auto& g = grid_.geoTransform;
-        scene.window = grid_;
-        scene.window.pixels = r.pixels;
-        scene.window.lines = r.lines;
-        scene.window.geoTransform[0] = g[0] + static_cast<double>(r.column) * g[1];
-        scene.window.geoTransform[3] = g[3] + static_cast<double>(r.row) * g[5];
+        scene.window = WindowAt(grid_, r.column, r.row, r.pixels, r.lines);
         scene.hasWindow = true;
         if (scene.inSlice)
             WarnUncovered(scene, r.uncoveredShare);
@@ -725,9 +720,8 @@ void Workflow::MakeGrid() {
             // --te without a pixel size, as gdalwarp -te: the area exactly, in whole cells of
             // about the source's resolution.
             if (options_.hasExtent && !sizeGiven) {
-                const double columns =
-                    std::floor((area[2] - area[0] + pixelWidth / 2) / pixelWidth);
-                const double rows = std::floor((area[3] - area[1] + pixelHeight / 2) / pixelHeight);
+                const double columns = WholeCells(area[2] - area[0], pixelWidth);
+                const double rows = WholeCells(area[3] - area[1], pixelHeight);
                 if (columns >= 1 && rows >= 1) {
                     pixelWidth = (area[2] - area[0]) / columns;
                     pixelHeight = (area[3] - area[1]) / rows;
@@ -1107,10 +1101,7 @@ void Workflow::Recover() {
                 Publish(PartName(source), source);
                 AddStep("occlusion recovery", SecondsSince(start));
                 step = Clock::now();
-                std::vector<SeamlineScene> named;
-                for (const RecoveryScene& scene : inputs)
-                    named.push_back({scene.name, scene.masterLine, scene.ortho, scene.source});
-                WriteSeamlines(source, named, grid_, PartName(seamlines));
+                WriteSeamlines(source, inputs, grid_, PartName(seamlines));
                 Publish(PartName(seamlines), seamlines);
                 AddStep("seamlines", SecondsSince(step));
                 MosaicBalance applied;

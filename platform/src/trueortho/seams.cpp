@@ -249,7 +249,6 @@ namespace {
 // only those of the start and of the fixed cells (where the start comes from a coarser level).
 std::vector<int> Solve(const SeamWindow& window, const SeamParams& params, std::vector<int> labels,
                        bool everyScene) {
-    CheckWindow(window);
     const Energy energy(window, params);
     const std::size_t cells = Cells(window);
     const int scenes = static_cast<int>(window.scenes.size());
@@ -295,6 +294,7 @@ std::vector<int> Solve(const SeamWindow& window, const SeamParams& params, std::
 }  // namespace
 
 std::vector<int> SolveSeams(const SeamWindow& window, const SeamParams& params) {
+    CheckWindow(window);
     return Solve(window, params, std::vector<int>(Cells(window), -1), true);
 }
 
@@ -473,7 +473,8 @@ class RegionChooser {
                 if (colour == 1)
                     Hold(window, win,
                          [&](int x, int y) { return Beside(core, x, y) ? Coarse(x, y) : 0; });
-                const std::vector<int> labels = SolveSeams(window, coarseParams_);
+                const std::vector<int> labels =
+                    Solve(window, coarseParams_, std::vector<int>(Cells(window), -1), true);
                 for (int y = core.y0; y < core.y0 + core.h; ++y)
                     for (int x = core.x0; x < core.x0 + core.w; ++x)
                         coarse_[static_cast<std::size_t>(y) * cw_ + x] = Scene(
@@ -497,15 +498,14 @@ class RegionChooser {
                 Hold(window, win, [&](int x, int y) -> int {
                     if (colour == 1 && !Inside(core, x, y))
                         return Beside(core, x, y) ? Neighbour(edges, x, y) : 0;
-                    const std::size_t c = static_cast<std::size_t>(y / factor_) * cw_ + x / factor_;
+                    const std::size_t c = CoarseCell(x, y);
                     return band_[c] ? 0 : coarse_[c];
                 });
                 Reach(window, win);
                 // The band starts from the coarse labels and may take only their scenes
                 // (and those that see what they do not).
-                const std::vector<int> start = Labels(window, win, [&](int x, int y) {
-                    return coarse_[static_cast<std::size_t>(y / factor_) * cw_ + x / factor_];
-                });
+                const std::vector<int> start = Labels(
+                    window, win, [&](int x, int y) { return coarse_[CoarseCell(x, y)]; });
                 const std::vector<int> labels = Solve(window, params_, start, false);
                 std::vector<std::uint16_t> out(static_cast<std::size_t>(core.w) * core.h);
                 for (int y = 0; y < core.h; ++y)
@@ -582,6 +582,11 @@ class RegionChooser {
         return window;
     }
 
+    // The coarse cell holding pixel (x, y).
+    std::size_t CoarseCell(int x, int y) const {
+        return static_cast<std::size_t>(y / factor_) * cw_ + x / factor_;
+    }
+
     std::uint16_t Coarse(int x, int y) const {
         return coarse_[static_cast<std::size_t>(y) * cw_ + x];
     }
@@ -590,18 +595,24 @@ class RegionChooser {
         return label < 0 ? 0 : static_cast<std::uint16_t>(window.scenes[label] + 1);
     }
 
-    // Per cell of the window (at s in the grid), the index into its scenes of the scene
-    // scene(x, y) names (1 + scene; <= 0: none), or -1 where that scene is not in the window or
-    // does not see the cell.
-    template <typename SceneAt>
-    static std::vector<int> Labels(const SeamWindow& window, const Chessboard::Square& s,
-                                   SceneAt sceneAt) {
+    // Per 1 + scene, its index into the window's scenes, or -1.
+    static std::vector<int> SceneIndex(const SeamWindow& window) {
         std::vector<int> index;
         for (std::size_t k = 0; k < window.scenes.size(); ++k) {
             if (window.scenes[k] + 2 > index.size())
                 index.resize(window.scenes[k] + 2, -1);
             index[window.scenes[k] + 1] = static_cast<int>(k);
         }
+        return index;
+    }
+
+    // Per cell of the window (at s in the grid), the index into its scenes of the scene
+    // scene(x, y) names (1 + scene; <= 0: none), or -1 where that scene is not in the window or
+    // does not see the cell.
+    template <typename SceneAt>
+    static std::vector<int> Labels(const SeamWindow& window, const Chessboard::Square& s,
+                                   SceneAt sceneAt) {
+        const std::vector<int> index = SceneIndex(window);
         std::vector<int> labels(Cells(window), -1);
         for (int y = 0; y < s.h; ++y)
             for (int x = 0; x < s.w; ++x) {
@@ -637,12 +648,7 @@ class RegionChooser {
         const int x1 = std::min(cw_, (s.x0 + s.w - 1) / factor_ + reach + 1);
         const int y1 = std::min(ch_, (s.y0 + s.h - 1) / factor_ + reach + 1);
         const int w = x1 - x0, h = y1 - y0;
-        std::vector<int> index;  // per 1 + scene, its index in the window or -1
-        for (std::size_t k = 0; k < scenes; ++k) {
-            if (window.scenes[k] + 2 > index.size())
-                index.resize(window.scenes[k] + 2, -1);
-            index[window.scenes[k] + 1] = static_cast<int>(k);
-        }
+        const std::vector<int> index = SceneIndex(window);
         std::vector<Mask> near(static_cast<std::size_t>(w) * h, 0);
         for (int y = 0; y < h; ++y)
             for (int x = 0; x < w; ++x) {
