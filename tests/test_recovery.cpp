@@ -171,6 +171,20 @@ TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
 // At equal levels the line of sight nearer the vertical wins: the northern camera north of the
 // building, the southern one south of it. Without models the first scene wins. (The other
 // rules are checked pixel by pixel on synthetic scenes below.)
+// Multiband blending builds its pyramid on the mosaic grid, whatever the tiles: tiles whose
+// origins are not on its cells give the same mosaic.
+TEST_F(OppositeViews, MultibandMosaicDoesNotDependOnTheTiles) {
+    std::vector<std::vector<double>> mosaics;
+    for (const unsigned int tile : {64u, 36u}) {
+        RecoveryJob job = Job(1, 1, 1, true);
+        job.seamlines = true, job.blendWidth = 16, job.blend = RecoveryJob::Blend::Multiband;
+        job.tileSize = tile;
+        ASSERT_TRUE(OcclusionRecovery().Recover(job).completed);
+        mosaics.push_back(ReadBand(dir->File("mosaic.tif"), 2));
+    }
+    EXPECT_EQ(mosaics[0], mosaics[1]);
+}
+
 TEST_F(OppositeViews, SteeperLineOfSightWinsAtEqualLevels) {
     const auto vis1 = Visibility(0), vis2 = Visibility(1);
     auto both = [&](size_t k) { return vis1[k] == VISIBILITY_SEEN && vis2[k] == VISIBILITY_SEEN; };

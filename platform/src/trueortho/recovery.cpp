@@ -169,6 +169,7 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
     // values, balanced.
     trueortho::BlendTile& blend = w.blend;
     blend.width = r.width, blend.height = r.height, blend.border = c.border, blend.bands = bands;
+    blend.x0 = t.x, blend.y0 = t.y;
     w.slot.assign(n, -1);
     for (const int label : labels)
         if (label >= 0)
