@@ -334,18 +334,10 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
 
     // Each tile reads the visibility with a border of the pixel error: tiles of at least twice
     // that (up to 1024) keep the border's share of the reading bounded.
-    const unsigned int tile =
-        std::max(job.tileSize, std::min(2u * static_cast<unsigned int>(grid.halo), 1024u));
-    const unsigned int tilesX = (grid.pixels + tile - 1) / tile;
-    const unsigned int tilesY = (grid.lines + tile - 1) / tile;
-    const size_t tiles = static_cast<size_t>(tilesX) * tilesY;
+    const int tile = static_cast<int>(
+        std::max(job.tileSize, std::min(2u * static_cast<unsigned int>(grid.halo), 1024u)));
+    const size_t tiles = grid.TileCount(tile);
     const unsigned int threads = static_cast<unsigned int>(std::min<size_t>(ThreadsToUse(), tiles));
-    auto tileAt = [&](size_t index) {
-        const int tx = static_cast<int>((index % tilesX) * tile);
-        const int ty = static_cast<int>((index / tilesX) * tile);
-        return Rect{tx, ty, static_cast<int>(std::min(tile, grid.pixels - tx)),
-                    static_cast<int>(std::min(tile, grid.lines - ty))};
-    };
 
     // 1. The balance, fitted where scenes overlap.
     const trueortho::BalanceMode balance =
@@ -402,7 +394,7 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     std::vector<TorthoRecoveryResult> counts(threads);
     std::vector<Worker> workers(threads);
     control.RunTiles(tiles, threads, "Occlusion recovery", [&](unsigned int thread, size_t index) {
-        Compose(composition, workers[thread], tileAt(index), control, counts[thread]);
+        Compose(composition, workers[thread], grid.Tile(tile, index), control, counts[thread]);
     });
     if (control.Stopped())
         return result;

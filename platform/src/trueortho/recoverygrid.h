@@ -93,6 +93,17 @@ struct RecoveryGrid {
     std::vector<Rect> windows;
 
     Rect Whole() const { return {0, 0, static_cast<int>(pixels), static_cast<int>(lines)}; }
+    // The grid cut into squares of `side` pixels (narrower at the right and bottom), line after
+    // line: how many, and the one at `index`.
+    std::size_t TileCount(int side) const {
+        return static_cast<std::size_t>((pixels + side - 1) / side) * ((lines + side - 1) / side);
+    }
+    Rect Tile(int side, std::size_t index) const {
+        const unsigned int across = (pixels + side - 1) / side;
+        return Rect{static_cast<int>(index % across) * side,
+                    static_cast<int>(index / across) * side, side, side}
+            .Intersect(Whole());
+    }
     // The scenes whose window meets r, in the job's order.
     std::vector<std::size_t> ScenesMeeting(const Rect& r) const;
     // Opens a raster that must lie on the grid's lattice (a mask, the regions); throws naming it.

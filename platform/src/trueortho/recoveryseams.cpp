@@ -327,8 +327,7 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
         std::vector<float> a, b;
     };
     const int side = RecoveryGrid::kBucket;
-    const unsigned int tilesX = (grid.pixels + side - 1) / side;
-    const size_t tiles = static_cast<size_t>(tilesX) * ((grid.lines + side - 1) / side);
+    const size_t tiles = grid.TileCount(side);
     struct Worker {
         SceneReader::Scratch scratch;
         std::vector<SceneTile> scenes;
@@ -339,9 +338,7 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
     control.RunTiles(tiles, static_cast<unsigned int>(workers.size()), "Colour balance",
                      [&](unsigned int thread, size_t t) {
         Worker& w = workers[thread];
-        const Rect r = Rect{static_cast<int>(t % tilesX) * side,
-                            static_cast<int>(t / tilesX) * side, side, side}
-                           .Intersect(grid.Whole());
+        const Rect r = grid.Tile(side, t);
         const std::vector<size_t> meeting = grid.ScenesMeeting(r);
         if (meeting.size() < 2)
             return;
