@@ -837,14 +837,6 @@ std::string SurfaceHoles(const Options& options, const Grid& grid) {
     return "--dem " + options.dem + text;
 }
 
-void CheckSource(const SceneInput& scene) {
-    std::unique_ptr<kestrel::datasources::IDataset> dataset(GetRasterDataset(scene.source));
-    std::vector<unsigned int> sourceChannels, orthoChannels;
-    GetSrcOrthoChans(dataset.get(), scene.channels, sourceChannels, orthoChannels);
-    std::unique_ptr<kestrel::datasources::IRasterReader> reader(
-        GetRasterReader(dataset.get(), sourceChannels));
-}
-
 Grid SceneLayout(const Options& options, const SceneInput& scene, const std::string& crs,
                  double pixelWidth, double pixelHeight, Footprint* footprint,
                  bool withUncoveredShare) {

@@ -95,10 +95,6 @@ std::unique_ptr<kestrel::dem::IElevationSource> OpenGround(
 // height"; empty for a TIN.
 std::string SurfaceHoles(const Options& options, const Grid& grid);
 
-// Opens the source raster and its channels as the generator will read them: throws when the
-// file is missing or unreadable, a channel does not exist, or the channels mix data types.
-void CheckSource(const SceneInput& scene);
-
 // The layout of a scene on its own: the grid in crs (empty: chosen for the scene) with the
 // pixel width and height (0: the source's resolution), the scene's footprint when asked for, and
 // the grid's uncoveredShare when asked for.
