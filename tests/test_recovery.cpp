@@ -491,7 +491,8 @@ TEST(RecoveryWindows, ScenesOnWindowsGiveTheMosaicOfTheScenesPaddedToTheGrid) {
 
 // A regions raster names each pixel's scene; where that scene does not see the pixel, and where
 // the raster says 0, the first-ranked scene fills it. A value that names no scene is refused,
-// naming the raster.
+// naming the raster. A tile whose pixels the named scenes see (or the mask leaves out) reads no
+// other scene.
 TEST(RecoveryRegions, TheRegionsRasterChoosesWhereItsSceneSees) {
     TempDir dir;
     std::vector<std::vector<unsigned char>> visibility;
@@ -525,6 +526,24 @@ TEST(RecoveryRegions, TheRegionsRasterChoosesWhereItsSceneSees) {
                   std::string::npos)
             << e.what();
     }
+
+    // Scene 1 sees every pixel and holds the region left of pixel 40; the mask leaves out the
+    // rest: each 16-pixel tile reads scene 1 alone, or nothing where it is all masked out.
+    std::vector<unsigned char> inside(regions.size());
+    for (size_t k = 0; k < regions.size(); ++k)
+        inside[k] = k % synthetic::kWidth < 40;
+    synthetic::WriteBand(dir.File("scene0_vis.tif"),
+                         std::vector<unsigned char>(regions.size(), VISIBILITY_SEEN));
+    synthetic::WriteBand(dir.File("regions.tif"), inside);
+    synthetic::WriteBand(dir.File("mask.tif"), inside);
+    job.maskPath = dir.File("mask.tif");
+    const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
+    ASSERT_TRUE(result.completed);
+    EXPECT_EQ(ReadBand(job.sourcePath), std::vector<double>(inside.begin(), inside.end()));
+    const unsigned long long tilesAcross = (synthetic::kWidth + 15) / 16,
+                             tilesDown = (synthetic::kHeight + 15) / 16;
+    EXPECT_EQ(result.sceneReads, (40 + 15) / 16 * tilesDown);
+    EXPECT_LT(result.sceneReads, tilesAcross * tilesDown);
 }
 
 // Two scenes of one texture t, the second exposed 1.2 t + 5, on overlapping windows: balanced,
