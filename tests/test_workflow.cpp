@@ -406,8 +406,9 @@ TEST(Workflow, SampleCityEndToEnd) {
                                         {"north_vis.tif", "COMPRESSION=DEFLATE"}}) {
         const Result scene = RunProgram("gdalinfo", {dir.File("out/" + raster)}, dir);
         EXPECT_NE(scene.out.find(shown), std::string::npos) << scene.out;
-        if (raster == "north_vis.tif")
+        if (raster == "north_vis.tif") {
             EXPECT_EQ(scene.out.find("PREDICTOR="), std::string::npos) << scene.out;
+        }
     }
     // Quicklooks lie where their rasters do (world files); the source raster's has a legend,
     // beside it and in the summary, whose value k names scene k.
