@@ -262,14 +262,14 @@ struct Window {
     int x = 0, y = 0, width = kWidth, height = kHeight;
 };
 
-// Writes the window of a one-band Byte raster on the common grid as a GeoTIFF of its own,
-// origin `shift` pixels off the grid's lattice.
+// Writes the window of a one-band raster (Byte unless said) on the common grid as a GeoTIFF of
+// its own, origin `shift` pixels off the grid's lattice.
 void WriteBand(const std::string& path, const std::vector<unsigned char>& values,
-               const Window& w = Window(), double shift = 0) {
+               const Window& w = Window(), double shift = 0, GDALDataType type = GDT_Byte) {
     GDALAllRegister();
     GDALDriver* gtiff = GetGDALDriverManager()->GetDriverByName("GTiff");
     std::unique_ptr<GDALDataset> ds(
-        gtiff->Create(path.c_str(), w.width, w.height, 1, GDT_Byte, nullptr));
+        gtiff->Create(path.c_str(), w.width, w.height, 1, type, nullptr));
     const double gt[6] = {kLeft + (w.x + shift) * kPixel, kPixel, 0, kTop - w.y * kPixel, 0,
                           -kPixel};
     ds->SetGeoTransform(const_cast<double*>(gt));
@@ -352,16 +352,19 @@ std::vector<double> ExpectedSource(const RecoveryJob& job,
 
 // The choice rules at every pixel: seen clearly (the pixel-error neighbourhood, across tile
 // borders, for errors from none to far beyond the grid, whose cost per pixel once grew with the
-// square of the error, and scenes whose errors differ), then the radiometric level, then order.
+// square of the error, and scenes whose errors differ), then the radiometric level, then order;
+// visibility indexes of another type than Byte read alike.
 TEST(RecoveryChoice, PixelErrorNeighbourhoodMatchesTheRuleAtEveryPixel) {
     const struct {
         std::vector<int> errors;
         double hidden;
-    } cases[] = {{{0, 0, 0}, 0.05},
-                 {{1, 1, 1}, 0.02},
-                 {{3, 0, 2}, 0.01},
-                 {{17, 5, 40}, 0.002},
-                 {{1000, 1000}, 0.0005}};
+        GDALDataType visibilityType;
+    } cases[] = {{{0, 0, 0}, 0.05, GDT_Byte},
+                 {{1, 1, 1}, 0.02, GDT_Byte},
+                 {{3, 0, 2}, 0.01, GDT_Byte},
+                 {{3, 0, 2}, 0.1, GDT_Float32},
+                 {{17, 5, 40}, 0.002, GDT_Byte},
+                 {{1000, 1000}, 0.0005, GDT_Byte}};
     unsigned seed = 1;
     for (const auto& c : cases) {
         SCOPED_TRACE(::testing::Message() << "errors " << c.errors[0] << ", hidden " << c.hidden);
@@ -369,8 +372,12 @@ TEST(RecoveryChoice, PixelErrorNeighbourhoodMatchesTheRuleAtEveryPixel) {
         std::vector<std::vector<unsigned char>> visibility;
         RecoveryJob job = synthetic::MakeScenes(dir, static_cast<int>(c.errors.size()), c.hidden,
                                                 seed++, visibility);
-        for (size_t s = 0; s < job.scenes.size(); ++s)
+        for (size_t s = 0; s < job.scenes.size(); ++s) {
             job.scenes[s].dbmPixelError = c.errors[s];
+            if (c.visibilityType != GDT_Byte)
+                synthetic::WriteBand(job.scenes[s].visibilityPath, visibility[s],
+                                     synthetic::Window(), 0, c.visibilityType);
+        }
         const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
         ASSERT_TRUE(result.completed);
         const auto expected = synthetic::ExpectedSource(job, visibility);
@@ -491,7 +498,8 @@ TEST(RecoveryWindows, ScenesOnWindowsGiveTheMosaicOfTheScenesPaddedToTheGrid) {
 
 // A regions raster names each pixel's scene; where that scene does not see the pixel, and where
 // the raster says 0, the first-ranked scene fills it. A value that names no scene is refused,
-// naming the raster.
+// naming the raster. A tile whose pixels the named scenes see (or the mask leaves out) reads no
+// other scene.
 TEST(RecoveryRegions, TheRegionsRasterChoosesWhereItsSceneSees) {
     TempDir dir;
     std::vector<std::vector<unsigned char>> visibility;
@@ -525,6 +533,24 @@ TEST(RecoveryRegions, TheRegionsRasterChoosesWhereItsSceneSees) {
                   std::string::npos)
             << e.what();
     }
+
+    // Scene 1 sees every pixel and holds the region left of pixel 40; the mask leaves out the
+    // rest: each 16-pixel tile reads scene 1 alone, or nothing where it is all masked out.
+    std::vector<unsigned char> inside(regions.size());
+    for (size_t k = 0; k < regions.size(); ++k)
+        inside[k] = k % synthetic::kWidth < 40;
+    synthetic::WriteBand(dir.File("scene0_vis.tif"),
+                         std::vector<unsigned char>(regions.size(), VISIBILITY_SEEN));
+    synthetic::WriteBand(dir.File("regions.tif"), inside);
+    synthetic::WriteBand(dir.File("mask.tif"), inside);
+    job.maskPath = dir.File("mask.tif");
+    const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
+    ASSERT_TRUE(result.completed);
+    EXPECT_EQ(ReadBand(job.sourcePath), std::vector<double>(inside.begin(), inside.end()));
+    const unsigned long long tilesAcross = (synthetic::kWidth + 15) / 16,
+                             tilesDown = (synthetic::kHeight + 15) / 16;
+    EXPECT_EQ(result.sceneReads, (40 + 15) / 16 * tilesDown);
+    EXPECT_LT(result.sceneReads, tilesAcross * tilesDown);
 }
 
 // Two scenes of one texture t, the second exposed 1.2 t + 5, on overlapping windows: balanced,

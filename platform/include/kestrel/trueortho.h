@@ -246,7 +246,9 @@ struct TorthoRecoveryResult {
     bool completed = false;
     unsigned long long filled = 0;    // pixels that came from a scene
     unsigned long long unfilled = 0;  // pixels that no scene sees
-    // Scene tiles the composition read: the mosaic's tiles times the scenes meeting each.
+    // Scene tiles the composition read: per tile of the mosaic, the scenes meeting it (with a
+    // regions raster, only those it names, and the others where a pixel that no named scene
+    // sees lies on their rasters).
     unsigned long long sceneReads = 0;
     // The balance applied, per scene and channel: value * gain + offset.
     std::vector<std::vector<double>> gain, offset;

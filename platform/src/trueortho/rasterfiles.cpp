@@ -32,8 +32,8 @@ DatasetPtr OpenRaster(const std::string& path, const char* role) {
     return ds;
 }
 
-void ReadWindow(GDALDataset& ds, const std::string& path, const std::vector<int>& bands, int x,
-                int y, int width, int height, float* buffer) {
+void ReadWindow(GDALDataset& ds, const std::string& path, const int* bands, int count, int x,
+                int y, int width, int height, GDALDataType type, void* buffer) {
     // Only the part inside the raster is read.
     const int x0 = std::max(x, 0), y0 = std::max(y, 0);
     const int x1 = std::min(x + width, ds.GetRasterXSize());
@@ -41,11 +41,12 @@ void ReadWindow(GDALDataset& ds, const std::string& path, const std::vector<int>
     if (x1 <= x0 || y1 <= y0)
         return;
     gdalsupport::ErrorCapture errors;
-    const GSpacing pixel = sizeof(float), line = pixel * width, band = line * height;
-    float* start = buffer + (y0 - y) * static_cast<std::ptrdiff_t>(width) + (x0 - x);
-    if (ds.RasterIO(GF_Read, x0, y0, x1 - x0, y1 - y0, start, x1 - x0, y1 - y0, GDT_Float32,
-                    static_cast<int>(bands.size()), const_cast<int*>(bands.data()), pixel, line,
-                    band, nullptr) != CE_None)
+    const GSpacing pixel = GDALGetDataTypeSizeBytes(type), line = pixel * width,
+                   band = line * height;
+    char* start = static_cast<char*>(buffer) +
+                  ((y0 - y) * static_cast<std::ptrdiff_t>(width) + (x0 - x)) * pixel;
+    if (ds.RasterIO(GF_Read, x0, y0, x1 - x0, y1 - y0, start, x1 - x0, y1 - y0, type, count,
+                    const_cast<int*>(bands), pixel, line, band, nullptr) != CE_None)
         KESTREL_THROW(
             FileAccessException, path, FileAccessException::ReadFailed,
             FormatString("Reading %s at pixel %d, line %d (%d x %d) failed: %s", path.c_str(), x0,

@@ -2,6 +2,8 @@
 // raster writer.
 #pragma once
 
+#include <gdal.h>
+
 #include <memory>
 #include <string>
 #include <vector>
@@ -21,10 +23,15 @@ using DatasetPtr = std::unique_ptr<GDALDataset, DatasetCloser>;
 // and GDAL's reason.
 DatasetPtr OpenRaster(const std::string& path, const char* role);
 
-// Reads a window of the listed bands as Float32, band after band; parts of the window outside
-// the raster are left as they are in the buffer.
-void ReadWindow(GDALDataset& ds, const std::string& path, const std::vector<int>& bands, int x,
-                int y, int width, int height, float* buffer);
+// Reads a window of `count` bands as `type`, band after band; parts of the window outside the
+// raster are left as they are in the buffer.
+void ReadWindow(GDALDataset& ds, const std::string& path, const int* bands, int count, int x,
+                int y, int width, int height, GDALDataType type, void* buffer);
+inline void ReadWindow(GDALDataset& ds, const std::string& path, const std::vector<int>& bands,
+                       int x, int y, int width, int height, float* buffer) {
+    ReadWindow(ds, path, bands.data(), static_cast<int>(bands.size()), x, y, width, height,
+               GDT_Float32, buffer);
+}
 
 }  // namespace trueortho
 }  // namespace processes

@@ -49,6 +49,8 @@ struct Worker {
     std::vector<SceneTile> scenes;
     std::vector<int> sceneSlot;  // per job scene: its index among the tile's scenes, or -1
     std::vector<int> slot;       // per tile scene: its index among those holding a region
+    std::vector<size_t> named;   // the scenes the regions raster names in the tile
+    std::vector<Rect> others;    // the rasters of the other scenes meeting the tile, on it
     std::vector<float> regions, mask, blended;
     std::vector<unsigned char> clear;  // per pixel: some scene of the blend sees it clearly
     trueortho::BlendTile blend;
@@ -96,32 +98,41 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
     const Rect r = t.Grown(c.border);
     const size_t size = r.Size();
     const std::vector<size_t> meeting = c.grid.ScenesMeeting(r);
-    counts.sceneReads += meeting.size();
     // The viewing angles only rank scenes where no region is given: read when needed.
     const bool angles = c.regions == nullptr;
-    size_t n = 0;
-    for (const size_t s : meeting) {
-        if (control.Stopped())
-            return;
+    size_t n = 0;  // the tile's scenes that see some pixel of it, w.scenes[0] to [n - 1]
+    const auto read = [&](size_t s) {
         if (w.scenes.size() <= n)
             w.scenes.emplace_back();
+        ++counts.sceneReads;
         n += c.reader.Read(s, r, false, angles, w.scratch, w.scenes[n]) ? 1 : 0;
+    };
+    if (c.mask != nullptr) {
+        // Outside the mask (and outside its raster) the pixels stay empty.
+        w.mask.assign(size, 0.0f);
+        c.mask->Read(r, w.mask.data());
     }
 
     // Regions: the raster's scene where it sees the pixel, else the first ranked.
     std::vector<int>& labels = w.blend.labels;
     labels.assign(size, -1);
-    if (c.regions != nullptr) {
-        // Set for the tile's scenes only, and reset after, so that a tile costs nothing per
-        // scene of the job.
-        w.sceneSlot.resize(job.scenes.size(), -1);
-        for (size_t k = 0; k < n; ++k)
-            w.sceneSlot[w.scenes[k].scene] = static_cast<int>(k);
+    if (c.regions == nullptr) {
+        for (const size_t s : meeting) {
+            if (control.Stopped())
+                return;
+            read(s);
+        }
+    } else {
         w.regions.assign(size, 0.0f);
-        c.regions->Read({1}, r, w.regions.data());
+        c.regions->Read(r, w.regions.data());
+        // The scenes the regions name here (regions are large, so a value is mostly the one
+        // before it).
+        std::vector<size_t>& named = w.named;
+        named.clear();
+        float previous = 0;
         for (size_t p = 0; p < size; ++p) {
             const float v = w.regions[p];
-            if (v == 0)
+            if (v == 0 || v == previous)
                 continue;
             if (!(v >= 1 && v <= job.scenes.size() && v == std::floor(v)))
                 KESTREL_THROW(DataException,
@@ -132,12 +143,68 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
                                            r.x + static_cast<int>(p % r.width),
                                            r.y + static_cast<int>(p / r.width),
                                            job.scenes.size()));
-            const int k = w.sceneSlot[static_cast<size_t>(v) - 1];
-            if (k >= 0 && w.scenes[k].state[p] != trueortho::kNotSeen)
-                labels[p] = k;
+            previous = v;
+            if (std::find(named.begin(), named.end(), static_cast<size_t>(v) - 1) == named.end())
+                named.push_back(static_cast<size_t>(v) - 1);
         }
-        for (size_t k = 0; k < n; ++k)
-            w.sceneSlot[w.scenes[k].scene] = -1;
+        std::sort(named.begin(), named.end());
+        // Set for the tile's scenes only, and reset after, so that a tile costs nothing per
+        // scene of the job.
+        const auto labelRegions = [&] {
+            w.sceneSlot.resize(job.scenes.size(), -1);
+            for (size_t k = 0; k < n; ++k)
+                w.sceneSlot[w.scenes[k].scene] = static_cast<int>(k);
+            for (size_t p = 0; p < size; ++p) {
+                const float v = w.regions[p];
+                if (v == 0)
+                    continue;
+                const int k = w.sceneSlot[static_cast<size_t>(v) - 1];
+                if (k >= 0 && w.scenes[k].state[p] != trueortho::kNotSeen)
+                    labels[p] = k;
+            }
+            for (size_t k = 0; k < n; ++k)
+                w.sceneSlot[w.scenes[k].scene] = -1;
+        };
+        // The regions' scenes first: the other scenes weigh in only at pixels that no region's
+        // scene sees, so they are read only when such a pixel (not masked out) lies on one of
+        // their rasters.
+        std::vector<Rect>& others = w.others;
+        others.clear();
+        for (const size_t s : meeting) {
+            if (control.Stopped())
+                return;
+            if (std::binary_search(named.begin(), named.end(), s))
+                read(s);
+            else
+                others.push_back(c.grid.visibilities[s]->window.Intersect(r));
+        }
+        labelRegions();
+        bool needed = false;
+        for (const Rect& o : others) {
+            for (int j = o.y - r.y; j < o.y - r.y + o.height && !needed; ++j)
+                for (int i = o.x - r.x; i < o.x - r.x + o.width && !needed; ++i) {
+                    const size_t p = static_cast<size_t>(j) * r.width + i;
+                    needed = labels[p] < 0 && (c.mask == nullptr || w.mask[p] != 0);
+                }
+            if (needed)
+                break;
+        }
+        if (needed) {
+            const size_t first = n;
+            for (const size_t s : meeting) {
+                if (control.Stopped())
+                    return;
+                if (!std::binary_search(named.begin(), named.end(), s))
+                    read(s);
+            }
+            if (n > first) {
+                // Back in the job's order, which breaks ties in the ranking and orders the blend.
+                std::sort(w.scenes.begin(), w.scenes.begin() + static_cast<std::ptrdiff_t>(n),
+                          [](const SceneTile& a, const SceneTile& b) { return a.scene < b.scene; });
+                labels.assign(size, -1);
+                labelRegions();
+            }
+        }
     }
     bool ranked = angles;
     for (size_t p = 0; p < size; ++p) {
@@ -156,14 +223,10 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
         }
         labels[p] = FirstRanked(job, w.scenes, n, p);
     }
-    if (c.mask != nullptr) {
-        // Outside the mask (and outside its raster) the pixels stay empty.
-        w.mask.assign(size, 0.0f);
-        c.mask->Read({1}, r, w.mask.data());
+    if (c.mask != nullptr)
         for (size_t p = 0; p < size; ++p)
             if (w.mask[p] == 0)
                 labels[p] = -1;
-    }
 
     // The scenes that hold a region here (the others weigh nothing in the blend): their
     // values, balanced.

@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <cmath>
+#include <cstring>
 
 namespace kestrel {
 namespace processes {
@@ -115,8 +116,8 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
 
 // Sizes a buffer of `planes` planes over r for a raster lying at `window`, filled with `outside`
 // only where the raster does not cover r (the read overwrites the rest).
-void Prepare(std::vector<float>& buffer, const Rect& r, const Rect& window, int planes,
-             float outside) {
+template <typename T>
+void Prepare(std::vector<T>& buffer, const Rect& r, const Rect& window, int planes, T outside) {
     const std::size_t size = r.Size() * static_cast<std::size_t>(planes);
     if (r.Intersect(window).Size() == r.Size())
         buffer.resize(size);
@@ -132,7 +133,8 @@ Rect Rect::Intersect(const Rect& o) const {
     return {x0, y0, std::max(0, x1 - x0), std::max(0, y1 - y0)};
 }
 
-void SharedRaster::Read(const std::vector<int>& bands, const Rect& r, float* buffer) {
+void SharedRaster::Read(const int* bands, int count, const Rect& r, GDALDataType bufferType,
+                        void* buffer) {
     if (r.Intersect(window).Empty())
         return;
     std::lock_guard<std::mutex> lock(mutex);
@@ -147,7 +149,8 @@ void SharedRaster::Read(const std::vector<int>& bands, const Rect& r, float* buf
     }
     if (pool != nullptr)
         pool->Touch(*this);
-    ReadWindow(*dataset, path, bands, r.x - window.x, r.y - window.y, r.width, r.height, buffer);
+    ReadWindow(*dataset, path, bands, count, r.x - window.x, r.y - window.y, r.width, r.height,
+               bufferType, buffer);
 }
 
 void RasterPool::Touch(SharedRaster& raster) {
@@ -287,6 +290,8 @@ RecoveryGrid InspectScenes(const RecoveryJob& job) {
                              "does not match its ortho %s (%d x %d)",
                              scene.visibilityPath.c_str(), visibility.GetRasterXSize(),
                              visibility.GetRasterYSize(), scene.orthoPath.c_str(), pixels, lines));
+        if (GDALRasterBand* band = visibility.GetRasterBand(1))
+            visibilityFile.type = band->GetRasterDataType();
         raw.push_back(window);
         // Opened again when read.
         orthoFile.dataset.reset(), visibilityFile.dataset.reset();
@@ -342,7 +347,10 @@ RecoveryGrid InspectScenes(const RecoveryJob& job) {
     return grid;
 }
 
-SceneReader::SceneReader(const RecoveryJob& job, const RecoveryGrid& grid) : job_(job), grid_(grid) {
+SceneReader::SceneReader(const RecoveryJob& job, const RecoveryGrid& grid)
+    : job_(job), grid_(grid), bands_(grid.bands) {
+    for (int b = 0; b < grid.bands; ++b)
+        bands_[b] = b + 1;
     toModel_.resize(job.scenes.size());
     for (size_t s = 0; s < job.scenes.size(); ++s) {
         const mathmodel::IMathModel* model = job.scenes[s].model;
@@ -357,23 +365,36 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
                        SceneTile& out) const {
     const int e = job_.scenes[s].dbmPixelError;
     const Rect border = r.Grown(e);
-    Prepare(scratch.visibility, border, grid_.visibilities[s]->window, 1, VISIBILITY_OUTSIDE);
-    grid_.visibilities[s]->Read({1}, border, scratch.visibility.data());
+    SharedRaster& file = *grid_.visibilities[s];
+    std::vector<unsigned char>& vis = scratch.visibility;
+    const unsigned char outside = VISIBILITY_OUTSIDE;
+    Prepare(vis, border, file.window, 1, outside);
+    if (file.type == GDT_Byte) {
+        file.Read(&SharedRaster::kFirstBand, 1, border, GDT_Byte, vis.data());
+    } else {
+        // Any other type: the values that are exactly seen or hidden, the rest outside.
+        Prepare(scratch.values, border, file.window, 1, static_cast<float>(outside));
+        file.Read(border, scratch.values.data());
+        for (size_t k = 0; k < vis.size(); ++k) {
+            const float v = scratch.values[k];
+            vis[k] = static_cast<unsigned char>(v == VISIBILITY_SEEN     ? VISIBILITY_SEEN
+                                                : v == VISIBILITY_HIDDEN ? VISIBILITY_HIDDEN
+                                                                         : VISIBILITY_OUTSIDE);
+        }
+    }
     out.scene = s;
     bool seesAny = false;
-    for (int j = 0; j < r.height && !seesAny; ++j) {
-        const float* line = scratch.visibility.data() + static_cast<size_t>(j + e) * border.width + e;
-        for (int i = 0; i < r.width && !seesAny; ++i)
-            seesAny = line[i] == VISIBILITY_SEEN;
-    }
+    for (int j = 0; j < r.height && !seesAny; ++j)
+        seesAny = std::memchr(vis.data() + static_cast<size_t>(j + e) * border.width + e,
+                              VISIBILITY_SEEN, static_cast<size_t>(r.width)) != nullptr;
     if (!seesAny)
         return false;
-    MarkNearHidden(scratch.visibility, r.width, r.height, e, scratch.counts, out.state);
+    MarkNearHidden(vis.data(), r.width, r.height, e, scratch, out.state);
     for (int j = 0; j < r.height; ++j) {
-        const float* line = scratch.visibility.data() + static_cast<size_t>(j + e) * border.width + e;
+        const unsigned char* line = vis.data() + static_cast<size_t>(j + e) * border.width + e;
         unsigned char* state = out.state.data() + static_cast<size_t>(j) * r.width;
-        for (int i = 0; i < r.width; ++i)
-            state[i] = line[i] != VISIBILITY_SEEN ? kNotSeen : state[i] ? kUnclear : kClear;
+        for (int i = 0; i < r.width; ++i)  // kNotSeen, kClear or kUnclear
+            state[i] = static_cast<unsigned char>((line[i] == VISIBILITY_SEEN) * (1 + state[i]));
     }
     if (values)
         ReadValues(s, r, out.values);
@@ -391,48 +412,49 @@ void SceneReader::ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) co
 }
 
 void SceneReader::ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const {
-    std::vector<int> bands(grid_.bands);
-    for (int b = 0; b < grid_.bands; ++b)
-        bands[b] = b + 1;
     Prepare(values, r, grid_.orthos[s]->window, grid_.bands, static_cast<float>(grid_.noData));
-    grid_.orthos[s]->Read(bands, r, values.data());
+    grid_.orthos[s]->Read(bands_.data(), grid_.bands, r, GDT_Float32, values.data());
 }
 
-// Counts of hidden pixels slide along each row and then down each column, so the cost per pixel
-// does not depend on e.
-void MarkNearHidden(const std::vector<float>& vis, int tw, int th, int e,
-                    std::vector<int>& rowCounts, std::vector<unsigned char>& near) {
-    const int span = 2 * e + 1, vw = tw + 2 * e, vh = th + 2 * e;
-    auto hidden = [](float v) { return v == VISIBILITY_HIDDEN ? 1 : 0; };
-    // rowCounts[r * tw + i]: hidden pixels of border row r in columns i to i + 2e.
-    rowCounts.assign(static_cast<size_t>(vh) * tw, 0);
-    for (int r = 0; r < vh; ++r) {
-        const float* line = vis.data() + static_cast<size_t>(r) * vw;
-        int* counts = rowCounts.data() + static_cast<size_t>(r) * tw;
-        int count = 0;
-        for (int c = 0; c < span - 1; ++c)
-            count += hidden(line[c]);
-        for (int i = 0; i < tw; ++i) {
-            count += hidden(line[i + span - 1]);
-            counts[i] = count;
-            count -= hidden(line[i]);
-        }
-    }
-    // Then over rows j to j + 2e of those counts.
-    std::vector<int> column(tw, 0);
-    for (int r = 0; r < span - 1; ++r)
-        for (int i = 0; i < tw; ++i)
-            column[i] += rowCounts[static_cast<size_t>(r) * tw + i];
+// The square neighbourhood is a dilation along each row, then down each column. Along a row,
+// each hidden pixel marks the 2e + 1 outputs that reach it, each output written once; down the
+// columns, each output looks at the last row that marked its column. Rows and windows without
+// a hidden pixel cost a scan for one.
+void MarkNearHidden(const unsigned char* vis, int tw, int th, int e, SceneReader::Scratch& scratch,
+                    std::vector<unsigned char>& near) {
+    const int vw = tw + 2 * e, vh = th + 2 * e;
     near.assign(static_cast<size_t>(tw) * th, 0);
-    for (int j = 0; j < th; ++j) {
-        const int* entering = rowCounts.data() + static_cast<size_t>(j + span - 1) * tw;
-        const int* leaving = rowCounts.data() + static_cast<size_t>(j) * tw;
-        unsigned char* out = near.data() + static_cast<size_t>(j) * tw;
-        for (int i = 0; i < tw; ++i) {
-            column[i] += entering[i];
-            out[i] = column[i] > 0;
-            column[i] -= leaving[i];
+    if (std::memchr(vis, VISIBILITY_HIDDEN, static_cast<size_t>(vw) * vh) == nullptr)
+        return;
+    std::vector<unsigned char>& row = scratch.row;  // the outputs of one border row
+    std::vector<int>& last = scratch.last;          // per column, the last border row marking it
+    row.resize(tw);
+    last.assign(tw, -1);
+    int latest = -1;  // the last border row marking any column
+    for (int r = 0; r < vh; ++r) {
+        const unsigned char* line = vis + static_cast<size_t>(r) * vw;
+        const void* hidden = std::memchr(line, VISIBILITY_HIDDEN, static_cast<size_t>(vw));
+        if (hidden != nullptr) {
+            std::fill(row.begin(), row.end(), 0);
+            int filled = 0;  // outputs before this one are written
+            for (const unsigned char* p = static_cast<const unsigned char*>(hidden); p != nullptr;
+                 p = static_cast<const unsigned char*>(std::memchr(
+                     p + 1, VISIBILITY_HIDDEN, static_cast<size_t>(line + vw - p - 1)))) {
+                const int c = static_cast<int>(p - line);
+                const int lo = std::max(filled, c - 2 * e), hi = std::min(tw, c + 1);
+                if (hi > lo)
+                    std::fill(row.begin() + lo, row.begin() + hi, 1), filled = hi;
+            }
+            for (int i = 0; i < tw; ++i)
+                last[i] = row[i] ? r : last[i];
+            latest = r;
         }
+        const int j = r - 2 * e;  // the output row whose neighbourhood ends here
+        if (j < 0 || latest < j)
+            continue;
+        unsigned char* out = near.data() + static_cast<size_t>(j) * tw;
+        for (int i = 0; i < tw; ++i)
+            out[i] = last[i] >= j;
     }
 }
 

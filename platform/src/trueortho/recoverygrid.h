@@ -48,9 +48,13 @@ struct SharedRaster {
     RasterPool* pool = nullptr;  // null: stays open
     std::mutex mutex;
     DatasetPtr dataset;  // while open
-    // Reads bands over `r` (mosaic pixels) into buffer (r.width x r.height per band); parts
-    // outside the raster keep what the buffer holds.
-    void Read(const std::vector<int>& bands, const Rect& r, float* buffer);
+    GDALDataType type = GDT_Float32;  // of its first band
+    // Reads `count` bands over `r` (mosaic pixels) as `bufferType` into buffer (r.width x
+    // r.height per band); parts outside the raster keep what the buffer holds.
+    void Read(const int* bands, int count, const Rect& r, GDALDataType bufferType, void* buffer);
+    // The first band as Float32.
+    void Read(const Rect& r, float* buffer) { Read(&kFirstBand, 1, r, GDT_Float32, buffer); }
+    static constexpr int kFirstBand = 1;
 
   private:
     friend class RasterPool;
@@ -138,8 +142,12 @@ constexpr float kUnknownAngle = std::numeric_limits<float>::infinity();
 class SceneReader {
   public:
     struct Scratch {
-        std::vector<float> visibility;
-        std::vector<int> counts;
+        // The visibility index over the read with its border: VISIBILITY_SEEN, VISIBILITY_HIDDEN
+        // or another value (a raster of another type than Byte is read into `values` first).
+        std::vector<unsigned char> visibility;
+        std::vector<float> values;
+        std::vector<unsigned char> row;  // MarkNearHidden's
+        std::vector<int> last;
         std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;
     };
     SceneReader(const RecoveryJob& job, const RecoveryGrid& grid);
@@ -155,13 +163,14 @@ class SceneReader {
   private:
     const RecoveryJob& job_;
     const RecoveryGrid& grid_;
+    std::vector<int> bands_;  // 1 to the grid's band count
     std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel_;
 };
 
-// Marks the pixels of a w x h rectangle that have a hidden pixel within e pixels (a square
-// neighbourhood); `vis` is the rectangle with a border of e pixels.
-void MarkNearHidden(const std::vector<float>& vis, int w, int h, int e,
-                    std::vector<int>& rowCounts, std::vector<unsigned char>& near);
+// Marks (1, else 0) the pixels of a w x h rectangle that have a VISIBILITY_HIDDEN pixel within
+// e pixels (a square neighbourhood); `vis` is the rectangle with a border of e pixels.
+void MarkNearHidden(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
+                    std::vector<unsigned char>& near);
 
 // Values as the mosaic's data type holds them: rounded and clamped for integer types.
 class ValueRange {
