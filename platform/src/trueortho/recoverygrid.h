@@ -178,16 +178,28 @@ class ValueRange {
     explicit ValueRange(GDALDataType type = GDT_Float32);
     float operator()(double v) const {
         if (integer_)
-            v = std::round(v);
+            v = Round(v);
         return static_cast<float>(std::min(hi_, std::max(lo_, v)));
     }
     // A value that is not `noData`, the nearest one inside the range when it is.
-    float Besides(float v, double noData) const;
+    float Besides(float v, double noData) const {
+        return v != static_cast<float>(noData) ? v : Beside(noData);
+    }
     // True for a value at either end of an integer type's range: a clipped (saturated) value
     // says nothing of the scene's exposure.
     bool Clipped(float v) const { return integer_ && (v <= lo_ || v >= hi_); }
 
   private:
+    // std::round (halves away from zero) without the library call: below 2^52 the fraction
+    // v - trunc(v) is exact.
+    static double Round(double v) {
+        if (!(std::fabs(v) < 4503599627370496.0))
+            return std::round(v);  // whole already, or NaN
+        const double whole = static_cast<double>(static_cast<long long>(v));
+        return std::fabs(v - whole) >= 0.5 ? whole + (v < 0 ? -1.0 : 1.0) : whole;
+    }
+    float Beside(double noData) const;
+
     bool integer_;
     double lo_, hi_;
 };

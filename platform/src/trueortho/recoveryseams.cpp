@@ -287,9 +287,7 @@ ValueRange::ValueRange(GDALDataType type) : integer_(GDALDataTypeIsInteger(type)
     hi_ = GDALAdjustValueToDataType(type, 1e300, nullptr, nullptr);
 }
 
-float ValueRange::Besides(float v, double noData) const {
-    if (v != static_cast<float>(noData))
-        return v;
+float ValueRange::Beside(double noData) const {
     const double step = integer_ ? 1.0 : std::max(1e-6, std::fabs(noData) * 1e-6);
     return static_cast<float>(noData + step <= hi_ ? noData + step : noData - step);
 }
