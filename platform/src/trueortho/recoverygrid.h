@@ -108,6 +108,16 @@ struct RecoveryGrid {
                     static_cast<int>(index / across) * side, side, side}
             .Intersect(Whole());
     }
+    // The index of the tile to take `q`-th: tiles in bands of kBandRows lines of tiles, column
+    // after column within a band. A scene's blocks straddle tile edges; taken line after line,
+    // a whole line of tiles came between a block's reads, and GDAL's block cache had let it go.
+    static constexpr std::size_t kBandRows = 4;
+    std::size_t InBands(int side, std::size_t q) const {
+        const std::size_t across = (pixels + side - 1) / side, down = (lines + side - 1) / side;
+        const std::size_t first = q / (across * kBandRows) * kBandRows;
+        const std::size_t rows = std::min(kBandRows, down - first), within = q - first * across;
+        return (first + within % rows) * across + within / rows;
+    }
     // The scenes whose window meets r, in the job's order.
     std::vector<std::size_t> ScenesMeeting(const Rect& r) const;
     // Opens a raster that must lie on the grid's lattice (a mask, the regions); throws naming it.

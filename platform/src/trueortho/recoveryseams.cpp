@@ -334,8 +334,9 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
     std::vector<Worker> workers(std::max(1u, threads));
     const ValueRange range(grid.type);
     control.RunTiles(tiles, static_cast<unsigned int>(workers.size()), "Colour balance",
-                     [&](unsigned int thread, size_t t) {
+                     [&](unsigned int thread, size_t q) {
         Worker& w = workers[thread];
+        const size_t t = grid.InBands(side, q);
         const Rect r = grid.Tile(side, t);
         const std::vector<size_t> meeting = grid.ScenesMeeting(r);
         if (meeting.size() < 2)
