@@ -102,6 +102,9 @@ CPLStringList DefaultCreationOptions(const std::string& format, DataType type) {
         options.SetNameValue("PREDICTOR", "YES");
         options.SetNameValue("OVERVIEW_RESAMPLING", "AVERAGE");
         options.SetNameValue("BIGTIFF", "IF_SAFER");
+        // Deflate level 5 rather than GDAL's 6: on aerial mosaics level 6 takes twice the time
+        // (about a tenth of the mosaic step) for files some 8 % smaller.
+        options.SetNameValue("LEVEL", "5");
     } else if (format == "GTiff") {
         options.SetNameValue("TILED", "YES");
         options.SetNameValue("BLOCKXSIZE", "256");
@@ -125,10 +128,12 @@ std::vector<std::string> SplitOptions(const std::string& text) {
 }
 
 // The options of text added to (and overriding) the defaults. A compression given without a
-// predictor drops the default predictor unless it is one that takes it.
+// predictor drops the default predictor unless it is one that takes it; one given without a
+// level drops the default (DEFLATE's) level unless it is DEFLATE.
 void AddOptions(CPLStringList& options, const std::string& text) {
     bool compress = false;
     bool predictor = false;
+    bool level = false;
     for (const std::string& option : SplitOptions(text)) {
         char* key = nullptr;
         const char* value = CPLParseNameValue(option.c_str(), &key);
@@ -136,6 +141,7 @@ void AddOptions(CPLStringList& options, const std::string& text) {
             options.SetNameValue(key, value);
             compress = compress || EQUAL(key, "COMPRESS");
             predictor = predictor || EQUAL(key, "PREDICTOR");
+            level = level || EQUAL(key, "LEVEL");
         }
         CPLFree(key);
     }
@@ -143,6 +149,8 @@ void AddOptions(CPLStringList& options, const std::string& text) {
     if (compress && !predictor && method != nullptr && !EQUAL(method, "DEFLATE") &&
         !EQUAL(method, "LZW") && !EQUAL(method, "ZSTD"))
         options.SetNameValue("PREDICTOR", nullptr);
+    if (compress && !level && method != nullptr && !EQUAL(method, "DEFLATE"))
+        options.SetNameValue("LEVEL", nullptr);
 }
 
 bool IsDirectory(const std::string& path) {

@@ -2,8 +2,11 @@
 // in the Cartesian (geocentric) frame of its ground CRS's datum.
 #include <algorithm>
 #include <cmath>
+#include <map>
 #include <memory>
 #include <mutex>
+#include <string>
+#include <utility>
 #include <vector>
 
 #include <ogr_spatialref.h>
@@ -45,11 +48,42 @@ Matrix EastNorthUp(double lon, double lat) {
     return {-sl, cl, 0, -sp * cl, -sp * sl, cp, cp * cl, cp * sl, sp};
 }
 
+// A PROJ transformation between two CRSs, made once in the process and copied from there:
+// making one searches PROJ's database (some milliseconds), and a survey's cameras all share
+// their CRSs. Copies are taken under the entry's lock.
+struct SharedTransformation {
+    explicit SharedTransformation(const ogc::cs::ICRS& from, const ogc::cs::ICRS& to)
+        : prototype(from, to) {}
+    ogc::cs::CoordinateTransformation prototype;
+    std::mutex mutex;
+};
+
+std::shared_ptr<SharedTransformation> FindTransformation(const ogc::cs::ICRS& from,
+                                                         const ogc::cs::ICRS& to) {
+    // Never destroyed: PROJ may be gone when the process's statics are.
+    static std::mutex& mutex = *new std::mutex;
+    static auto& made =
+        *new std::map<std::pair<std::string, std::string>, std::shared_ptr<SharedTransformation>>;
+    const std::pair<std::string, std::string> key(from.GetWKT(), to.GetWKT());
+    std::lock_guard<std::mutex> lock(mutex);
+    std::shared_ptr<SharedTransformation>& entry = made[key];
+    if (!entry) {
+        try {
+            entry = std::make_shared<SharedTransformation>(from, to);
+        } catch (...) {
+            made.erase(key);
+            throw;
+        }
+    }
+    return entry;
+}
+
 // PROJ transformations of one pair of CRSs, handed out one per calling thread at a time: the
 // model's const operations may run on several threads, PROJ's objects may not.
 class TransformPool {
   public:
-    TransformPool(const ogc::cs::ICRS& from, const ogc::cs::ICRS& to) : prototype_(from, to) {}
+    TransformPool(const ogc::cs::ICRS& from, const ogc::cs::ICRS& to)
+        : shared_(FindTransformation(from, to)) {}
 
     class Lease {
       public:
@@ -69,16 +103,21 @@ class TransformPool {
     };
 
     Lease Take() {
-        std::lock_guard<std::mutex> lock(mutex_);
-        if (free_.empty())
-            return Lease(*this, std::make_unique<ogc::cs::CoordinateTransformation>(prototype_));
-        auto t = std::move(free_.back());
-        free_.pop_back();
-        return Lease(*this, std::move(t));
+        {
+            std::lock_guard<std::mutex> lock(mutex_);
+            if (!free_.empty()) {
+                auto t = std::move(free_.back());
+                free_.pop_back();
+                return Lease(*this, std::move(t));
+            }
+        }
+        std::lock_guard<std::mutex> lock(shared_->mutex);
+        return Lease(*this,
+                     std::make_unique<ogc::cs::CoordinateTransformation>(shared_->prototype));
     }
 
   private:
-    ogc::cs::CoordinateTransformation prototype_;
+    std::shared_ptr<SharedTransformation> shared_;
     std::mutex mutex_;
     std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> free_;
 };
@@ -233,8 +272,7 @@ class FrameCameraModel final : public IMathModel {
         } else {
             const ogc::cs::ICRS wgs84("EPSG:4979");
             double o[3] = {pose.origin[0], pose.origin[1], pose.origin[2]};
-            if (!ogc::cs::CoordinateTransformation(wgs84, cartesian).Transform(1, &o[0], &o[1],
-                                                                                &o[2])) {
+            if (!TransformPool(wgs84, cartesian).Take()->Transform(1, &o[0], &o[1], &o[2])) {
                 KESTREL_THROW(DataException,
                               FormatString("%s: the frame's origin (%.12g, %.12g, %.6g) is not "
                                            "a place on the earth",
