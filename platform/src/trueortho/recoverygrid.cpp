@@ -100,20 +100,31 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
     std::vector<double> fractions(tw);
     for (int i = 0; i < tw; ++i)
         cell(i, tw, nodes[i], fractions[i]);
+    // Per column, along the lattice rows above and below the current line (unknown where a
+    // node of the cell is).
+    std::vector<double> above(tw), below(tw);
+    std::vector<unsigned char> unknown(tw);
+    int row = -1;
     for (int j = 0; j < th; ++j) {
         int b;
         double fy;
         cell(j, th, b, fy);
-        for (int i = 0; i < tw; ++i) {
-            const int a = nodes[i];
-            const double fx = fractions[i];
-            const size_t k = static_cast<size_t>(b) * nx + a;
-            const float q[4] = {lattice[k], lattice[k + 1], lattice[k + nx], lattice[k + nx + 1]};
-            if (std::isinf(q[0]) || std::isinf(q[1]) || std::isinf(q[2]) || std::isinf(q[3]))
-                continue;  // unknown
-            out[static_cast<size_t>(j) * tw + i] = static_cast<float>(
-                (1 - fy) * ((1 - fx) * q[0] + fx * q[1]) + fy * ((1 - fx) * q[2] + fx * q[3]));
+        if (b != row) {
+            row = b;
+            for (int i = 0; i < tw; ++i) {
+                const double fx = fractions[i];
+                const size_t k = static_cast<size_t>(b) * nx + nodes[i];
+                const float q[4] = {lattice[k], lattice[k + 1], lattice[k + nx], lattice[k + nx + 1]};
+                unknown[i] =
+                    std::isinf(q[0]) || std::isinf(q[1]) || std::isinf(q[2]) || std::isinf(q[3]);
+                above[i] = (1 - fx) * q[0] + fx * q[1];
+                below[i] = (1 - fx) * q[2] + fx * q[3];
+            }
         }
+        float* line = out.data() + static_cast<size_t>(j) * tw;
+        for (int i = 0; i < tw; ++i)
+            if (!unknown[i])
+                line[i] = static_cast<float>((1 - fy) * above[i] + fy * below[i]);
     }
 }
 
