@@ -428,6 +428,20 @@ TEST(Workflow, SampleCityEndToEnd) {
         EXPECT_EQ(legend[k].GetString("scene"), names[k - 1]);
         EXPECT_EQ(legend[k].GetString("colour").size(), 7u);
     }
+    // Each pixel of the picture has its value's legend colour, and none where no image sees.
+    const GDALColorTable* palette = picture->GetRasterBand(1)->GetColorTable();
+    ASSERT_NE(palette, nullptr);
+    const std::vector<unsigned char> indexes = ReadBytes(*picture);
+    ASSERT_EQ(indexes.size(), from.size());
+    std::size_t miscoloured = 0;
+    for (std::size_t p = 0; p < from.size(); ++p) {
+        const GDALColorEntry* e = palette->GetColorEntry(indexes[p]);
+        char colour[8];
+        std::snprintf(colour, sizeof colour, "#%02x%02x%02x", e->c1, e->c2, e->c3);
+        miscoloured += from[p] == 0 ? e->c4 != 0
+                                    : e->c4 != 255 || legend[from[p]].GetString("colour") != colour;
+    }
+    EXPECT_EQ(miscoloured, 0u);
     // The balance applied: a gain and an offset per scene and channel, in the scenes' order.
     const CPLJSONObject balance = summaryFile.GetRoot().GetObj("balance");
     EXPECT_EQ(balance.GetString("method"), "gain-offset");
