@@ -710,17 +710,18 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         std::set<std::string> madeAgain;
         std::string reason;  // of each scene made again, or else of the mosaic
         bool mosaic;
+        bool footprints = true;  // footprints.gpkg merged again (when the mosaic is made)
     } steps[] = {
-        {"nothing", [] {}, {}, "", false},
+        {"nothing", [] {}, {}, "", false, false},
         {"the generator's threads, which change no pixel",
-         [&] { args.insert(args.end(), {"--proc", "CPU:2"}); }, {}, "", false},
+         [&] { args.insert(args.end(), {"--proc", "CPU:2"}); }, {}, "", false, false},
         {"a source's time but not its content",
          [&] {
              const auto path = dir.Path() / "sample/north.tif";
              std::filesystem::last_write_time(
                  path, std::filesystem::last_write_time(path) + std::chrono::hours(1));
          },
-         {}, "", false},
+         {}, "", false, false},
         {"the resampling",
          [&] { args.insert(args.end(), {"--resample", "near"}); },
          all, "--resample changed: bilinear -> near", true},
@@ -749,16 +750,16 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
          [&] {
              ReplaceInFile(dir.File("sample/master.txt"), "HIGH;1", "HIGH;2");
          },
-         {}, "scene west changed", true},
+         {}, "scene west changed", true, false},
         {"the colour balance, which only the mosaic reads",
          [&] { args.insert(args.end(), {"--balance", "none"}); },
-         {}, "--balance changed: gain-offset -> none", true},
+         {}, "--balance changed: gain-offset -> none", true, false},
         {"seamlines handed back",
          [&] {
              std::filesystem::copy_file(dir.File("out/seamlines.gpkg"), dir.File("seams.gpkg"));
              args.insert(args.end(), {"--seamlines", dir.File("seams.gpkg")});
          },
-         {}, "--seamlines changed", true},
+         {}, "--seamlines changed", true, false},
         {"a seamline polygon given to another scene",
          [&] {
              Dataset seams(GDALDataset::Open(dir.File("seams.gpkg").c_str(),
@@ -773,15 +774,15 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
                                             : "north");
              ASSERT_EQ(layer->SetFeature(feature.get()), OGRERR_NONE);
          },
-         {}, "seamlines file " + dir.File("seams.gpkg") + " changed", true},
+         {}, "seamlines file " + dir.File("seams.gpkg") + " changed", true, false},
         {"an area of interest that changes no scene's window",
          [&] { args.insert(args.end(), {"--te", "514848", "5033845", "515008", "5033989"}); },
-         {}, "--te changed", true},
+         {}, "--te changed", true, false},
         {"an area of interest that clips one scene's window",
          [&] { args[args.size() - 2] = "514985"; }, {"west"}, "window changed", true},
         {"a lost output",
          [&] { std::filesystem::remove(dir.Path() / "out/north_vis.png"); },
-         {"north"}, dir.File("out/north_vis.png") + " is missing", false},
+         {"north"}, dir.File("out/north_vis.png") + " is missing", false, false},
         {"--overwrite", [&] { args.push_back("--overwrite"); }, all, "--overwrite", true},
     };
     for (const auto& step : steps) {
@@ -804,6 +805,8 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
         const std::string mosaicReason = summary.GetRoot().GetString("mosaic_reason");
         EXPECT_EQ(!mosaicReason.empty(), step.mosaic) << mosaicReason;
+        EXPECT_EQ(summary.GetRoot().GetObj("timings").GetObj("footprint merge").IsValid(),
+                  step.mosaic && step.footprints);
         if (step.madeAgain.empty() && step.mosaic) {
             EXPECT_NE(mosaicReason.find(step.reason), std::string::npos) << mosaicReason;
         }
