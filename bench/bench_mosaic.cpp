@@ -324,10 +324,15 @@ int main(int argc, char** argv) {
     GDALAllRegister();
     std::string only, given;
     for (int i = 1; i < argc; ++i) {
-        if (std::string(argv[i]) == "--only" && i + 1 < argc)
+        const std::string arg = argv[i];
+        if (arg == "--only" && i + 1 < argc) {
             only = argv[++i];
-        else
-            given = argv[i];
+        } else if (arg.empty() || arg[0] == '-' || !given.empty()) {
+            std::fprintf(stderr, "usage: bench_mosaic [--only exposure|surface] [DIR]\n");
+            return arg == "--help" ? 0 : 2;
+        } else {
+            given = arg;
+        }
     }
     if (!only.empty() && only != "exposure" && only != "surface") {
         std::fprintf(stderr, "bench_mosaic: --only takes exposure or surface, not %s\n",

@@ -555,14 +555,10 @@ std::string OptionText(const std::string& defaults, const std::vector<std::strin
     return text;
 }
 
-// The options of a per-scene raster of GDAL's format: the fastest deflate level for GeoTIFF (an
-// ortho is read once more, by recovery, and the default level costs a quarter of a run's
-// processor time) and the nearest class for overviews of a raster of classes; then the --co
-// options its driver takes, for the ortho.
+// The options of a per-scene raster of GDAL's format: the generator's own, then the --co options
+// its driver takes, for the ortho.
 std::string SceneRasterOptions(const Options& options, const std::string& format, bool classes) {
-    const std::string defaults = format == "GTiff"                 ? "ZLEVEL=1"
-                                 : classes && format == "COG" ? "OVERVIEW_RESAMPLING=NEAREST"
-                                                              : "";
+    const std::string defaults = kestrel::processes::SceneRasterOptions(format, classes);
     if (classes)
         return defaults;
     std::vector<std::string> taken;

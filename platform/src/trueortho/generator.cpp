@@ -122,16 +122,6 @@ void ReadSource(const Plan& plan, GDALDataset* dataset, int x, int y, int width,
     }
 }
 
-// The creation options of an output the generator makes itself: the fastest deflate level for
-// GeoTIFF (an ortho is read once more, by recovery, and the default level costs a quarter of a
-// run's processor time); overviews of the visibility index take the nearest class, never a mean
-// of two.
-std::string OutputOptions(const std::string& format, bool classes) {
-    if (format == "GTiff")
-        return "ZLEVEL=1";
-    return classes && format == "COG" ? "OVERVIEW_RESAMPLING=NEAREST" : "";
-}
-
 // A writer of the generator's own for an output given by path.
 std::unique_ptr<datasources::BasicWriter> OutputWriter(const TorthoJob& job,
                                                        const std::string& path, size_t bands,
@@ -142,7 +132,7 @@ std::unique_ptr<datasources::BasicWriter> OutputWriter(const TorthoJob& job,
     for (size_t b = 0; b < bands; ++b)
         channels[b] = static_cast<unsigned int>(b + 1);
     return std::make_unique<datasources::BasicWriter>(path, channels, job.format,
-                                                      OutputOptions(job.format, classes));
+                                                      SceneRasterOptions(job.format, classes));
 }
 
 // An output of the run, through a writer of the caller's or of the generator's own.
@@ -732,6 +722,12 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
     }
     result.completed = true;
     return result;
+}
+
+std::string SceneRasterOptions(const std::string& format, bool classes) {
+    if (format == "GTiff")
+        return classes ? "ZLEVEL=1 PREDICTOR=1" : "ZLEVEL=1";
+    return classes && format == "COG" ? "OVERVIEW_RESAMPLING=NEAREST PREDICTOR=NO" : "";
 }
 
 }  // namespace processes

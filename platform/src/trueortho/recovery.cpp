@@ -461,6 +461,11 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     });
     if (control.Stopped())
         return result;
+    // The scenes are read: their files and cached blocks go before the outputs are finished
+    // (building overviews and compressing take memory of their own).
+    grid.pool->CloseAll();
+    regions.reset();
+    mask.reset();
     trueortho::ReleaseFreeMemory();
     mosaic->Close();
     source->Close();

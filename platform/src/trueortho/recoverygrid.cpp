@@ -173,6 +173,16 @@ void RasterPool::Touch(SharedRaster& raster) {
     }
 }
 
+void RasterPool::CloseAll() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    for (SharedRaster* raster : order_) {
+        std::lock_guard<std::mutex> held(raster->mutex);
+        raster->dataset.reset();
+        raster->listed_ = false;
+    }
+    order_.clear();
+}
+
 std::vector<std::size_t> RecoveryGrid::ScenesMeeting(const Rect& r) const {
     const Rect in = r.Intersect(Whole());
     std::vector<std::size_t> scenes;

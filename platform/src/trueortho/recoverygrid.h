@@ -70,6 +70,8 @@ class RasterPool {
     explicit RasterPool(std::size_t capacity) : capacity_(capacity) {}
     // Marks `raster` (whose lock the caller holds) as just read.
     void Touch(SharedRaster& raster);
+    // Closes every raster, with the blocks GDAL holds for them; no thread may be reading.
+    void CloseAll();
 
   private:
     std::mutex mutex_;

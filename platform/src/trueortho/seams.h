@@ -53,7 +53,7 @@ struct SeamParams {
     float seamWeight = 0.5f;     // per metre of seam on open ground
     float raisedWeight = 2.0f;   // added per metre the surface stands above the ground
     float colourWeight = 0.05f;  // added per grey level the two scenes disagree (on each side)
-    int tile = 512;              // cells per side of the windows read and solved (>= 16)
+    int tile = 256;              // cells per side of the windows read and solved (>= 16)
 };
 
 // The labels of a window: per cell an index into window.scenes, -1 where every cost is
