@@ -96,14 +96,17 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
         const int p1 = std::min((node + 1) * kAngleStep, size - 1);
         f = p1 > p0 ? static_cast<double>(i - p0) / (p1 - p0) : 0.0;
     };
+    std::vector<int> nodes(tw);  // per column, its cell
+    std::vector<double> fractions(tw);
+    for (int i = 0; i < tw; ++i)
+        cell(i, tw, nodes[i], fractions[i]);
     for (int j = 0; j < th; ++j) {
         int b;
         double fy;
         cell(j, th, b, fy);
         for (int i = 0; i < tw; ++i) {
-            int a;
-            double fx;
-            cell(i, tw, a, fx);
+            const int a = nodes[i];
+            const double fx = fractions[i];
             const size_t k = static_cast<size_t>(b) * nx + a;
             const float q[4] = {lattice[k], lattice[k + 1], lattice[k + nx], lattice[k + nx + 1]};
             if (std::isinf(q[0]) || std::isinf(q[1]) || std::isinf(q[2]) || std::isinf(q[3]))
