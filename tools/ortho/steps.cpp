@@ -1344,13 +1344,18 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
                              static_cast<GSpacing>(count) * sizeof(float), &window) != CE_None)
             FailFile(raster, "cannot be read", errors);
         std::fill(empty.begin(), empty.begin() + static_cast<std::ptrdiff_t>(count), GByte{0});
+        bool datasetMaskRead = false;  // a mask of the whole file is every band's: read once
         for (int b = 0; b < bands; ++b) {
             GDALRasterBand* band = source->GetRasterBand(b + 1);
-            const bool masked = band->GetMaskFlags() != GMF_ALL_VALID;
-            if (masked && band->GetMaskBand()->RasterIO(GF_Read, 0, y0, width, y1 - y0,
-                                                        mask.data(), outWidth, rows, GDT_Byte,
-                                                        0, 0, &window) != CE_None)
+            const int flags = band->GetMaskFlags();
+            const bool masked = flags != GMF_ALL_VALID;
+            const bool datasetMask = (flags & GMF_PER_DATASET) != 0;
+            if (masked && !(datasetMask && datasetMaskRead) &&
+                band->GetMaskBand()->RasterIO(GF_Read, 0, y0, width, y1 - y0, mask.data(),
+                                              outWidth, rows, GDT_Byte, 0, 0,
+                                              &window) != CE_None)
                 FailFile(raster, "cannot be read", errors);
+            datasetMaskRead = datasetMaskRead || datasetMask;
             const float* values = strip.data() + count * static_cast<std::size_t>(b);
             for (std::size_t i = 0; i < count; ++i) {
                 if (std::isnan(values[i]) || (masked && mask[i] == 0))
