@@ -352,8 +352,10 @@ std::unique_ptr<trueortho::SharedRaster> ChooseSeamlines(const RecoveryJob& job,
                                                          RunControl& control,
                                                          ScratchFile& scratch) {
     scratch.path = job.sourcePath + ".regions.tif";
-    auto labels =
-        OutputWriter(scratch.path, "GTiff", "", grid, 1, GDT_UInt16, 0.0);
+    // Classes, read back tile by tile by the composition: options of a scene's classes (no
+    // predictor, which is slow to undo on one band).
+    auto labels = OutputWriter(scratch.path, "GTiff", SceneRasterOptions("GTiff", true), grid, 1,
+                               GDT_UInt16, 0.0);
     const std::unique_ptr<trueortho::SeamSource> source =
         trueortho::MakeSeamSource(job, grid, reader, fit, control);
     trueortho::SeamParams params;
