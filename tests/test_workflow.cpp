@@ -432,6 +432,20 @@ TEST(Workflow, SampleCityEndToEnd) {
         EXPECT_EQ(legend[k].GetString("scene"), names[k - 1]);
         EXPECT_EQ(legend[k].GetString("colour").size(), 7u);
     }
+    // Each pixel of the picture has its value's legend colour, and none where no image sees.
+    const GDALColorTable* palette = picture->GetRasterBand(1)->GetColorTable();
+    ASSERT_NE(palette, nullptr);
+    const std::vector<unsigned char> indexes = ReadBytes(*picture);
+    ASSERT_EQ(indexes.size(), from.size());
+    std::size_t miscoloured = 0;
+    for (std::size_t p = 0; p < from.size(); ++p) {
+        const GDALColorEntry* e = palette->GetColorEntry(indexes[p]);
+        char colour[8];
+        std::snprintf(colour, sizeof colour, "#%02x%02x%02x", e->c1, e->c2, e->c3);
+        miscoloured += from[p] == 0 ? e->c4 != 0
+                                    : e->c4 != 255 || legend[from[p]].GetString("colour") != colour;
+    }
+    EXPECT_EQ(miscoloured, 0u);
     // The balance applied: a gain and an offset per scene and channel, in the scenes' order.
     const CPLJSONObject balance = summaryFile.GetRoot().GetObj("balance");
     EXPECT_EQ(balance.GetString("method"), "gain-offset");
@@ -700,17 +714,18 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         std::set<std::string> madeAgain;
         std::string reason;  // of each scene made again, or else of the mosaic
         bool mosaic;
+        bool footprints = true;  // footprints.gpkg merged again (when the mosaic is made)
     } steps[] = {
-        {"nothing", [] {}, {}, "", false},
+        {"nothing", [] {}, {}, "", false, false},
         {"the generator's threads, which change no pixel",
-         [&] { args.insert(args.end(), {"--proc", "CPU:2"}); }, {}, "", false},
+         [&] { args.insert(args.end(), {"--proc", "CPU:2"}); }, {}, "", false, false},
         {"a source's time but not its content",
          [&] {
              const auto path = dir.Path() / "sample/north.tif";
              std::filesystem::last_write_time(
                  path, std::filesystem::last_write_time(path) + std::chrono::hours(1));
          },
-         {}, "", false},
+         {}, "", false, false},
         {"the resampling",
          [&] { args.insert(args.end(), {"--resample", "near"}); },
          all, "--resample changed: bilinear -> near", true},
@@ -739,16 +754,16 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
          [&] {
              ReplaceInFile(dir.File("sample/master.txt"), "HIGH;1", "HIGH;2");
          },
-         {}, "scene west changed", true},
+         {}, "scene west changed", true, false},
         {"the colour balance, which only the mosaic reads",
          [&] { args.insert(args.end(), {"--balance", "none"}); },
-         {}, "--balance changed: gain-offset -> none", true},
+         {}, "--balance changed: gain-offset -> none", true, false},
         {"seamlines handed back",
          [&] {
              std::filesystem::copy_file(dir.File("out/seamlines.gpkg"), dir.File("seams.gpkg"));
              args.insert(args.end(), {"--seamlines", dir.File("seams.gpkg")});
          },
-         {}, "--seamlines changed", true},
+         {}, "--seamlines changed", true, false},
         {"a seamline polygon given to another scene",
          [&] {
              Dataset seams(GDALDataset::Open(dir.File("seams.gpkg").c_str(),
@@ -763,15 +778,15 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
                                             : "north");
              ASSERT_EQ(layer->SetFeature(feature.get()), OGRERR_NONE);
          },
-         {}, "seamlines file " + dir.File("seams.gpkg") + " changed", true},
+         {}, "seamlines file " + dir.File("seams.gpkg") + " changed", true, false},
         {"an area of interest that changes no scene's window",
          [&] { args.insert(args.end(), {"--te", "514848", "5033845", "515008", "5033989"}); },
-         {}, "--te changed", true},
+         {}, "--te changed", true, false},
         {"an area of interest that clips one scene's window",
          [&] { args[args.size() - 2] = "514985"; }, {"west"}, "window changed", true},
         {"a lost output",
          [&] { std::filesystem::remove(dir.Path() / "out/north_vis.png"); },
-         {"north"}, dir.File("out/north_vis.png") + " is missing", false},
+         {"north"}, dir.File("out/north_vis.png") + " is missing", false, false},
         {"--overwrite", [&] { args.push_back("--overwrite"); }, all, "--overwrite", true},
     };
     for (const auto& step : steps) {
@@ -794,6 +809,8 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
         const std::string mosaicReason = summary.GetRoot().GetString("mosaic_reason");
         EXPECT_EQ(!mosaicReason.empty(), step.mosaic) << mosaicReason;
+        EXPECT_EQ(summary.GetRoot().GetObj("timings").GetObj("footprint merge").IsValid(),
+                  step.mosaic && step.footprints);
         if (step.madeAgain.empty() && step.mosaic) {
             EXPECT_NE(mosaicReason.find(step.reason), std::string::npos) << mosaicReason;
         }

@@ -1344,13 +1344,18 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
                              static_cast<GSpacing>(count) * sizeof(float), &window) != CE_None)
             FailFile(raster, "cannot be read", errors);
         std::fill(empty.begin(), empty.begin() + static_cast<std::ptrdiff_t>(count), GByte{0});
+        bool datasetMaskRead = false;  // a mask of the whole file is every band's: read once
         for (int b = 0; b < bands; ++b) {
             GDALRasterBand* band = source->GetRasterBand(b + 1);
-            const bool masked = band->GetMaskFlags() != GMF_ALL_VALID;
-            if (masked && band->GetMaskBand()->RasterIO(GF_Read, 0, y0, width, y1 - y0,
-                                                        mask.data(), outWidth, rows, GDT_Byte,
-                                                        0, 0, &window) != CE_None)
+            const int flags = band->GetMaskFlags();
+            const bool masked = flags != GMF_ALL_VALID;
+            const bool datasetMask = (flags & GMF_PER_DATASET) != 0;
+            if (masked && !(datasetMask && datasetMaskRead) &&
+                band->GetMaskBand()->RasterIO(GF_Read, 0, y0, width, y1 - y0, mask.data(),
+                                              outWidth, rows, GDT_Byte, 0, 0,
+                                              &window) != CE_None)
                 FailFile(raster, "cannot be read", errors);
+            datasetMaskRead = datasetMaskRead || datasetMask;
             const float* values = strip.data() + count * static_cast<std::size_t>(b);
             for (std::size_t i = 0; i < count; ++i) {
                 if (std::isnan(values[i]) || (masked && mask[i] == 0))
@@ -1394,43 +1399,56 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
         scale = high > low ? 254.0 / (high - low) : 0.0;
     }
 
-    // Red, green, blue, alpha, strip by strip into the picture.
+    // Red, green, blue, alpha, strip by strip into the picture; classes as indexes into the
+    // palette (index 0 transparent, k + 1 the colour of class k), a quarter of the bytes to
+    // filter and compress.
     GDALDriver* memory = GetGDALDriverManager()->GetDriverByName("MEM");
     GDALDriver* pngDriver = GetGDALDriverManager()->GetDriverByName("PNG");
-    DatasetPtr picture(memory->Create("", outWidth, outHeight, 4, GDT_Byte, nullptr));
+    const int channels = kind == Quicklook::Image ? 4 : 1;
+    DatasetPtr picture(memory->Create("", outWidth, outHeight, channels, GDT_Byte, nullptr));
     if (!picture)
         FailFile(png, "cannot be drawn", errors);
-    std::vector<GByte> rgba(stripCount * 4);
+    if (channels == 1) {
+        GDALColorTable palette;
+        const GDALColorEntry none = {0, 0, 0, 0};
+        palette.SetColorEntry(0, &none);
+        for (int k = 0; k < kColours; ++k) {
+            const GDALColorEntry colour = {kPalette[k][0], kPalette[k][1], kPalette[k][2], 255};
+            palette.SetColorEntry(k + 1, &colour);
+        }
+        picture->GetRasterBand(1)->SetColorTable(&palette);
+    }
+    std::vector<GByte> pixels(stripCount * channels);
     for (int row = 0; row < outHeight; row += kStripRows) {
         const int rows = std::min(kStripRows, outHeight - row);
         const std::size_t count = read(row, rows);
-        GByte* alpha = rgba.data() + 3 * count;
-        for (std::size_t i = 0; i < count; ++i)
-            alpha[i] = empty[i] ? 0 : 255;
-        if (kind == Quicklook::Image) {
+        if (channels == 1) {
+            for (std::size_t i = 0; i < count; ++i) {
+                const auto v = static_cast<long long>(std::llround(strip[i]));
+                pixels[i] =
+                    empty[i] ? 0 : static_cast<GByte>(1 + ((v % kColours) + kColours) % kColours);
+            }
+        } else {
+            GByte* alpha = pixels.data() + 3 * count;
+            for (std::size_t i = 0; i < count; ++i)
+                alpha[i] = empty[i] ? 0 : 255;
             for (int b = 0; b < bands; ++b) {
                 const float* values = strip.data() + count * static_cast<std::size_t>(b);
                 for (std::size_t i = 0; i < count; ++i) {
                     const double v = 1.0 + (values[i] - low) * scale;
                     const auto byte = static_cast<GByte>(std::clamp(v, 1.0, 255.0));
                     for (int c = b; c < (bands == 1 ? 3 : b + 1); ++c)
-                        rgba[count * c + i] = byte;
+                        pixels[count * c + i] = byte;
                 }
             }
-        } else {
-            for (std::size_t i = 0; i < count; ++i) {
-                const auto v = static_cast<long long>(std::llround(strip[i]));
-                const int index = static_cast<int>(((v % kColours) + kColours) % kColours);
-                for (int c = 0; c < 3; ++c)
-                    rgba[count * c + i] = kPalette[index][c];
-            }
         }
-        if (picture->RasterIO(GF_Write, 0, row, outWidth, rows, rgba.data(), outWidth, rows,
-                              GDT_Byte, 4, nullptr, 0, 0, static_cast<GSpacing>(count),
+        if (picture->RasterIO(GF_Write, 0, row, outWidth, rows, pixels.data(), outWidth, rows,
+                              GDT_Byte, channels, nullptr, 0, 0, static_cast<GSpacing>(count),
                               nullptr) != CE_None)
             FailFile(png, "cannot be drawn", errors);
     }
-    picture->GetRasterBand(4)->SetColorInterpretation(GCI_AlphaBand);
+    if (channels == 4)
+        picture->GetRasterBand(4)->SetColorInterpretation(GCI_AlphaBand);
     // A world file places the picture where the raster lies, at its own pixel size.
     double geo[6] = {};
     const bool placed = source->GetGeoTransform(geo) == CE_None;

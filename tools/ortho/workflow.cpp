@@ -1008,7 +1008,14 @@ void Workflow::Recover() {
     made.Set("program", ProgramVersion());
     for (const PixelOption& option : PixelOptions())
         made.Set(option.name, option.value(options_));
-    made.Set("common grid", grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")");
+    const std::string commonGrid =
+        grid_.Describe() + " (" + Fingerprint(GridText("", grid_)) + ")";
+    made.Set("common grid", commonGrid);
+    // What footprints.gpkg is merged from: the scenes' footprints alone, so that a rerun that
+    // makes the mosaic again for its own options (or a missing mosaic) keeps it.
+    Manifest merged;
+    merged.Set("program", ProgramVersion());
+    merged.Set("common grid", commonGrid);
     // Cutline, seamlines, ground, blending and balance change the mosaic alone, not the scenes.
     for (const PixelOption& option : MosaicOptions())
         made.Set(option.name, option.value(options_));
@@ -1024,6 +1031,8 @@ void Workflow::Recover() {
         if (scene.status != "done" && scene.status != "complete")
             continue;
         layers.push_back({scene.name, scene.footprint, scene.input.source});
+        merged.Set("layer " + scene.name, scene.footprint + " from " + scene.input.source + " (" +
+                                              scene.madeFrom.Fingerprint() + ")");
         made.Set("scene " + scene.name,
                  scene.inImageSet ? "fill, radiometric difference " +
                                         std::to_string(static_cast<int>(scene.radioDif)) +
@@ -1050,6 +1059,8 @@ void Workflow::Recover() {
         colours.push_back(SourceColour(k));
     if (layers.empty())
         return;
+    // Recorded, not compared: the footprints are merged again only when it changes.
+    made.Set("footprints", "merged from the scenes", merged.Fingerprint());
 
     std::vector<std::string> outputs = {footprints};
     if (!inputs.empty())
@@ -1073,14 +1084,18 @@ void Workflow::Recover() {
         balance = earlier.Note("--balance");
     } else {
         if (reason != "not made before")
-            progress_.Info("mosaic and footprints made again: " + reason);
+            progress_.Info("mosaic made again: " + reason);
         summary_.mosaicReason = reason;
         RemoveFile(record);
-        progress_.Info("merging the footprints of " + std::to_string(layers.size()) + " scene(s)");
         auto step = Clock::now();
-        MergeFootprints(layers, grid_, PartName(footprints));
-        Publish(PartName(footprints), footprints);
-        AddStep("footprint merge", SecondsSince(step));
+        if (options_.overwrite || earlier.Note("footprints") != merged.Fingerprint() ||
+            !FileExists(footprints)) {
+            progress_.Info("merging the footprints of " + std::to_string(layers.size()) +
+                           " scene(s)");
+            MergeFootprints(layers, grid_, PartName(footprints));
+            Publish(PartName(footprints), footprints);
+            AddStep("footprint merge", SecondsSince(step));
+        }
         if (!inputs.empty()) {
             progress_.Info("occlusion recovery over " + std::to_string(inputs.size()) +
                            " scene(s) of the image set");

@@ -277,10 +277,18 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
             const double gain = c.fit.gain[scene.scene][b], offset = c.fit.offset[scene.scene][b];
             if (gain == 1 && offset == 0)
                 continue;
+            // The whole values 0 to 255 (all of a Byte mosaic's) balanced once each.
+            float table[256];
+            for (int value = 0; value < 256; ++value)
+                table[value] = c.range(gain * value + offset);
             float* v = values.data() + size * b;
-            for (size_t p = 0; p < size; ++p)
-                if (scene.state[p] != trueortho::kNotSeen)
-                    v[p] = c.range(gain * v[p] + offset);
+            for (size_t p = 0; p < size; ++p) {
+                if (scene.state[p] == trueortho::kNotSeen)
+                    continue;
+                const float x = v[p];
+                const int whole = x >= 0 && x <= 255 ? static_cast<int>(x) : -1;
+                v[p] = whole >= 0 && whole == x ? table[whole] : c.range(gain * x + offset);
+            }
         }
     }
     const float noData = static_cast<float>(c.grid.noData);
@@ -344,8 +352,10 @@ std::unique_ptr<trueortho::SharedRaster> ChooseSeamlines(const RecoveryJob& job,
                                                          RunControl& control,
                                                          ScratchFile& scratch) {
     scratch.path = job.sourcePath + ".regions.tif";
-    auto labels =
-        OutputWriter(scratch.path, "GTiff", "", grid, 1, GDT_UInt16, 0.0);
+    // Classes, read back tile by tile by the composition: options of a scene's classes (no
+    // predictor, which is slow to undo on one band).
+    auto labels = OutputWriter(scratch.path, "GTiff", SceneRasterOptions("GTiff", true), grid, 1,
+                               GDT_UInt16, 0.0);
     const std::unique_ptr<trueortho::SeamSource> source =
         trueortho::MakeSeamSource(job, grid, reader, fit, control);
     trueortho::SeamParams params;

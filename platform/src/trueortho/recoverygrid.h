@@ -110,6 +110,16 @@ struct RecoveryGrid {
                     static_cast<int>(index / across) * side, side, side}
             .Intersect(Whole());
     }
+    // The index of the tile to take `q`-th: tiles in bands of kBandRows lines of tiles, column
+    // after column within a band. A scene's blocks straddle tile edges; taken line after line,
+    // a whole line of tiles came between a block's reads, and GDAL's block cache had let it go.
+    static constexpr std::size_t kBandRows = 4;
+    std::size_t InBands(int side, std::size_t q) const {
+        const std::size_t across = (pixels + side - 1) / side, down = (lines + side - 1) / side;
+        const std::size_t first = q / (across * kBandRows) * kBandRows;
+        const std::size_t rows = std::min(kBandRows, down - first), within = q - first * across;
+        return (first + within % rows) * across + within / rows;
+    }
     // The scenes whose window meets r, in the job's order.
     std::vector<std::size_t> ScenesMeeting(const Rect& r) const;
     // Opens a raster that must lie on the grid's lattice (a mask, the regions); throws naming it.
@@ -148,7 +158,7 @@ class SceneReader {
         // or another value (a raster of another type than Byte is read into `values` first).
         std::vector<unsigned char> visibility;
         std::vector<float> values;
-        std::vector<unsigned char> row;  // MarkNearHidden's
+        std::vector<unsigned char> row;  // PixelStates'
         std::vector<int> last;
         std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;
     };
@@ -169,10 +179,11 @@ class SceneReader {
     std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel_;
 };
 
-// Marks (1, else 0) the pixels of a w x h rectangle that have a VISIBILITY_HIDDEN pixel within
-// e pixels (a square neighbourhood); `vis` is the rectangle with a border of e pixels.
-void MarkNearHidden(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
-                    std::vector<unsigned char>& near);
+// The state of each pixel of a w x h rectangle: kNotSeen, kClear or kUnclear (a
+// VISIBILITY_HIDDEN pixel within e pixels, a square neighbourhood); `vis` is the rectangle with
+// a border of e pixels.
+void PixelStates(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
+                 std::vector<unsigned char>& state);
 
 // Values as the mosaic's data type holds them: rounded and clamped for integer types.
 class ValueRange {
@@ -180,16 +191,28 @@ class ValueRange {
     explicit ValueRange(GDALDataType type = GDT_Float32);
     float operator()(double v) const {
         if (integer_)
-            v = std::round(v);
+            v = Round(v);
         return static_cast<float>(std::min(hi_, std::max(lo_, v)));
     }
     // A value that is not `noData`, the nearest one inside the range when it is.
-    float Besides(float v, double noData) const;
+    float Besides(float v, double noData) const {
+        return v != static_cast<float>(noData) ? v : Beside(noData);
+    }
     // True for a value at either end of an integer type's range: a clipped (saturated) value
     // says nothing of the scene's exposure.
     bool Clipped(float v) const { return integer_ && (v <= lo_ || v >= hi_); }
 
   private:
+    // std::round (halves away from zero) without the library call: below 2^52 the fraction
+    // v - trunc(v) is exact.
+    static double Round(double v) {
+        if (!(std::fabs(v) < 4503599627370496.0))
+            return std::round(v);  // whole already, or NaN
+        const double whole = static_cast<double>(static_cast<long long>(v));
+        return std::fabs(v - whole) >= 0.5 ? whole + (v < 0 ? -1.0 : 1.0) : whole;
+    }
+    float Beside(double noData) const;
+
     bool integer_;
     double lo_, hi_;
 };

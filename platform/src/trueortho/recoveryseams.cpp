@@ -287,9 +287,7 @@ ValueRange::ValueRange(GDALDataType type) : integer_(GDALDataTypeIsInteger(type)
     hi_ = GDALAdjustValueToDataType(type, 1e300, nullptr, nullptr);
 }
 
-float ValueRange::Besides(float v, double noData) const {
-    if (v != static_cast<float>(noData))
-        return v;
+float ValueRange::Beside(double noData) const {
     const double step = integer_ ? 1.0 : std::max(1e-6, std::fabs(noData) * 1e-6);
     return static_cast<float>(noData + step <= hi_ ? noData + step : noData - step);
 }
@@ -336,8 +334,9 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
     std::vector<Worker> workers(std::max(1u, threads));
     const ValueRange range(grid.type);
     control.RunTiles(tiles, static_cast<unsigned int>(workers.size()), "Colour balance",
-                     [&](unsigned int thread, size_t t) {
+                     [&](unsigned int thread, size_t q) {
         Worker& w = workers[thread];
+        const size_t t = grid.InBands(side, q);
         const Rect r = grid.Tile(side, t);
         const std::vector<size_t> meeting = grid.ScenesMeeting(r);
         if (meeting.size() < 2)
