@@ -560,79 +560,85 @@ TEST(RecoveryBalance, TwoExposuresMakeOneMosaicWithoutAStep) {
     using synthetic::kWidth;
     TempDir dir;
     const std::vector<synthetic::Window> windows = {{0, 0, 45, 50}, {25, 0, 45, 50}};
-    std::vector<double> texture(kWidth * synthetic::kHeight);
-    for (size_t k = 0; k < texture.size(); ++k)
-        texture[k] = 40 + (k % kWidth * 7 + k / kWidth * 13) % 120;
-    RecoveryJob job;
-    for (int s = 0; s < 2; ++s) {
-        std::vector<unsigned char> ortho(texture.size());
-        for (size_t k = 0; k < ortho.size(); ++k)
-            ortho[k] = static_cast<unsigned char>(std::lround(s == 0 ? texture[k] : 1.2 * texture[k] + 5));
-        const std::string name = "exposure" + std::to_string(s);
-        synthetic::WriteBand(dir.File(name + "_ortho.tif"), ortho, windows[s]);
-        synthetic::WriteBand(dir.File(name + "_vis.tif"),
-                             std::vector<unsigned char>(ortho.size(), VISIBILITY_SEEN), windows[s]);
-        RecoveryScene scene;
-        scene.orthoPath = dir.File(name + "_ortho.tif");
-        scene.visibilityPath = dir.File(name + "_vis.tif");
-        job.scenes.push_back(scene);
-    }
-    job.mosaicPath = dir.File("mosaic.tif");
-    job.sourcePath = dir.File("source.tif");
-    job.tileSize = 16;
-    for (const auto balance : {RecoveryJob::Balance::GainOffset, RecoveryJob::Balance::None}) {
-        job.balance = balance;
-        std::vector<double> fractions;
-        OcclusionRecovery recovery;
-        recovery.SetProgress(
-            [](double fraction, const char*, void* data) {
-                static_cast<std::vector<double>*>(data)->push_back(fraction);
-                return true;
-            },
-            &fractions);
-        const TorthoRecoveryResult result = recovery.Recover(job);
+    // Byte orthos, and Float32 ones (read and balanced without the table of byte values).
+    for (const GDALDataType type : {GDT_Byte, GDT_Float32}) {
+        SCOPED_TRACE(GDALGetDataTypeName(type));
+        std::vector<double> texture(kWidth * synthetic::kHeight);
+        for (size_t k = 0; k < texture.size(); ++k)
+            texture[k] = 40 + (k % kWidth * 7 + k / kWidth * 13) % 120;
+        RecoveryJob job;
+        for (int s = 0; s < 2; ++s) {
+            std::vector<unsigned char> ortho(texture.size());
+            for (size_t k = 0; k < ortho.size(); ++k)
+                ortho[k] = static_cast<unsigned char>(
+                    std::lround(s == 0 ? texture[k] : 1.2 * texture[k] + 5));
+            const std::string name = "exposure" + std::to_string(s);
+            synthetic::WriteBand(dir.File(name + "_ortho.tif"), ortho, windows[s], 0, type);
+            synthetic::WriteBand(dir.File(name + "_vis.tif"),
+                                 std::vector<unsigned char>(ortho.size(), VISIBILITY_SEEN),
+                                 windows[s]);
+            RecoveryScene scene;
+            scene.orthoPath = dir.File(name + "_ortho.tif");
+            scene.visibilityPath = dir.File(name + "_vis.tif");
+            job.scenes.push_back(scene);
+        }
+        job.mosaicPath = dir.File("mosaic.tif");
+        job.sourcePath = dir.File("source.tif");
+        job.tileSize = 16;
+        for (const auto balance : {RecoveryJob::Balance::GainOffset, RecoveryJob::Balance::None}) {
+            job.balance = balance;
+            std::vector<double> fractions;
+            OcclusionRecovery recovery;
+            recovery.SetProgress(
+                [](double fraction, const char*, void* data) {
+                    static_cast<std::vector<double>*>(data)->push_back(fraction);
+                    return true;
+                },
+                &fractions);
+            const TorthoRecoveryResult result = recovery.Recover(job);
+            ASSERT_TRUE(result.completed);
+            EXPECT_TRUE(std::is_sorted(fractions.begin(), fractions.end()));
+            EXPECT_EQ(fractions.back(), 1.0);
+            ASSERT_EQ(result.gain.size(), 2u);
+            const auto mosaic = ReadBand(job.mosaicPath);
+            // The least-squares line of the mosaic against t, and the largest residual.
+            double n = 0, st = 0, sm = 0, stt = 0, stm = 0;
+            for (size_t k = 0; k < mosaic.size(); ++k)
+                n += 1, st += texture[k], sm += mosaic[k], stt += texture[k] * texture[k],
+                    stm += texture[k] * mosaic[k];
+            const double a = (n * stm - st * sm) / (n * stt - st * st), b = (sm - a * st) / n;
+            double worst = 0;
+            for (size_t k = 0; k < mosaic.size(); ++k)
+                worst = std::max(worst, std::fabs(mosaic[k] - (a * texture[k] + b)));
+            if (balance == RecoveryJob::Balance::None) {
+                EXPECT_GT(worst, 10);
+                EXPECT_EQ(result.gain[1][0], 1.0);
+            } else {
+                EXPECT_LE(worst, 1.5);
+                EXPECT_NEAR(result.gain[0][0] / result.gain[1][0], 1.2, 0.01);
+            }
+        }
+        // Orthos of one fine texture a pixel apart (as resampling and misregistration leave them):
+        // the fit still finds the exposures, not a gain of the pixel-to-pixel noise.
+        for (size_t k = 0; k < texture.size(); ++k) {
+            unsigned long long h = (k + 1) * 0x9E3779B97F4A7C15ull;
+            h ^= h >> 31, h *= 0xBF58476D1CE4E5B9ull, h ^= h >> 29;
+            texture[k] = 40 + static_cast<double>(h % 120);
+        }
+        for (int s = 0; s < 2; ++s) {
+            std::vector<unsigned char> ortho(texture.size());
+            for (size_t k = 0; k < ortho.size(); ++k) {
+                const size_t from = s == 0 || (k + 1) % kWidth == 0 ? k : k + 1;
+                ortho[k] = static_cast<unsigned char>(
+                    std::lround(s == 0 ? texture[from] : 1.2 * texture[from] + 5));
+            }
+            synthetic::WriteBand(job.scenes[s].orthoPath, ortho, windows[s], 0, type);
+        }
+        job.balance = RecoveryJob::Balance::GainOffset;
+        const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
         ASSERT_TRUE(result.completed);
-        EXPECT_TRUE(std::is_sorted(fractions.begin(), fractions.end()));
-        EXPECT_EQ(fractions.back(), 1.0);
-        ASSERT_EQ(result.gain.size(), 2u);
-        const auto mosaic = ReadBand(job.mosaicPath);
-        // The least-squares line of the mosaic against t, and the largest residual.
-        double n = 0, st = 0, sm = 0, stt = 0, stm = 0;
-        for (size_t k = 0; k < mosaic.size(); ++k)
-            n += 1, st += texture[k], sm += mosaic[k], stt += texture[k] * texture[k],
-                stm += texture[k] * mosaic[k];
-        const double a = (n * stm - st * sm) / (n * stt - st * st), b = (sm - a * st) / n;
-        double worst = 0;
-        for (size_t k = 0; k < mosaic.size(); ++k)
-            worst = std::max(worst, std::fabs(mosaic[k] - (a * texture[k] + b)));
-        if (balance == RecoveryJob::Balance::None) {
-            EXPECT_GT(worst, 10);
-            EXPECT_EQ(result.gain[1][0], 1.0);
-        } else {
-            EXPECT_LE(worst, 1.5);
-            EXPECT_NEAR(result.gain[0][0] / result.gain[1][0], 1.2, 0.01);
-        }
+        EXPECT_NEAR(result.gain[0][0] / result.gain[1][0], 1.2, 0.03);
     }
-    // Orthos of one fine texture a pixel apart (as resampling and misregistration leave them):
-    // the fit still finds the exposures, not a gain of the pixel-to-pixel noise.
-    for (size_t k = 0; k < texture.size(); ++k) {
-        unsigned long long h = (k + 1) * 0x9E3779B97F4A7C15ull;
-        h ^= h >> 31, h *= 0xBF58476D1CE4E5B9ull, h ^= h >> 29;
-        texture[k] = 40 + static_cast<double>(h % 120);
-    }
-    for (int s = 0; s < 2; ++s) {
-        std::vector<unsigned char> ortho(texture.size());
-        for (size_t k = 0; k < ortho.size(); ++k) {
-            const size_t from = s == 0 || (k + 1) % kWidth == 0 ? k : k + 1;
-            ortho[k] = static_cast<unsigned char>(
-                std::lround(s == 0 ? texture[from] : 1.2 * texture[from] + 5));
-        }
-        synthetic::WriteBand(job.scenes[s].orthoPath, ortho, windows[s]);
-    }
-    job.balance = RecoveryJob::Balance::GainOffset;
-    const TorthoRecoveryResult result = OcclusionRecovery().Recover(job);
-    ASSERT_TRUE(result.completed);
-    EXPECT_NEAR(result.gain[0][0] / result.gain[1][0], 1.2, 0.03);
 }
 
 // A pixel a scene sees whose value is the no-data value is filled with the nearest other value,

@@ -271,25 +271,8 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
             seen[p] = scene.state[p] == trueortho::kClear ||
                       (scene.state[p] == trueortho::kUnclear && !w.clear[p] &&
                        labels[p] == static_cast<int>(u));
-        std::vector<float>& values = blend.values[u];
-        c.reader.ReadValues(scene.scene, r, values);
-        for (int b = 0; b < bands; ++b) {
-            const double gain = c.fit.gain[scene.scene][b], offset = c.fit.offset[scene.scene][b];
-            if (gain == 1 && offset == 0)
-                continue;
-            // The whole values 0 to 255 (all of a Byte mosaic's) balanced once each.
-            float table[256];
-            for (int value = 0; value < 256; ++value)
-                table[value] = c.range(gain * value + offset);
-            float* v = values.data() + size * b;
-            for (size_t p = 0; p < size; ++p) {
-                if (scene.state[p] == trueortho::kNotSeen)
-                    continue;
-                const float x = v[p];
-                const int whole = x >= 0 && x <= 255 ? static_cast<int>(x) : -1;
-                v[p] = whole >= 0 && whole == x ? table[whole] : c.range(gain * x + offset);
-            }
-        }
+        c.reader.ReadBalanced(scene.scene, r, c.fit.gain[scene.scene], c.fit.offset[scene.scene],
+                              scene.state, c.range, w.scratch, blend.values[u]);
     }
     const float noData = static_cast<float>(c.grid.noData);
     trueortho::BlendRegions(blend, c.blend, static_cast<int>(job.blendWidth), noData, w.blended);

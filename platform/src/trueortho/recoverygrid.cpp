@@ -316,6 +316,10 @@ RecoveryGrid InspectScenes(const RecoveryJob& job) {
                              visibility.GetRasterYSize(), scene.orthoPath.c_str(), pixels, lines));
         if (GDALRasterBand* band = visibility.GetRasterBand(1))
             visibilityFile.type = band->GetRasterDataType();
+        orthoFile.type = GDT_Byte;  // when every band is
+        for (int b = 1; b <= ortho.GetRasterCount(); ++b)
+            if (ortho.GetRasterBand(b)->GetRasterDataType() != GDT_Byte)
+                orthoFile.type = GDT_Float32;
         raw.push_back(window);
         // Opened again when read.
         orthoFile.dataset.reset(), visibilityFile.dataset.reset();
@@ -427,6 +431,47 @@ void SceneReader::ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) co
     if (toModel_[s] && !scratch.toModel[s])
         scratch.toModel[s] = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel_[s]);
     Angles(job_, grid_, job_.scenes[s], scratch.toModel[s].get(), r, out.angle);
+}
+
+void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const std::vector<double>& gain,
+                               const std::vector<double>& offset,
+                               const std::vector<unsigned char>& state, const ValueRange& range,
+                               Scratch& scratch, std::vector<float>& values) const {
+    const size_t size = r.Size();
+    if (grid_.orthos[s]->type != GDT_Byte) {
+        ReadValues(s, r, values);
+        for (int b = 0; b < grid_.bands; ++b) {
+            if (gain[b] == 1 && offset[b] == 0)
+                continue;
+            float* v = values.data() + size * b;
+            for (size_t p = 0; p < size; ++p)
+                if (state[p] != kNotSeen)
+                    v[p] = range(gain[b] * v[p] + offset[b]);
+        }
+        return;
+    }
+    // Byte values: read as they are, each band's 256 values balanced once, and both taken to
+    // Float32 in one pass over the part of r on the scene's raster.
+    const Rect on = r.Intersect(grid_.orthos[s]->window);
+    Prepare(values, r, on, grid_.bands, static_cast<float>(grid_.noData));
+    scratch.bytes.resize(size * grid_.bands);
+    grid_.orthos[s]->Read(bands_.data(), grid_.bands, r, GDT_Byte, scratch.bytes.data());
+    float table[256], plain[256];
+    for (int value = 0; value < 256; ++value)
+        plain[value] = static_cast<float>(value);
+    for (int b = 0; b < grid_.bands; ++b) {
+        const bool balanced = !(gain[b] == 1 && offset[b] == 0);
+        for (int value = 0; value < 256 && balanced; ++value)
+            table[value] = range(gain[b] * value + offset[b]);
+        for (int j = on.y - r.y; j < on.y - r.y + on.height; ++j) {
+            const size_t first = static_cast<size_t>(j) * r.width + (on.x - r.x);
+            const unsigned char* in = scratch.bytes.data() + size * b + first;
+            const unsigned char* seen = state.data() + first;
+            float* out = values.data() + size * b + first;
+            for (int i = 0; i < on.width; ++i)
+                out[i] = balanced && seen[i] != kNotSeen ? table[in[i]] : plain[in[i]];
+        }
+    }
 }
 
 void SceneReader::ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const {

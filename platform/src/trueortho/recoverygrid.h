@@ -48,7 +48,7 @@ struct SharedRaster {
     RasterPool* pool = nullptr;  // null: stays open
     std::mutex mutex;
     DatasetPtr dataset;  // while open
-    GDALDataType type = GDT_Float32;  // of its first band
+    GDALDataType type = GDT_Float32;  // of its first band (an ortho's: Byte if all are)
     // Reads `count` bands over `r` (mosaic pixels) as `bufferType` into buffer (r.width x
     // r.height per band); parts outside the raster keep what the buffer holds.
     void Read(const int* bands, int count, const Rect& r, GDALDataType bufferType, void* buffer);
@@ -137,54 +137,6 @@ struct RecoveryGrid {
 // count and data type, and lays out the mosaic grid (the job's, or the union of the windows).
 RecoveryGrid InspectScenes(const RecoveryJob& job);
 
-// One scene over a rectangle of the mosaic grid.
-struct SceneTile {
-    std::size_t scene = 0;
-    // Per pixel: kNotSeen, kClear (seen, no hidden pixel within the pixel error) or kUnclear.
-    std::vector<unsigned char> state;
-    std::vector<float> angle;   // tangent of the off-nadir angle (infinity: unknown), if asked
-    std::vector<float> values;  // `bands` planes, if asked
-};
-enum : unsigned char { kNotSeen = 0, kClear = 1, kUnclear = 2 };
-
-constexpr float kUnknownAngle = std::numeric_limits<float>::infinity();
-
-// Reads scenes over rectangles; Read may be called from several threads, each with its own
-// Scratch.
-class SceneReader {
-  public:
-    struct Scratch {
-        // The visibility index over the read with its border: VISIBILITY_SEEN, VISIBILITY_HIDDEN
-        // or another value (a raster of another type than Byte is read into `values` first).
-        std::vector<unsigned char> visibility;
-        std::vector<float> values;
-        std::vector<unsigned char> row;  // PixelStates'
-        std::vector<int> last;
-        std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;
-    };
-    SceneReader(const RecoveryJob& job, const RecoveryGrid& grid);
-    // Fills `out` for scene s over r; false (values and angles not read) when the scene sees
-    // no pixel of r.
-    bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
-              SceneTile& out) const;
-    // The angles of out.scene over r, for a tile Read without them.
-    void ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) const;
-    // The ortho's `bands` planes over r; no-data outside the scene's raster.
-    void ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const;
-
-  private:
-    const RecoveryJob& job_;
-    const RecoveryGrid& grid_;
-    std::vector<int> bands_;  // 1 to the grid's band count
-    std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel_;
-};
-
-// The state of each pixel of a w x h rectangle: kNotSeen, kClear or kUnclear (a
-// VISIBILITY_HIDDEN pixel within e pixels, a square neighbourhood); `vis` is the rectangle with
-// a border of e pixels.
-void PixelStates(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
-                 std::vector<unsigned char>& state);
-
 // Values as the mosaic's data type holds them: rounded and clamped for integer types.
 class ValueRange {
   public:
@@ -216,6 +168,60 @@ class ValueRange {
     bool integer_;
     double lo_, hi_;
 };
+
+// One scene over a rectangle of the mosaic grid.
+struct SceneTile {
+    std::size_t scene = 0;
+    // Per pixel: kNotSeen, kClear (seen, no hidden pixel within the pixel error) or kUnclear.
+    std::vector<unsigned char> state;
+    std::vector<float> angle;   // tangent of the off-nadir angle (infinity: unknown), if asked
+    std::vector<float> values;  // `bands` planes, if asked
+};
+enum : unsigned char { kNotSeen = 0, kClear = 1, kUnclear = 2 };
+
+constexpr float kUnknownAngle = std::numeric_limits<float>::infinity();
+
+// Reads scenes over rectangles; Read may be called from several threads, each with its own
+// Scratch.
+class SceneReader {
+  public:
+    struct Scratch {
+        // The visibility index over the read with its border: VISIBILITY_SEEN, VISIBILITY_HIDDEN
+        // or another value (a raster of another type than Byte is read into `values` first).
+        std::vector<unsigned char> visibility;
+        std::vector<float> values;
+        std::vector<unsigned char> row;  // PixelStates'
+        std::vector<unsigned char> bytes;  // a Byte ortho's values
+        std::vector<int> last;
+        std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;
+    };
+    SceneReader(const RecoveryJob& job, const RecoveryGrid& grid);
+    // Fills `out` for scene s over r; false (values and angles not read) when the scene sees
+    // no pixel of r.
+    bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
+              SceneTile& out) const;
+    // The angles of out.scene over r, for a tile Read without them.
+    void ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) const;
+    // The ortho's `bands` planes over r; no-data outside the scene's raster.
+    void ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const;
+    // The same, balanced (value * gain + offset per band, as `range` holds it) where `state`
+    // (over r) says the scene sees the pixel.
+    void ReadBalanced(std::size_t s, const Rect& r, const std::vector<double>& gain,
+                      const std::vector<double>& offset, const std::vector<unsigned char>& state,
+                      const ValueRange& range, Scratch& scratch, std::vector<float>& values) const;
+
+  private:
+    const RecoveryJob& job_;
+    const RecoveryGrid& grid_;
+    std::vector<int> bands_;  // 1 to the grid's band count
+    std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel_;
+};
+
+// The state of each pixel of a w x h rectangle: kNotSeen, kClear or kUnclear (a
+// VISIBILITY_HIDDEN pixel within e pixels, a square neighbourhood); `vis` is the rectangle with
+// a border of e pixels.
+void PixelStates(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
+                 std::vector<unsigned char>& state);
 
 // Metres per pixel of the grid (near enough on a geographic one).
 double PixelMetres(const RecoveryGrid& grid);
