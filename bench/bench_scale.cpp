@@ -4,7 +4,8 @@
 // (every file named after it), and the mosaic step: its time in the run (summary.json's
 // "occlusion recovery") and a second run that makes the mosaic alone (the scenes kept), against
 // gdalwarp making a Cloud Optimized GeoTIFF of the same scene orthos on the mosaic's grid on one
-// thread. Time and memory per image should not grow with the block.
+// thread, with the mosaic's default creation options. Time and memory per image should not grow
+// with the block.
 //
 //   bench_scale [--blocks 2x2,4x4,8x8] [--image-size 1000] [--jobs 2] [--fresh]
 //
@@ -174,7 +175,8 @@ int main(int argc, char** argv) {
             "--config", "GDAL_NUM_THREADS", "1", "-te", number(gt[0]), number(gt[3] + height * gt[5]),
             number(gt[0] + width * gt[1]), number(gt[3]), "-ts", std::to_string(width),
             std::to_string(height), "-r", "near", "-co", "COMPRESS=DEFLATE", "-co",
-            "PREDICTOR=YES", "-co", "BLOCKSIZE=512"};
+            "PREDICTOR=YES", "-co", "LEVEL=5", "-co", "BLOCKSIZE=512", "-co",
+            "OVERVIEW_RESAMPLING=AVERAGE"};
         warp.insert(warp.end(), orthos.begin(), orthos.end());
         warp.push_back((scratch / ("gdalwarp" + std::to_string(n) + ".tif")).string());
         const benchsupport::ChildRun gdalwarp =

@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <fstream>
 #include <iterator>
+#include <optional>
 #include <random>
 #include <string>
 
@@ -57,6 +58,30 @@ inline void ExpectThrownFrom(const kestrel::Exception& e, const std::string& fun
     EXPECT_EQ(e.GetFunction(), function);
     EXPECT_EQ(e.GetSourceFile(), sourceFile);
     EXPECT_GT(e.GetSourceLine(), 0u);
+}
+
+// What `call` throws as an E, for its fields to be checked; none, and a failure naming `what`,
+// when it throws nothing.
+template <class E = kestrel::Exception, class F>
+std::optional<E> Thrown(F&& call, const std::string& what = "") {
+    try {
+        call();
+    } catch (const E& e) {
+        return e;
+    }
+    ADD_FAILURE() << "nothing thrown: " << what;
+    return std::nullopt;
+}
+
+// The message of what `call` throws as an E, or "(nothing thrown)".
+template <class E = kestrel::Exception, class F>
+std::string ThrownMessage(F&& call, const std::string& what = "") {
+    const std::optional<E> e = Thrown<E>(call, what);
+    return e ? std::string(e->what()) : "(nothing thrown)";
+}
+
+inline bool Contains(const std::string& text, const std::string& part) {
+    return text.find(part) != std::string::npos;
 }
 
 }  // namespace testsupport

@@ -229,17 +229,6 @@ std::array<double, 2> Project(const IMathModel& model, double x, double y, doubl
     return image;
 }
 
-// The message of what a call throws.
-template <typename F>
-std::string Thrown(F&& call) {
-    try {
-        call();
-    } catch (const kestrel::Exception& e) {
-        return e.what();
-    }
-    return "nothing thrown";
-}
-
 }  // namespace
 
 // Omega, phi, kappa in the classical convention: a camera 1000 m above the ground, f = 1000 px
@@ -429,13 +418,13 @@ TEST(FrameCamera, UnusableOrientationsAreNamed) {
         std::filesystem::remove(side);
         if (!k.sideFile.empty())
             testsupport::WriteFile(side, k.sideFile);
-        const std::string message = Thrown(k.call);
+        const std::string message = testsupport::ThrownMessage(k.call, k.what);
         for (const std::string& name : k.named)
             EXPECT_NE(message.find(name), std::string::npos) << k.what << ": " << message;
     }
     // A camera of another size than its image.
     testsupport::WriteFile(side, "{" + std::string(good).replace(good.find("80"), 2, "81") + "}");
-    const std::string message = Thrown(fromSide);
+    const std::string message = testsupport::ThrownMessage(fromSide);
     EXPECT_NE(message.find(side), std::string::npos) << message;
     EXPECT_NE(message.find("the camera of \"" + image + "\" is 100 x 81 pixels, the image 100 x 80"),
               std::string::npos)

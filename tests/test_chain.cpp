@@ -249,7 +249,9 @@ TEST(ParserFactory, EveryParserRefusesBadFilesAndIndices) {
     }
 }
 
-TEST(ParserFactory, SceneParserForAMissingFileHoldsTheNameAndNothingRead) {
+// A scene parser for a file not yet written holds its name and nothing read; a file that is
+// malformed or misses elements is refused.
+TEST(ParserFactory, SceneParserReadsAFileThatExistsAndRefusesABrokenOne) {
     TempDir dir;
     const std::string name = dir.File("later.xml");
     std::unique_ptr<TOSceneParser> scene(ParserFactory::CreateSceneParser(name));
@@ -257,10 +259,6 @@ TEST(ParserFactory, SceneParserForAMissingFileHoldsTheNameAndNothingRead) {
     EXPECT_EQ(scene->GetSceneFilename(), "");
     EXPECT_EQ(scene->GetMmseg(), -1);
     EXPECT_EQ(scene->GetSceneFootprint(), nullptr);
-}
-
-TEST(ParserFactory, SceneParserForABrokenFileThrowsAndKeepsNothing) {
-    TempDir dir;
     const std::string malformed = WriteFile(dir.File("bad.xml"), "<TOSceneDesc_Document><Sou");
     EXPECT_THROW(delete ParserFactory::CreateSceneParser(malformed), kestrel::Exception);
     const std::string incomplete = WriteFile(dir.File("short.xml"),

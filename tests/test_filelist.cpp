@@ -3,61 +3,38 @@
 
 #include "support.h"
 
+#include <climits>
+
 using kestrel::DataException;
 using kestrel::processes::silvan::FileListParser;
-using testsupport::ExpectThrownFrom;
 using testsupport::TempDir;
 using testsupport::WriteFile;
 
-namespace {
-
-const char* const kParseLine = "void kestrel::processes::silvan::FileListParser::ParseLine(int)";
-
-std::string ThreeFiles(const TempDir& dir) {
-    return WriteFile(dir.File("list.txt"), "!MFILE\na.tif\nsub/b.tif\nc d.tif\n");
-}
-
-void ExpectRangeError(FileListParser& files, int index, const std::string& message) {
-    try {
+// Lines are read by index in any order, an empty field as an empty name; an index outside the
+// lines is refused and keeps the current line.
+TEST(FileListParser, ReadsLinesByIndexAndRefusesIndicesOutsideThem) {
+    TempDir dir;
+    FileListParser files(
+        WriteFile(dir.File("list.txt"), "!MFILE\na.tif\nsub/b.tif\nc d.tif\n ;x\n"));
+    EXPECT_EQ(files.GetMfileLines(), 4u);
+    EXPECT_EQ(files.GetFili(), "");
+    const std::pair<int, const char*> reads[] = {
+        {2, "c d.tif"}, {0, "a.tif"}, {0, "a.tif"}, {3, ""}, {1, "sub/b.tif"}};
+    for (const auto& [index, name] : reads) {
         files.ParseLine(index);
-        FAIL() << "index " << index << " was accepted";
-    } catch (const DataException& e) {
-        EXPECT_EQ(e.GetErrorMessage(), message);
-        ExpectThrownFrom(e, kParseLine, "filelistparser.cpp");
+        EXPECT_EQ(files.GetFili(), name) << index;
     }
-}
-
-}  // namespace
-
-TEST(FileListParser, ReadsLinesByIndexInAnyOrder) {
-    TempDir dir;
-    FileListParser files(ThreeFiles(dir));
-    EXPECT_EQ(files.GetMfileLines(), 3u);
-    EXPECT_EQ(files.GetFili(), "");
-    files.ParseLine(2);
-    EXPECT_EQ(files.GetFili(), "c d.tif");
-    files.ParseLine(0);
-    EXPECT_EQ(files.GetFili(), "a.tif");
-    files.ParseLine(0);
-    EXPECT_EQ(files.GetFili(), "a.tif");
-    files.ParseLine(1);
+    for (const int index : {4, -1, INT_MIN}) {
+        try {
+            files.ParseLine(index);
+            ADD_FAILURE() << "index " << index << " was accepted";
+        } catch (const DataException& e) {
+            EXPECT_EQ(e.GetErrorMessage(),
+                      "Index " + std::to_string(index) + " is outside of valid range: 4");
+            testsupport::ExpectThrownFrom(
+                e, "void kestrel::processes::silvan::FileListParser::ParseLine(int)",
+                "filelistparser.cpp");
+        }
+    }
     EXPECT_EQ(files.GetFili(), "sub/b.tif");
-    EXPECT_EQ(files.GetMfileLines(), 3u);
-}
-
-TEST(FileListParser, IndexOutsideTheLinesIsRefusedAndKeepsTheCurrentLine) {
-    TempDir dir;
-    FileListParser files(ThreeFiles(dir));
-    files.ParseLine(1);
-    ExpectRangeError(files, 3, "Index 3 is outside of valid range: 3");
-    ExpectRangeError(files, -1, "Index -1 is outside of valid range: 3");
-    ExpectRangeError(files, -2147483647 - 1, "Index -2147483648 is outside of valid range: 3");
-    EXPECT_EQ(files.GetFili(), "sub/b.tif");
-}
-
-TEST(FileListParser, EmptyFieldReadsAsEmptyName) {
-    TempDir dir;
-    FileListParser files(WriteFile(dir.File("list.txt"), "a.tif\n ;x\n"));
-    files.ParseLine(1);
-    EXPECT_EQ(files.GetFili(), "");
 }

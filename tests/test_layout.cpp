@@ -402,9 +402,9 @@ TEST(Layout, ExtentAgreesWithGdalwarpOverTerrain) {
     }
 }
 
-// A DEM that covers part of the scene gives the layout of the covered ground and says what share
-// it leaves out; one that misses all of it, or covers under 2 %, and requests that would give a
-// useless grid, are refused with what was wrong.
+// A DEM that covers the whole scene, or part of it: the latter gives the layout of the covered
+// ground and says what share it leaves out; one that misses all of it, or covers under 2 %, and
+// requests that would give a useless grid, are refused with what was wrong.
 TEST(Layout, PartialTerrainCutsTheSceneAndTooLittleIsRefused) {
     TempDir dir;
     const std::string image = dir.File("src.tif");
@@ -426,6 +426,13 @@ TEST(Layout, PartialTerrainCutsTheSceneAndTooLittleIsRefused) {
     const kestrel::orthoutils::Layout whole =
         kestrel::orthoutils::ComputeLayout(*model, &terrain, plain);
     EXPECT_EQ(whole.uncoveredShare, 0.0);
+    // Without a pixel size, the source's ground resolution (about 1.5 m), and corners on whole
+    // multiples of it.
+    EXPECT_NEAR(whole.pixelWidth, 1.5, 0.2);
+    EXPECT_EQ(whole.pixelWidth, whole.pixelHeight);
+    for (const int corner : {0, 3})
+        EXPECT_NEAR(std::remainder(whole.geocoding.GetGeoTransform()[corner], whole.pixelWidth),
+                    0.0, 1e-6);
     const auto xs = std::minmax_element(whole.borderX.begin(), whole.borderX.end());
     const double west = *xs.first, east = *xs.second;
     const FunctionTerrain half(&rpcscene::Hills, 511000, 5030000, (west + east) / 2, 5038000);
@@ -449,23 +456,6 @@ TEST(Layout, PartialTerrainCutsTheSceneAndTooLittleIsRefused) {
     expectMessage(&terrain, request, "is not a finite value of 0 or more");
     request.pixelWidth = request.pixelHeight = 1e-4;
     expectMessage(&terrain, request, "larger than");
-}
-
-// Without a pixel size the ground resolution of the source is taken: this image has about
-// 1.5 m pixels.
-TEST(Layout, ZeroPixelSizeTakesTheSourceResolution) {
-    TempDir dir;
-    const std::string image = dir.File("src.tif");
-    rpcscene::WriteRpcImage(image, 1000, 800);
-    std::unique_ptr<kestrel::mathmodel::IMathModel> model(GetSrcModel(image, "", 0));
-    const FunctionTerrain terrain = SceneHills();
-    const auto layout = kestrel::orthoutils::ComputeLayout(*model, &terrain, {});
-    EXPECT_NEAR(layout.pixelWidth, 1.5, 0.2);
-    EXPECT_EQ(layout.pixelWidth, layout.pixelHeight);
-    // Corners on whole multiples of the pixel size.
-    const auto& g = layout.geocoding.GetGeoTransform();
-    EXPECT_NEAR(std::remainder(g[0], layout.pixelWidth), 0.0, 1e-6);
-    EXPECT_NEAR(std::remainder(g[3], layout.pixelHeight), 0.0, 1e-6);
 }
 
 // A nadir frame camera whose centre ray is plumb, 90.2 m above flat ground: the layout lies on

@@ -20,7 +20,9 @@
 #include "support.h"
 
 using kestrel::mathmodel::IMathModel;
+using testsupport::Contains;
 using testsupport::TempDir;
+using testsupport::ThrownMessage;
 
 namespace {
 
@@ -201,27 +203,17 @@ TEST(SourceModels, SegmentSelectsTheKindAndMissingModelsAreNamed) {
     EXPECT_TRUE(Model(both, 0)->GetCRS()->IsGeographic());
     EXPECT_TRUE(Model(both, 1)->GetCRS()->IsGeographic());
     EXPECT_EQ(Model(both, 3)->GetCRS(), nullptr);  // a geotransform without a CRS
-    try {
-        Model(both, 2);
-        FAIL() << "no GCPs";
-    } catch (const kestrel::DataException& e) {
-        EXPECT_NE(std::string(e.what()).find("ground control points"), std::string::npos);
-        EXPECT_NE(std::string(e.what()).find(both), std::string::npos);
-    }
+    const std::string noGcps = ThrownMessage<kestrel::DataException>([&] { Model(both, 2); });
+    EXPECT_TRUE(Contains(noGcps, "ground control points") && Contains(noGcps, both)) << noGcps;
     const std::string plain = dir.File("plain.tif");
     {
         std::unique_ptr<GDALDataset> ds(GetGDALDriverManager()->GetDriverByName("GTiff")->Create(
             plain.c_str(), 10, 10, 1, GDT_Byte, nullptr));
     }
-    try {
-        Model(plain);
-        FAIL() << "no model";
-    } catch (const kestrel::DataException& e) {
-        EXPECT_NE(std::string(e.what()).find("has no math model"), std::string::npos);
-        EXPECT_NE(std::string(e.what()).find("RPC coefficients, ground control points or a "
-                                             "geotransform"),
-                  std::string::npos);
-    }
+    const std::string none = ThrownMessage<kestrel::DataException>([&] { Model(plain); });
+    EXPECT_TRUE(Contains(none, "has no math model") &&
+                Contains(none, "RPC coefficients, ground control points or a geotransform"))
+        << none;
     EXPECT_THROW(Model(dir.File("missing.tif")), kestrel::FileNotFoundException);
     EXPECT_THROW(Model(both, 5), kestrel::ParameterException);
     // The library's own entry point hands the segment on.
@@ -239,10 +231,7 @@ TEST(MapunitsToCRS, TakesWhatOgrTakesAndQuotesWhatNamesNoCRS) {
             kestrel::ogc::utils::MapunitsToCRS(crs->GetWKT()));
         EXPECT_TRUE(again->IsSame(*crs)) << text;
     }
-    try {
-        delete kestrel::ogc::utils::MapunitsToCRS("Non");
-        FAIL();
-    } catch (const kestrel::DataException& e) {
-        EXPECT_NE(std::string(e.what()).find("\"Non\""), std::string::npos);
-    }
+    EXPECT_TRUE(Contains(ThrownMessage<kestrel::DataException>(
+                             [] { delete kestrel::ogc::utils::MapunitsToCRS("Non"); }),
+                         "\"Non\""));
 }

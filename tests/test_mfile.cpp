@@ -85,11 +85,21 @@ TEST(MFileTable, ControlBytesInValuesAreRefused) {
     }
 }
 
-TEST(MFileTable, FieldsAreTrimmedButKeepInnerBlanks) {
+// Fields are trimmed but keep inner blanks, list items may have blanks around them, later
+// columns do not shift earlier ones, and a file of comments and blank lines has no lines.
+TEST(MFileTable, FieldsAndListsReadAsWritten) {
     TempDir dir;
-    auto table = Read(WriteFile(dir.File("m.txt"), " \tmy scene.tif\t ; -12 \n"));
+    auto table =
+        Read(WriteFile(dir.File("m.txt"),
+                       " \tmy scene.tif\t ; -12 ;1,2,3; 4 , -5 ,+6 ;2147483647,-2147483648;e\n"));
     EXPECT_EQ(table->GetString(0, 0), "my scene.tif");
     EXPECT_EQ(table->GetInt(0, 1), -12);
+    EXPECT_EQ(table->GetIntList(0, 2), (std::vector<int>{1, 2, 3}));
+    EXPECT_EQ(table->GetIntList(0, 3), (std::vector<int>{4, -5, 6}));
+    EXPECT_EQ(table->GetIntList(0, 4), (std::vector<int>{2147483647, -2147483648}));
+    EXPECT_EQ(table->GetString(0, 5), "e");
+    EXPECT_EQ(Read(WriteFile(dir.File("c.txt"), "!MFILE\n\n  \n"))->GetLineCount(), 0u);
+    EXPECT_EQ(Read(WriteFile(dir.File("e.txt"), ""))->GetLineCount(), 0u);
 }
 
 TEST(MFileTable, MissingOrEmptyFieldsReadAsTypedDefaults) {
@@ -106,21 +116,6 @@ TEST(MFileTable, MissingOrEmptyFieldsReadAsTypedDefaults) {
     EXPECT_EQ(table->GetString(0, 0), "only");
     table->AddDefaultIntList({});
     EXPECT_TRUE(table->GetIntList(0, 3).empty());
-}
-
-TEST(MFileTable, IntegerListsAllowBlanksAroundItems) {
-    TempDir dir;
-    auto table = Read(WriteFile(dir.File("m.txt"), "1,2,3; 4 , -5 ,+6 ;2147483647,-2147483648\n"));
-    EXPECT_EQ(table->GetIntList(0, 0), (std::vector<int>{1, 2, 3}));
-    EXPECT_EQ(table->GetIntList(0, 1), (std::vector<int>{4, -5, 6}));
-    EXPECT_EQ(table->GetIntList(0, 2), (std::vector<int>{2147483647, -2147483648}));
-}
-
-TEST(MFileTable, ExtraSeparatorsDoNotShiftEarlierColumns) {
-    TempDir dir;
-    auto table = Read(WriteFile(dir.File("m.txt"), "a;b;c;d;e\n"));
-    EXPECT_EQ(table->GetString(0, 1), "b");
-    EXPECT_EQ(table->GetString(0, 4), "e");
 }
 
 // A value that is not of the asked type is refused with the file, line in the file and column.
@@ -203,14 +198,6 @@ TEST(MFileTable, PipeIsRead) {
     EXPECT_EQ(table->GetInt(1, 1), 2);
 }
 #endif
-
-TEST(MFileTable, FileOfCommentsHasNoLines) {
-    TempDir dir;
-    auto table = Read(WriteFile(dir.File("m.txt"), "!MFILE\n\n  \n"));
-    ASSERT_TRUE(table);
-    EXPECT_EQ(table->GetLineCount(), 0u);
-    EXPECT_EQ(Read(WriteFile(dir.File("e.txt"), ""))->GetLineCount(), 0u);
-}
 
 // A file of many read chunks: lines, comments, blank lines and CR LF ends that straddle chunk
 // boundaries are indexed like any others.

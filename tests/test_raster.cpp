@@ -30,7 +30,10 @@ using kestrel::datasources::IRasterDataset;
 using kestrel::datasources::IRasterReader;
 using kestrel::datasources::IRasterWriter;
 using kestrel::gobs::Raster;
+using testsupport::Contains;
 using testsupport::TempDir;
+using testsupport::Thrown;
+using testsupport::ThrownMessage;
 
 namespace {
 
@@ -135,14 +138,12 @@ TEST(RasterDataset, PathThatIsNoRasterThrowsFileNotFoundWithThePath) {
     TempDir dir;
     for (const std::string& path :
          {dir.File("missing.tif"), testsupport::WriteFile(dir.File("junk.tif"), "not a tiff")}) {
-        try {
-            delete GetRasterDataset(path);
-            ADD_FAILURE() << path;
-        } catch (const kestrel::FileNotFoundException& e) {
-            EXPECT_EQ(e.GetFileName(), path);
-            EXPECT_EQ(e.GetErrorMessage(), "");
-            testsupport::ExpectThrownFrom(e, e.GetFunction(), "utils.cpp");
-            EXPECT_NE(e.GetFunction().find("GetRasterDataset"), std::string::npos);
+        if (const auto e = Thrown<kestrel::FileNotFoundException>(
+                [&] { delete GetRasterDataset(path); }, path)) {
+            EXPECT_EQ(e->GetFileName(), path);
+            EXPECT_EQ(e->GetErrorMessage(), "");
+            testsupport::ExpectThrownFrom(*e, e->GetFunction(), "utils.cpp");
+            EXPECT_TRUE(Contains(e->GetFunction(), "GetRasterDataset"));
         }
     }
     // The platform's own dataset is never null and says why it is not valid.
@@ -233,32 +234,23 @@ TEST(RasterReader, BadInputGivesClearErrors) {
     BasicReader reader(path);
     for (auto w : std::vector<std::vector<unsigned int>>{
              {0, 0, 0, 1}, {299, 0, 2, 1}, {0, 199, 1, 2}, {4000000000u, 0, 1, 1}}) {
-        try {
-            delete reader.ReadWindow(w[0], w[1], w[2], w[3]);
-            ADD_FAILURE() << w[0];
-        } catch (const kestrel::DataException& e) {
-            EXPECT_NE(std::string(e.what()).find("a.tif"), std::string::npos) << e.what();
-        }
+        EXPECT_TRUE(Contains(ThrownMessage<kestrel::DataException>(
+                                 [&] { delete reader.ReadWindow(w[0], w[1], w[2], w[3]); }),
+                             "a.tif"))
+            << w[0];
     }
     std::unique_ptr<IDataset> ds(GetRasterDataset(path));
-    try {
+    const std::string channel = ThrownMessage<kestrel::DataException>([&] {
         delete GetRasterReader(ds.get(), {1, 4});
-        ADD_FAILURE();
-    } catch (const kestrel::DataException& e) {
-        EXPECT_NE(std::string(e.what()).find("Channel 4"), std::string::npos) << e.what();
-        EXPECT_NE(std::string(e.what()).find("3 channels"), std::string::npos) << e.what();
-    }
+    });
+    EXPECT_TRUE(Contains(channel, "Channel 4") && Contains(channel, "3 channels")) << channel;
     EXPECT_THROW(BasicReader(dir.File("none.tif")), kestrel::FileNotFoundException);
     // A truncated file opens but cannot be read: the probe reports it with GDAL's reason.
     const std::string bytes = testsupport::ReadFile(path);
     const std::string cut =
         testsupport::WriteFile(dir.File("cut.tif"), bytes.substr(0, bytes.size() / 3));
-    try {
-        delete GetRasterReader(cut);
-        ADD_FAILURE();
-    } catch (const kestrel::FileAccessException& e) {
-        EXPECT_EQ(e.GetFileName(), cut);
-    }
+    const auto e = Thrown<kestrel::FileAccessException>([&] { delete GetRasterReader(cut); });
+    EXPECT_EQ(e ? e->GetFileName() : "", cut);
 }
 
 // ---------------------------------------------------------------------------------------------
@@ -435,13 +427,12 @@ TEST(RasterWriter, CogIsTiledCompressedWithAveragedOverviewsAndAMask) {
                    {"COG", "BLOCKSIZE=16", "should be >= 128"}};
     for (const auto& r : refused) {
         SCOPED_TRACE(r.option);
-        try {
-            BasicWriter writer(dir.File("refused.tif"), {1}, r.format, "BIGTIFF=IF_SAFER " + r.option);
-            ADD_FAILURE() << "accepted";
-        } catch (const kestrel::ParameterException& e) {
-            EXPECT_EQ(e.GetValue(), r.option);
-            EXPECT_NE(std::string(e.what()).find(r.message), std::string::npos) << e.what();
-            EXPECT_NE(std::string(e.what()).find(r.format + " driver"), std::string::npos);
+        if (const auto e = Thrown<kestrel::ParameterException>([&] {
+                BasicWriter(dir.File("refused.tif"), {1}, r.format, "BIGTIFF=IF_SAFER " + r.option);
+            })) {
+            EXPECT_EQ(e->GetValue(), r.option);
+            EXPECT_TRUE(Contains(e->what(), r.message) && Contains(e->what(), r.format + " driver"))
+                << e->what();
         }
         EXPECT_FALSE(std::filesystem::exists(dir.File("refused.tif")));
     }
@@ -485,12 +476,9 @@ TEST(RasterWriter, SideFilesArePublishedWithTheirDatasetOrNotAtAll) {
 
     // The world file's name is taken by a directory: its rename fails.
     std::filesystem::create_directories(dir.Path() / "ortho.wld" / "inside");
-    try {
-        write("WORLDFILE=YES");
-        ADD_FAILURE() << "no exception";
-    } catch (const kestrel::FileAccessException& e) {
-        EXPECT_EQ(e.GetFileName(), png);
-        EXPECT_NE(std::string(e.what()).find("ortho.wld"), std::string::npos) << e.what();
+    if (const auto e = Thrown<kestrel::FileAccessException>([&] { write("WORLDFILE=YES"); })) {
+        EXPECT_EQ(e->GetFileName(), png);
+        EXPECT_TRUE(Contains(e->what(), "ortho.wld")) << e->what();
     }
     EXPECT_EQ(files(), (std::set<std::string>{"ortho.png", "ortho.png.aux.xml", "ortho.wld"}));
     EXPECT_EQ(testsupport::ReadFile(png), image);
@@ -518,12 +506,9 @@ TEST(RasterWriter, FailuresNameTheFileAndLeaveNothing) {
         std::unique_ptr<IRasterWriter> writer(GetRasterWriter(path, "tif", {1}));
         writer->SetSize(16, 16);
         writer->SetDataType(DataType::Byte);
-        try {
-            writer->Create();
-            ADD_FAILURE();
-        } catch (const kestrel::FileAccessException& e) {
-            EXPECT_EQ(e.GetFileName(), path);
-            EXPECT_EQ(e.GetType(), kestrel::FileAccessException::CreateFailed);
+        if (const auto e = Thrown<kestrel::FileAccessException>([&] { writer->Create(); })) {
+            EXPECT_EQ(e->GetFileName(), path);
+            EXPECT_EQ(e->GetType(), kestrel::FileAccessException::CreateFailed);
         }
     }
     std::filesystem::permissions(locked, std::filesystem::perms::owner_all);
@@ -533,35 +518,27 @@ TEST(RasterWriter, FailuresNameTheFileAndLeaveNothing) {
         std::unique_ptr<IRasterWriter> writer(GetRasterWriter(png, "png", {1}));
         writer->SetSize(16, 16);
         writer->SetDataType(DataType::Float64);
-        try {
-            writer->Close();
-            ADD_FAILURE();
-        } catch (const kestrel::FileAccessException& e) {
-            EXPECT_EQ(e.GetFileName(), png);
-        }
+        const auto e = Thrown<kestrel::FileAccessException>([&] { writer->Close(); });
+        EXPECT_EQ(e ? e->GetFileName() : "", png);
     }
     EXPECT_TRUE(std::filesystem::is_empty(dir.Path() / "locked"));
     std::filesystem::remove(dir.Path() / "locked");
     EXPECT_TRUE(std::filesystem::is_empty(dir.Path()));
     // A directory that does not exist.
-    try {
-        std::unique_ptr<IRasterWriter> writer(
-            GetRasterWriter(dir.File("no/such/dir/o.tif"), "tif", {1}));
-        writer->SetSize(16, 16);
-        writer->SetDataType(DataType::Byte);
-        writer->Create();
-        ADD_FAILURE();
-    } catch (const kestrel::FileAccessException& e) {
-        EXPECT_NE(std::string(e.what()).find("no/such/dir/o.tif"), std::string::npos);
-    }
+    EXPECT_TRUE(Contains(ThrownMessage<kestrel::FileAccessException>([&] {
+                             std::unique_ptr<IRasterWriter> writer(
+                                 GetRasterWriter(dir.File("no/such/dir/o.tif"), "tif", {1}));
+                             writer->SetSize(16, 16);
+                             writer->SetDataType(DataType::Byte);
+                             writer->Create();
+                         }),
+                         "no/such/dir/o.tif"));
     // Unknown types and formats.
-    try {
-        delete GetRasterWriter(dir.File("a.xyz1"), "xyz1", {1});
-        ADD_FAILURE();
-    } catch (const kestrel::ParameterException& e) {
-        EXPECT_EQ(e.GetType(), kestrel::ParameterException::Unsupported);
-        EXPECT_EQ(e.GetValue(), "xyz1");
-        EXPECT_NE(e.GetExpected().find("gpkg"), std::string::npos);
+    if (const auto e = Thrown<kestrel::ParameterException>(
+            [&] { delete GetRasterWriter(dir.File("a.xyz1"), "xyz1", {1}); })) {
+        EXPECT_EQ(e->GetType(), kestrel::ParameterException::Unsupported);
+        EXPECT_EQ(e->GetValue(), "xyz1");
+        EXPECT_TRUE(Contains(e->GetExpected(), "gpkg"));
     }
 }
 
@@ -657,13 +634,11 @@ TEST(RasterUtils, FileTypesNameGdalFormats) {
         EXPECT_EQ(kestrel::core::FileExtension(format), extension) << format;
     for (const std::string& type :
          std::vector<std::string>{"", "tiff2", "ESRI Shapefile", std::string("tif\0x", 5)}) {
-        try {
-            kestrel::core::FType2FormatName(type);
-            ADD_FAILURE() << type;
-        } catch (const kestrel::ParameterException& e) {
-            EXPECT_EQ(e.GetType(), kestrel::ParameterException::Unsupported);
-            EXPECT_EQ(e.GetValue(), type);
-            EXPECT_NE(std::string(e.what()).find("tif, tiff"), std::string::npos) << e.what();
+        if (const auto e = Thrown<kestrel::ParameterException>(
+                [&] { kestrel::core::FType2FormatName(type); }, type)) {
+            EXPECT_EQ(e->GetType(), kestrel::ParameterException::Unsupported);
+            EXPECT_EQ(e->GetValue(), type);
+            EXPECT_TRUE(Contains(e->what(), "tif, tiff")) << e->what();
         }
     }
 }
@@ -676,13 +651,12 @@ TEST(RasterUtils, SourceAndOrthoChannelsOfOneDataType) {
     GetSrcOrthoChans(ds.get(), {3, 1}, src, ortho);
     EXPECT_EQ(src, (std::vector<unsigned int>{3, 1}));
     EXPECT_EQ(ortho, (std::vector<unsigned int>{1, 2}));
-    try {
-        GetSrcOrthoChans(ds.get(), {1, 2}, src, ortho);
-        ADD_FAILURE();
-    } catch (const kestrel::DataException& e) {
-        EXPECT_EQ(e.GetErrorMessage(),
+    if (const auto e = Thrown<kestrel::DataException>([&] {
+            GetSrcOrthoChans(ds.get(), {1, 2}, src, ortho);
+        })) {
+        EXPECT_EQ(e->GetErrorMessage(),
                   "All channels must belong to the same datatype, but 2 data types are found.");
-        EXPECT_EQ(e.GetSourceFile(), "utils.cpp");
+        EXPECT_EQ(e->GetSourceFile(), "utils.cpp");
     }
     EXPECT_EQ(src, (std::vector<unsigned int>{3, 1}));
     EXPECT_EQ(ortho, (std::vector<unsigned int>{1, 2}));
@@ -699,13 +673,10 @@ TEST(RasterUtils, SourceAndOrthoChannelsOfOneDataType) {
     EXPECT_EQ(infos.size(), 3u);
     GetChanGroups("", {2, 1, 3}, ds.get(), infos, groups, true);
     EXPECT_EQ(groups[1].orthoChans, (std::vector<unsigned int>{2, 3}));
-    try {
+    const std::string zero = ThrownMessage<kestrel::DataException>([&] {
         GetSrcOrthoChans(ds.get(), {1, 0}, src, ortho);
-        ADD_FAILURE();
-    } catch (const kestrel::DataException& e) {
-        EXPECT_NE(std::string(e.what()).find("Channel 0"), std::string::npos) << e.what();
-        EXPECT_NE(std::string(e.what()).find("3 channels"), std::string::npos) << e.what();
-    }
+    });
+    EXPECT_TRUE(Contains(zero, "Channel 0") && Contains(zero, "3 channels")) << zero;
 }
 
 TEST(RasterUtils, DiskIdIsTheDeviceOfTheFile) {

@@ -100,20 +100,31 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
     std::vector<double> fractions(tw);
     for (int i = 0; i < tw; ++i)
         cell(i, tw, nodes[i], fractions[i]);
+    // Per column, along the lattice rows above and below the current line (unknown where a
+    // node of the cell is).
+    std::vector<double> above(tw), below(tw);
+    std::vector<unsigned char> unknown(tw);
+    int row = -1;
     for (int j = 0; j < th; ++j) {
         int b;
         double fy;
         cell(j, th, b, fy);
-        for (int i = 0; i < tw; ++i) {
-            const int a = nodes[i];
-            const double fx = fractions[i];
-            const size_t k = static_cast<size_t>(b) * nx + a;
-            const float q[4] = {lattice[k], lattice[k + 1], lattice[k + nx], lattice[k + nx + 1]};
-            if (std::isinf(q[0]) || std::isinf(q[1]) || std::isinf(q[2]) || std::isinf(q[3]))
-                continue;  // unknown
-            out[static_cast<size_t>(j) * tw + i] = static_cast<float>(
-                (1 - fy) * ((1 - fx) * q[0] + fx * q[1]) + fy * ((1 - fx) * q[2] + fx * q[3]));
+        if (b != row) {
+            row = b;
+            for (int i = 0; i < tw; ++i) {
+                const double fx = fractions[i];
+                const size_t k = static_cast<size_t>(b) * nx + nodes[i];
+                const float q[4] = {lattice[k], lattice[k + 1], lattice[k + nx], lattice[k + nx + 1]};
+                unknown[i] =
+                    std::isinf(q[0]) || std::isinf(q[1]) || std::isinf(q[2]) || std::isinf(q[3]);
+                above[i] = (1 - fx) * q[0] + fx * q[1];
+                below[i] = (1 - fx) * q[2] + fx * q[3];
+            }
         }
+        float* line = out.data() + static_cast<size_t>(j) * tw;
+        for (int i = 0; i < tw; ++i)
+            if (!unknown[i])
+                line[i] = static_cast<float>((1 - fy) * above[i] + fy * below[i]);
     }
 }
 
@@ -402,13 +413,7 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
                               VISIBILITY_SEEN, static_cast<size_t>(r.width)) != nullptr;
     if (!seesAny)
         return false;
-    MarkNearHidden(vis.data(), r.width, r.height, e, scratch, out.state);
-    for (int j = 0; j < r.height; ++j) {
-        const unsigned char* line = vis.data() + static_cast<size_t>(j + e) * border.width + e;
-        unsigned char* state = out.state.data() + static_cast<size_t>(j) * r.width;
-        for (int i = 0; i < r.width; ++i)  // kNotSeen, kClear or kUnclear
-            state[i] = static_cast<unsigned char>((line[i] == VISIBILITY_SEEN) * (1 + state[i]));
-    }
+    PixelStates(vis.data(), r.width, r.height, e, scratch, out.state);
     if (values)
         ReadValues(s, r, out.values);
     if (angles)
@@ -429,27 +434,28 @@ void SceneReader::ReadValues(std::size_t s, const Rect& r, std::vector<float>& v
     grid_.orthos[s]->Read(bands_.data(), grid_.bands, r, GDT_Float32, values.data());
 }
 
-// The square neighbourhood is a dilation along each row, then down each column. Along a row,
-// each hidden pixel marks the 2e + 1 outputs that reach it, each output written once; down the
-// columns, each output looks at the last row that marked its column. Rows and windows without
-// a hidden pixel cost a scan for one.
-void MarkNearHidden(const unsigned char* vis, int tw, int th, int e, SceneReader::Scratch& scratch,
-                    std::vector<unsigned char>& near) {
+// The square neighbourhood of hidden pixels is a dilation along each row, then down each
+// column. Along a row, each hidden pixel marks the 2e + 1 outputs that reach it, each output
+// written once; down the columns, each output looks at the last row that marked its column.
+// Rows and windows without a hidden pixel cost a scan for one.
+void PixelStates(const unsigned char* vis, int tw, int th, int e, SceneReader::Scratch& scratch,
+                 std::vector<unsigned char>& state) {
     const int vw = tw + 2 * e, vh = th + 2 * e;
-    near.assign(static_cast<size_t>(tw) * th, 0);
-    if (std::memchr(vis, VISIBILITY_HIDDEN, static_cast<size_t>(vw) * vh) == nullptr)
-        return;
-    std::vector<unsigned char>& row = scratch.row;  // the outputs of one border row
+    state.resize(static_cast<size_t>(tw) * th);
+    const bool anyHidden =
+        std::memchr(vis, VISIBILITY_HIDDEN, static_cast<size_t>(vw) * vh) != nullptr;
+    std::vector<unsigned char>& row = scratch.row;  // the marks of one border row
     std::vector<int>& last = scratch.last;          // per column, the last border row marking it
     row.resize(tw);
     last.assign(tw, -1);
     int latest = -1;  // the last border row marking any column
-    for (int r = 0; r < vh; ++r) {
+    for (int r = anyHidden ? 0 : 2 * e; r < vh; ++r) {
         const unsigned char* line = vis + static_cast<size_t>(r) * vw;
-        const void* hidden = std::memchr(line, VISIBILITY_HIDDEN, static_cast<size_t>(vw));
+        const void* hidden =
+            anyHidden ? std::memchr(line, VISIBILITY_HIDDEN, static_cast<size_t>(vw)) : nullptr;
         if (hidden != nullptr) {
             std::fill(row.begin(), row.end(), 0);
-            int filled = 0;  // outputs before this one are written
+            int filled = 0;  // marks before this one are written
             for (const unsigned char* p = static_cast<const unsigned char*>(hidden); p != nullptr;
                  p = static_cast<const unsigned char*>(std::memchr(
                      p + 1, VISIBILITY_HIDDEN, static_cast<size_t>(line + vw - p - 1)))) {
@@ -462,12 +468,17 @@ void MarkNearHidden(const unsigned char* vis, int tw, int th, int e, SceneReader
                 last[i] = row[i] ? r : last[i];
             latest = r;
         }
-        const int j = r - 2 * e;  // the output row whose neighbourhood ends here
-        if (j < 0 || latest < j)
+        const int j = r - 2 * e;  // the output line whose neighbourhood ends here
+        if (j < 0)
             continue;
-        unsigned char* out = near.data() + static_cast<size_t>(j) * tw;
-        for (int i = 0; i < tw; ++i)
-            out[i] = last[i] >= j;
+        const unsigned char* seen = vis + static_cast<size_t>(j + e) * vw + e;
+        unsigned char* out = state.data() + static_cast<size_t>(j) * tw;
+        if (latest < j)
+            for (int i = 0; i < tw; ++i)
+                out[i] = seen[i] == VISIBILITY_SEEN ? kClear : kNotSeen;
+        else
+            for (int i = 0; i < tw; ++i)
+                out[i] = seen[i] != VISIBILITY_SEEN ? kNotSeen : last[i] >= j ? kUnclear : kClear;
     }
 }
 

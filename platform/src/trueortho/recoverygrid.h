@@ -158,7 +158,7 @@ class SceneReader {
         // or another value (a raster of another type than Byte is read into `values` first).
         std::vector<unsigned char> visibility;
         std::vector<float> values;
-        std::vector<unsigned char> row;  // MarkNearHidden's
+        std::vector<unsigned char> row;  // PixelStates'
         std::vector<int> last;
         std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;
     };
@@ -179,10 +179,11 @@ class SceneReader {
     std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel_;
 };
 
-// Marks (1, else 0) the pixels of a w x h rectangle that have a VISIBILITY_HIDDEN pixel within
-// e pixels (a square neighbourhood); `vis` is the rectangle with a border of e pixels.
-void MarkNearHidden(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
-                    std::vector<unsigned char>& near);
+// The state of each pixel of a w x h rectangle: kNotSeen, kClear or kUnclear (a
+// VISIBILITY_HIDDEN pixel within e pixels, a square neighbourhood); `vis` is the rectangle with
+// a border of e pixels.
+void PixelStates(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
+                 std::vector<unsigned char>& state);
 
 // Values as the mosaic's data type holds them: rounded and clamped for integer types.
 class ValueRange {
