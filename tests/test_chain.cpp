@@ -162,19 +162,16 @@ TEST(ParserFactory, EmptyFileNamesAreRefusedWithTheOperationsParameterName) {
          "CreateTPMFileParser"},
     };
     for (const auto& c : cases) {
-        try {
-            c.create();
-            ADD_FAILURE() << c.function << " accepted an empty name";
-        } catch (const ParameterException& e) {
-            EXPECT_EQ(e.GetErrorMessage(), "Empty filename");
-            EXPECT_EQ(e.GetParameterName(), c.parameter);
-            EXPECT_EQ(e.GetType(), ParameterException::EmptyValue);
-            EXPECT_EQ(static_cast<int>(e.GetType()), 3);
-            EXPECT_EQ(e.GetValue(), "");
-            EXPECT_EQ(e.GetSourceFile(), "parserfactory.cpp");
-            EXPECT_NE(e.GetFunction().find(std::string("ParserFactory::") + c.function),
-                      std::string::npos)
-                << e.GetFunction();
+        if (const auto e = testsupport::Thrown<ParameterException>(c.create, c.function)) {
+            EXPECT_EQ(e->GetErrorMessage(), "Empty filename");
+            EXPECT_EQ(e->GetParameterName(), c.parameter);
+            EXPECT_EQ(e->GetType(), ParameterException::EmptyValue);
+            EXPECT_EQ(static_cast<int>(e->GetType()), 3);
+            EXPECT_EQ(e->GetValue(), "");
+            EXPECT_EQ(e->GetSourceFile(), "parserfactory.cpp");
+            EXPECT_TRUE(testsupport::Contains(e->GetFunction(),
+                                              std::string("ParserFactory::") + c.function))
+                << e->GetFunction();
         }
     }
 }
@@ -218,32 +215,30 @@ TEST(ParserFactory, EveryParserRefusesBadFilesAndIndices) {
     for (std::size_t k = 0; k < 4; ++k) {
         const std::string name = parsers[k].name;
         for (const std::string& file : {missing, empty}) {
-            try {
-                parsers[k].open(file, 0);
-                ADD_FAILURE() << name << " read " << file;
-            } catch (const ParameterException& e) {
-                EXPECT_EQ(e.GetErrorMessage(), file == empty ? "Empty text file" : "Invalid MFILE");
-                EXPECT_EQ(e.GetParameterName(), "MFILE");
-                EXPECT_EQ(static_cast<int>(e.GetType()), 0);
-                EXPECT_EQ(e.GetValue(), file);
-                EXPECT_EQ(e.GetExpected(), "");
-                EXPECT_NE(e.GetFunction().find(name + "::" + name + "(const std::string&"),
-                          std::string::npos)
-                    << e.GetFunction();
-                EXPECT_EQ(e.GetSourceFile(), source[k]);
+            if (const auto e = testsupport::Thrown<ParameterException>(
+                    [&] { parsers[k].open(file, 0); }, name + " read " + file)) {
+                EXPECT_EQ(e->GetErrorMessage(),
+                          file == empty ? "Empty text file" : "Invalid MFILE");
+                EXPECT_EQ(e->GetParameterName(), "MFILE");
+                EXPECT_EQ(static_cast<int>(e->GetType()), 0);
+                EXPECT_EQ(e->GetValue(), file);
+                EXPECT_EQ(e->GetExpected(), "");
+                EXPECT_TRUE(testsupport::Contains(e->GetFunction(),
+                                                  name + "::" + name + "(const std::string&"))
+                    << e->GetFunction();
+                EXPECT_EQ(e->GetSourceFile(), source[k]);
             }
         }
         if (name == "TOMFileParser")
             continue;  // reads lines only for its writers
         for (const int index : {2, -1}) {
-            try {
-                parsers[k].open(two, index);
-                ADD_FAILURE() << name << " read line " << index;
-            } catch (const DataException& e) {
-                EXPECT_EQ(e.GetErrorMessage(),
+            if (const auto e =
+                    testsupport::Thrown<DataException>([&] { parsers[k].open(two, index); },
+                                                       name + " line " + std::to_string(index))) {
+                EXPECT_EQ(e->GetErrorMessage(),
                           "Index " + std::to_string(index) + " is outside of valid range: 2");
-                EXPECT_NE(e.GetFunction().find(name + "::ParseLine"), std::string::npos);
-                EXPECT_EQ(e.GetSourceFile(), source[k]);
+                EXPECT_TRUE(testsupport::Contains(e->GetFunction(), name + "::ParseLine"));
+                EXPECT_EQ(e->GetSourceFile(), source[k]);
             }
         }
     }

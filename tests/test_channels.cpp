@@ -30,13 +30,11 @@ TEST(ExpandChannelList, EntriesNamingNoChannelAreRefused) {
     };
     for (const auto& c : cases) {
         std::vector<unsigned int> dbic{7, 8};
-        try {
-            ExpandChannelList(c.list, dbic);
-            ADD_FAILURE() << c.message << " was accepted";
-        } catch (const DataException& e) {
-            EXPECT_EQ(e.GetErrorMessage().rfind(c.message, 0), 0u) << e.GetErrorMessage();
-            EXPECT_NE(e.GetFunction().find("ExpandChannelList"), std::string::npos);
-            EXPECT_EQ(e.GetSourceFile(), "channels.cpp");
+        if (const auto e = testsupport::Thrown<DataException>(
+                [&] { ExpandChannelList(c.list, dbic); }, c.message)) {
+            EXPECT_EQ(e->GetErrorMessage().rfind(c.message, 0), 0u) << e->GetErrorMessage();
+            EXPECT_TRUE(testsupport::Contains(e->GetFunction(), "ExpandChannelList"));
+            EXPECT_EQ(e->GetSourceFile(), "channels.cpp");
         }
         EXPECT_EQ(dbic, (std::vector<unsigned int>{7, 8}));
     }

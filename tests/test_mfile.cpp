@@ -14,7 +14,9 @@
 using kestrel::DataException;
 using kestrel::MFileParser;
 using kestrel::ParametersTableIF;
+using testsupport::Contains;
 using testsupport::TempDir;
+using testsupport::Thrown;
 using testsupport::WriteFile;
 
 namespace {
@@ -43,13 +45,8 @@ TEST(MFileTable, LineEndsHeadersCommentsAndBlankLines) {
         EXPECT_EQ(table->GetInt(0, 1), 1);
         EXPECT_EQ(table->GetString(1, 1), "2") << bytes;
         EXPECT_EQ(table->GetString(2, 1), "x") << bytes;
-        try {
-            table->GetInt(2, 1);
-            ADD_FAILURE() << "x read as an integer";
-        } catch (const DataException& e) {
-            EXPECT_NE(e.GetErrorMessage().find(", line 7, column 1"), std::string::npos)
-                << e.GetErrorMessage();
-        }
+        const auto e = Thrown<DataException>([&] { table->GetInt(2, 1); }, bytes);
+        EXPECT_TRUE(e && Contains(e->GetErrorMessage(), ", line 7, column 1")) << bytes;
     }
 }
 
@@ -73,14 +70,11 @@ TEST(MFileTable, ControlBytesInValuesAreRefused) {
         {1, 1, ", line 3, column 1: the value holds the control byte 0x7F at character 6"},
         {1, 2, ", line 3, column 2: the value holds the control byte 0x1B at character 8"}};
     for (const auto& c : cases) {
-        try {
-            table->GetString(c.line, c.column);
-            ADD_FAILURE() << c.where;
-        } catch (const DataException& e) {
-            EXPECT_EQ(e.GetErrorMessage().rfind(path + c.where, 0), 0u) << e.GetErrorMessage();
+        if (const auto e =
+                Thrown<DataException>([&] { table->GetString(c.line, c.column); }, c.where)) {
+            EXPECT_EQ(e->GetErrorMessage().rfind(path + c.where, 0), 0u) << e->GetErrorMessage();
             // Only a NUL says that the file is binary.
-            EXPECT_EQ(e.GetErrorMessage().find("binary") != std::string::npos,
-                      std::string(c.where).find("0x00") != std::string::npos);
+            EXPECT_EQ(Contains(e->GetErrorMessage(), "binary"), Contains(c.where, "0x00"));
         }
     }
 }
@@ -138,17 +132,15 @@ TEST(MFileTable, BadValuesNameFileLineAndColumn) {
                  {5, false, "\"+-5\" is not an integer"},
                  {6, true, "\"+-2\" is not an integer"}};
     for (const auto& c : cases) {
-        try {
-            if (c.list)
-                table->GetIntList(1, c.column);
-            else
-                table->GetInt(1, c.column);
-            ADD_FAILURE() << "column " << c.column << " was read";
-        } catch (const DataException& e) {
-            const std::string expected =
-                path + ", line 4, column " + std::to_string(c.column) + ": " + c.value;
-            EXPECT_EQ(e.GetErrorMessage(), expected);
-            EXPECT_NE(e.GetFunction().find("GetInt"), std::string::npos);
+        if (const auto e = Thrown<DataException>(
+                [&] {
+                    c.list ? (void)table->GetIntList(1, c.column)
+                           : (void)table->GetInt(1, c.column);
+                },
+                c.value)) {
+            EXPECT_EQ(e->GetErrorMessage(),
+                      path + ", line 4, column " + std::to_string(c.column) + ": " + c.value);
+            EXPECT_TRUE(Contains(e->GetFunction(), "GetInt"));
         }
     }
 }
@@ -173,13 +165,9 @@ TEST(MFileTable, UnreadableFilesGiveNoTableAndTooLargeOnesAreRefused) {
     EXPECT_FALSE(Read(dir.Path().string()));
     const std::string large = WriteFile(dir.File("large.txt"), "a;1\n");
     std::filesystem::resize_file(large, MFileParser::kMaxFileBytes + 1);  // sparse: no disk used
-    try {
-        Read(large);
-        ADD_FAILURE() << "a file above the limit was read";
-    } catch (const kestrel::FileAccessException& e) {
-        EXPECT_EQ(e.GetFileName(), large);
-        EXPECT_NE(e.GetErrorMessage().find("larger than 256 MiB"), std::string::npos);
-    }
+    const auto e = Thrown<kestrel::FileAccessException>([&] { Read(large); });
+    EXPECT_TRUE(e && e->GetFileName() == large &&
+                Contains(e->GetErrorMessage(), "larger than 256 MiB"));
 }
 
 #if !defined(_WIN32)

@@ -248,16 +248,14 @@ TEST(Resampler, MethodsByGdalNamesWithoutRegardToCase) {
     EXPECT_THROW(cubic->SetSourceStep(0, 1), kestrel::DataException);
     EXPECT_THROW(cubic->SetSourceStep(1, NAN), kestrel::DataException);
     for (std::string name : {"gauss", "", "bilinear "}) {
-        try {
-            delete GetResampler(name);
-            ADD_FAILURE() << name;
-        } catch (const kestrel::ParameterException& e) {
-            EXPECT_EQ(e.GetParameterName(), name);
-            EXPECT_EQ(e.GetType(), kestrel::ParameterException::Unsupported);
-            EXPECT_EQ(e.GetValue(), "");
-            EXPECT_EQ(e.GetExpected(), "");
-            EXPECT_EQ(e.GetErrorMessage(), "Unsupported resampling method.");
-            EXPECT_EQ(e.GetSourceFile(), "utils.cpp");
+        if (const auto e = testsupport::Thrown<kestrel::ParameterException>(
+                [&] { delete GetResampler(name); }, name)) {
+            EXPECT_EQ(e->GetParameterName(), name);
+            EXPECT_EQ(e->GetType(), kestrel::ParameterException::Unsupported);
+            EXPECT_EQ(e->GetValue(), "");
+            EXPECT_EQ(e->GetExpected(), "");
+            EXPECT_EQ(e->GetErrorMessage(), "Unsupported resampling method.");
+            EXPECT_EQ(e->GetSourceFile(), "utils.cpp");
         }
     }
 }

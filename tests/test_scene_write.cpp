@@ -222,19 +222,17 @@ TEST_F(SceneWrite, DtdThatCannotBeCreatedIsReported) {
     const std::string dtd = directory + "TOSceneDesc_Document.dtd";
     TOSceneParser scene;
     Fill(scene);
-    try {
-        Write(scene, directory + "s.xml");
-        ADD_FAILURE() << "written";
-    } catch (const FileAccessException& e) {
-        EXPECT_EQ(e.GetFileName(), dtd);
-        EXPECT_EQ(static_cast<int>(e.GetType()), 5);
+    if (const auto e =
+            testsupport::Thrown<FileAccessException>([&] { Write(scene, directory + "s.xml"); })) {
+        EXPECT_EQ(e->GetFileName(), dtd);
+        EXPECT_EQ(static_cast<int>(e->GetType()), 5);
         const std::string head = " Scene XML file: " + dtd + " couldn't be created because\n ";
-        const std::string message = e.GetErrorMessage();
+        const std::string message = e->GetErrorMessage();
         EXPECT_EQ(message.substr(0, head.size()), head) << message;
         EXPECT_TRUE(Contains(message, "cannot be created: No such file")) << message;
         EXPECT_EQ(message.back(), '\n');
         testsupport::ExpectThrownFrom(
-            e,
+            *e,
             "void kestrel::processes::silvan::TOSceneParser::CreateDTDFile(const std::string&) "
             "const",
             "tosceneparser.cpp");

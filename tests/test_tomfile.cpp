@@ -101,16 +101,14 @@ TEST(TOMFileParser, UncreatableOutputThrowsAndLeavesNoFile) {
     Master m;
     const std::string out = m.dir.File("no-such-dir/prep.txt");
     for (auto write : {&TOMFileParser::WriteMFilePrep, &TOMFileParser::WriteImgSet}) {
-        try {
-            (m.parser.*write)(out);
-            FAIL() << "writing " << out << " succeeded";
-        } catch (const FileAccessException& e) {
-            EXPECT_EQ(e.GetFileName(), out);
-            EXPECT_EQ(e.GetType(), FileAccessException::CreateFailed);
-            EXPECT_EQ(static_cast<int>(e.GetType()), 5);
-            EXPECT_NE(e.GetErrorMessage().find(out), std::string::npos);
-            EXPECT_EQ(e.GetSourceFile(), "tomfileparser.cpp");
-            EXPECT_NE(e.GetFunction().find("TOMFileParser::Write"), std::string::npos);
+        if (const auto e =
+                testsupport::Thrown<FileAccessException>([&] { (m.parser.*write)(out); }, out)) {
+            EXPECT_EQ(e->GetFileName(), out);
+            EXPECT_EQ(e->GetType(), FileAccessException::CreateFailed);
+            EXPECT_EQ(static_cast<int>(e->GetType()), 5);
+            EXPECT_TRUE(testsupport::Contains(e->GetErrorMessage(), out));
+            EXPECT_EQ(e->GetSourceFile(), "tomfileparser.cpp");
+            EXPECT_TRUE(testsupport::Contains(e->GetFunction(), "TOMFileParser::Write"));
         }
         EXPECT_FALSE(std::filesystem::exists(m.dir.File("no-such-dir")));
     }

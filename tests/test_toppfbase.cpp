@@ -184,14 +184,12 @@ TEST_F(ProcessBase, NoGeneratorObtainedNamesTheProcText) {
     for (const auto& c : cases) {
         factory->calls.clear();
         process.SetProc(c.first);
-        try {
-            delete process.CreateTorthoGenerator();
-            ADD_FAILURE() << "no error for " << c.first;
-        } catch (const DataException& e) {
-            EXPECT_EQ(e.what(), std::string("Failed to instantiate an trueortho generator with "
-                                            "PROC option set to \"") +
-                                    c.first + "\"");
-            ExpectThrownAt(e, "CreateTrueortho");
+        if (const auto e = testsupport::Thrown<DataException>(
+                [&] { delete process.CreateTorthoGenerator(); }, c.first)) {
+            EXPECT_EQ(e->what(), std::string("Failed to instantiate an trueortho generator with "
+                                             "PROC option set to \"") +
+                                     c.first + "\"");
+            ExpectThrownAt(*e, "CreateTrueortho");
         }
         EXPECT_EQ(factory->calls.size(), c.second) << c.first;
     }
@@ -201,15 +199,14 @@ TEST_F(ProcessBase, GeneratorOfWrongKindIsReleasedAndRefused) {
     process.SetProc("CPU:1");
     factory->swapped = true;
     for (bool tortho : {true, false}) {
-        try {
-            if (tortho)
-                delete process.CreateTorthoGenerator();
-            else
-                delete process.CreateOcclusionRecovery();
-            ADD_FAILURE();
-        } catch (const DataException& e) {
-            EXPECT_STREQ(e.what(), "The trueortho generator is not of the expected type");
-            ExpectThrownAt(e, tortho ? "CreateTorthoGenerator" : "CreateOcclusionRecovery");
+        if (const auto e = testsupport::Thrown<DataException>([&] {
+                if (tortho)
+                    delete process.CreateTorthoGenerator();
+                else
+                    delete process.CreateOcclusionRecovery();
+            })) {
+            EXPECT_STREQ(e->what(), "The trueortho generator is not of the expected type");
+            ExpectThrownAt(*e, tortho ? "CreateTorthoGenerator" : "CreateOcclusionRecovery");
         }
         EXPECT_EQ(liveGenerators, 0);
     }
