@@ -737,6 +737,15 @@ void BasicWriter::Close() {
         if (impl.copyOnClose && !errors.Failed()) {
             CPLStringList options = DefaultCreationOptions(impl.format, impl.type);
             AddOptions(options, impl.options);
+            // The COG driver computes the overviews into a temporary ZSTD file that it reads
+            // back once; at ZSTD's fastest level rather than its default 9 the file is written
+            // in a fraction of the time, and the output is the same bytes. Not when the COG is
+            // ZSTD itself, whose own overviews the setting would reach too.
+            const char* method = options.FetchNameValue("COMPRESS");
+            std::optional<CPLConfigOptionSetter> fastOverviews;
+            if (impl.format == "COG" &&
+                (method == nullptr || std::string(method).find("ZSTD") == std::string::npos))
+                fastOverviews.emplace("ZSTD_LEVEL_OVERVIEW", "1", true);
             const std::string copyPath = parts.dir + impl.tempStem + parts.ext;
             GDALDatasetPtr copy(impl.driver->CreateCopy(copyPath.c_str(), impl.dataset.get(), TRUE,
                                                         options.List(), nullptr, nullptr));
