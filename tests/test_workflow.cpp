@@ -23,6 +23,7 @@
 #include <memory>
 #include <set>
 #include <string>
+#include <tuple>
 
 #ifndef _WIN32
 #include <fcntl.h>
@@ -258,8 +259,10 @@ TEST(Workflow, SampleCityEndToEnd) {
     TempDir dir;
     std::vector<std::string> args = MakeSample(dir);
     // Blocks small enough for the sample's mosaic to have overviews (an option of the mosaic's
-    // driver alone), and a compression that the orthos take too.
-    args.insert(args.end(), {"--jobs", "2", "--co", "BLOCKSIZE=128", "--co", "COMPRESS=LZW"});
+    // driver alone), a compression that the orthos take too, and blocks of the orthos (options
+    // of their driver alone).
+    args.insert(args.end(), {"--jobs", "2", "--co", "BLOCKSIZE=128", "--co", "COMPRESS=LZW",
+                             "--co", "BLOCKXSIZE=64", "--co", "BLOCKYSIZE=64"});
     const Result first = Ortho(args, dir);
     ASSERT_EQ(first.status, 0) << first.err;
     const std::string summary = ReadFile(dir.File("out/summary.json"));
@@ -399,16 +402,16 @@ TEST(Workflow, SampleCityEndToEnd) {
                               "Mask Flags: PER_DATASET"})
         EXPECT_NE(info.out.find(shown), std::string::npos) << shown << "\n" << info.out;
     EXPECT_EQ(info.out.find("NoData Value"), std::string::npos) << info.out;
-    // The orthos take --co too; the visibility index keeps its own lossless options, without a
-    // predictor (slow to undo on one Byte band).
-    for (const auto& [raster, shown] : {std::pair<std::string, std::string>{"north_ortho.tif",
-                                                                            "COMPRESSION=LZW"},
-                                        {"north_vis.tif", "COMPRESSION=DEFLATE"}}) {
+    // The orthos take the --co their driver knows; the visibility index keeps its own lossless
+    // options, without a predictor (slow to undo on one Byte band).
+    for (const auto& [raster, shown, absent] :
+         {std::tuple<std::string, std::string, std::string>{"north_ortho.tif", "COMPRESSION=LZW",
+                                                            "Block=128x128"},
+          {"north_ortho.tif", "Block=64x64", "COMPRESSION=DEFLATE"},
+          {"north_vis.tif", "COMPRESSION=DEFLATE", "PREDICTOR="}}) {
         const Result scene = RunProgram("gdalinfo", {dir.File("out/" + raster)}, dir);
         EXPECT_NE(scene.out.find(shown), std::string::npos) << scene.out;
-        if (raster == "north_vis.tif") {
-            EXPECT_EQ(scene.out.find("PREDICTOR="), std::string::npos) << scene.out;
-        }
+        EXPECT_EQ(scene.out.find(absent), std::string::npos) << scene.out;
     }
     // Quicklooks lie where their rasters do (world files); the source raster's has a legend,
     // beside it and in the summary, whose value k names scene k.

@@ -555,18 +555,23 @@ std::string OptionText(const std::string& defaults, const std::vector<std::strin
     return text;
 }
 
-// The options of a per-scene raster of GDAL's format: the generator's own, then the --co options
-// its driver takes, for the ortho.
-std::string SceneRasterOptions(const Options& options, const std::string& format, bool classes) {
-    const std::string defaults = kestrel::processes::SceneRasterOptions(format, classes);
-    if (classes)
-        return defaults;
+// The --co options that GDAL's format takes, after `defaults`: each raster takes those its driver
+// knows (the orthos GTiff's, the mosaic COG's).
+std::string TakenOptions(const Options& options, const std::string& format,
+                         const std::string& defaults) {
     std::vector<std::string> taken;
     for (const std::string& option : options.creationOptions) {
         if (TakesOption(format, option))
             taken.push_back(option);
     }
     return OptionText(defaults, taken);
+}
+
+// The options of a per-scene raster of GDAL's format: the generator's own, then, for the ortho,
+// the --co options its driver takes.
+std::string SceneRasterOptions(const Options& options, const std::string& format, bool classes) {
+    const std::string defaults = kestrel::processes::SceneRasterOptions(format, classes);
+    return classes ? defaults : TakenOptions(options, format, defaults);
 }
 
 }  // namespace
@@ -1226,7 +1231,7 @@ MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoverySce
     job.sourcePath = source;
     job.format = lossy ? "GTiff" : format;
     if (!lossy)
-        job.mosaicOptions = OptionText("", options.creationOptions);
+        job.mosaicOptions = TakenOptions(options, format, "");
     if (!options.cutline.empty()) {
         mask.path = mosaic + ".cutline.tif";
         BurnCutline(options.cutline, grid, mask.path);
