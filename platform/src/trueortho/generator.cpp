@@ -726,8 +726,7 @@ TorthoResult TorthoGenerator::Generate(const TorthoJob& job) {
 
 std::string SceneRasterOptions(const std::string& format, bool classes) {
     if (format == "GTiff")
-        return classes ? "ZLEVEL=1 BLOCKXSIZE=128 BLOCKYSIZE=128 PREDICTOR=1"
-                       : "ZLEVEL=1 BLOCKXSIZE=128 BLOCKYSIZE=128";
+        return classes ? "ZLEVEL=1 PREDICTOR=1" : "ZLEVEL=1 BLOCKXSIZE=128 BLOCKYSIZE=128";
     return classes && format == "COG" ? "OVERVIEW_RESAMPLING=NEAREST PREDICTOR=NO" : "";
 }
 
