@@ -761,6 +761,12 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         {"the colour balance, which only the mosaic reads",
          [&] { args.insert(args.end(), {"--balance", "none"}); },
          {}, "--balance changed: gain-offset -> none", true, false},
+        {"a creation option only the mosaic takes",
+         [&] { args.insert(args.end(), {"--co", "LEVEL=6"}); },
+         {}, "--co changed:  -> LEVEL=6", true, false},
+        {"a creation option of the orthos",
+         [&] { args.insert(args.end(), {"--co", "BLOCKXSIZE=64", "--co", "BLOCKYSIZE=64"}); },
+         all, "--co changed:  -> BLOCKXSIZE=64 BLOCKYSIZE=64", true},
         {"seamlines handed back",
          [&] {
              std::filesystem::copy_file(dir.File("out/seamlines.gpkg"), dir.File("seams.gpkg"));

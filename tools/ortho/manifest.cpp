@@ -86,6 +86,15 @@ constexpr std::uint64_t kWholeFileLimit = 1u << 20;
 constexpr std::uint64_t kSampleBlock = 64u << 10;
 constexpr std::uint64_t kSampleBlocks = 16;
 
+// The --co options the orthos (or the mosaic) are made with: an option only the other's driver
+// takes changes nothing here.
+std::string CreationOptions(const Options& o, bool mosaic) {
+    std::string text;
+    for (const std::string& option : TakenCreationOptions(o, mosaic))
+        text += (text.empty() ? "" : " ") + option;
+    return text;
+}
+
 }  // namespace
 
 const std::vector<PixelOption>& PixelOptions() {
@@ -118,13 +127,7 @@ const std::vector<PixelOption>& PixelOptions() {
          }},
         {"--resample", false, [](const Options& o) { return o.resample; }},
         {"--of", false, [](const Options& o) { return o.format; }},
-        {"--co", false,
-         [](const Options& o) {
-             std::string text;
-             for (const std::string& option : o.creationOptions)
-                 text += (text.empty() ? "" : " ") + option;
-             return text;
-         }},
+        {"--co", false, [](const Options& o) { return CreationOptions(o, false); }},
     };
     return options;
 }
@@ -140,6 +143,7 @@ const std::vector<PixelOption>& MosaicOptions() {
          }},
         {"--blend", false, [](const Options& o) { return o.blend; }},
         {"--balance", false, [](const Options& o) { return o.balance; }},
+        {"--co", false, [](const Options& o) { return CreationOptions(o, true); }},
     };
     return options;
 }

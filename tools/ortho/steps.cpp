@@ -555,16 +555,20 @@ std::string OptionText(const std::string& defaults, const std::vector<std::strin
     return text;
 }
 
-// The --co options that GDAL's format takes, after `defaults`: each raster takes those its driver
-// knows (the orthos GTiff's, the mosaic COG's).
-std::string TakenOptions(const Options& options, const std::string& format,
-                         const std::string& defaults) {
+std::vector<std::string> TakenOptions(const Options& options, const std::string& format) {
     std::vector<std::string> taken;
     for (const std::string& option : options.creationOptions) {
         if (TakesOption(format, option))
             taken.push_back(option);
     }
-    return OptionText(defaults, taken);
+    return taken;
+}
+
+// The --co options that GDAL's format takes, after `defaults`: each raster takes those its driver
+// knows (the orthos GTiff's, the mosaic COG's).
+std::string TakenOptions(const Options& options, const std::string& format,
+                         const std::string& defaults) {
+    return OptionText(defaults, TakenOptions(options, format));
 }
 
 // The options of a per-scene raster of GDAL's format: the generator's own, then, for the ortho,
@@ -575,6 +579,11 @@ std::string SceneRasterOptions(const Options& options, const std::string& format
 }
 
 }  // namespace
+
+std::vector<std::string> TakenCreationOptions(const Options& options, bool mosaic) {
+    return TakenOptions(options, mosaic ? MosaicFormat(options)
+                                        : kestrel::core::FType2FormatName(options.format));
+}
 
 std::string ClassRasterType(const std::string& type) {
     std::string format;

@@ -180,6 +180,10 @@ struct RecoveryScene {
 // format of --of otherwise.
 std::string MosaicFormat(const Options& options);
 
+// The --co options, in their order, that the per-scene orthos' driver (or the mosaic's) takes:
+// those that make them.
+std::vector<std::string> TakenCreationOptions(const Options& options, bool mosaic);
+
 // The file type of the rasters of classes and scene numbers (the visibility index, the mosaic's
 // source raster): --of, or tif where --of's driver is lossy, which would change their values.
 std::string ClassRasterType(const std::string& type);
