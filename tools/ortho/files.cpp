@@ -171,6 +171,19 @@ std::vector<std::pair<unsigned int, std::string>> DataLines(const std::string& p
     return lines;
 }
 
+std::vector<std::string> LineColumns(const std::string& line) {
+    std::vector<std::string> columns;
+    std::istringstream fields(line);
+    for (std::string field; std::getline(fields, field, ';');) {
+        field.erase(0, field.find_first_not_of(" \t"));
+        field.erase(field.find_last_not_of(" \t") + 1);
+        columns.push_back(std::move(field));
+    }
+    if (columns.empty())
+        columns.emplace_back();
+    return columns;
+}
+
 std::string ResolveSource(const std::string& given, const fs::path& masterDir) {
     std::error_code ec;
     fs::path source(given);

@@ -63,6 +63,10 @@ std::string ReadText(const std::string& path);
 // parameter-table reader counts them.
 std::vector<std::pair<unsigned int, std::string>> DataLines(const std::string& path);
 
+// The columns of a data line: separated by ";", blanks (spaces and tabs) trimmed, as the
+// parameter table reads them.
+std::vector<std::string> LineColumns(const std::string& line);
+
 // A source as a line names it: relative to the master file's directory when it exists there
 // (or nowhere else), absolute and normalised.
 std::string ResolveSource(const std::string& given, const std::filesystem::path& masterDir);

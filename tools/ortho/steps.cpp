@@ -14,7 +14,6 @@
 #include <kestrel/orthoutils.h>
 #include <kestrel/processparams.h>
 #include <kestrel/rasterio.h>
-#include <kestrel/stringlist.h>
 
 #include <cpl_error.h>
 #include <gdal_alg.h>
@@ -762,10 +761,7 @@ void CheckModels(const Options& options) {
         const std::filesystem::path masterDir =
             std::filesystem::absolute(options.master).parent_path();
         for (const auto& line : DataLines(options.master)) {
-            std::vector<std::string> columns;
-            std::istringstream fields(line.second);
-            for (std::string field; std::getline(fields, field, ';');)
-                columns.push_back(TrimWhitespace(field));
+            const std::vector<std::string> columns = LineColumns(line.second);
             Source source{options.master + ", line " + std::to_string(line.first),
                           ResolveSource(columns[0], masterDir), 0};
             try {

@@ -395,10 +395,7 @@ void Workflow::Prepare() {
     std::vector<std::string> sources;
     for (const auto& line : DataLines(options_.master)) {
         masterLines_.push_back(line.first);
-        std::string source = line.second.substr(0, line.second.find(';'));
-        source.erase(0, source.find_first_not_of(" \t"));
-        source.erase(source.find_last_not_of(" \t") + 1);
-        sources.push_back(source);
+        sources.push_back(LineColumns(line.second)[0]);
     }
     CheckOutputsSpareInputs(sources);
     try {
