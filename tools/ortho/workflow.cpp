@@ -209,7 +209,6 @@ std::vector<Output> SceneOutputs(const std::string& dir, const std::string& name
             {Join(dir, name + "_manifest.json"), "the record of inputs"}};
 }
 
-// A relative source is taken from the master file's directory, or else from the current one.
 // What two paths are compared by: the same file however it is named (links, "..", and the
 // letter case on file systems that ignore it).
 std::string SameFileKey(const std::string& path) {
