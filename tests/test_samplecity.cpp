@@ -1,6 +1,7 @@
 // The synthetic aerial block: its nadir images through the true-ortho generator match the ideal
 // image once their exposure gain is taken out, and the DSM handed to the workflow differs from the
-// true one only at building edges, by at most the error asked for.
+// true one only at building edges, by at most the error asked for; both say their heights are
+// ellipsoidal.
 #include <gtest/gtest.h>
 
 #include <cmath>
@@ -11,6 +12,7 @@
 #include <vector>
 
 #include <kestrel/crs.h>
+#include <kestrel/elevation.h>
 #include <kestrel/orthoutils.h>
 #include <kestrel/trueortho.h>
 #include <samplecity.h>
@@ -33,6 +35,12 @@ TEST(SampleBlock, OrthosMatchTheIdealImageAndTheDsmErrorStaysAtEdges) {
     const samplecity::Sample sample = samplecity::MakeSample(dir.Path().string(), options, 2);
     ASSERT_EQ(sample.images.size(), 4u);
     ASSERT_NE(sample.dsmPath, sample.trueDsmPath);
+    // Both DSMs say their heights are ellipsoidal (RPC heights are), so that a run without
+    // --elevref does not take them for heights above the geoid.
+    for (const std::string& dsm : {sample.dsmPath, sample.trueDsmPath}) {
+        const auto vertical = kestrel::dem::ReadVerticalReference(dsm);
+        EXPECT_TRUE(vertical.known && vertical.datum == kestrel::ogc::cs::DatumEllipsoid) << dsm;
+    }
 
     // Gains drawn within the spread, seeded, and written to the notes as used.
     const std::string notes = testsupport::ReadFile(sample.notesPath);

@@ -431,8 +431,11 @@ void WriteDsm(const Dsm& dsm, const std::string& path) {
                                                   errors.Reason().c_str()));
     std::array<double, 6> gt = dsm.GeoTransform();
     ds->SetGeoTransform(gt.data());
-    const ICRS crs(dsm.Options().crs);
-    ds->SetSpatialRef(&crs.GetSpatialReference());
+    // The heights are ellipsoidal, and the CRS says so (a third axis, ellipsoidal height, kept
+    // in the side file dsm.tif.aux.xml): a model read without --elevref takes them as they are.
+    OGRSpatialReference crs(ICRS(dsm.Options().crs).GetSpatialReference());
+    crs.PromoteTo3D(nullptr);
+    ds->SetSpatialRef(&crs);
     GDALRasterBand* band = ds->GetRasterBand(1);
     band->SetNoDataValue(-32768.0);
     CheckWrite(band->RasterIO(GF_Write, 0, 0, static_cast<int>(dsm.Width()),
