@@ -53,40 +53,90 @@ struct Worker {
     std::vector<Rect> others;    // the rasters of the other scenes meeting the tile, on it
     std::vector<float> regions, mask, blended;
     std::vector<unsigned char> clear;  // per pixel: some scene of the blend sees it clearly
+    // RankPixels': per tile scene, its states, level and the angle cells it needs.
+    std::vector<const unsigned char*> states;
+    std::vector<int> levels;
+    std::vector<std::vector<unsigned char>> cells;
     trueortho::BlendTile blend;
 };
 
-// The scene that ranks first at pixel p among the tile's n scenes, or -1. Lower ranks first:
+// Labels each pixel that `labels` leaves unlabelled (-1) and no mask takes out with the scene
+// that ranks first there among the tile's n scenes (-1: none sees it). Lower ranks first:
 //   1. seen clearly: no hidden pixel of the scene within its DBM pixel error (the visibility
 //      test's tolerance), so an error of the surface model cannot have put the pixel on the
 //      wrong side of an occlusion edge;
 //   2. the lower radiometric difference level;
 //   3. the line of sight nearer the vertical (a known angle before an unknown one);
-//   4. the scene listed first.
-int FirstRanked(const RecoveryJob& job, const std::vector<SceneTile>& scenes, size_t n,
-                size_t p) {
-    int best = -1;
+//   4. the scene listed first (scenes are in job order).
+// The angles are read only for the scenes tied on the first two, in the lattice cells of the
+// tied pixels.
+void RankPixels(const RecoveryJob& job, const SceneReader& reader, const Rect& r, size_t n,
+                const std::vector<float>* mask, Worker& w, std::vector<int>& labels) {
+    constexpr int kTied = -2;
+    const int across = trueortho::AngleCells(r.width);
+    const size_t cells = static_cast<size_t>(across) * trueortho::AngleCells(r.height);
+    w.states.resize(n);
+    w.levels.resize(n);
+    if (w.cells.size() < n)
+        w.cells.resize(n);
     for (size_t k = 0; k < n; ++k) {
-        const SceneTile& a = scenes[k];
-        if (a.state[p] == trueortho::kNotSeen)
-            continue;
-        if (best >= 0) {
-            const SceneTile& b = scenes[best];
-            const int la = job.scenes[a.scene].radiometricLevel;
-            const int lb = job.scenes[b.scene].radiometricLevel;
-            if (a.state[p] != b.state[p]) {
-                if (a.state[p] > b.state[p])
-                    continue;
-            } else if (la != lb) {
-                if (la > lb)
-                    continue;
-            } else if (!(a.angle[p] < b.angle[p])) {
-                continue;  // equal angles: the scene listed first (scenes are in job order)
-            }
-        }
-        best = static_cast<int>(k);
+        w.states[k] = w.scenes[k].state.data();
+        w.levels[k] = job.scenes[w.scenes[k].scene].radiometricLevel;
+        w.cells[k].assign(cells, 0);
     }
-    return best;
+    const unsigned char* const* states = w.states.data();
+    const int* levels = w.levels.data();
+    // The best state and level at p, and how many scenes have them; first: the first of them.
+    const auto best = [&](size_t p, unsigned char& state, int& level, int& first) {
+        int count = 0;
+        first = -1;
+        for (size_t k = 0; k < n; ++k) {
+            const unsigned char s = states[k][p];
+            if (s == trueortho::kNotSeen)
+                continue;
+            if (first < 0 || s < state || (s == state && levels[k] < level))
+                first = static_cast<int>(k), state = s, level = levels[k], count = 1;
+            else if (s == state && levels[k] == level)
+                ++count;
+        }
+        return count;
+    };
+    bool tied = false;
+    for (int j = 0; j < r.height; ++j)
+        for (int i = 0; i < r.width; ++i) {
+            const size_t p = static_cast<size_t>(j) * r.width + i;
+            if (labels[p] >= 0 || (mask != nullptr && (*mask)[p] == 0))
+                continue;
+            unsigned char state = 0;
+            int level = 0, first;
+            if (best(p, state, level, first) < 2) {
+                labels[p] = first;
+                continue;
+            }
+            labels[p] = kTied, tied = true;
+            const size_t c = static_cast<size_t>(j / trueortho::kAngleStep) * across +
+                             i / trueortho::kAngleStep;
+            for (size_t k = 0; k < n; ++k)
+                if (states[k][p] == state && levels[k] == level)
+                    w.cells[k][c] = 1;
+        }
+    if (!tied)
+        return;
+    for (size_t k = 0; k < n; ++k)
+        if (std::find(w.cells[k].begin(), w.cells[k].end(), 1) != w.cells[k].end())
+            reader.ReadAngles(r, w.scratch, w.scenes[k], &w.cells[k]);
+    for (size_t p = 0; p < r.Size(); ++p) {
+        if (labels[p] != kTied)
+            continue;
+        unsigned char state = 0;
+        int level = 0, first;
+        best(p, state, level, first);
+        for (size_t k = static_cast<size_t>(first) + 1; k < n; ++k)
+            if (states[k][p] == state && levels[k] == level &&
+                w.scenes[k].angle[p] < w.scenes[first].angle[p])
+                first = static_cast<int>(k);
+        labels[p] = first;
+    }
 }
 
 // One tile of the mosaic: its scenes read with the blend border, each pixel's region, the
@@ -98,14 +148,12 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
     const Rect r = t.Grown(c.border);
     const size_t size = r.Size();
     const std::vector<size_t> meeting = c.grid.ScenesMeeting(r);
-    // The viewing angles only rank scenes where no region is given: read when needed.
-    const bool angles = c.regions == nullptr;
     size_t n = 0;  // the tile's scenes that see some pixel of it, w.scenes[0] to [n - 1]
     const auto read = [&](size_t s) {
         if (w.scenes.size() <= n)
             w.scenes.emplace_back();
         ++counts.sceneReads;
-        n += c.reader.Read(s, r, false, angles, w.scratch, w.scenes[n]) ? 1 : 0;
+        n += c.reader.Read(s, r, false, false, w.scratch, w.scenes[n]) ? 1 : 0;
     };
     if (c.mask != nullptr) {
         // Outside the mask (and outside its raster) the pixels stay empty.
@@ -206,23 +254,7 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
             }
         }
     }
-    bool ranked = angles;
-    for (size_t p = 0; p < size; ++p) {
-        if (labels[p] >= 0)
-            continue;
-        if (!ranked) {
-            // A pixel that some scene sees and no region gives: every scene's angles.
-            bool seen = false;
-            for (size_t k = 0; k < n && !seen; ++k)
-                seen = w.scenes[k].state[p] != trueortho::kNotSeen;
-            if (!seen)
-                continue;
-            for (size_t k = 0; k < n; ++k)
-                c.reader.ReadAngles(r, w.scratch, w.scenes[k]);
-            ranked = true;
-        }
-        labels[p] = FirstRanked(job, w.scenes, n, p);
-    }
+    RankPixels(job, c.reader, r, n, c.mask != nullptr ? &w.mask : nullptr, w, labels);
     if (c.mask != nullptr)
         for (size_t p = 0; p < size; ++p)
             if (w.mask[p] == 0)
