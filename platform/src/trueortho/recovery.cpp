@@ -14,6 +14,7 @@
 #include <gdal_priv.h>
 
 #include <algorithm>
+#include <array>
 #include <cmath>
 #include <filesystem>
 #include <limits>
@@ -41,6 +42,10 @@ struct Composition {
     int border = 0;
     trueortho::ValueRange range;
     datasources::BasicWriter *mosaic = nullptr, *source = nullptr;
+    // Every scene and the mosaic are Byte: hard seams go from byte to byte (HardSeamBytes).
+    bool bytes = false;
+    std::vector<int> channels;  // 1 to the grid's band count
+    unsigned char noDataByte = 0;  // the no-data value as the mosaic's Byte band holds it
 };
 
 // One thread's buffers, reused from tile to tile.
@@ -57,6 +62,7 @@ struct Worker {
     std::vector<const unsigned char*> states;
     std::vector<int> levels;
     std::vector<std::vector<unsigned char>> cells;
+    std::vector<std::array<int, 4>> boxes;  // HardSeamBytes': per scene, its pixels' box
     trueortho::BlendTile blend;
 };
 
@@ -137,6 +143,83 @@ void RankPixels(const RecoveryJob& job, const SceneReader& reader, const Rect& r
                 first = static_cast<int>(k);
         labels[p] = first;
     }
+}
+
+// Float32 values as GDAL writes them into a Byte band.
+void ToBytes(const float* values, unsigned char* bytes, int count) {
+    GDALCopyWords(values, GDT_Float32, sizeof(float), bytes, GDT_Byte, 1, count);
+}
+
+// The inner tile t of a tile r whose regions (w.blend's labels and scenes) are joined by hard
+// seams, when every scene and the mosaic are Byte: each pixel its region's byte through one table
+// per scene and band (its balance, the value range, a value beside no-data, as the blend's
+// Float32 values reach the file), each scene read only over the box of its pixels in t.
+void HardSeamBytes(const Composition& c, Worker& w, const Rect& t, const Rect& r,
+                   TorthoRecoveryResult& counts) {
+    const int bands = c.grid.bands;
+    const std::vector<size_t>& scenes = w.blend.scenes;
+    const std::vector<int>& labels = w.blend.labels;
+    gobs::Raster mosaic(t.width, t.height, bands, datasources::DataType::Byte,
+                        gobs::Raster::Initial::Unset);
+    gobs::Raster source(t.width, t.height, 1, datasources::DataType::Float32);
+    unsigned char* out = static_cast<unsigned char*>(mosaic.GetData());
+    float* from = static_cast<float*>(source.GetData());
+    const size_t plane = t.Size();
+    // Per scene: the first and last column and line of its pixels in t.
+    w.boxes.assign(scenes.size(), {t.width, t.height, -1, -1});
+    for (int j = 0; j < t.height; ++j) {
+        const int* label = labels.data() + static_cast<size_t>(j + c.border) * r.width + c.border;
+        for (int i = 0; i < t.width; ++i) {
+            const size_t o = static_cast<size_t>(j) * t.width + i;
+            if (label[i] < 0) {
+                ++counts.unfilled;
+                from[o] = 0;
+                for (int b = 0; b < bands; ++b)
+                    out[plane * b + o] = c.noDataByte;
+                continue;
+            }
+            ++counts.filled;
+            from[o] = static_cast<float>(scenes[label[i]] + 1);
+            std::array<int, 4>& box = w.boxes[label[i]];
+            box = {std::min(box[0], i), std::min(box[1], j), std::max(box[2], i),
+                   std::max(box[3], j)};
+        }
+    }
+    float values[256];
+    unsigned char table[256];
+    std::vector<unsigned char>& bytes = w.scratch.bytes;
+    for (size_t u = 0; u < scenes.size(); ++u) {
+        const std::array<int, 4>& box = w.boxes[u];
+        if (box[2] < 0)
+            continue;  // its region lies in the border only
+        const size_t s = scenes[u];
+        const Rect read{t.x + box[0], t.y + box[1], box[2] - box[0] + 1, box[3] - box[1] + 1};
+        bytes.resize(read.Size() * bands);
+        c.grid.orthos[s]->Read(c.channels.data(), bands, read, GDT_Byte, bytes.data());
+        for (int b = 0; b < bands; ++b) {
+            const double gain = c.fit.gain[s][b], offset = c.fit.offset[s][b];
+            const bool balanced = !(gain == 1 && offset == 0);
+            for (int v = 0; v < 256; ++v)
+                values[v] = c.range.Besides(
+                    c.range(balanced ? c.range(gain * v + offset) : static_cast<float>(v)),
+                    c.grid.noData);
+            ToBytes(values, table, 256);
+            for (int j = 0; j < read.height; ++j) {
+                const int* label = labels.data() +
+                                   static_cast<size_t>(box[1] + j + c.border) * r.width +
+                                   box[0] + c.border;
+                const unsigned char* in = bytes.data() + read.Size() * b +
+                                          static_cast<size_t>(j) * read.width;
+                unsigned char* o = out + plane * b + static_cast<size_t>(box[1] + j) * t.width +
+                                   box[0];
+                for (int i = 0; i < read.width; ++i)
+                    if (label[i] == static_cast<int>(u))
+                        o[i] = table[in[i]];
+            }
+        }
+    }
+    c.mosaic->WriteWindow(mosaic, t.x, t.y);
+    c.source->WriteWindow(source, t.x, t.y);
 }
 
 // One tile of the mosaic: its scenes read with the blend border, each pixel's region, the
@@ -277,6 +360,13 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
         if (label >= 0)
             label = w.slot[label];
     blend.scenes.resize(used);
+    for (size_t k = 0; k < n; ++k)
+        if (w.slot[k] >= 0)
+            blend.scenes[static_cast<size_t>(w.slot[k])] = w.scenes[k].scene;
+    if (c.bytes && trueortho::HardSeamsOnly(c.blend, static_cast<int>(job.blendWidth), used)) {
+        HardSeamBytes(c, w, t, r, counts);
+        return;
+    }
     blend.values.resize(used);
     blend.seen.resize(used);
     // A scene weighs in the blend only where it sees the pixel clearly, or unclearly in its own
@@ -296,7 +386,6 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
             continue;
         const size_t u = static_cast<size_t>(w.slot[k]);
         const SceneTile& scene = w.scenes[k];
-        blend.scenes[u] = scene.scene;
         std::vector<unsigned char>& seen = blend.seen[u];
         seen.resize(size);
         for (size_t p = 0; p < size; ++p)
@@ -467,6 +556,15 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     const trueortho::BlendMode blend = job.blend == RecoveryJob::Blend::Multiband
                                            ? trueortho::BlendMode::Multiband
                                            : trueortho::BlendMode::Feather;
+    bool bytes = grid.type == GDT_Byte;
+    for (const auto& ortho : grid.orthos)
+        bytes = bytes && ortho->type == GDT_Byte;
+    std::vector<int> channels(grid.bands);
+    for (int b = 0; b < grid.bands; ++b)
+        channels[b] = b + 1;
+    const float noData = static_cast<float>(grid.noData);
+    unsigned char noDataByte = 0;
+    ToBytes(&noData, &noDataByte, 1);
     const Composition composition{job,
                                   grid,
                                   reader,
@@ -477,7 +575,10 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
                                   trueortho::BlendBorder(blend, static_cast<int>(job.blendWidth)),
                                   trueortho::ValueRange(grid.type),
                                   mosaic.get(),
-                                  source.get()};
+                                  source.get(),
+                                  bytes,
+                                  channels,
+                                  noDataByte};
     control.SetSpan(0.6, 0.4);
     std::vector<TorthoRecoveryResult> counts(threads);
     std::vector<Worker> workers(threads);
