@@ -169,19 +169,24 @@ void HardSeamBytes(const Composition& c, Worker& w, const Rect& t, const Rect& r
     w.boxes.assign(scenes.size(), {t.width, t.height, -1, -1});
     for (int j = 0; j < t.height; ++j) {
         const int* label = labels.data() + static_cast<size_t>(j + c.border) * r.width + c.border;
-        for (int i = 0; i < t.width; ++i) {
+        // Runs of one label along the line.
+        for (int i = 0, end; i < t.width; i = end) {
+            const int l = label[i];
+            for (end = i + 1; end < t.width && label[end] == l;)
+                ++end;
             const size_t o = static_cast<size_t>(j) * t.width + i;
-            if (label[i] < 0) {
-                ++counts.unfilled;
-                from[o] = 0;
+            const size_t length = static_cast<size_t>(end - i);
+            if (l < 0) {
+                counts.unfilled += length;
+                std::fill_n(from + o, length, 0.0f);
                 for (int b = 0; b < bands; ++b)
-                    out[plane * b + o] = c.noDataByte;
+                    std::fill_n(out + plane * b + o, length, c.noDataByte);
                 continue;
             }
-            ++counts.filled;
-            from[o] = static_cast<float>(scenes[label[i]] + 1);
-            std::array<int, 4>& box = w.boxes[label[i]];
-            box = {std::min(box[0], i), std::min(box[1], j), std::max(box[2], i),
+            counts.filled += length;
+            std::fill_n(from + o, length, static_cast<float>(scenes[l] + 1));
+            std::array<int, 4>& box = w.boxes[l];
+            box = {std::min(box[0], i), std::min(box[1], j), std::max(box[2], end - 1),
                    std::max(box[3], j)};
         }
     }
@@ -582,8 +587,10 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     control.SetSpan(0.6, 0.4);
     std::vector<TorthoRecoveryResult> counts(threads);
     std::vector<Worker> workers(threads);
+    // Tiles in bands, so that the scene blocks two tiles share are still in GDAL's cache.
     control.RunTiles(tiles, threads, "Occlusion recovery", [&](unsigned int thread, size_t index) {
-        Compose(composition, workers[thread], grid.Tile(tile, index), control, counts[thread]);
+        Compose(composition, workers[thread], grid.Tile(tile, grid.InBands(tile, index)), control,
+                counts[thread]);
     });
     if (control.Stopped())
         return result;
