@@ -1209,6 +1209,7 @@ MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoverySce
     const std::unique_ptr<kestrel::dem::IElevationSource> ground = OpenGround(options, model);
     job.ground = ground.get();
     job.blendWidth = BlendWidth(options);
+    job.seamlines = options.seams == "lines";
     using Job = kestrel::processes::RecoveryJob;
     job.blend = options.blend == "multiband" ? Job::Blend::Multiband : Job::Blend::Feather;
     job.balance = options.balance == "none"   ? Job::Balance::None
