@@ -16,8 +16,6 @@ namespace trueortho {
 
 namespace {
 
-// Angles are computed on a coarser lattice and interpolated: they change slowly.
-constexpr int kAngleStep = 16;
 // Grids share a lattice when their pixel sizes agree to this share of a pixel per pixel and
 // their origins lie this share of a pixel from a whole number of pixels apart.
 constexpr double kSizeTolerance = 1e-7;
