@@ -149,6 +149,7 @@ TEST(OrthoCommandLine, BadOptionsAndInputsAreRefusedBeforeAnyWork) {
         {{geo}, {"--cameras", master}, "--cameras: " + master + " orients none of the images"},
         {{master}, {"--blend", "gauss"}, "--blend: \"gauss\" is not one of feather, multiband"},
         {{master}, {"--balance", "mean"}, "--balance: \"mean\" is not one of gain, gain-offset"},
+        {{master}, {"--seams", "curved"}, "--seams: \"curved\" is not one of lines, pixel"},
         {{master}, {"--frobnicate"}, "unknown option"},
         {{master}, {"--dem"}, "--dem needs a value"},
         // A master file where images are expected, and the reverse, said plainly.
@@ -206,7 +207,7 @@ TEST(OrthoCommandLine, ValuesThatHelpListsAreAccepted) {
         {"--co", "COMPRESS=JPEG"}, {"--co", "QUALITY=90"},        {"--co", "BLOCKSIZE=256"},
         {"--tr", "0.5", "0.25"},   {"--te", "9", "45", "9.1", "45.1", "--te-srs", "EPSG:4326"},
         {"--blend", "multiband"},  {"--balance", "gain"},         {"--balance", "none"},
-        {"--blend-width", "0"},
+        {"--blend-width", "0"},    {"--seams", "pixel"},
     };
     for (const auto& option : accepted) {
         SCOPED_TRACE(option[0] + " " + option[1]);

@@ -1,6 +1,7 @@
 // Raster datasets, readers and writers on GDAL, and the utility functions that make them.
 #include <algorithm>
 #include <cstdlib>
+#include <limits>
 #include <map>
 #include <memory>
 #include <set>
@@ -435,6 +436,60 @@ TEST(RasterWriter, CogIsTiledCompressedWithAveragedOverviewsAndAMask) {
                 << e->what();
         }
         EXPECT_FALSE(std::filesystem::exists(dir.File("refused.tif")));
+    }
+}
+
+// The mask leaves out exactly the pixels that are no data in every channel, whatever the data
+// type (NaN included); a channel without a no-data value makes every pixel valid.
+TEST(RasterWriter, MaskLeavesOutThePixelsThatAreNoDataInEveryChannel) {
+    TempDir dir;
+    const double nan = std::numeric_limits<double>::quiet_NaN();
+    const struct {
+        DataType type;
+        double noData;
+        unsigned int channelsWithNoData;
+    } cases[] = {{DataType::Byte, 0, 3},     {DataType::UInt16, 65535, 3},
+                 {DataType::Int16, -1, 3},   {DataType::Int32, -9999, 3},
+                 {DataType::Float32, nan, 3}, {DataType::Float64, -1e30, 3},
+                 {DataType::Byte, 0, 2}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(std::to_string(static_cast<int>(c.type)) + " " + std::to_string(c.noData) +
+                     " in " + std::to_string(c.channelsWithNoData) + " channels");
+        const std::string path = dir.File("masked.tif");
+        const int width = 40, height = 24;
+        auto empty = [](int x, int y) { return (x + y) % 5 == 0; };
+        {
+            BasicWriter writer(path, {1, 2, 3}, "GTiff", "");
+            writer.SetSize(width, height);
+            writer.SetDataType(c.type);
+            for (unsigned int b = 0; b < c.channelsWithNoData; ++b)
+                writer.SetNoDataValue(b, c.noData);
+            writer.SetNoDataAsMask();
+            Raster raster(width, height, 3, c.type);
+            for (unsigned int b = 0; b < 3; ++b)
+                for (int y = 0; y < height; ++y)
+                    for (int x = 0; x < width; ++x) {
+                        // The first channel alone is no data in every seventh column.
+                        const bool none = empty(x, y) || (b == 0 && x % 7 == 0);
+                        raster.SetValue(b, x, y, none ? c.noData : 1 + Pattern(x, y, b + 1));
+                    }
+            writer.Write(raster);
+            writer.Close();
+        }
+        std::unique_ptr<GDALDataset> ds(
+            GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY));
+        ASSERT_TRUE(ds != nullptr);
+        std::vector<GByte> mask(static_cast<std::size_t>(width) * height);
+        ASSERT_EQ(ds->GetRasterBand(1)->GetMaskBand()->RasterIO(
+                      GF_Read, 0, 0, width, height, mask.data(), width, height, GDT_Byte, 0, 0,
+                      nullptr),
+                  CE_None);
+        int wrong = 0;
+        for (int y = 0; y < height; ++y)
+            for (int x = 0; x < width; ++x)
+                wrong += mask[y * width + x] !=
+                         (empty(x, y) && c.channelsWithNoData == 3 ? 0 : 255);
+        EXPECT_EQ(wrong, 0);
     }
 }
 

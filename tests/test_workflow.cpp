@@ -761,12 +761,15 @@ TEST(Workflow, RerunMakesAgainWhatChangedAndSaysWhy) {
         {"the colour balance, which only the mosaic reads",
          [&] { args.insert(args.end(), {"--balance", "none"}); },
          {}, "--balance changed: gain-offset -> none", true, false},
+        {"the choice of regions, which only the mosaic reads",
+         [&] { args.insert(args.end(), {"--seams", "pixel"}); },
+         {}, "--seams changed: lines -> pixel", true, false},
         {"a creation option only the mosaic takes",
          [&] { args.insert(args.end(), {"--co", "LEVEL=6"}); },
-         {}, "--co changed:  -> LEVEL=6", true, false},
+         {}, "--co changed: (none) -> LEVEL=6", true, false},
         {"a creation option of the orthos",
          [&] { args.insert(args.end(), {"--co", "BLOCKXSIZE=64", "--co", "BLOCKYSIZE=64"}); },
-         all, "--co changed:  -> BLOCKXSIZE=64 BLOCKYSIZE=64", true},
+         all, "--co changed: (none) -> BLOCKXSIZE=64 BLOCKYSIZE=64", true},
         {"seamlines handed back",
          [&] {
              std::filesystem::copy_file(dir.File("out/seamlines.gpkg"), dir.File("seams.gpkg"));

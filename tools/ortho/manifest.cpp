@@ -136,6 +136,7 @@ const std::vector<PixelOption>& MosaicOptions() {
     static const std::vector<PixelOption> options = {
         {"--cutline", false, [](const Options& o) { return FilePath(o.cutline); }},
         {"--seamlines", false, [](const Options& o) { return FilePath(o.seamlines); }},
+        {"--seams", false, [](const Options& o) { return o.seams; }},
         {"--dtm", false, [](const Options& o) { return FilePath(o.dtm); }},
         {"--blend-width", false,
          [](const Options& o) {
@@ -277,6 +278,15 @@ bool Manifest::Read(const std::string& path) {
     return header;
 }
 
+namespace {
+
+// A recorded value as a reason shows it: "(none)" for an option not given.
+std::string Shown(const std::string& value) {
+    return value.empty() ? "(none)" : value;
+}
+
+}  // namespace
+
 std::vector<std::string> Manifest::ChangesSince(const Manifest& earlier) const {
     std::vector<std::string> changes;
     for (const std::string& what : order_) {
@@ -286,7 +296,9 @@ std::vector<std::string> Manifest::ChangesSince(const Manifest& earlier) const {
             changes.push_back(what + " is new");
         else if (before->second.value != now.value)
             changes.push_back(what + " changed" +
-                              (now.shown ? ": " + before->second.value + " -> " + now.value : ""));
+                              (now.shown ? ": " + Shown(before->second.value) + " -> " +
+                                               Shown(now.value)
+                                         : ""));
     }
     for (const std::string& what : earlier.order_) {
         if (entries_.find(what) == entries_.end())

@@ -176,6 +176,8 @@ Options ParseOptions(const std::vector<std::string>& args) {
             options.blend = OneOf(name, take(), {"feather", "multiband"});
         } else if (name == "--balance") {
             options.balance = OneOf(name, take(), {"gain", "gain-offset", "none"});
+        } else if (name == "--seams") {
+            options.seams = OneOf(name, take(), {"lines", "pixel"});
         } else if (name == "--seamlines") {
             options.seamlines = take();
         } else if (name == "--dtm") {
@@ -309,8 +311,14 @@ Mosaic (only the mosaic is made again when these change):
   --seamlines FILE    make the mosaic from these regions: the polygon layer "seamlines" (any
                       OGR format), as DIR/seamlines.gpkg holds it and edited in a GIS, say; each
                       feature's field "scene" names the scene its pixels come from, later
-                      features win where polygons overlap, and pixels no polygon covers are
-                      filled as without --seamlines
+                      features win where polygons overlap, and pixels no polygon covers take
+                      the scene that sees them best (as --seams pixel)
+  --seams METHOD      how the mosaic's regions are chosen: lines (default), seamlines solved
+                      over the whole mosaic that keep off raised objects and colour edges;
+                      pixel, each pixel from the scene that sees it best (clear view, lower
+                      radiometric level, line of sight nearer the vertical), with no seams to
+                      solve: some half of the mosaic step's time, seams wherever the choice
+                      changes
   --blend-width N     blend the two scenes across each seam over N mosaic pixels (default 16;
                       0: hard seams; at most 4096)
   --blend METHOD      feather (default) or multiband (Laplacian pyramid)

@@ -47,6 +47,7 @@ struct Options {
     std::optional<unsigned int> blendWidth;  // --blend-width: mosaic pixels; unset: the default
     std::string blend = "feather";            // --blend: feather or multiband
     std::string balance = "gain-offset";      // --balance: gain, gain-offset or none
+    std::string seams = "lines";              // --seams: lines (solved) or pixel
     // --seamlines FILE: the polygon layer "seamlines" (as DIR/seamlines.gpkg holds it) gives
     // each mosaic pixel its scene; empty: seamlines chosen by the recovery.
     std::string seamlines;

@@ -1209,6 +1209,7 @@ MosaicResult RecoverMosaic(const Options& options, const std::vector<RecoverySce
     const std::unique_ptr<kestrel::dem::IElevationSource> ground = OpenGround(options, model);
     job.ground = ground.get();
     job.blendWidth = BlendWidth(options);
+    job.seamlines = options.seams == "lines";
     using Job = kestrel::processes::RecoveryJob;
     job.blend = options.blend == "multiband" ? Job::Blend::Multiband : Job::Blend::Feather;
     job.balance = options.balance == "none"   ? Job::Balance::None
@@ -1375,40 +1376,6 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
         return count;
     };
 
-    // One stretch for all bands, so that colours keep their balance: between the 2nd and 98th
-    // percentiles of the values with data, taken from every pixel or, on larger pictures, from
-    // pixels evenly spread (at most kStretchSamples values: a few MB).
-    double low = 0, scale = 0;
-    if (kind == Quicklook::Image) {
-        constexpr std::size_t kStretchSamples = std::size_t{1} << 20;
-        const std::size_t pixels = static_cast<std::size_t>(outWidth) * outHeight;
-        const std::size_t stride =
-            std::max<std::size_t>(1, pixels * bands / kStretchSamples + 1);
-        std::vector<float> data;
-        data.reserve(std::min(pixels * bands, kStretchSamples + bands));
-        std::size_t first = 0;  // index in the picture of the strip's first pixel
-        for (int row = 0; row < outHeight; row += kStripRows) {
-            const std::size_t count = read(row, std::min(kStripRows, outHeight - row));
-            for (std::size_t i = (stride - first % stride) % stride; i < count; i += stride) {
-                if (empty[i])
-                    continue;
-                for (int b = 0; b < bands; ++b)
-                    data.push_back(strip[count * static_cast<std::size_t>(b) + i]);
-            }
-            first += count;
-        }
-        auto percentile = [&data](std::size_t share, double none) {
-            if (data.empty())
-                return none;
-            const auto at = data.begin() + static_cast<std::ptrdiff_t>(data.size() * share / 100);
-            std::nth_element(data.begin(), at, data.end());
-            return static_cast<double>(*at);
-        };
-        low = percentile(2, 0.0);
-        const double high = percentile(98, 1.0);
-        scale = high > low ? 254.0 / (high - low) : 0.0;
-    }
-
     // Red, green, blue, alpha, strip by strip into the picture; classes as indexes into the
     // palette (index 0 transparent, k + 1 the colour of class k), a quarter of the bytes to
     // filter and compress.
@@ -1429,33 +1396,111 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
         picture->GetRasterBand(1)->SetColorTable(&palette);
     }
     std::vector<GByte> pixels(stripCount * channels);
-    for (int row = 0; row < outHeight; row += kStripRows) {
+    auto put = [&](int row, int rows) {
+        if (picture->RasterIO(GF_Write, 0, row, outWidth, rows, pixels.data(), outWidth, rows,
+                              GDT_Byte, channels, nullptr, 0, 0,
+                              static_cast<GSpacing>(outWidth) * rows, nullptr) != CE_None)
+            FailFile(png, "cannot be drawn", errors);
+    };
+    // An image's strip as red, green, blue (one band: grey) and alpha, each value through
+    // `colour`.
+    auto drawImage = [&](std::size_t count, auto colour) {
+        GByte* alpha = pixels.data() + 3 * count;
+        for (std::size_t i = 0; i < count; ++i)
+            alpha[i] = empty[i] ? 0 : 255;
+        for (int b = 0; b < bands; ++b) {
+            const float* values = strip.data() + count * static_cast<std::size_t>(b);
+            for (std::size_t i = 0; i < count; ++i) {
+                const GByte byte = colour(values[i]);
+                for (int c = b; c < (bands == 1 ? 3 : b + 1); ++c)
+                    pixels[count * c + i] = byte;
+            }
+        }
+    };
+
+    // One stretch for all bands, so that colours keep their balance: between the 2nd and 98th
+    // percentiles of the values with data, taken from every pixel or, on larger pictures, from
+    // pixels evenly spread (at most kStretchSamples values: a few MB). Byte values are drawn
+    // as they are while the samples are taken, and then stretched in the picture, so that the
+    // raster is read once.
+    double low = 0, scale = 0;
+    bool drawn = false;
+    if (kind == Quicklook::Image) {
+        drawn = std::all_of(bandList.begin(), bandList.end(), [&](int b) {
+            return source->GetRasterBand(b)->GetRasterDataType() == GDT_Byte;
+        });
+        constexpr std::size_t kStretchSamples = std::size_t{1} << 20;
+        const std::size_t area = static_cast<std::size_t>(outWidth) * outHeight;
+        const std::size_t stride = std::max<std::size_t>(1, area * bands / kStretchSamples + 1);
+        std::vector<float> data;
+        data.reserve(std::min(area * bands, kStretchSamples + bands));
+        std::size_t first = 0;  // index in the picture of the strip's first pixel
+        for (int row = 0; row < outHeight; row += kStripRows) {
+            const int rows = std::min(kStripRows, outHeight - row);
+            const std::size_t count = read(row, rows);
+            for (std::size_t i = (stride - first % stride) % stride; i < count; i += stride) {
+                if (empty[i])
+                    continue;
+                for (int b = 0; b < bands; ++b)
+                    data.push_back(strip[count * static_cast<std::size_t>(b) + i]);
+            }
+            first += count;
+            if (drawn) {
+                drawImage(count, [](float v) { return static_cast<GByte>(v); });
+                put(row, rows);
+            }
+        }
+        auto percentile = [&data](std::size_t share, double none) {
+            if (data.empty())
+                return none;
+            const auto at = data.begin() + static_cast<std::ptrdiff_t>(data.size() * share / 100);
+            std::nth_element(data.begin(), at, data.end());
+            return static_cast<double>(*at);
+        };
+        low = percentile(2, 0.0);
+        const double high = percentile(98, 1.0);
+        scale = high > low ? 254.0 / (high - low) : 0.0;
+    }
+    auto stretch = [&](float value) {
+        const double v = 1.0 + (value - low) * scale;
+        return static_cast<GByte>(std::clamp(v, 1.0, 255.0));
+    };
+
+    if (drawn) {
+        // Every byte value through the stretch, in place in the picture's colour bands; other
+        // pictures are drawn now, strip by strip.
+        GByte table[256];
+        for (int v = 0; v < 256; ++v)
+            table[v] = stretch(static_cast<float>(v));
+        const int coloured = bands == 1 ? 3 : bands;
+        for (int row = 0; row < outHeight; row += kStripRows) {
+            const int rows = std::min(kStripRows, outHeight - row);
+            const std::size_t count = static_cast<std::size_t>(outWidth) * rows;
+            for (GDALRWFlag direction : {GF_Read, GF_Write}) {
+                if (picture->RasterIO(direction, 0, row, outWidth, rows, pixels.data(), outWidth,
+                                      rows, GDT_Byte, coloured, nullptr, 0, 0,
+                                      static_cast<GSpacing>(count), nullptr) != CE_None)
+                    FailFile(png, "cannot be drawn", errors);
+                if (direction == GF_Read) {
+                    for (std::size_t i = 0; i < coloured * count; ++i)
+                        pixels[i] = table[pixels[i]];
+                }
+            }
+        }
+    }
+    for (int row = 0; row < outHeight && !drawn; row += kStripRows) {
         const int rows = std::min(kStripRows, outHeight - row);
         const std::size_t count = read(row, rows);
-        if (channels == 1) {
+        if (channels == 4) {
+            drawImage(count, stretch);
+        } else {
             for (std::size_t i = 0; i < count; ++i) {
                 const auto v = static_cast<long long>(std::llround(strip[i]));
                 pixels[i] =
                     empty[i] ? 0 : static_cast<GByte>(1 + ((v % kColours) + kColours) % kColours);
             }
-        } else {
-            GByte* alpha = pixels.data() + 3 * count;
-            for (std::size_t i = 0; i < count; ++i)
-                alpha[i] = empty[i] ? 0 : 255;
-            for (int b = 0; b < bands; ++b) {
-                const float* values = strip.data() + count * static_cast<std::size_t>(b);
-                for (std::size_t i = 0; i < count; ++i) {
-                    const double v = 1.0 + (values[i] - low) * scale;
-                    const auto byte = static_cast<GByte>(std::clamp(v, 1.0, 255.0));
-                    for (int c = b; c < (bands == 1 ? 3 : b + 1); ++c)
-                        pixels[count * c + i] = byte;
-                }
-            }
         }
-        if (picture->RasterIO(GF_Write, 0, row, outWidth, rows, pixels.data(), outWidth, rows,
-                              GDT_Byte, channels, nullptr, 0, 0, static_cast<GSpacing>(count),
-                              nullptr) != CE_None)
-            FailFile(png, "cannot be drawn", errors);
+        put(row, rows);
     }
     if (channels == 4)
         picture->GetRasterBand(4)->SetColorInterpretation(GCI_AlphaBand);

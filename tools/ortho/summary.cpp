@@ -184,7 +184,7 @@ std::string BalanceJson(const MosaicBalance& balance) {
     };
     out << "{\"method\": " << JsonString(balance.method) << ", \"blend\": "
         << JsonString(balance.blend) << ", \"blend_width\": " << balance.blendWidth
-        << ", \"seamlines\": " << PathOrNull(balance.seamlines) << ", \"scenes\": [";
+        << ", \"seams\": " << JsonString(balance.seams) << ", \"seamlines\": " << PathOrNull(balance.seamlines) << ", \"scenes\": [";
     for (std::size_t i = 0; i < balance.scenes.size(); ++i) {
         out << (i ? ", " : "") << "{\"scene\": " << JsonString(balance.scenes[i])
             << ", \"gain\": ";

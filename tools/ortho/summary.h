@@ -53,12 +53,14 @@ std::string LegendJson(const std::vector<std::string>& scenes,
 struct MosaicBalance {
     std::string method;  // --balance
     std::string blend;   // --blend
+    std::string seams;   // --seams
     unsigned int blendWidth = 0;
     std::string seamlines;  // the --seamlines file; empty: chosen by the recovery
     std::vector<std::string> scenes;
     std::vector<std::vector<double>> gain, offset;  // per scene and channel
 };
-// One line: {"method": "gain-offset", "blend": "feather", "blend_width": 16, "seamlines": null,
+// One line: {"method": "gain-offset", "blend": "feather", "blend_width": 16, "seams": "lines",
+// "seamlines": null,
 // "scenes": [{"scene": "north", "gain": [1.02, ...], "offset": [-1.5, ...]}, ...]}; a scene
 // for which the recovery reported no balance has empty lists.
 std::string BalanceJson(const MosaicBalance& balance);

@@ -1119,6 +1119,7 @@ void Workflow::Recover() {
                 applied.method = options_.balance;
                 applied.blend = options_.blend;
                 applied.blendWidth = BlendWidth(options_);
+                applied.seams = options_.seams;
                 applied.seamlines = options_.seamlines;
                 applied.scenes = mosaicScenes;
                 applied.gain = result.gain;

@@ -656,12 +656,29 @@ bool IsNoData(double value, const std::optional<double>& noData) {
     return noData.has_value() && (value == *noData || (std::isnan(value) && std::isnan(*noData)));
 }
 
+// Marks with 255 in `valid` the pixels of a window, `values` holding `bands` values a pixel,
+// where some band holds other than its no-data value.
+template <typename T>
+void MarkValid(const std::vector<std::optional<double>>& noData, int bands, const T* values,
+               std::size_t count, GByte* valid) {
+    for (int b = 0; b < bands; ++b) {
+        const std::optional<double> value =
+            b < static_cast<int>(noData.size()) ? noData[b] : std::nullopt;
+        if (!value.has_value()) {
+            std::fill(valid, valid + count, GByte{255});
+            return;
+        }
+        for (std::size_t i = 0; i < count; ++i)
+            if (!IsNoData(static_cast<double>(values[i * bands + b]), value))
+                valid[i] = 255;
+    }
+}
+
 // Puts the pixels that are no data in every channel into the GeoTIFF's internal mask, and drops
-// the channels' no-data values, so that readers see the mask rather than a colour.
-void NoDataToMask(BasicWriter::Impl& impl, GDALDataset& ds) {
-    if (std::none_of(impl.noData.begin(), impl.noData.end(),
-                     [](const std::optional<double>& v) { return v.has_value(); }))
-        return;
+// the channels' no-data values, so that readers see the mask rather than a colour. The pixels
+// are read in the file's own type and order, which costs a fraction of converting them.
+template <typename T>
+void NoDataToMask(BasicWriter::Impl& impl, GDALDataset& ds, GDALDataType type) {
     CPLConfigOptionSetter internal("GDAL_TIFF_INTERNAL_MASK", "YES", true);
     if (ds.CreateMaskBand(GMF_PER_DATASET) != CE_None)
         return;
@@ -670,7 +687,7 @@ void NoDataToMask(BasicWriter::Impl& impl, GDALDataset& ds) {
     const int height = ds.GetRasterYSize();
     const int bands = static_cast<int>(impl.channelCount);
     const int step = 512;
-    std::vector<double> values;
+    std::vector<T> values;
     std::vector<GByte> valid;
     for (int y = 0; y < height; y += step) {
         for (int x = 0; x < width; x += step) {
@@ -679,17 +696,11 @@ void NoDataToMask(BasicWriter::Impl& impl, GDALDataset& ds) {
             const std::size_t count = static_cast<std::size_t>(w) * h;
             values.resize(count * bands);
             valid.assign(count, 0);
-            if (ds.RasterIO(GF_Read, x, y, w, h, values.data(), w, h, GDT_Float64, bands, nullptr,
-                            0, 0, 0, nullptr) != CE_None)
+            const GSpacing pixel = static_cast<GSpacing>(sizeof(T)) * bands;
+            if (ds.RasterIO(GF_Read, x, y, w, h, values.data(), w, h, type, bands, nullptr, pixel,
+                            pixel * w, sizeof(T), nullptr) != CE_None)
                 return;
-            for (int b = 0; b < bands; ++b) {
-                const std::optional<double> noData =
-                    b < static_cast<int>(impl.noData.size()) ? impl.noData[b] : std::nullopt;
-                const double* band = values.data() + count * b;
-                for (std::size_t i = 0; i < count; ++i)
-                    if (!IsNoData(band[i], noData))
-                        valid[i] = 255;
-            }
+            MarkValid(impl.noData, bands, values.data(), count, valid.data());
             if (mask->RasterIO(GF_Write, x, y, w, h, valid.data(), w, h, GDT_Byte, 0, 0,
                                nullptr) != CE_None)
                 return;
@@ -697,6 +708,28 @@ void NoDataToMask(BasicWriter::Impl& impl, GDALDataset& ds) {
     }
     for (int b = 1; b <= bands; ++b)
         ds.GetRasterBand(b)->DeleteNoDataValue();
+}
+
+void NoDataToMask(BasicWriter::Impl& impl, GDALDataset& ds) {
+    if (std::none_of(impl.noData.begin(), impl.noData.end(),
+                     [](const std::optional<double>& v) { return v.has_value(); }))
+        return;
+    switch (const GDALDataType type = ds.GetRasterBand(1)->GetRasterDataType()) {
+    case GDT_Byte:
+        return NoDataToMask<GByte>(impl, ds, type);
+    case GDT_UInt16:
+        return NoDataToMask<GUInt16>(impl, ds, type);
+    case GDT_Int16:
+        return NoDataToMask<GInt16>(impl, ds, type);
+    case GDT_UInt32:
+        return NoDataToMask<GUInt32>(impl, ds, type);
+    case GDT_Int32:
+        return NoDataToMask<GInt32>(impl, ds, type);
+    case GDT_Float32:
+        return NoDataToMask<float>(impl, ds, type);
+    default:
+        return NoDataToMask<double>(impl, ds, GDT_Float64);
+    }
 }
 
 }  // namespace

@@ -566,10 +566,16 @@ int BlendBorder(BlendMode mode, int blendWidth) {
     return levels == 0 ? 0 : (kMultibandBorderCells + 1) << levels;
 }
 
+bool HardSeamsOnly(BlendMode mode, int blendWidth, std::size_t scenes) {
+    if (blendWidth == 0 || (mode == BlendMode::Multiband && Levels(blendWidth) == 0))
+        return true;
+    return mode == BlendMode::Feather && scenes < 2;
+}
+
 void BlendRegions(const BlendTile& tile, BlendMode mode, int blendWidth, float noData,
                   std::vector<float>& out) {
     CheckTile(tile, blendWidth);
-    if (blendWidth == 0 || (mode == BlendMode::Multiband && Levels(blendWidth) == 0)) {
+    if (HardSeamsOnly(mode, blendWidth, tile.scenes.size())) {
         HardSeams(tile, noData, out);
         return;
     }
@@ -578,7 +584,7 @@ void BlendRegions(const BlendTile& tile, BlendMode mode, int blendWidth, float n
         return;
     }
     const std::vector<int> order = ScenesWithRegions(tile, 0, 0);
-    if (order.size() < 2)
+    if (HardSeamsOnly(mode, blendWidth, order.size()))
         HardSeams(tile, noData, out);
     else
         Feather(tile, order, blendWidth, noData, out);

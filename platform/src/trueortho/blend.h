@@ -36,6 +36,10 @@ struct BlendTile {
 // for multiband).
 KESTREL_API int BlendBorder(BlendMode mode, int blendWidth);
 
+// Whether BlendRegions gives every pixel its region's value (hard seams) in a tile whose regions
+// belong to `scenes` scenes.
+KESTREL_API bool HardSeamsOnly(BlendMode mode, int blendWidth, std::size_t scenes);
+
 // The blended inner tile ((width - 2 border) x (height - 2 border), `bands` planes) into out;
 // pixels whose label is -1 take noData. blendWidth 0: every pixel its region's value. Throws
 // DataException for a negative width or arrays that do not match the tile's size.

@@ -14,6 +14,7 @@
 #include <gdal_priv.h>
 
 #include <algorithm>
+#include <array>
 #include <cmath>
 #include <filesystem>
 #include <limits>
@@ -41,6 +42,10 @@ struct Composition {
     int border = 0;
     trueortho::ValueRange range;
     datasources::BasicWriter *mosaic = nullptr, *source = nullptr;
+    // Every scene and the mosaic are Byte: hard seams go from byte to byte (HardSeamBytes).
+    bool bytes = false;
+    std::vector<int> channels;  // 1 to the grid's band count
+    unsigned char noDataByte = 0;  // the no-data value as the mosaic's Byte band holds it
 };
 
 // One thread's buffers, reused from tile to tile.
@@ -53,40 +58,173 @@ struct Worker {
     std::vector<Rect> others;    // the rasters of the other scenes meeting the tile, on it
     std::vector<float> regions, mask, blended;
     std::vector<unsigned char> clear;  // per pixel: some scene of the blend sees it clearly
+    // RankPixels': per tile scene, its states, level and the angle cells it needs.
+    std::vector<const unsigned char*> states;
+    std::vector<int> levels;
+    std::vector<std::vector<unsigned char>> cells;
+    std::vector<std::array<int, 4>> boxes;  // HardSeamBytes': per scene, its pixels' box
     trueortho::BlendTile blend;
 };
 
-// The scene that ranks first at pixel p among the tile's n scenes, or -1. Lower ranks first:
+// Labels each pixel that `labels` leaves unlabelled (-1) and no mask takes out with the scene
+// that ranks first there among the tile's n scenes (-1: none sees it). Lower ranks first:
 //   1. seen clearly: no hidden pixel of the scene within its DBM pixel error (the visibility
 //      test's tolerance), so an error of the surface model cannot have put the pixel on the
 //      wrong side of an occlusion edge;
 //   2. the lower radiometric difference level;
 //   3. the line of sight nearer the vertical (a known angle before an unknown one);
-//   4. the scene listed first.
-int FirstRanked(const RecoveryJob& job, const std::vector<SceneTile>& scenes, size_t n,
-                size_t p) {
-    int best = -1;
+//   4. the scene listed first (scenes are in job order).
+// The angles are read only for the scenes tied on the first two, in the lattice cells of the
+// tied pixels.
+void RankPixels(const RecoveryJob& job, const SceneReader& reader, const Rect& r, size_t n,
+                const std::vector<float>* mask, Worker& w, std::vector<int>& labels) {
+    constexpr int kTied = -2;
+    const int across = trueortho::AngleCells(r.width);
+    const size_t cells = static_cast<size_t>(across) * trueortho::AngleCells(r.height);
+    w.states.resize(n);
+    w.levels.resize(n);
+    if (w.cells.size() < n)
+        w.cells.resize(n);
     for (size_t k = 0; k < n; ++k) {
-        const SceneTile& a = scenes[k];
-        if (a.state[p] == trueortho::kNotSeen)
+        w.states[k] = w.scenes[k].state.data();
+        w.levels[k] = job.scenes[w.scenes[k].scene].radiometricLevel;
+        w.cells[k].assign(cells, 0);
+    }
+    const unsigned char* const* states = w.states.data();
+    const int* levels = w.levels.data();
+    // The best state and level at p, and how many scenes have them; first: the first of them.
+    const auto best = [&](size_t p, unsigned char& state, int& level, int& first) {
+        int count = 0;
+        first = -1;
+        for (size_t k = 0; k < n; ++k) {
+            const unsigned char s = states[k][p];
+            if (s == trueortho::kNotSeen)
+                continue;
+            if (first < 0 || s < state || (s == state && levels[k] < level))
+                first = static_cast<int>(k), state = s, level = levels[k], count = 1;
+            else if (s == state && levels[k] == level)
+                ++count;
+        }
+        return count;
+    };
+    bool tied = false;
+    for (int j = 0; j < r.height; ++j)
+        for (int i = 0; i < r.width; ++i) {
+            const size_t p = static_cast<size_t>(j) * r.width + i;
+            if (labels[p] >= 0 || (mask != nullptr && (*mask)[p] == 0))
+                continue;
+            unsigned char state = 0;
+            int level = 0, first;
+            if (best(p, state, level, first) < 2) {
+                labels[p] = first;
+                continue;
+            }
+            labels[p] = kTied, tied = true;
+            const size_t c = static_cast<size_t>(j / trueortho::kAngleStep) * across +
+                             i / trueortho::kAngleStep;
+            for (size_t k = 0; k < n; ++k)
+                if (states[k][p] == state && levels[k] == level)
+                    w.cells[k][c] = 1;
+        }
+    if (!tied)
+        return;
+    for (size_t k = 0; k < n; ++k)
+        if (std::find(w.cells[k].begin(), w.cells[k].end(), 1) != w.cells[k].end())
+            reader.ReadAngles(r, w.scratch, w.scenes[k], &w.cells[k]);
+    for (size_t p = 0; p < r.Size(); ++p) {
+        if (labels[p] != kTied)
             continue;
-        if (best >= 0) {
-            const SceneTile& b = scenes[best];
-            const int la = job.scenes[a.scene].radiometricLevel;
-            const int lb = job.scenes[b.scene].radiometricLevel;
-            if (a.state[p] != b.state[p]) {
-                if (a.state[p] > b.state[p])
-                    continue;
-            } else if (la != lb) {
-                if (la > lb)
-                    continue;
-            } else if (!(a.angle[p] < b.angle[p])) {
-                continue;  // equal angles: the scene listed first (scenes are in job order)
+        unsigned char state = 0;
+        int level = 0, first;
+        best(p, state, level, first);
+        for (size_t k = static_cast<size_t>(first) + 1; k < n; ++k)
+            if (states[k][p] == state && levels[k] == level &&
+                w.scenes[k].angle[p] < w.scenes[first].angle[p])
+                first = static_cast<int>(k);
+        labels[p] = first;
+    }
+}
+
+// Float32 values as GDAL writes them into a Byte band.
+void ToBytes(const float* values, unsigned char* bytes, int count) {
+    GDALCopyWords(values, GDT_Float32, sizeof(float), bytes, GDT_Byte, 1, count);
+}
+
+// The inner tile t of a tile r whose regions (w.blend's labels and scenes) are joined by hard
+// seams, when every scene and the mosaic are Byte: each pixel its region's byte through one table
+// per scene and band (its balance, the value range, a value beside no-data, as the blend's
+// Float32 values reach the file), each scene read only over the box of its pixels in t.
+void HardSeamBytes(const Composition& c, Worker& w, const Rect& t, const Rect& r,
+                   TorthoRecoveryResult& counts) {
+    const int bands = c.grid.bands;
+    const std::vector<size_t>& scenes = w.blend.scenes;
+    const std::vector<int>& labels = w.blend.labels;
+    gobs::Raster mosaic(t.width, t.height, bands, datasources::DataType::Byte,
+                        gobs::Raster::Initial::Unset);
+    gobs::Raster source(t.width, t.height, 1, datasources::DataType::Float32);
+    unsigned char* out = static_cast<unsigned char*>(mosaic.GetData());
+    float* from = static_cast<float*>(source.GetData());
+    const size_t plane = t.Size();
+    // Per scene: the first and last column and line of its pixels in t.
+    w.boxes.assign(scenes.size(), {t.width, t.height, -1, -1});
+    for (int j = 0; j < t.height; ++j) {
+        const int* label = labels.data() + static_cast<size_t>(j + c.border) * r.width + c.border;
+        // Runs of one label along the line.
+        for (int i = 0, end; i < t.width; i = end) {
+            const int l = label[i];
+            for (end = i + 1; end < t.width && label[end] == l;)
+                ++end;
+            const size_t o = static_cast<size_t>(j) * t.width + i;
+            const size_t length = static_cast<size_t>(end - i);
+            if (l < 0) {
+                counts.unfilled += length;
+                std::fill_n(from + o, length, 0.0f);
+                for (int b = 0; b < bands; ++b)
+                    std::fill_n(out + plane * b + o, length, c.noDataByte);
+                continue;
+            }
+            counts.filled += length;
+            std::fill_n(from + o, length, static_cast<float>(scenes[l] + 1));
+            std::array<int, 4>& box = w.boxes[l];
+            box = {std::min(box[0], i), std::min(box[1], j), std::max(box[2], end - 1),
+                   std::max(box[3], j)};
+        }
+    }
+    float values[256];
+    unsigned char table[256];
+    std::vector<unsigned char>& bytes = w.scratch.bytes;
+    for (size_t u = 0; u < scenes.size(); ++u) {
+        const std::array<int, 4>& box = w.boxes[u];
+        if (box[2] < 0)
+            continue;  // its region lies in the border only
+        const size_t s = scenes[u];
+        const Rect read{t.x + box[0], t.y + box[1], box[2] - box[0] + 1, box[3] - box[1] + 1};
+        bytes.resize(read.Size() * bands);
+        c.grid.orthos[s]->Read(c.channels.data(), bands, read, GDT_Byte, bytes.data());
+        for (int b = 0; b < bands; ++b) {
+            const double gain = c.fit.gain[s][b], offset = c.fit.offset[s][b];
+            const bool balanced = !(gain == 1 && offset == 0);
+            for (int v = 0; v < 256; ++v)
+                values[v] = c.range.Besides(
+                    c.range(balanced ? c.range(gain * v + offset) : static_cast<float>(v)),
+                    c.grid.noData);
+            ToBytes(values, table, 256);
+            for (int j = 0; j < read.height; ++j) {
+                const int* label = labels.data() +
+                                   static_cast<size_t>(box[1] + j + c.border) * r.width +
+                                   box[0] + c.border;
+                const unsigned char* in = bytes.data() + read.Size() * b +
+                                          static_cast<size_t>(j) * read.width;
+                unsigned char* o = out + plane * b + static_cast<size_t>(box[1] + j) * t.width +
+                                   box[0];
+                for (int i = 0; i < read.width; ++i)
+                    if (label[i] == static_cast<int>(u))
+                        o[i] = table[in[i]];
             }
         }
-        best = static_cast<int>(k);
     }
-    return best;
+    c.mosaic->WriteWindow(mosaic, t.x, t.y);
+    c.source->WriteWindow(source, t.x, t.y);
 }
 
 // One tile of the mosaic: its scenes read with the blend border, each pixel's region, the
@@ -98,14 +236,12 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
     const Rect r = t.Grown(c.border);
     const size_t size = r.Size();
     const std::vector<size_t> meeting = c.grid.ScenesMeeting(r);
-    // The viewing angles only rank scenes where no region is given: read when needed.
-    const bool angles = c.regions == nullptr;
     size_t n = 0;  // the tile's scenes that see some pixel of it, w.scenes[0] to [n - 1]
     const auto read = [&](size_t s) {
         if (w.scenes.size() <= n)
             w.scenes.emplace_back();
         ++counts.sceneReads;
-        n += c.reader.Read(s, r, false, angles, w.scratch, w.scenes[n]) ? 1 : 0;
+        n += c.reader.Read(s, r, false, false, w.scratch, w.scenes[n]) ? 1 : 0;
     };
     if (c.mask != nullptr) {
         // Outside the mask (and outside its raster) the pixels stay empty.
@@ -206,23 +342,7 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
             }
         }
     }
-    bool ranked = angles;
-    for (size_t p = 0; p < size; ++p) {
-        if (labels[p] >= 0)
-            continue;
-        if (!ranked) {
-            // A pixel that some scene sees and no region gives: every scene's angles.
-            bool seen = false;
-            for (size_t k = 0; k < n && !seen; ++k)
-                seen = w.scenes[k].state[p] != trueortho::kNotSeen;
-            if (!seen)
-                continue;
-            for (size_t k = 0; k < n; ++k)
-                c.reader.ReadAngles(r, w.scratch, w.scenes[k]);
-            ranked = true;
-        }
-        labels[p] = FirstRanked(job, w.scenes, n, p);
-    }
+    RankPixels(job, c.reader, r, n, c.mask != nullptr ? &w.mask : nullptr, w, labels);
     if (c.mask != nullptr)
         for (size_t p = 0; p < size; ++p)
             if (w.mask[p] == 0)
@@ -245,6 +365,13 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
         if (label >= 0)
             label = w.slot[label];
     blend.scenes.resize(used);
+    for (size_t k = 0; k < n; ++k)
+        if (w.slot[k] >= 0)
+            blend.scenes[static_cast<size_t>(w.slot[k])] = w.scenes[k].scene;
+    if (c.bytes && trueortho::HardSeamsOnly(c.blend, static_cast<int>(job.blendWidth), used)) {
+        HardSeamBytes(c, w, t, r, counts);
+        return;
+    }
     blend.values.resize(used);
     blend.seen.resize(used);
     // A scene weighs in the blend only where it sees the pixel clearly, or unclearly in its own
@@ -264,7 +391,6 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
             continue;
         const size_t u = static_cast<size_t>(w.slot[k]);
         const SceneTile& scene = w.scenes[k];
-        blend.scenes[u] = scene.scene;
         std::vector<unsigned char>& seen = blend.seen[u];
         seen.resize(size);
         for (size_t p = 0; p < size; ++p)
@@ -435,6 +561,15 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     const trueortho::BlendMode blend = job.blend == RecoveryJob::Blend::Multiband
                                            ? trueortho::BlendMode::Multiband
                                            : trueortho::BlendMode::Feather;
+    bool bytes = grid.type == GDT_Byte;
+    for (const auto& ortho : grid.orthos)
+        bytes = bytes && ortho->type == GDT_Byte;
+    std::vector<int> channels(grid.bands);
+    for (int b = 0; b < grid.bands; ++b)
+        channels[b] = b + 1;
+    const float noData = static_cast<float>(grid.noData);
+    unsigned char noDataByte = 0;
+    ToBytes(&noData, &noDataByte, 1);
     const Composition composition{job,
                                   grid,
                                   reader,
@@ -445,12 +580,17 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
                                   trueortho::BlendBorder(blend, static_cast<int>(job.blendWidth)),
                                   trueortho::ValueRange(grid.type),
                                   mosaic.get(),
-                                  source.get()};
+                                  source.get(),
+                                  bytes,
+                                  channels,
+                                  noDataByte};
     control.SetSpan(0.6, 0.4);
     std::vector<TorthoRecoveryResult> counts(threads);
     std::vector<Worker> workers(threads);
+    // Tiles in bands, so that the scene blocks two tiles share are still in GDAL's cache.
     control.RunTiles(tiles, threads, "Occlusion recovery", [&](unsigned int thread, size_t index) {
-        Compose(composition, workers[thread], grid.Tile(tile, index), control, counts[thread]);
+        Compose(composition, workers[thread], grid.Tile(tile, grid.InBands(tile, index)), control,
+                counts[thread]);
     });
     if (control.Stopped())
         return result;

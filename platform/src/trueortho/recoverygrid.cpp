@@ -65,20 +65,34 @@ float OffNadir(const mathmodel::IMathModel& model, const ogc::cs::CoordinateTran
     return static_cast<float>(std::hypot(dx, dy));
 }
 
-// The viewing angles of a scene over a rectangle, interpolated from a lattice.
+// The viewing angles of a scene over a rectangle, interpolated from a lattice; only in the
+// cells that `cells` flags (all when it is null), the rest unknown.
 void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScene& scene,
             const ogc::cs::CoordinateTransformation* toModel, const Rect& r,
-            std::vector<float>& out) {
+            const std::vector<unsigned char>* cells, std::vector<float>& out) {
     out.assign(r.Size(), kUnknownAngle);
     if (scene.model == nullptr || job.surface == nullptr)
         return;
     const int tw = r.width, th = r.height;
-    const int nx = (tw + kAngleStep - 1) / kAngleStep + 1,
-              ny = (th + kAngleStep - 1) / kAngleStep + 1;
-    std::vector<float> lattice(static_cast<size_t>(nx) * ny);
+    const int cx = AngleCells(tw), cy = AngleCells(th);
+    const int nx = cx + 1, ny = cy + 1;
+    const auto flagged = [&](int a, int b) {
+        return cells == nullptr || (*cells)[static_cast<size_t>(b) * cx + a] != 0;
+    };
+    // A node is needed by the (up to four) cells it is a corner of.
+    const auto needed = [&](int a, int b) {
+        for (int bb = std::max(0, b - 1); bb <= std::min(cy - 1, b); ++bb)
+            for (int aa = std::max(0, a - 1); aa <= std::min(cx - 1, a); ++aa)
+                if (flagged(aa, bb))
+                    return true;
+        return false;
+    };
+    std::vector<float> lattice(static_cast<size_t>(nx) * ny, kUnknownAngle);
     const auto& g = grid.geoTransform;
     for (int b = 0; b < ny; ++b)
         for (int a = 0; a < nx; ++a) {
+            if (!needed(a, b))
+                continue;
             const double p = r.x + std::min(a * kAngleStep, tw - 1) + 0.5;
             const double l = r.y + std::min(b * kAngleStep, th - 1) + 0.5;
             const double x = g[0] + p * g[1] + l * g[2], y = g[3] + p * g[4] + l * g[5];
@@ -99,7 +113,7 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
     for (int i = 0; i < tw; ++i)
         cell(i, tw, nodes[i], fractions[i]);
     // Per column, along the lattice rows above and below the current line (unknown where a
-    // node of the cell is).
+    // node of the cell is, or the cell is not flagged).
     std::vector<double> above(tw), below(tw);
     std::vector<unsigned char> unknown(tw);
     int row = -1;
@@ -113,8 +127,8 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
                 const double fx = fractions[i];
                 const size_t k = static_cast<size_t>(b) * nx + nodes[i];
                 const float q[4] = {lattice[k], lattice[k + 1], lattice[k + nx], lattice[k + nx + 1]};
-                unknown[i] =
-                    std::isinf(q[0]) || std::isinf(q[1]) || std::isinf(q[2]) || std::isinf(q[3]);
+                unknown[i] = !flagged(nodes[i], b) || std::isinf(q[0]) || std::isinf(q[1]) ||
+                             std::isinf(q[2]) || std::isinf(q[3]);
                 above[i] = (1 - fx) * q[0] + fx * q[1];
                 below[i] = (1 - fx) * q[2] + fx * q[3];
             }
@@ -423,12 +437,13 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
     return true;
 }
 
-void SceneReader::ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) const {
+void SceneReader::ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out,
+                             const std::vector<unsigned char>* cells) const {
     const std::size_t s = out.scene;
     scratch.toModel.resize(toModel_.size());
     if (toModel_[s] && !scratch.toModel[s])
         scratch.toModel[s] = std::make_unique<ogc::cs::CoordinateTransformation>(*toModel_[s]);
-    Angles(job_, grid_, job_.scenes[s], scratch.toModel[s].get(), r, out.angle);
+    Angles(job_, grid_, job_.scenes[s], scratch.toModel[s].get(), r, cells, out.angle);
 }
 
 void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const std::vector<double>& gain,

@@ -180,9 +180,11 @@ struct SceneTile {
 enum : unsigned char { kNotSeen = 0, kClear = 1, kUnclear = 2 };
 
 constexpr float kUnknownAngle = std::numeric_limits<float>::infinity();
-// Angles change slowly: a read computes them on nodes every kAngleStep pixels from its corner
-// (and on its last line and column) and interpolates between.
+// Angles are computed on a lattice of nodes kAngleStep pixels apart (and on a rectangle's last
+// pixel) and interpolated within its cells: they change slowly. Cells of a rectangle `size`
+// pixels across: AngleCells(size).
 constexpr int kAngleStep = 16;
+inline int AngleCells(int size) { return (size + kAngleStep - 1) / kAngleStep; }
 
 // Reads scenes over rectangles; Read may be called from several threads, each with its own
 // Scratch.
@@ -203,8 +205,11 @@ class KESTREL_API SceneReader {
     // no pixel of r.
     bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
               SceneTile& out) const;
-    // The angles of out.scene over r, for a tile Read without them.
-    void ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out) const;
+    // The angles of out.scene over r, for a tile Read without them: in the cells of the angle
+    // lattice that `cells` flags (AngleCells(r.width) per row, line after line), or all of r
+    // when it is null; unknown elsewhere.
+    void ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out,
+                    const std::vector<unsigned char>* cells = nullptr) const;
     // The ortho's `bands` planes over r; no-data outside the scene's raster.
     void ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const;
     // The same, balanced (value * gain + offset per band, as `range` holds it) where `state`
