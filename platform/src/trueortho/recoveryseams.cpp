@@ -247,49 +247,46 @@ class RecoverySeamSource : public SeamSource {
         }
     }
 
-    // Adds to the scene's sums its pixels in the cells `full` names (at full resolution),
-    // reading its angles and values over the part of each chunk that holds such pixels it sees.
-    // That part starts a whole number of kAngleStep pixels from the chunk's corner and ends one
-    // pixel past such a step (or where the chunk does): angles are interpolated between nodes
-    // every kAngleStep pixels from a read's corner and on its last pixel, so that they come out
-    // as over the whole chunk. False once the run stops.
+    // Adds to the scene's sums its pixels in the cells `full` names (at full resolution): its
+    // values over the box of those it sees in each chunk, its angles over the chunk (so that
+    // they come out as a read of the whole chunk gives them) in the lattice cells holding them.
+    // False once the run stops.
     bool ReadNeeded(const Layout& at, const std::vector<std::uint8_t>& full, const Relief& relief,
                     SceneReader::Scratch& scratch, SceneTile& tile, Sums& sum) const {
         tile.scene = sum.scene;
+        std::vector<unsigned char> cells;
+        std::vector<float> angles;
         for (const auto& [chunk, states] : sum.states) {
             if (control_.Stopped())
                 return false;
-            const int right = chunk.x + chunk.width, bottom = chunk.y + chunk.height;
-            int x0 = right, x1 = chunk.x, y0 = bottom, y1 = chunk.y;
-            for (int y = chunk.y; y < bottom; ++y) {
-                const size_t row = at.Cell(chunk.x, y);
-                for (int x = chunk.x; x < right; ++x)
-                    if (full[row + (x - chunk.x)] && sum.allowed[row + (x - chunk.x)])
-                        x0 = std::min(x0, x), x1 = std::max(x1, x + 1), y0 = std::min(y0, y),
+            const int across = AngleCells(chunk.width);
+            cells.assign(static_cast<size_t>(across) * AngleCells(chunk.height), 0);
+            int x0 = chunk.width, x1 = 0, y0 = chunk.height, y1 = 0;  // the box, in the chunk
+            for (int y = 0; y < chunk.height; ++y) {
+                const size_t row = at.Cell(chunk.x, chunk.y + y);
+                for (int x = 0; x < chunk.width; ++x)
+                    if (full[row + x] && sum.allowed[row + x]) {
+                        x0 = std::min(x0, x), x1 = std::max(x1, x + 1), y0 = std::min(y0, y);
                         y1 = y + 1;
+                        cells[static_cast<size_t>(y / kAngleStep) * across + x / kAngleStep] = 1;
+                    }
             }
             if (x1 <= x0)
                 continue;
-            auto node = [](int v, int origin) {
-                return origin + (v - origin) / kAngleStep * kAngleStep;
-            };
-            const Rect read{node(x0, chunk.x), node(y0, chunk.y),
-                            std::min(right, node(x1 + kAngleStep - 2, chunk.x) + 1) -
-                                node(x0, chunk.x),
-                            std::min(bottom, node(y1 + kAngleStep - 2, chunk.y) + 1) -
-                                node(y0, chunk.y)};
-            tile.state.resize(read.Size());
-            for (int j = 0; j < read.height; ++j)
-                std::copy_n(states.begin() + static_cast<std::ptrdiff_t>(
-                                                 static_cast<size_t>(read.y - chunk.y + j) *
-                                                     chunk.width +
-                                                 static_cast<size_t>(read.x - chunk.x)),
-                            read.width,
-                            tile.state.begin() +
-                                static_cast<std::ptrdiff_t>(static_cast<size_t>(j) * read.width));
-            reader_.ReadValues(sum.scene, read, tile.values);
-            reader_.ReadAngles(read, scratch, tile);
-            Add(at, tile, read, read, false, true, relief, full, sum);
+            reader_.ReadAngles(chunk, scratch, tile, &cells);
+            const Rect box{chunk.x + x0, chunk.y + y0, x1 - x0, y1 - y0};
+            angles.swap(tile.angle);
+            tile.angle.resize(box.Size()), tile.state.resize(box.Size());
+            for (int j = 0; j < box.height; ++j) {
+                const size_t from = static_cast<size_t>(y0 + j) * chunk.width + x0;
+                const size_t to = static_cast<size_t>(j) * box.width;
+                std::copy_n(angles.begin() + static_cast<std::ptrdiff_t>(from), box.width,
+                            tile.angle.begin() + static_cast<std::ptrdiff_t>(to));
+                std::copy_n(states.begin() + static_cast<std::ptrdiff_t>(from), box.width,
+                            tile.state.begin() + static_cast<std::ptrdiff_t>(to));
+            }
+            reader_.ReadValues(sum.scene, box, tile.values);
+            Add(at, tile, box, box, false, true, relief, full, sum);
         }
         return true;
     }
