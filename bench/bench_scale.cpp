@@ -2,12 +2,15 @@
 // same size (the sample's --block), each run a child process of its own. Per block: wall-clock
 // and processor seconds per image, the child's peak resident memory, bytes written per scene
 // (every file named after it), and the mosaic step: its time in the run (summary.json's
-// "occlusion recovery") and a second run that makes the mosaic alone (the scenes kept), against
-// gdalwarp making a Cloud Optimized GeoTIFF of the same scene orthos on the mosaic's grid on one
-// thread, with the mosaic's default creation options. Time and memory per image should not grow
-// with the block.
+// "occlusion recovery") and runs that make the mosaic alone (the scenes kept), by default and
+// doing what gdalwarp does (--seams pixel --balance none --blend-width 0: no seams to solve, no
+// balance, no blending), against gdalwarp making a Cloud Optimized GeoTIFF of the same scene
+// orthos on the mosaic's grid on one thread, with the mosaic's default creation options. The
+// three alternate --repeat times; the table gives each one's processor time (range over the
+// repeats) and the ratios to gdalwarp's of the same round. Time and memory per image should not
+// grow with the block.
 //
-//   bench_scale [--blocks 2x2,4x4,8x8] [--image-size 1000] [--jobs 2] [--fresh]
+//   bench_scale [--blocks 2x2,4x4,8x8] [--image-size 1000] [--jobs 2] [--repeat 3] [--fresh]
 //
 // The blocks are made once into the scratch directory (--fresh makes them again); every run
 // makes its outputs anew. gdalwarp must be on PATH.
@@ -17,6 +20,7 @@
 
 #include <gdal_priv.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -72,7 +76,7 @@ std::string MachineLoad() {
 
 [[noreturn]] void Usage() {
     std::fprintf(stderr, "Usage: bench_scale [--blocks 2x2,4x4,8x8] [--image-size N] [--jobs N] "
-                         "[--fresh]\n");
+                         "[--repeat N] [--fresh]\n");
     std::exit(2);
 }
 
@@ -80,7 +84,7 @@ std::string MachineLoad() {
 
 int main(int argc, char** argv) {
     std::vector<Block> blocks = {{2, 2}, {4, 4}, {8, 8}};
-    unsigned int imageSize = 1000, jobs = 2;
+    unsigned int imageSize = 1000, jobs = 2, repeat = 3;
     bool fresh = false;
     for (int i = 1; i < argc; ++i) {
         const std::string a = argv[i];
@@ -95,11 +99,11 @@ int main(int argc, char** argv) {
                     Usage();
                 blocks.push_back(b);
             }
-        } else if ((a == "--image-size" || a == "--jobs") && i + 1 < argc) {
+        } else if ((a == "--image-size" || a == "--jobs" || a == "--repeat") && i + 1 < argc) {
             const int v = std::atoi(argv[++i]);
             if (v < 1)
                 Usage();
-            (a == "--jobs" ? jobs : imageSize) = static_cast<unsigned int>(v);
+            (a == "--jobs" ? jobs : a == "--repeat" ? repeat : imageSize) = static_cast<unsigned int>(v);
         } else {
             Usage();
         }
@@ -111,9 +115,10 @@ int main(int argc, char** argv) {
                 imageSize, imageSize, jobs, std::thread::hardware_concurrency(),
                 MachineLoad().c_str());
     std::printf("| images | wall s / image | cpu s / image | peak MB | MB written / scene | mosaic "
-                "Mpx | mosaic step s (in the run) | mosaic alone: wall / cpu s | gdalwarp -of COG: "
-                "wall / cpu s | load after |\n");
-    std::printf("|---|---|---|---|---|---|---|---|---|---|\n");
+                "Mpx | mosaic step s (in the run) | mosaic alone, default: cpu s | mosaic alone, "
+                "as gdalwarp: cpu s | gdalwarp -of COG: cpu s | default / gdalwarp | as gdalwarp "
+                "/ gdalwarp | load after |\n");
+    std::printf("|---|---|---|---|---|---|---|---|---|---|---|---|---|\n");
     int failures = 0;
     for (const Block& block : blocks) {
         const unsigned int n = block.rows * block.cols;
@@ -127,24 +132,19 @@ int main(int argc, char** argv) {
                                    samplecity::BlockCity(block.rows, block.cols, imageSize));
         }
         const fs::path out = scratch / ("out" + std::to_string(n));
+        const std::string log = (scratch / ("ortho" + std::to_string(n) + ".log")).string();
         fs::remove_all(out);
         const std::vector<std::string> orthoArgs = {
             SILVAN_ORTHO_EXE, (sampleDir / "master.txt").string(), "--out", out.string(), "--dem",
             (sampleDir / "dsm.tif").string(), "--elevref", "ELLIPS", "--jobs",
             std::to_string(jobs), "--quiet"};
-        const benchsupport::ChildRun ortho = benchsupport::RunMeasured(
-            orthoArgs, (scratch / ("ortho" + std::to_string(n) + ".log")).string());
+        const benchsupport::ChildRun ortho = benchsupport::RunMeasured(orthoArgs, log);
         if (ortho.status != 0) {
             std::printf("| %u | silvan-ortho failed with status %d: see %s |\n", n, ortho.status,
-                        (scratch / ("ortho" + std::to_string(n) + ".log")).string().c_str());
+                        log.c_str());
             ++failures;
             continue;
         }
-        // The mosaic alone: a second run with the scenes kept and the mosaic removed, so that its
-        // processor time is its own.
-        fs::remove(out / "mosaic.tif");
-        const benchsupport::ChildRun mosaic = benchsupport::RunMeasured(
-            orthoArgs, (scratch / ("mosaic" + std::to_string(n) + ".log")).string());
         std::uint64_t written = 0;
         std::vector<std::string> orthos;
         const samplecity::CityOptions city = samplecity::BlockCity(block.rows, block.cols, imageSize);
@@ -179,21 +179,45 @@ int main(int argc, char** argv) {
             "OVERVIEW_RESAMPLING=AVERAGE"};
         warp.insert(warp.end(), orthos.begin(), orthos.end());
         warp.push_back((scratch / ("gdalwarp" + std::to_string(n) + ".tif")).string());
-        const benchsupport::ChildRun gdalwarp =
-            benchsupport::RunMeasured(warp, (scratch / ("gdalwarp" + std::to_string(n) + ".log")).string());
-        if (mosaic.status != 0 || gdalwarp.status != 0) {
-            std::printf("| %u | the mosaic alone (status %d) or gdalwarp (status %d) failed: see "
-                        "%s |\n",
-                        n, mosaic.status, gdalwarp.status, scratch.string().c_str());
+
+        // The mosaic alone (the scenes kept, the mosaic removed, so that the processor time is
+        // its own), by default and as gdalwarp, and gdalwarp, in turn.
+        std::vector<std::string> likeArgs = orthoArgs;
+        likeArgs.insert(likeArgs.end(), {"--seams", "pixel", "--balance", "none", "--blend-width", "0"});
+        const std::vector<std::string>* runs[] = {&orthoArgs, &likeArgs, &warp};
+        std::vector<double> cpu[3];
+        bool failed = false;
+        for (unsigned int round = 0; round < repeat && !failed; ++round)
+            for (int k = 0; k < 3 && !failed; ++k) {
+                if (k < 2)
+                    fs::remove(out / "mosaic.tif");
+                const benchsupport::ChildRun run = benchsupport::RunMeasured(*runs[k], log);
+                failed = run.status != 0;
+                cpu[k].push_back(run.cpuSeconds);
+            }
+        if (failed) {
+            std::printf("| %u | the mosaic alone or gdalwarp failed: see %s |\n", n, log.c_str());
             ++failures;
             continue;
         }
-        std::printf("| %u | %.2f | %.2f | %.0f | %.2f | %.1f | %.1f | %.1f / %.1f | %.1f / %.1f | "
-                    "%s |\n",
+        // "min-max" of values, and of the ratios of a run to gdalwarp's in the same round.
+        auto range = [](std::vector<double> v) {
+            const auto [lo, hi] = std::minmax_element(v.begin(), v.end());
+            char text[48];
+            std::snprintf(text, sizeof text, *lo == *hi ? "%.2f" : "%.2f-%.2f", *lo, *hi);
+            return std::string(text);
+        };
+        auto ratios = [&](int k) {
+            std::vector<double> r;
+            for (size_t i = 0; i < cpu[k].size(); ++i)
+                r.push_back(cpu[k][i] / cpu[2][i]);
+            return range(r);
+        };
+        std::printf("| %u | %.2f | %.2f | %.0f | %.2f | %.1f | %.1f | %s | %s | %s | %s | %s | %s |\n",
                     n, ortho.wallSeconds / n, ortho.cpuSeconds / n, ortho.peakBytes / 1048576.0,
                     written / 1048576.0 / n, width * static_cast<double>(height) / 1e6, mosaicStep,
-                    mosaic.wallSeconds, mosaic.cpuSeconds, gdalwarp.wallSeconds,
-                    gdalwarp.cpuSeconds, MachineLoad().c_str());
+                    range(cpu[0]).c_str(), range(cpu[1]).c_str(), range(cpu[2]).c_str(),
+                    ratios(0).c_str(), ratios(1).c_str(), MachineLoad().c_str());
         std::fflush(stdout);
     }
     return failures == 0 ? 0 : 1;

@@ -8,6 +8,7 @@
 #include "support.h"
 
 #include <gdal_priv.h>
+#include <gdal_utils.h>
 
 #include <algorithm>
 #include <cmath>
@@ -171,18 +172,73 @@ TEST_F(OppositeViews, EachSceneFillsTheOthersHiddenStrip) {
 // At equal levels the line of sight nearer the vertical wins: the northern camera north of the
 // building, the southern one south of it. Without models the first scene wins. (The other
 // rules are checked pixel by pixel on synthetic scenes below.)
-// Multiband blending builds its pyramid on the mosaic grid, whatever the tiles: tiles whose
-// origins are not on its cells give the same mosaic.
-TEST_F(OppositeViews, MultibandMosaicDoesNotDependOnTheTiles) {
-    std::vector<std::vector<double>> mosaics;
-    for (const unsigned int tile : {64u, 36u}) {
-        RecoveryJob job = Job(1, 1, 1, true);
-        job.seamlines = true, job.blendWidth = 16, job.blend = RecoveryJob::Blend::Multiband;
-        job.tileSize = tile;
-        ASSERT_TRUE(OcclusionRecovery().Recover(job).completed);
-        mosaics.push_back(ReadBand(dir->File("mosaic.tif"), 2));
+// Blending does not depend on the tiles: multiband blending builds its pyramid on the mosaic
+// grid (tiles whose origins are not on its cells give the same mosaic), and feathering reads
+// each scene within the blend's reach of its region, whatever the tile cuts off.
+TEST_F(OppositeViews, BlendedMosaicDoesNotDependOnTheTiles) {
+    for (const auto blend : {RecoveryJob::Blend::Multiband, RecoveryJob::Blend::Feather}) {
+        std::vector<std::vector<double>> mosaics;
+        for (const unsigned int tile : {64u, 36u}) {
+            RecoveryJob job = Job(1, 1, 1, true);
+            job.seamlines = true, job.blendWidth = 16, job.blend = blend;
+            job.tileSize = tile;
+            ASSERT_TRUE(OcclusionRecovery().Recover(job).completed);
+            mosaics.push_back(ReadBand(dir->File("mosaic.tif"), 2));
+        }
+        EXPECT_EQ(mosaics[0], mosaics[1]);
     }
-    EXPECT_EQ(mosaics[0], mosaics[1]);
+}
+
+// Byte orthos go from byte to byte where the seams are hard, and are read only within the
+// blend's reach of their regions where feathered: the mosaic is the one that Float32 copies of
+// them make, rounded (and moved off no-data as a Byte mosaic is), from the same regions.
+TEST_F(OppositeViews, ByteOrthosMakeTheMosaicOfTheirFloat32Copies) {
+    for (const char* name : {"view000", "view180"}) {
+        std::unique_ptr<GDALDataset> byte(
+            GDALDataset::Open(dir->File(std::string(name) + "_ortho.tif").c_str(), GDAL_OF_RASTER));
+        ASSERT_TRUE(byte);
+        const char* args[] = {"-ot", "Float32", nullptr};
+        GDALTranslateOptions* translate =
+            GDALTranslateOptionsNew(const_cast<char**>(args), nullptr);
+        GDALClose(GDALTranslate(dir->File(std::string(name) + "_float.tif").c_str(), byte.get(),
+                                translate, nullptr));
+        GDALTranslateOptionsFree(translate);
+    }
+    const struct {
+        bool seamlines;
+        unsigned int blendWidth;
+        RecoveryJob::Blend blend;
+    } cases[] = {{false, 0, RecoveryJob::Blend::Feather},
+                 {false, 16, RecoveryJob::Blend::Feather},
+                 {true, 0, RecoveryJob::Blend::Feather},
+                 {true, 16, RecoveryJob::Blend::Feather},
+                 {true, 16, RecoveryJob::Blend::Multiband}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(testing::Message() << "seamlines " << c.seamlines << ", blend width "
+                                        << c.blendWidth << ", multiband "
+                                        << (c.blend == RecoveryJob::Blend::Multiband));
+        std::vector<std::vector<double>> mosaics[2], sources;
+        for (const bool asFloat : {false, true}) {
+            RecoveryJob job = Job(1, 1, 1, true);
+            job.seamlines = c.seamlines, job.blendWidth = c.blendWidth, job.blend = c.blend;
+            if (asFloat)
+                job.scenes[0].orthoPath = dir->File("view000_float.tif"),
+                job.scenes[1].orthoPath = dir->File("view180_float.tif");
+            ASSERT_TRUE(OcclusionRecovery().Recover(job).completed);
+            for (int band = 1; band <= 3; ++band)
+                mosaics[asFloat].push_back(ReadBand(job.mosaicPath, band));
+            sources.push_back(ReadBand(job.sourcePath));
+        }
+        ASSERT_EQ(sources[0], sources[1]);
+        size_t differences = 0;
+        for (int band = 0; band < 3; ++band)
+            for (size_t k = 0; k < sources[0].size(); ++k) {
+                const double rounded = std::round(mosaics[1][band][k]);
+                const double expected = sources[0][k] == 0 ? 0 : rounded == 0 ? 1 : rounded;
+                differences += mosaics[0][band][k] != expected;
+            }
+        EXPECT_EQ(differences, 0u);
+    }
 }
 
 TEST_F(OppositeViews, SteeperLineOfSightWinsAtEqualLevels) {

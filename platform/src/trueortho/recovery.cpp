@@ -62,7 +62,8 @@ struct Worker {
     std::vector<const unsigned char*> states;
     std::vector<int> levels;
     std::vector<std::vector<unsigned char>> cells;
-    std::vector<std::array<int, 4>> boxes;  // HardSeamBytes': per scene, its pixels' box
+    std::vector<std::array<int, 4>> extents;  // RegionBoxes'
+    std::vector<Rect> boxes;  // per scene of the blend, where its values are read
     trueortho::BlendTile blend;
 };
 
@@ -150,6 +151,31 @@ void ToBytes(const float* values, unsigned char* bytes, int count) {
     GDALCopyWords(values, GDT_Float32, sizeof(float), bytes, GDT_Byte, 1, count);
 }
 
+// Per label 0 to count - 1: the bounding box (in the labels' coordinates) of its pixels within
+// `window` of labels `stride` across; empty where it has none.
+void RegionBoxes(const std::vector<int>& labels, int stride, const Rect& window, size_t count,
+                 std::vector<std::array<int, 4>>& extents, std::vector<Rect>& boxes) {
+    // First and last column and line, found by runs of one label along each line.
+    extents.assign(count, {std::numeric_limits<int>::max(), std::numeric_limits<int>::max(), -1, -1});
+    for (int j = window.y; j < window.y + window.height; ++j) {
+        const int* label = labels.data() + static_cast<size_t>(j) * stride;
+        for (int i = window.x, end; i < window.x + window.width; i = end) {
+            const int l = label[i];
+            for (end = i + 1; end < window.x + window.width && label[end] == l;)
+                ++end;
+            if (l < 0)
+                continue;
+            std::array<int, 4>& e = extents[l];
+            e = {std::min(e[0], i), std::min(e[1], j), std::max(e[2], end - 1), std::max(e[3], j)};
+        }
+    }
+    boxes.resize(count);
+    for (size_t l = 0; l < count; ++l) {
+        const std::array<int, 4>& e = extents[l];
+        boxes[l] = e[2] < 0 ? Rect{} : Rect{e[0], e[1], e[2] - e[0] + 1, e[3] - e[1] + 1};
+    }
+}
+
 // The inner tile t of a tile r whose regions (w.blend's labels and scenes) are joined by hard
 // seams, when every scene and the mosaic are Byte: each pixel its region's byte through one table
 // per scene and band (its balance, the value range, a value beside no-data, as the blend's
@@ -165,40 +191,28 @@ void HardSeamBytes(const Composition& c, Worker& w, const Rect& t, const Rect& r
     unsigned char* out = static_cast<unsigned char*>(mosaic.GetData());
     float* from = static_cast<float*>(source.GetData());
     const size_t plane = t.Size();
-    // Per scene: the first and last column and line of its pixels in t.
-    w.boxes.assign(scenes.size(), {t.width, t.height, -1, -1});
     for (int j = 0; j < t.height; ++j) {
         const int* label = labels.data() + static_cast<size_t>(j + c.border) * r.width + c.border;
-        // Runs of one label along the line.
-        for (int i = 0, end; i < t.width; i = end) {
-            const int l = label[i];
-            for (end = i + 1; end < t.width && label[end] == l;)
-                ++end;
+        for (int i = 0; i < t.width; ++i) {
             const size_t o = static_cast<size_t>(j) * t.width + i;
-            const size_t length = static_cast<size_t>(end - i);
-            if (l < 0) {
-                counts.unfilled += length;
-                std::fill_n(from + o, length, 0.0f);
+            ++(label[i] < 0 ? counts.unfilled : counts.filled);
+            from[o] = label[i] < 0 ? 0.0f : static_cast<float>(scenes[label[i]] + 1);
+            if (label[i] < 0)
                 for (int b = 0; b < bands; ++b)
-                    std::fill_n(out + plane * b + o, length, c.noDataByte);
-                continue;
-            }
-            counts.filled += length;
-            std::fill_n(from + o, length, static_cast<float>(scenes[l] + 1));
-            std::array<int, 4>& box = w.boxes[l];
-            box = {std::min(box[0], i), std::min(box[1], j), std::max(box[2], end - 1),
-                   std::max(box[3], j)};
+                    out[plane * b + o] = c.noDataByte;
         }
     }
+    RegionBoxes(labels, r.width, Rect{c.border, c.border, t.width, t.height}, scenes.size(),
+                w.extents, w.boxes);
     float values[256];
     unsigned char table[256];
     std::vector<unsigned char>& bytes = w.scratch.bytes;
     for (size_t u = 0; u < scenes.size(); ++u) {
-        const std::array<int, 4>& box = w.boxes[u];
-        if (box[2] < 0)
+        const Rect& box = w.boxes[u];
+        if (box.Empty())
             continue;  // its region lies in the border only
         const size_t s = scenes[u];
-        const Rect read{t.x + box[0], t.y + box[1], box[2] - box[0] + 1, box[3] - box[1] + 1};
+        const Rect read{r.x + box.x, r.y + box.y, box.width, box.height};
         bytes.resize(read.Size() * bands);
         c.grid.orthos[s]->Read(c.channels.data(), bands, read, GDT_Byte, bytes.data());
         for (int b = 0; b < bands; ++b) {
@@ -210,13 +224,13 @@ void HardSeamBytes(const Composition& c, Worker& w, const Rect& t, const Rect& r
                     c.grid.noData);
             ToBytes(values, table, 256);
             for (int j = 0; j < read.height; ++j) {
-                const int* label = labels.data() +
-                                   static_cast<size_t>(box[1] + j + c.border) * r.width +
-                                   box[0] + c.border;
+                const int* label =
+                    labels.data() + static_cast<size_t>(box.y + j) * r.width + box.x;
                 const unsigned char* in = bytes.data() + read.Size() * b +
                                           static_cast<size_t>(j) * read.width;
-                unsigned char* o = out + plane * b + static_cast<size_t>(box[1] + j) * t.width +
-                                   box[0];
+                unsigned char* o = out + plane * b +
+                                   static_cast<size_t>(box.y - c.border + j) * t.width + box.x -
+                                   c.border;
                 for (int i = 0; i < read.width; ++i)
                     if (label[i] == static_cast<int>(u))
                         o[i] = table[in[i]];
@@ -381,24 +395,55 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
     // more than 15 grey levels from the ideal image); blended in, they drew dotted lines along
     // the seams beside buildings. Where its own scene weighs nothing, a pixel near a seam takes
     // the other scenes' values, and keeps its own beyond their reach.
+    // Feathering takes a scene's values (and visibility) only in the inner tile within its reach
+    // (the border) of the scene's region: they are read there alone. Multiband blending takes
+    // them over the whole tile.
+    const Rect whole{0, 0, r.width, r.height};
+    const Rect inner{c.border, c.border, t.width, t.height};
+    if (c.blend == trueortho::BlendMode::Feather) {
+        RegionBoxes(labels, r.width, whole, used, w.extents, w.boxes);
+        for (Rect& box : w.boxes)
+            box = box.Empty() ? box : box.Grown(c.border).Intersect(inner);
+    } else {
+        w.boxes.assign(used, whole);
+    }
+    Rect any{};  // the boxes' bounding box
+    for (const Rect& box : w.boxes)
+        if (!box.Empty())
+            any = any.Empty() ? box
+                              : Rect{std::min(any.x, box.x), std::min(any.y, box.y),
+                                     std::max(any.x + any.width, box.x + box.width) -
+                                         std::min(any.x, box.x),
+                                     std::max(any.y + any.height, box.y + box.height) -
+                                         std::min(any.y, box.y)};
     w.clear.assign(size, 0);
     for (size_t k = 0; k < n; ++k)
         if (w.slot[k] >= 0)
-            for (size_t p = 0; p < size; ++p)
-                w.clear[p] |= w.scenes[k].state[p] == trueortho::kClear;
+            for (int j = any.y; j < any.y + any.height; ++j) {
+                const size_t first = static_cast<size_t>(j) * r.width + any.x;
+                const unsigned char* state = w.scenes[k].state.data() + first;
+                unsigned char* clear = w.clear.data() + first;
+                for (int i = 0; i < any.width; ++i)
+                    clear[i] |= state[i] == trueortho::kClear;
+            }
     for (size_t k = 0; k < n; ++k) {
         if (w.slot[k] < 0)
             continue;
         const size_t u = static_cast<size_t>(w.slot[k]);
         const SceneTile& scene = w.scenes[k];
+        const Rect& box = w.boxes[u];
         std::vector<unsigned char>& seen = blend.seen[u];
-        seen.resize(size);
-        for (size_t p = 0; p < size; ++p)
-            seen[p] = scene.state[p] == trueortho::kClear ||
-                      (scene.state[p] == trueortho::kUnclear && !w.clear[p] &&
-                       labels[p] == static_cast<int>(u));
-        c.reader.ReadBalanced(scene.scene, r, c.fit.gain[scene.scene], c.fit.offset[scene.scene],
-                              scene.state, c.range, w.scratch, blend.values[u]);
+        seen.assign(size, 0);
+        for (int j = box.y; j < box.y + box.height; ++j)
+            for (int i = box.x; i < box.x + box.width; ++i) {
+                const size_t p = static_cast<size_t>(j) * r.width + i;
+                seen[p] = scene.state[p] == trueortho::kClear ||
+                          (scene.state[p] == trueortho::kUnclear && !w.clear[p] &&
+                           labels[p] == static_cast<int>(u));
+            }
+        c.reader.ReadBalanced(scene.scene, r, Rect{r.x + box.x, r.y + box.y, box.width, box.height},
+                              c.fit.gain[scene.scene], c.fit.offset[scene.scene], scene.state,
+                              c.range, w.scratch, blend.values[u]);
     }
     const float noData = static_cast<float>(c.grid.noData);
     trueortho::BlendRegions(blend, c.blend, static_cast<int>(job.blendWidth), noData, w.blended);

@@ -432,8 +432,17 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
     PixelStates(vis.data(), r.width, r.height, e, scratch, out.state);
     if (values)
         ReadValues(s, r, out.values);
-    if (angles)
-        ReadAngles(r, scratch, out);
+    if (angles) {
+        const int across = AngleCells(r.width);
+        scratch.cells.assign(static_cast<size_t>(across) * AngleCells(r.height), 0);
+        for (int j = 0; j < r.height; ++j) {
+            const unsigned char* state = out.state.data() + static_cast<size_t>(j) * r.width;
+            unsigned char* cells = scratch.cells.data() + static_cast<size_t>(j / kAngleStep) * across;
+            for (int i = 0; i < r.width; ++i)
+                cells[i / kAngleStep] |= state[i] != kNotSeen;
+        }
+        ReadAngles(r, scratch, out, &scratch.cells);
+    }
     return true;
 }
 
@@ -446,8 +455,8 @@ void SceneReader::ReadAngles(const Rect& r, Scratch& scratch, SceneTile& out,
     Angles(job_, grid_, job_.scenes[s], scratch.toModel[s].get(), r, cells, out.angle);
 }
 
-void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const std::vector<double>& gain,
-                               const std::vector<double>& offset,
+void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const Rect& part,
+                               const std::vector<double>& gain, const std::vector<double>& offset,
                                const std::vector<unsigned char>& state, const ValueRange& range,
                                Scratch& scratch, std::vector<float>& values) const {
     const size_t size = r.Size();
@@ -464,11 +473,19 @@ void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const std::vector<d
         return;
     }
     // Byte values: read as they are, each band's 256 values balanced once, and both taken to
-    // Float32 in one pass over the part of r on the scene's raster.
-    const Rect on = r.Intersect(grid_.orthos[s]->window);
-    Prepare(values, r, on, grid_.bands, static_cast<float>(grid_.noData));
-    scratch.bytes.resize(size * grid_.bands);
-    grid_.orthos[s]->Read(bands_.data(), grid_.bands, r, GDT_Byte, scratch.bytes.data());
+    // Float32 in one pass over the part on the scene's raster (no-data in the rest of the part).
+    const Rect on = part.Intersect(grid_.orthos[s]->window);
+    values.resize(size * grid_.bands);
+    if (on.Size() != part.Size())
+        for (int b = 0; b < grid_.bands; ++b)
+            for (int j = part.y - r.y; j < part.y - r.y + part.height; ++j)
+                std::fill_n(values.data() + size * b + static_cast<size_t>(j) * r.width +
+                                (part.x - r.x),
+                            part.width, static_cast<float>(grid_.noData));
+    if (on.Empty())
+        return;
+    scratch.bytes.resize(on.Size() * grid_.bands);
+    grid_.orthos[s]->Read(bands_.data(), grid_.bands, on, GDT_Byte, scratch.bytes.data());
     float table[256], plain[256];
     for (int value = 0; value < 256; ++value)
         plain[value] = static_cast<float>(value);
@@ -476,9 +493,10 @@ void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const std::vector<d
         const bool balanced = !(gain[b] == 1 && offset[b] == 0);
         for (int value = 0; value < 256 && balanced; ++value)
             table[value] = range(gain[b] * value + offset[b]);
-        for (int j = on.y - r.y; j < on.y - r.y + on.height; ++j) {
-            const size_t first = static_cast<size_t>(j) * r.width + (on.x - r.x);
-            const unsigned char* in = scratch.bytes.data() + size * b + first;
+        for (int j = 0; j < on.height; ++j) {
+            const size_t first = static_cast<size_t>(on.y - r.y + j) * r.width + (on.x - r.x);
+            const unsigned char* in =
+                scratch.bytes.data() + on.Size() * b + static_cast<size_t>(j) * on.width;
             const unsigned char* seen = state.data() + first;
             float* out = values.data() + size * b + first;
             for (int i = 0; i < on.width; ++i)

@@ -198,11 +198,12 @@ class SceneReader {
         std::vector<unsigned char> row;  // PixelStates'
         std::vector<unsigned char> bytes;  // a Byte ortho's values
         std::vector<int> last;
+        std::vector<unsigned char> cells;  // Read's: the angle cells the scene sees
         std::vector<std::unique_ptr<ogc::cs::CoordinateTransformation>> toModel;
     };
     SceneReader(const RecoveryJob& job, const RecoveryGrid& grid);
-    // Fills `out` for scene s over r; false (values and angles not read) when the scene sees
-    // no pixel of r.
+    // Fills `out` for scene s over r, the angles only in the lattice cells where the scene sees
+    // some pixel; false (values and angles not read) when it sees no pixel of r.
     bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
               SceneTile& out) const;
     // The angles of out.scene over r, for a tile Read without them: in the cells of the angle
@@ -213,8 +214,10 @@ class SceneReader {
     // The ortho's `bands` planes over r; no-data outside the scene's raster.
     void ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const;
     // The same, balanced (value * gain + offset per band, as `range` holds it) where `state`
-    // (over r) says the scene sees the pixel.
-    void ReadBalanced(std::size_t s, const Rect& r, const std::vector<double>& gain,
+    // (over r) says the scene sees the pixel; `values` holds planes over r, but is read only
+    // over `part` of r (the rest may hold anything).
+    void ReadBalanced(std::size_t s, const Rect& r, const Rect& part,
+                      const std::vector<double>& gain,
                       const std::vector<double>& offset, const std::vector<unsigned char>& state,
                       const ValueRange& range, Scratch& scratch, std::vector<float>& values) const;
 
