@@ -4,6 +4,8 @@
 #include <kestrel/trueortho.h>
 #include <samplecity.h>
 
+#include "../platform/src/trueortho/recoverygrid.h"
+#include "../platform/src/trueortho/runcontrol.h"
 #include "rasterread.h"
 #include "support.h"
 
@@ -238,6 +240,54 @@ TEST_F(OppositeViews, ByteOrthosMakeTheMosaicOfTheirFloat32Copies) {
                 differences += mosaics[0][band][k] != expected;
             }
         EXPECT_EQ(differences, 0u);
+    }
+}
+
+// The seam source asked for some cells of a window reads them as a read of the whole window
+// does, on windows whose chunks start off the angles' lattice; every other cell keeps which
+// scenes may take it.
+TEST_F(OppositeViews, SeamSourceReadsTheCellsAskedAsTheWholeWindow) {
+    RecoveryJob job = Job(1, 1, 2, true);
+    const trueortho::RecoveryGrid grid = trueortho::InspectScenes(job);
+    job.surface->SetInputCRS(grid.crs.get());
+    const trueortho::SceneReader reader(job, grid);
+    trueortho::BalanceFit fit;
+    fit.gain.assign(2, std::vector<double>(static_cast<size_t>(grid.bands), 1.1));
+    fit.offset.assign(2, std::vector<double>(static_cast<size_t>(grid.bands), -3.0));
+    trueortho::RunControl control(nullptr, nullptr, nullptr);
+    const auto source = trueortho::MakeSeamSource(job, grid, reader, fit, control);
+    for (const std::array<int, 4> at : {std::array<int, 4>{0, 0, 258, 258}, {37, 101, 203, 150}}) {
+        const auto [x0, y0, w, h] = at;
+        SCOPED_TRACE(::testing::Message() << "window at " << x0 << ", " << y0);
+        const trueortho::SeamWindow whole = source->Read(x0, y0, w, h, 1);
+        ASSERT_EQ(whole.scenes.size(), 2u);
+        std::vector<std::uint8_t> needed(static_cast<size_t>(w) * h);
+        for (int y = 0; y < h; ++y)
+            for (int x = 0; x < w; ++x)  // diagonal bands and a lone corner
+                needed[static_cast<size_t>(y) * w + x] = (x + 2 * y) % 97 < 9 || (x > 180 && y > 130);
+        int asked = 0;
+        const trueortho::SeamWindow part =
+            source->Read(x0, y0, w, h, 1, [&](const trueortho::SeamWindow& allowed) {
+                ++asked;
+                EXPECT_EQ(allowed.scenes, whole.scenes);
+                return needed;
+            });
+        ASSERT_EQ(asked, 1);
+        ASSERT_EQ(part.scenes, whole.scenes);
+        size_t differ = 0, allowedDiffer = 0, compared = 0;
+        for (size_t k = 0; k < whole.scenes.size(); ++k)
+            for (size_t c = 0; c < needed.size(); ++c) {
+                const bool allowed = whole.cost[k][c] < trueortho::kForbidden;
+                allowedDiffer += allowed != (part.cost[k][c] < trueortho::kForbidden);
+                if (!needed[c] || !allowed)
+                    continue;
+                ++compared;
+                differ += part.cost[k][c] != whole.cost[k][c] ||
+                          part.grey[k][c] != whole.grey[k][c] || part.raised[c] != whole.raised[c];
+            }
+        EXPECT_EQ(allowedDiffer, 0u);
+        EXPECT_EQ(differ, 0u);
+        EXPECT_GT(compared, needed.size() / 10);
     }
 }
 

@@ -846,6 +846,65 @@ std::vector<unsigned char> Burnt(GDALDataset& grid, OGRGeometry& shape) {
     return ReadBytes(*burnt);
 }
 
+// DIR/seamlines.gpkg against the source raster `source` of the scenes `scenes`: burnt back by
+// gdal_rasterize, scene by scene, it is the source raster, and it holds one valid polygon for
+// each region (4-connected pixels of one scene).
+void ExpectSeamlinesAreTheRegions(const TempDir& dir, const CPLJSONArray& scenes,
+                                  const std::vector<unsigned char>& source) {
+    const Result blank = RunProgram(
+        "gdal_translate", {"-q", "-scale", "0", "255", "0", "0", dir.File("out/mosaic_source.tif"),
+                           dir.File("burnt.tif")},
+        dir);
+    ASSERT_EQ(blank.status, 0) << blank.err;
+    for (int k = 1; k <= scenes.Size(); ++k) {
+        const Result burn = RunProgram(
+            "gdal_rasterize", {"-q", "-l", "seamlines", "-where",
+                               "scene = '" + scenes[k - 1].ToString() + "'", "-burn",
+                               std::to_string(k), dir.File("out/seamlines.gpkg"),
+                               dir.File("burnt.tif")},
+            dir);
+        ASSERT_EQ(burn.status, 0) << burn.err;
+    }
+    Dataset burnt = Open(dir.File("burnt.tif"));
+    ASSERT_TRUE(burnt);
+    EXPECT_EQ(ReadBytes(*burnt), source);
+    const int width = burnt->GetRasterXSize(), height = burnt->GetRasterYSize();
+    std::vector<int> label(source.size(), -1);
+    int regions = 0;
+    for (std::size_t start = 0; start < source.size(); ++start) {
+        if (source[start] == 0 || label[start] >= 0)
+            continue;
+        std::vector<std::size_t> stack = {start};
+        label[start] = regions;
+        while (!stack.empty()) {
+            const std::size_t p = stack.back();
+            stack.pop_back();
+            const int x = static_cast<int>(p % width), y = static_cast<int>(p / width);
+            const std::pair<int, int> next[] = {{x - 1, y}, {x + 1, y}, {x, y - 1}, {x, y + 1}};
+            for (const auto& [u, v] : next) {
+                const std::size_t q = static_cast<std::size_t>(v) * width + u;
+                if (u >= 0 && v >= 0 && u < width && v < height && label[q] < 0 &&
+                    source[q] == source[p]) {
+                    label[q] = regions;
+                    stack.push_back(q);
+                }
+            }
+        }
+        ++regions;
+    }
+    Dataset seams = Open(dir.File("out/seamlines.gpkg"), GDAL_OF_VECTOR);
+    ASSERT_TRUE(seams);
+    OGRLayer* layer = seams->GetLayerByName("seamlines");
+    ASSERT_NE(layer, nullptr);
+    int features = 0, invalid = 0;
+    for (const auto& feature : *layer) {
+        ++features;
+        invalid += !feature->GetGeometryRef()->IsValid();
+    }
+    EXPECT_EQ(features, regions);
+    EXPECT_EQ(invalid, 0);
+}
+
 // DIR/seamlines.gpkg holds the mosaic's regions: burnt back by gdal_rasterize, scene by scene,
 // it is the source raster. An edited copy (one vertex of a polygon dragged outward) handed back
 // with --seamlines makes the mosaic again, not the scenes, and the mosaic changes only between
@@ -866,24 +925,7 @@ TEST(Workflow, EditedSeamlinesChangeTheMosaicThereAlone) {
     EXPECT_EQ(summary.GetRoot().GetObj("balance").GetInteger("blend_width"), kBlend);
     EXPECT_EQ(summary.GetRoot().GetObj("balance").GetArray("scenes").Size(), scenes.Size());
 
-    // The oracle: an empty copy of the source raster's grid, each scene's polygons burnt in.
-    const Result blank = RunProgram(
-        "gdal_translate", {"-q", "-scale", "0", "255", "0", "0", dir.File("out/mosaic_source.tif"),
-                           dir.File("burnt.tif")},
-        dir);
-    ASSERT_EQ(blank.status, 0) << blank.err;
-    for (int k = 1; k <= scenes.Size(); ++k) {
-        const Result burn = RunProgram(
-            "gdal_rasterize", {"-q", "-l", "seamlines", "-where",
-                               "scene = '" + scenes[k - 1].ToString() + "'", "-burn",
-                               std::to_string(k), dir.File("out/seamlines.gpkg"),
-                               dir.File("burnt.tif")},
-            dir);
-        ASSERT_EQ(burn.status, 0) << burn.err;
-    }
-    Dataset burnt = Open(dir.File("burnt.tif"));
-    ASSERT_TRUE(burnt);
-    EXPECT_EQ(ReadBytes(*burnt), sourceBefore);
+    ExpectSeamlinesAreTheRegions(dir, scenes, sourceBefore);
 
     // Later features win where polygons overlap: the largest region, dragged last, one vertex
     // moved 6 m (6 pixels) away from its centre into another scene's region.
@@ -987,6 +1029,58 @@ TEST(Workflow, EditedSeamlinesChangeTheMosaicThereAlone) {
 
     EXPECT_EQ(strayedSource, 0u);
     EXPECT_EQ(strayedPixels, 0u);
+}
+
+// Per-pixel regions, and regions drawn as a checkerboard of one scene's pixels in another's:
+// holes, and pixels of a scene that touch at a corner alone.
+TEST(Workflow, RaggedSeamlinesAreTheRegions) {
+    TempDir dir;
+    std::vector<std::string> args = MakeSample(dir);
+    args.insert(args.end(), {"--seams", "pixel", "--blend-width", "0"});
+    ASSERT_EQ(Ortho(args, dir).status, 0);
+    CPLJSONDocument summary;
+    ASSERT_TRUE(summary.Load(dir.File("out/summary.json")));
+    const CPLJSONArray scenes = summary.GetRoot().GetArray("mosaic_scenes");
+    ASSERT_GE(scenes.Size(), 2);
+    Dataset source = Open(dir.File("out/mosaic_source.tif"));
+    ASSERT_TRUE(source);
+    ExpectSeamlinesAreTheRegions(dir, scenes, ReadBytes(*source));
+
+    // A square of the first scene, and in its middle every other pixel the second's.
+    double geo[6];
+    ASSERT_EQ(source->GetGeoTransform(geo), CE_None);
+    const int cx = source->GetRasterXSize() / 2, cy = source->GetRasterYSize() / 2;
+    {
+        Dataset drawn(GetGDALDriverManager()->GetDriverByName("GPKG")->Create(
+            dir.File("checkers.gpkg").c_str(), 0, 0, 0, GDT_Unknown, nullptr));
+        ASSERT_TRUE(drawn);
+        OGRSpatialReference srs(*source->GetSpatialRef());
+        OGRLayer* layer = drawn->CreateLayer("seamlines", &srs, wkbPolygon, nullptr);
+        ASSERT_NE(layer, nullptr);
+        OGRFieldDefn scene("scene", OFTString);
+        ASSERT_EQ(layer->CreateField(&scene), OGRERR_NONE);
+        auto square = [&](const std::string& name, int x, int y, int size) {
+            OGRLinearRing ring;
+            for (const auto& [u, v] : {std::pair<int, int>{x, y}, {x + size, y},
+                                      {x + size, y + size}, {x, y + size}, {x, y}})
+                ring.addPoint(geo[0] + u * geo[1], geo[3] + v * geo[5]);
+            OGRPolygon polygon;
+            polygon.addRing(&ring);
+            OGRFeature feature(layer->GetLayerDefn());
+            feature.SetField("scene", name.c_str());
+            feature.SetGeometry(&polygon);
+            EXPECT_EQ(layer->CreateFeature(&feature), OGRERR_NONE);
+        };
+        square(scenes[0].ToString(), cx - 12, cy - 12, 24);
+        for (int y = cy - 5; y < cy + 5; ++y)
+            for (int x = cx - 5 + (y - cy + 5) % 2; x < cx + 5; x += 2)
+                square(scenes[1].ToString(), x, y, 1);
+    }
+    args.insert(args.end(), {"--seamlines", dir.File("checkers.gpkg")});
+    ASSERT_EQ(Ortho(args, dir).status, 0);
+    source = Open(dir.File("out/mosaic_source.tif"));
+    ASSERT_TRUE(source);
+    ExpectSeamlinesAreTheRegions(dir, scenes, ReadBytes(*source));
 }
 
 // Images of 4 pixels: one scene's footprint has 3 corners. It fails on its own, saying so, and

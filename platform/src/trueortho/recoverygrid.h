@@ -135,7 +135,7 @@ struct RecoveryGrid {
 
 // Opens every scene for the whole run, checks that they lie on one lattice with one channel
 // count and data type, and lays out the mosaic grid (the job's, or the union of the windows).
-RecoveryGrid InspectScenes(const RecoveryJob& job);
+KESTREL_API RecoveryGrid InspectScenes(const RecoveryJob& job);
 
 // Values as the mosaic's data type holds them: rounded and clamped for integer types.
 class ValueRange {
@@ -188,7 +188,7 @@ inline int AngleCells(int size) { return (size + kAngleStep - 1) / kAngleStep; }
 
 // Reads scenes over rectangles; Read may be called from several threads, each with its own
 // Scratch.
-class SceneReader {
+class KESTREL_API SceneReader {
   public:
     struct Scratch {
         // The visibility index over the read with its border: VISIBILITY_SEEN, VISIBILITY_HIDDEN
@@ -261,9 +261,11 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
 // The seam solver's view of the scenes (costs, balanced brightness, raised heights). Once
 // control stops, a read gives up at its next slice of heights or scene chunk and hands back a
 // window without scenes: the run is being abandoned.
-std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job, const RecoveryGrid& grid,
-                                           const SceneReader& reader, const BalanceFit& fit,
-                                           const RunControl& control);
+KESTREL_API std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job,
+                                                       const RecoveryGrid& grid,
+                                                       const SceneReader& reader,
+                                                       const BalanceFit& fit,
+                                                       const RunControl& control);
 
 }  // namespace trueortho
 }  // namespace processes
