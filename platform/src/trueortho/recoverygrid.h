@@ -206,6 +206,14 @@ class KESTREL_API SceneReader {
     // some pixel; false (values and angles not read) when it sees no pixel of r.
     bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
               SceneTile& out) const;
+    // The visibility index of scene s over r with a border of its DBM pixel error, as
+    // VISIBILITY_SEEN, VISIBILITY_HIDDEN or VISIBILITY_OUTSIDE (the index's other values);
+    // false when the scene sees no pixel of r.
+    bool ReadVisibility(std::size_t s, const Rect& r, Scratch& scratch,
+                        std::vector<unsigned char>& vis) const;
+    // The ortho's `bands` planes over r as they are, when its raster is Byte (else false and
+    // nothing read); parts outside the raster hold anything.
+    bool ReadBytes(std::size_t s, const Rect& r, std::vector<unsigned char>& bytes) const;
     // The angles of out.scene over r, for a tile Read without them: in the cells of the angle
     // lattice that `cells` flags (AngleCells(r.width) per row, line after line), or all of r
     // when it is null; unknown elsewhere.
@@ -233,6 +241,10 @@ class KESTREL_API SceneReader {
 // a border of e pixels.
 void PixelStates(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
                  std::vector<unsigned char>& state);
+
+// Whether pixel (i, j) of a rectangle is kClear as PixelStates has it; `vis` is the rectangle
+// with a border of e pixels, `width` pixels across with it.
+bool SeenClearly(const unsigned char* vis, int width, int e, int i, int j);
 
 // Metres per pixel of the grid (near enough on a geographic one).
 double PixelMetres(const RecoveryGrid& grid);

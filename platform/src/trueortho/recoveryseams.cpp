@@ -501,9 +501,18 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
     };
     const int side = RecoveryGrid::kBucket;
     const size_t tiles = grid.TileCount(side);
+    // The samples are sparse (one pixel in stride x stride of a pair), but every block of a
+    // scene holds some: the tile is read whole, its states and values taken at the samples
+    // alone (Byte values as they are).
+    struct Scene {
+        size_t scene;
+        int e;
+        std::vector<unsigned char> visibility, bytes;  // bytes: of a Byte ortho
+        std::vector<float> values;                     // of another
+    };
     struct Worker {
         SceneReader::Scratch scratch;
-        std::vector<SceneTile> scenes;
+        std::vector<Scene> scenes;
         std::vector<Chunk> chunks;
     };
     std::vector<Worker> workers(std::max(1u, threads));
@@ -520,11 +529,24 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
         for (const size_t s : meeting) {
             if (w.scenes.size() <= n)
                 w.scenes.emplace_back();
-            n += reader.Read(s, r, true, false, w.scratch, w.scenes[n]) ? 1 : 0;
+            Scene& scene = w.scenes[n];
+            if (!reader.ReadVisibility(s, r, w.scratch, scene.visibility))
+                continue;
+            scene.scene = s, scene.e = job.scenes[s].dbmPixelError;
+            if (!reader.ReadBytes(s, r, scene.bytes))
+                reader.ReadValues(s, r, scene.values);
+            ++n;
         }
+        const auto clear = [&](const Scene& scene, int i, int j) {
+            return SeenClearly(scene.visibility.data(), r.width + 2 * scene.e, scene.e, i, j);
+        };
+        const auto value = [&](const Scene& scene, int band, size_t p) {
+            const size_t k = r.Size() * band + p;
+            return scene.bytes.empty() ? scene.values[k] : static_cast<float>(scene.bytes[k]);
+        };
         for (size_t k = 0; k < n; ++k)
             for (size_t l = k + 1; l < n; ++l) {
-                const SceneTile &a = w.scenes[k], &b = w.scenes[l];
+                const Scene &a = w.scenes[k], &b = w.scenes[l];
                 const auto found = index.find(a.scene * count + b.scene);
                 if (found == index.end())
                     continue;
@@ -535,18 +557,18 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
                 for (int j = j0; j < r.height; j += stride)
                     for (int i = i0; i < r.width; i += stride) {
                         const size_t p = static_cast<size_t>(j) * r.width + i;
-                        if (a.state[p] != kClear || b.state[p] != kClear)
+                        if (!clear(a, i, j) || !clear(b, i, j))
                             continue;
                         // Pixels clipped in either scene would pull the fit towards the clip.
                         bool clipped = false;
                         for (int band = 0; band < grid.bands && !clipped; ++band)
-                            clipped = range.Clipped(a.values[r.Size() * band + p]) ||
-                                      range.Clipped(b.values[r.Size() * band + p]);
+                            clipped = range.Clipped(value(a, band, p)) ||
+                                      range.Clipped(value(b, band, p));
                         if (clipped)
                             continue;
                         for (int band = 0; band < grid.bands; ++band) {
-                            chunk.a.push_back(a.values[r.Size() * band + p]);
-                            chunk.b.push_back(b.values[r.Size() * band + p]);
+                            chunk.a.push_back(value(a, band, p));
+                            chunk.b.push_back(value(b, band, p));
                         }
                     }
                 if (!chunk.a.empty())
