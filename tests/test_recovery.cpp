@@ -4,6 +4,8 @@
 #include <kestrel/trueortho.h>
 #include <samplecity.h>
 
+#include "../platform/src/trueortho/recoverygrid.h"
+#include "../platform/src/trueortho/runcontrol.h"
 #include "rasterread.h"
 #include "support.h"
 
@@ -241,6 +243,54 @@ TEST_F(OppositeViews, ByteOrthosMakeTheMosaicOfTheirFloat32Copies) {
     }
 }
 
+// The seam source asked for some cells of a window reads them as a read of the whole window
+// does, on windows whose chunks start off the angles' lattice; every other cell keeps which
+// scenes may take it.
+TEST_F(OppositeViews, SeamSourceReadsTheCellsAskedAsTheWholeWindow) {
+    RecoveryJob job = Job(1, 1, 2, true);
+    const trueortho::RecoveryGrid grid = trueortho::InspectScenes(job);
+    job.surface->SetInputCRS(grid.crs.get());
+    const trueortho::SceneReader reader(job, grid);
+    trueortho::BalanceFit fit;
+    fit.gain.assign(2, std::vector<double>(static_cast<size_t>(grid.bands), 1.1));
+    fit.offset.assign(2, std::vector<double>(static_cast<size_t>(grid.bands), -3.0));
+    trueortho::RunControl control(nullptr, nullptr, nullptr);
+    const auto source = trueortho::MakeSeamSource(job, grid, reader, fit, control);
+    for (const std::array<int, 4> at : {std::array<int, 4>{0, 0, 258, 258}, {37, 101, 203, 150}}) {
+        const auto [x0, y0, w, h] = at;
+        SCOPED_TRACE(::testing::Message() << "window at " << x0 << ", " << y0);
+        const trueortho::SeamWindow whole = source->Read(x0, y0, w, h, 1);
+        ASSERT_EQ(whole.scenes.size(), 2u);
+        std::vector<std::uint8_t> needed(static_cast<size_t>(w) * h);
+        for (int y = 0; y < h; ++y)
+            for (int x = 0; x < w; ++x)  // diagonal bands and a lone corner
+                needed[static_cast<size_t>(y) * w + x] = (x + 2 * y) % 97 < 9 || (x > 180 && y > 130);
+        int asked = 0;
+        const trueortho::SeamWindow part =
+            source->Read(x0, y0, w, h, 1, [&](const trueortho::SeamWindow& allowed) {
+                ++asked;
+                EXPECT_EQ(allowed.scenes, whole.scenes);
+                return needed;
+            });
+        ASSERT_EQ(asked, 1);
+        ASSERT_EQ(part.scenes, whole.scenes);
+        size_t differ = 0, allowedDiffer = 0, compared = 0;
+        for (size_t k = 0; k < whole.scenes.size(); ++k)
+            for (size_t c = 0; c < needed.size(); ++c) {
+                const bool allowed = whole.cost[k][c] < trueortho::kForbidden;
+                allowedDiffer += allowed != (part.cost[k][c] < trueortho::kForbidden);
+                if (!needed[c] || !allowed)
+                    continue;
+                ++compared;
+                differ += part.cost[k][c] != whole.cost[k][c] ||
+                          part.grey[k][c] != whole.grey[k][c] || part.raised[c] != whole.raised[c];
+            }
+        EXPECT_EQ(allowedDiffer, 0u);
+        EXPECT_EQ(differ, 0u);
+        EXPECT_GT(compared, needed.size() / 10);
+    }
+}
+
 TEST_F(OppositeViews, SteeperLineOfSightWinsAtEqualLevels) {
     const auto vis1 = Visibility(0), vis2 = Visibility(1);
     auto both = [&](size_t k) { return vis1[k] == VISIBILITY_SEEN && vis2[k] == VISIBILITY_SEEN; };
@@ -279,30 +329,43 @@ TEST_F(OppositeViews, CancelledOrRefusedRunsLeaveNoOutput) {
 
 // A cancel while the seam step asks for the surface's heights (the ground's opening, in slices)
 // ends the run there: after the slice at hand no height is asked for, nothing is published.
+// Cancelled at the seam source's first read of surface heights (the ground's estimate) or at
+// its last (a refinement window's, after it said which cells it needs): the read stops at the
+// slice and the run leaves no output.
 TEST_F(OppositeViews, CancelWhileSeamsReadHeightsStopsAtTheSlice) {
     struct Cancelling : samplecity::GridSurface {
         using GridSurface::GridSurface;
         bool* flag = nullptr;
-        mutable std::size_t cells = 0;
+        std::size_t cancelAt = 0;  // reads of several heights before cancelling; 0: never
+        mutable std::size_t reads = 0, cells = 0;
         void GetHeights(std::size_t n, const double* x, const double* y,
                         double* h) const override {
             GridSurface::GetHeights(n, x, y, h);
-            if (n > 1)  // not a single point's view angle
+            if (n > 1 && ++reads >= cancelAt && cancelAt > 0)  // not a view angle's point
                 cells += n, *flag = true;
         }
     } heights(dir->File("dsm.tif"));
-    bool cancel = false;
-    heights.flag = &cancel;
     RecoveryJob job = Job(1, 1, 1, true);
     job.surface = &heights;
     job.seamlines = true;
-    OcclusionRecovery recovery;
-    recovery.SetCancelFlag(&cancel);
-    EXPECT_FALSE(recovery.Recover(job).completed);
-    EXPECT_GT(heights.cells, 0u);
-    EXPECT_LE(heights.cells, 2u * 4096u);  // a slice on each of two threads at the most
-    for (const char* name : {"mosaic.tif", "source.tif"})
-        EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
+    bool cancel = false;
+    heights.flag = &cancel;
+    ASSERT_TRUE(OcclusionRecovery().Recover(job).completed);
+    const std::size_t all = heights.reads;
+    for (const std::size_t at : {std::size_t{1}, all}) {
+        SCOPED_TRACE(::testing::Message() << "cancelled at read " << at << " of " << all);
+        cancel = false;
+        heights.cancelAt = at, heights.reads = 0, heights.cells = 0;
+        std::filesystem::remove(dir->File("mosaic.tif"));
+        std::filesystem::remove(dir->File("source.tif"));
+        OcclusionRecovery recovery;
+        recovery.SetCancelFlag(&cancel);
+        EXPECT_FALSE(recovery.Recover(job).completed);
+        EXPECT_GT(heights.cells, 0u);
+        EXPECT_LE(heights.cells, 2u * 4096u);  // a slice on each of two threads at the most
+        for (const char* name : {"mosaic.tif", "source.tif"})
+            EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
+    }
 }
 
 // ---------------------------------------------------------------------------------------------

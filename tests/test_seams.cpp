@@ -298,6 +298,8 @@ TEST(SolveSeams, SeamGoesAroundRaisedGroundAtAnyPixelSize) {
 
 // A field as a seam source: reduced cells take the mean cost and the highest raised height of
 // their pixels. Scene 1 alone sees the lines below `onlyOne`; no scene sees the last column.
+// With `garbled`, a read that says which cells it needs gets costs, greys and raised heights
+// that would move the seams everywhere else (and greys of 0, no colour term, where needed).
 class FieldSource : public SeamSource {
   public:
     FieldSource(Field f, int pixels, int lines) : f_(f), pixels_(pixels), lines_(lines) {}
@@ -322,7 +324,8 @@ class FieldSource : public SeamSource {
                         raised = std::max(raised, f_.Raised(px + 0.5, py + 0.5));
                         for (int k = 0; k < 2; ++k)
                             if (Sees(k, px, py))
-                                sum[k] += f_.Cost(k, px + 0.5), ++seen[k];
+                                sum[k] += f_.Cost(k, px + 0.5) + noise * Noise(px, py, k),
+                                    ++seen[k];
                     }
                 for (int k = 0; k < 2; ++k)
                     w.cost[k].push_back(seen[k] > 0 ? static_cast<float>(sum[k] / seen[k])
@@ -332,12 +335,54 @@ class FieldSource : public SeamSource {
         return w;
     }
 
+    SeamWindow Read(int x0, int y0, int width, int height, int factor,
+                    const CellsNeeded& needed) override {
+        SeamWindow w = Read(x0, y0, width, height, factor);
+        if (!garbled)
+            return w;
+        SeamWindow allowed = w;
+        for (std::vector<float>& cost : allowed.cost)
+            for (float& c : cost)
+                c = c < kForbidden ? 0.0f : kForbidden;
+        allowed.raised.clear();
+        const std::vector<std::uint8_t> full = needed(allowed);
+        EXPECT_EQ(full.size(), w.cost[0].size());
+        std::mt19937 rng(static_cast<unsigned>(x0 * 7919 + y0));
+        std::uniform_real_distribution<float> garbage(0.0f, 50.0f);
+        w.grey.assign(2, std::vector<float>(full.size(), 0.0f));
+        for (std::size_t c = 0; c < full.size(); ++c) {
+            if (full[c])
+                continue;
+            for (int k = 0; k < 2; ++k) {
+                if (w.cost[k][c] < kForbidden)
+                    w.cost[k][c] = garbage(rng);
+                w.grey[k][c] = 1000 * garbage(rng);
+            }
+            w.raised[c] = 100 * garbage(rng);
+        }
+        std::lock_guard<std::mutex> lock(mutex_);
+        neededCells += static_cast<std::size_t>(std::count(full.begin(), full.end(), 1));
+        readCells += full.size();
+        return w;
+    }
+
     bool Sees(int scene, int x, int y) const {
         return x + 1 < pixels_ && (scene == 1 || y < onlyOne);
     }
+    // A fixed pseudo-random value in [0, 1) per pixel and scene.
+    static float Noise(int x, int y, int k) {
+        std::uint32_t h = static_cast<std::uint32_t>(x) * 73856093u ^
+                          static_cast<std::uint32_t>(y) * 19349663u ^
+                          static_cast<std::uint32_t>(k) * 83492791u;
+        h ^= h >> 13, h *= 0x5bd1e995u, h ^= h >> 15;
+        return static_cast<float>(h % 1000) / 1000.0f;
+    }
 
     int onlyOne = 0;
+    float noise = 0;  // added to each pixel's cost, times Noise
     int largest = 0;
+    bool garbled = false;
+    std::size_t neededCells = 0, readCells = 0;
 
   private:
     Field f_;
@@ -394,6 +439,18 @@ TEST(ChooseRegions, TilesMeetAlongOneSeamAroundRaisedGround) {
     const std::vector<std::uint16_t> labels = choose(2);
     EXPECT_EQ(choose(1), labels);
     EXPECT_LE(source.largest, params.tile + 2);
+    // The refinement reads in full only the cells it may relabel and their neighbours: the same
+    // labels whatever the rest holds, also where noisy costs make ragged seams.
+    for (const float noise : {0.0f, 2.0f}) {
+        source.noise = noise;
+        source.garbled = false;
+        const std::vector<std::uint16_t> plain = choose(2);
+        source.garbled = true;
+        EXPECT_EQ(choose(2), plain) << "noise " << noise;
+    }
+    EXPECT_GT(source.neededCells, 0u);
+    EXPECT_LT(source.neededCells, source.readCells / 4);
+    source.noise = 0, source.garbled = false;
 
     std::vector<float> raised;
     for (int y = 0; y < lines; ++y)

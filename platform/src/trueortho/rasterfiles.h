@@ -2,6 +2,8 @@
 // raster writer.
 #pragma once
 
+#include <kestrel/export.h>
+
 #include <gdal.h>
 
 #include <memory>
@@ -14,7 +16,7 @@ namespace kestrel {
 namespace processes {
 namespace trueortho {
 
-struct DatasetCloser {
+struct KESTREL_API DatasetCloser {
     void operator()(GDALDataset* ds) const;
 };
 using DatasetPtr = std::unique_ptr<GDALDataset, DatasetCloser>;

@@ -401,12 +401,11 @@ SceneReader::SceneReader(const RecoveryJob& job, const RecoveryGrid& grid)
     }
 }
 
-bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
-                       SceneTile& out) const {
+bool SceneReader::ReadVisibility(std::size_t s, const Rect& r, Scratch& scratch,
+                                 std::vector<unsigned char>& vis) const {
     const int e = job_.scenes[s].dbmPixelError;
     const Rect border = r.Grown(e);
     SharedRaster& file = *grid_.visibilities[s];
-    std::vector<unsigned char>& vis = scratch.visibility;
     const unsigned char outside = VISIBILITY_OUTSIDE;
     Prepare(vis, border, file.window, 1, outside);
     if (file.type == GDT_Byte) {
@@ -422,12 +421,27 @@ bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, S
                                                                          : VISIBILITY_OUTSIDE);
         }
     }
+    for (int j = 0; j < r.height; ++j)
+        if (std::memchr(vis.data() + static_cast<size_t>(j + e) * border.width + e,
+                        VISIBILITY_SEEN, static_cast<size_t>(r.width)) != nullptr)
+            return true;
+    return false;
+}
+
+bool SceneReader::ReadBytes(std::size_t s, const Rect& r, std::vector<unsigned char>& bytes) const {
+    if (grid_.orthos[s]->type != GDT_Byte)
+        return false;
+    bytes.resize(r.Size() * grid_.bands);
+    grid_.orthos[s]->Read(bands_.data(), grid_.bands, r, GDT_Byte, bytes.data());
+    return true;
+}
+
+bool SceneReader::Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
+                       SceneTile& out) const {
+    const int e = job_.scenes[s].dbmPixelError;
+    std::vector<unsigned char>& vis = scratch.visibility;
     out.scene = s;
-    bool seesAny = false;
-    for (int j = 0; j < r.height && !seesAny; ++j)
-        seesAny = std::memchr(vis.data() + static_cast<size_t>(j + e) * border.width + e,
-                              VISIBILITY_SEEN, static_cast<size_t>(r.width)) != nullptr;
-    if (!seesAny)
+    if (!ReadVisibility(s, r, scratch, vis))
         return false;
     PixelStates(vis.data(), r.width, r.height, e, scratch, out.state);
     if (values)
@@ -508,6 +522,16 @@ void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const Rect& part,
 void SceneReader::ReadValues(std::size_t s, const Rect& r, std::vector<float>& values) const {
     Prepare(values, r, grid_.orthos[s]->window, grid_.bands, static_cast<float>(grid_.noData));
     grid_.orthos[s]->Read(bands_.data(), grid_.bands, r, GDT_Float32, values.data());
+}
+
+bool SeenClearly(const unsigned char* vis, int width, int e, int i, int j) {
+    if (vis[static_cast<size_t>(j + e) * width + i + e] != VISIBILITY_SEEN)
+        return false;
+    for (int row = j; row <= j + 2 * e; ++row)
+        if (std::memchr(vis + static_cast<size_t>(row) * width + i, VISIBILITY_HIDDEN,
+                        static_cast<size_t>(2 * e + 1)) != nullptr)
+            return false;
+    return true;
 }
 
 // The square neighbourhood of hidden pixels is a dilation along each row, then down each

@@ -135,7 +135,7 @@ struct RecoveryGrid {
 
 // Opens every scene for the whole run, checks that they lie on one lattice with one channel
 // count and data type, and lays out the mosaic grid (the job's, or the union of the windows).
-RecoveryGrid InspectScenes(const RecoveryJob& job);
+KESTREL_API RecoveryGrid InspectScenes(const RecoveryJob& job);
 
 // Values as the mosaic's data type holds them: rounded and clamped for integer types.
 class ValueRange {
@@ -188,7 +188,7 @@ inline int AngleCells(int size) { return (size + kAngleStep - 1) / kAngleStep; }
 
 // Reads scenes over rectangles; Read may be called from several threads, each with its own
 // Scratch.
-class SceneReader {
+class KESTREL_API SceneReader {
   public:
     struct Scratch {
         // The visibility index over the read with its border: VISIBILITY_SEEN, VISIBILITY_HIDDEN
@@ -206,6 +206,14 @@ class SceneReader {
     // some pixel; false (values and angles not read) when it sees no pixel of r.
     bool Read(std::size_t s, const Rect& r, bool values, bool angles, Scratch& scratch,
               SceneTile& out) const;
+    // The visibility index of scene s over r with a border of its DBM pixel error, as
+    // VISIBILITY_SEEN, VISIBILITY_HIDDEN or VISIBILITY_OUTSIDE (the index's other values);
+    // false when the scene sees no pixel of r.
+    bool ReadVisibility(std::size_t s, const Rect& r, Scratch& scratch,
+                        std::vector<unsigned char>& vis) const;
+    // The ortho's `bands` planes over r as they are, when its raster is Byte (else false and
+    // nothing read); parts outside the raster hold anything.
+    bool ReadBytes(std::size_t s, const Rect& r, std::vector<unsigned char>& bytes) const;
     // The angles of out.scene over r, for a tile Read without them: in the cells of the angle
     // lattice that `cells` flags (AngleCells(r.width) per row, line after line), or all of r
     // when it is null; unknown elsewhere.
@@ -234,6 +242,10 @@ class SceneReader {
 void PixelStates(const unsigned char* vis, int w, int h, int e, SceneReader::Scratch& scratch,
                  std::vector<unsigned char>& state);
 
+// Whether pixel (i, j) of a rectangle is kClear as PixelStates has it; `vis` is the rectangle
+// with a border of e pixels, `width` pixels across with it.
+bool SeenClearly(const unsigned char* vis, int width, int e, int i, int j);
+
 // Metres per pixel of the grid (near enough on a geographic one).
 double PixelMetres(const RecoveryGrid& grid);
 
@@ -249,9 +261,11 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
 // The seam solver's view of the scenes (costs, balanced brightness, raised heights). Once
 // control stops, a read gives up at its next slice of heights or scene chunk and hands back a
 // window without scenes: the run is being abandoned.
-std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job, const RecoveryGrid& grid,
-                                           const SceneReader& reader, const BalanceFit& fit,
-                                           const RunControl& control);
+KESTREL_API std::unique_ptr<SeamSource> MakeSeamSource(const RecoveryJob& job,
+                                                       const RecoveryGrid& grid,
+                                                       const SceneReader& reader,
+                                                       const BalanceFit& fit,
+                                                       const RunControl& control);
 
 }  // namespace trueortho
 }  // namespace processes

@@ -3,6 +3,8 @@
 #include "recoverygrid.h"
 #include "runcontrol.h"
 
+#include <kestrel/exception.h>
+
 #include <algorithm>
 #include <cmath>
 #include <tuple>
@@ -62,82 +64,134 @@ class RecoverySeamSource : public SeamSource {
     // Raised heights: per cell, the highest within the largest DBM pixel error, so that a seam
     // priced on the lower side of its pair keeps that error off the raised object's outline.
     SeamWindow Read(int x0, int y0, int width, int height, int factor) override {
+        return Read(x0, y0, width, height, factor, CellsNeeded());
+    }
+
+    // With `needed` at full resolution, the scenes' visibility is read over the whole window
+    // first; then each scene's angles and values only over the part of each chunk that holds the
+    // needed pixels it sees, and the surface only within the largest pixel error of the needed
+    // pixels. (At a coarser factor the whole window is read.)
+    SeamWindow Read(int x0, int y0, int width, int height, int factor,
+                    const CellsNeeded& needed) override {
         SeamWindow window;
         window.width = width, window.height = height;
-        const size_t cells = static_cast<size_t>(width) * height;
-        const Relief relief = ReadRelief(x0, y0, width, height, factor);
+        const Layout at(x0, y0, width, height, factor, grid_.Whole());
+        const bool whole = !needed || factor != 1;
+        Relief relief;
+        if (whole)
+            relief = ReadRelief(at, {});
         if (control_.Stopped())
             return window;
-        const Rect pixels{x0 * factor, y0 * factor, width * factor, height * factor};
-        const Rect in = pixels.Intersect(grid_.Whole());
         SceneReader::Scratch scratch;
         SceneTile tile;
-        std::vector<unsigned int> seen;
         // One scene at a time, in chunks of about 256 pixels across: the sums of its pixel costs
-        // and brightness per cell go straight into the window's arrays.
-        const int chunk = std::max(factor, 256 / factor * factor);
-        for (const size_t s : grid_.ScenesMeeting(in)) {
-            const Rect sceneIn = in.Intersect(grid_.windows[s]);
-            std::vector<float> cost, grey;
-            const int level = job_.scenes[s].radiometricLevel;
-            for (int cy = in.y; cy < in.y + in.height; cy += chunk)
-                for (int cx = in.x; cx < in.x + in.width; cx += chunk) {
-                    if (control_.Stopped())
-                        return window;  // the scenes read so far, whole
-                    const Rect part = Rect{cx, cy, chunk, chunk}.Intersect(sceneIn);
-                    if (part.Empty() || !reader_.Read(s, part, true, true, scratch, tile))
-                        continue;
-                    if (cost.empty())
-                        seen.assign(cells, 0), cost.assign(cells, 0.0f), grey.assign(cells, 0.0f);
-                    for (int j = 0; j < part.height; ++j)
-                        for (int i = 0; i < part.width; ++i) {
-                            const size_t p = static_cast<size_t>(j) * part.width + i;
-                            if (tile.state[p] == kNotSeen)
-                                continue;
-                            const size_t c =
-                                static_cast<size_t>((part.y + j - pixels.y) / factor) * width +
-                                (part.x + i - pixels.x) / factor;
-                            ++seen[c];
-                            cost[c] += PixelCost(tile, p, level, relief.rise[c] <= kExposedRise);
-                            double sum = 0;
-                            for (int b = 0; b < grid_.bands; ++b)
-                                sum += fit_.gain[s][b] * tile.values[part.Size() * b + p] +
-                                       fit_.offset[s][b];
-                            grey[c] += static_cast<float>(sum / grid_.bands);
-                        }
-                }
-            if (cost.empty())
+        // and brightness per cell go straight into its arrays.
+        std::vector<Sums> sums;
+        for (const size_t s : grid_.ScenesMeeting(at.in)) {
+            Sums sum;
+            sum.scene = s;
+            for (const Rect& part : Chunks(at, s)) {
+                if (control_.Stopped())
+                    return window;  // no scene: the run is being abandoned
+                if (!reader_.Read(s, part, whole, whole, scratch, tile))
+                    continue;
+                if (sum.seen.empty())
+                    sum.seen.assign(at.cells, 0), sum.cost.assign(at.cells, 0.0f),
+                        sum.grey.assign(at.cells, 0.0f);
+                Add(at, tile, part, part, true, whole, relief, {}, sum);
+                if (!whole)
+                    sum.states.emplace_back(part, tile.state);
+            }
+            if (sum.seen.empty())
                 continue;
+            sum.allowed.resize(at.cells);
             bool any = false;
-            for (int cy = 0; cy < height; ++cy)
-                for (int cx = 0; cx < width; ++cx) {
-                    const size_t c = static_cast<size_t>(cy) * width + cx;
-                    // The cell's pixels inside the grid (fewer at its right and bottom edges).
-                    const int left = pixels.x + cx * factor, top = pixels.y + cy * factor;
-                    const int across = std::min(left + factor, in.x + in.width) - std::max(left, in.x);
-                    const int down = std::min(top + factor, in.y + in.height) - std::max(top, in.y);
-                    const size_t total = static_cast<size_t>(std::max(0, across)) *
-                                         static_cast<size_t>(std::max(0, down));
-                    if (seen[c] == 0 || 2 * static_cast<size_t>(seen[c]) < total) {
-                        cost[c] = kForbidden, grey[c] = 0;
-                        continue;
-                    }
-                    cost[c] = cost[c] / seen[c] +
-                              kUnclearCost * static_cast<float>(total - seen[c]) / total;
-                    grey[c] /= seen[c];
-                    any = true;
-                }
-            if (!any)
-                continue;
-            window.scenes.push_back(s);
-            window.cost.push_back(std::move(cost));
-            window.grey.push_back(std::move(grey));
+            for (size_t c = 0; c < at.cells; ++c) {
+                sum.allowed[c] = sum.seen[c] > 0 && 2 * static_cast<size_t>(sum.seen[c]) >= at.total[c];
+                any = any || sum.allowed[c];
+            }
+            if (any)
+                sums.push_back(std::move(sum));
         }
-        window.raised = relief.raised;
+        std::vector<std::uint8_t> full;
+        if (!whole) {
+            for (const Sums& sum : sums) {
+                window.scenes.push_back(sum.scene);
+                window.cost.emplace_back(at.cells);
+                for (size_t c = 0; c < at.cells; ++c)
+                    window.cost.back()[c] = sum.allowed[c] ? 0.0f : kForbidden;
+            }
+            full = needed(window);
+            if (full.size() != at.cells)
+                KESTREL_THROW(DataException, "seam source: " + std::to_string(full.size()) +
+                                                 " cells needed out of a window of " +
+                                                 std::to_string(at.cells));
+            window.scenes.clear(), window.cost.clear();
+            relief = ReadRelief(at, full);
+            for (Sums& sum : sums)
+                if (!ReadNeeded(at, full, relief, scratch, tile, sum))
+                    return window;
+        }
+        for (Sums& sum : sums) {
+            for (size_t c = 0; c < at.cells; ++c) {
+                if (!sum.allowed[c]) {
+                    sum.cost[c] = kForbidden, sum.grey[c] = 0;
+                } else if (whole || full[c]) {
+                    sum.cost[c] = sum.cost[c] / sum.seen[c] +
+                                  kUnclearCost * static_cast<float>(at.total[c] - sum.seen[c]) /
+                                      at.total[c];
+                    sum.grey[c] /= sum.seen[c];
+                }
+            }
+            window.scenes.push_back(sum.scene);
+            window.cost.push_back(std::move(sum.cost));
+            window.grey.push_back(std::move(sum.grey));
+        }
+        window.raised = std::move(relief.raised);
         return window;
     }
 
   private:
+    // A window of cells on the grid.
+    struct Layout {
+        Layout(int x0, int y0, int w, int h, int f, const Rect& whole)
+            : width(w),
+              height(h),
+              factor(f),
+              cells(static_cast<size_t>(w) * h),
+              pixels{x0 * f, y0 * f, w * f, h * f},
+              in(pixels.Intersect(whole)),
+              total(cells) {
+            for (int cy = 0; cy < h; ++cy)
+                for (int cx = 0; cx < w; ++cx) {
+                    // The cell's pixels inside the grid (fewer at its right and bottom edges).
+                    const int left = pixels.x + cx * f, top = pixels.y + cy * f;
+                    const int across = std::min(left + f, in.x + in.width) - std::max(left, in.x);
+                    const int down = std::min(top + f, in.y + in.height) - std::max(top, in.y);
+                    total[static_cast<size_t>(cy) * w + cx] =
+                        static_cast<unsigned int>(std::max(0, across) * std::max(0, down));
+                }
+        }
+        size_t Cell(int x, int y) const {
+            return static_cast<size_t>((y - pixels.y) / factor) * width + (x - pixels.x) / factor;
+        }
+        int width, height, factor;
+        size_t cells;
+        Rect pixels, in;
+        std::vector<unsigned int> total;  // per cell
+    };
+
+    // One scene's pixels seen per cell, whether it may take each cell, the sums of the costs and
+    // brightness of the pixels it sees, and its pixel states over the chunks read (kept only to
+    // read the needed pixels after).
+    struct Sums {
+        size_t scene = 0;
+        std::vector<unsigned int> seen;
+        std::vector<std::uint8_t> allowed;
+        std::vector<float> cost, grey;
+        std::vector<std::pair<Rect, std::vector<unsigned char>>> states;
+    };
+
     // Per cell of a window: the highest raised height within the largest DBM pixel error, and
     // how far the cell stands above the lowest surface within it (metres; empty without a
     // surface model).
@@ -145,63 +199,184 @@ class RecoverySeamSource : public SeamSource {
         std::vector<float> raised, rise;
     };
 
-    Relief ReadRelief(int x0, int y0, int width, int height, int factor) const {
-        const size_t cells = static_cast<size_t>(width) * height;
+    // The chunks scene s is read in: its part of the window cut into squares of about 256
+    // pixels, whole cells.
+    std::vector<Rect> Chunks(const Layout& at, size_t s) const {
+        const int factor = at.factor, chunk = std::max(factor, 256 / factor * factor);
+        const Rect sceneIn = at.in.Intersect(grid_.windows[s]);
+        std::vector<Rect> parts;
+        for (int cy = at.in.y; cy < at.in.y + at.in.height; cy += chunk)
+            for (int cx = at.in.x; cx < at.in.x + at.in.width; cx += chunk) {
+                const Rect part = Rect{cx, cy, chunk, chunk}.Intersect(sceneIn);
+                if (!part.Empty())
+                    parts.push_back(part);
+            }
+        return parts;
+    }
+
+    // Adds the pixels of `part` that the scene sees (`tile` holds it over `read`, which holds
+    // `part`): their count per cell if `count`, and if `values` the sums of their costs and
+    // brightness in the cells `full` names (empty: all).
+    void Add(const Layout& at, const SceneTile& tile, const Rect& read, const Rect& part,
+             bool count, bool values, const Relief& relief, const std::vector<std::uint8_t>& full,
+             Sums& sum) const {
+        const int level = job_.scenes[sum.scene].radiometricLevel;
+        std::vector<size_t> column(static_cast<size_t>(part.width));  // per pixel, its cell's
+        for (int i = 0; i < part.width; ++i)
+            column[i] = at.Cell(part.x + i, at.pixels.y);
+        for (int j = 0; j < part.height; ++j) {
+            const size_t row = at.Cell(at.pixels.x, part.y + j);
+            const size_t line = static_cast<size_t>(part.y - read.y + j) * read.width +
+                                static_cast<size_t>(part.x - read.x);
+            for (int i = 0; i < part.width; ++i) {
+                const size_t p = line + i;
+                if (tile.state[p] == kNotSeen)
+                    continue;
+                const size_t c = row + column[i];
+                if (count)
+                    ++sum.seen[c];
+                if (!values || (!full.empty() && !full[c]))
+                    continue;
+                sum.cost[c] += PixelCost(tile, p, level, relief.rise[c] <= kExposedRise);
+                double grey = 0;
+                for (int b = 0; b < grid_.bands; ++b)
+                    grey += fit_.gain[sum.scene][b] * tile.values[read.Size() * b + p] +
+                            fit_.offset[sum.scene][b];
+                sum.grey[c] += static_cast<float>(grey / grid_.bands);
+            }
+        }
+    }
+
+    // Adds to the scene's sums its pixels in the cells `full` names (at full resolution): its
+    // values over the box of those it sees in each chunk, its angles over the chunk (so that
+    // they come out as a read of the whole chunk gives them) in the lattice cells holding them.
+    // False once the run stops.
+    bool ReadNeeded(const Layout& at, const std::vector<std::uint8_t>& full, const Relief& relief,
+                    SceneReader::Scratch& scratch, SceneTile& tile, Sums& sum) const {
+        tile.scene = sum.scene;
+        std::vector<unsigned char> cells;
+        std::vector<float> angles;
+        for (const auto& [chunk, states] : sum.states) {
+            if (control_.Stopped())
+                return false;
+            const int across = AngleCells(chunk.width);
+            cells.assign(static_cast<size_t>(across) * AngleCells(chunk.height), 0);
+            int x0 = chunk.width, x1 = 0, y0 = chunk.height, y1 = 0;  // the box, in the chunk
+            for (int y = 0; y < chunk.height; ++y) {
+                const size_t row = at.Cell(chunk.x, chunk.y + y);
+                for (int x = 0; x < chunk.width; ++x)
+                    if (full[row + x] && sum.allowed[row + x]) {
+                        x0 = std::min(x0, x), x1 = std::max(x1, x + 1), y0 = std::min(y0, y);
+                        y1 = y + 1;
+                        cells[static_cast<size_t>(y / kAngleStep) * across + x / kAngleStep] = 1;
+                    }
+            }
+            if (x1 <= x0)
+                continue;
+            reader_.ReadAngles(chunk, scratch, tile, &cells);
+            const Rect box{chunk.x + x0, chunk.y + y0, x1 - x0, y1 - y0};
+            angles.swap(tile.angle);
+            tile.angle.resize(box.Size()), tile.state.resize(box.Size());
+            for (int j = 0; j < box.height; ++j) {
+                const size_t from = static_cast<size_t>(y0 + j) * chunk.width + x0;
+                const size_t to = static_cast<size_t>(j) * box.width;
+                std::copy_n(angles.begin() + static_cast<std::ptrdiff_t>(from), box.width,
+                            tile.angle.begin() + static_cast<std::ptrdiff_t>(to));
+                std::copy_n(states.begin() + static_cast<std::ptrdiff_t>(from), box.width,
+                            tile.state.begin() + static_cast<std::ptrdiff_t>(to));
+            }
+            reader_.ReadValues(sum.scene, box, tile.values);
+            Add(at, tile, box, box, false, true, relief, full, sum);
+        }
+        return true;
+    }
+
+    // The relief of the cells `full` names (empty: all; 0 elsewhere), from the surface heights
+    // within the largest pixel error of them.
+    Relief ReadRelief(const Layout& at, const std::vector<std::uint8_t>& full) const {
+        const int width = at.width, height = at.height;
         Relief relief;
-        relief.rise.assign(cells, 0.0f);
+        relief.rise.assign(at.cells, 0.0f);
         if (job_.surface == nullptr)
             return relief;
-        const int m = (grid_.halo + factor - 1) / factor;
+        const int factor = at.factor, m = (grid_.halo + factor - 1) / factor;
         const int w = width + 2 * m, h = height + 2 * m;
-        const std::vector<float> raised = Raised(x0 - m, y0 - m, w, h, factor);
+        std::vector<float> reach;  // nonzero where a needed cell's square reaches
+        if (!full.empty()) {
+            reach.assign(static_cast<size_t>(w) * h, 0.0f);
+            for (int j = 0; j < height; ++j)
+                for (int i = 0; i < width; ++i)
+                    reach[static_cast<size_t>(j + m) * w + i + m] =
+                        full[static_cast<size_t>(j) * width + i];
+            SquareFilter(reach, w, h, m, true);
+        }
+        const std::vector<float> raised =
+            Raised(at.pixels.x / factor - m, at.pixels.y / factor - m, w, h, factor, reach);
         if (control_.Stopped())
             return relief;
         std::vector<float> highest = raised, lowest = raised;
         SquareFilter(highest, w, h, m, true);
         SquareFilter(lowest, w, h, m, false);
-        relief.raised.resize(cells);
+        relief.raised.assign(at.cells, 0.0f);
         for (int j = 0; j < height; ++j)
             for (int i = 0; i < width; ++i) {
                 const size_t c = static_cast<size_t>(j) * width + i;
                 const size_t k = static_cast<size_t>(j + m) * w + i + m;
+                if (!full.empty() && !full[c])
+                    continue;
                 relief.raised[c] = (raised[k] + highest[k]) / 2;
                 relief.rise[c] = raised[k] - lowest[k];
             }
         return relief;
     }
 
-    // Heights at the centres of cells [x0, x0 + width) x [y0, y0 + height); NaN where none.
-    // Asked in slices of lines (a vertical datum conversion makes them slow), each after a look
-    // at the run's control: once it stops, the rest stay NaN.
+    // Heights at the centres of cells [x0, x0 + width) x [y0, y0 + height) that `mask` names
+    // (empty: all); NaN where none or not asked. Asked in slices of lines (a vertical datum
+    // conversion makes them slow), each after a look at the run's control: once it stops, the
+    // rest stay NaN.
     std::vector<float> Heights(const dem::IElevationSource& source, int x0, int y0, int width,
-                               int height, int factor) const {
+                               int height, int factor, const std::vector<float>& mask) const {
         const size_t cells = static_cast<size_t>(width) * height;
-        std::vector<double> x(cells), y(cells), h(cells, NAN);
+        std::vector<size_t> asked;
+        std::vector<double> x, y;
         const auto& g = grid_.geoTransform;
         for (int j = 0; j < height; ++j)
             for (int i = 0; i < width; ++i) {
-                const double p = (x0 + i + 0.5) * factor, l = (y0 + j + 0.5) * factor;
                 const size_t c = static_cast<size_t>(j) * width + i;
-                x[c] = g[0] + p * g[1] + l * g[2], y[c] = g[3] + p * g[4] + l * g[5];
+                if (!mask.empty() && mask[c] == 0)
+                    continue;
+                const double p = (x0 + i + 0.5) * factor, l = (y0 + j + 0.5) * factor;
+                asked.push_back(c);
+                x.push_back(g[0] + p * g[1] + l * g[2]), y.push_back(g[3] + p * g[4] + l * g[5]);
             }
+        std::vector<double> h(asked.size(), NAN);
         const size_t slice = std::max<size_t>(1, kHeightSlice / std::max(1, width)) * width;
-        for (size_t c = 0; c < cells && !control_.Stopped(); c += slice)
-            source.GetHeights(std::min(slice, cells - c), &x[c], &y[c], &h[c]);
-        return std::vector<float>(h.begin(), h.end());
+        for (size_t k = 0; k < asked.size() && !control_.Stopped(); k += slice)
+            source.GetHeights(std::min(slice, asked.size() - k), &x[k], &y[k], &h[k]);
+        std::vector<float> heights(cells, NAN);
+        for (size_t k = 0; k < asked.size(); ++k)
+            heights[asked[k]] = static_cast<float>(h[k]);
+        return heights;
     }
 
-    // Metres the surface stands above the ground: against the job's ground when given, else
-    // against the grid's ground estimate (EstimateGround).
-    std::vector<float> Raised(int x0, int y0, int width, int height, int factor) const {
+    // Metres the surface stands above the ground at the cells `mask` names (empty: all; 0
+    // elsewhere): against the job's ground when given, else against the grid's ground estimate
+    // (EstimateGround).
+    std::vector<float> Raised(int x0, int y0, int width, int height, int factor,
+                              const std::vector<float>& mask) const {
         if (job_.surface == nullptr)
             return {};
-        std::vector<float> raised = Heights(*job_.surface, x0, y0, width, height, factor);
+        std::vector<float> raised = Heights(*job_.surface, x0, y0, width, height, factor, mask);
         std::vector<float> ground;
         if (job_.ground != nullptr)
-            ground = Heights(*job_.ground, x0, y0, width, height, factor);
+            ground = Heights(*job_.ground, x0, y0, width, height, factor, mask);
         for (int j = 0; j < height; ++j)
             for (int i = 0; i < width; ++i) {
                 const size_t c = static_cast<size_t>(j) * width + i;
+                if (!mask.empty() && mask[c] == 0) {
+                    raised[c] = 0.0f;
+                    continue;
+                }
                 const float d = raised[c] - (ground.empty() ? GroundAt((x0 + i + 0.5) * factor,
                                                                        (y0 + j + 0.5) * factor)
                                                             : ground[c]);
@@ -229,7 +404,7 @@ class RecoverySeamSource : public SeamSource {
         const int band = std::max(1, static_cast<int>(kHeightSlice * 16 / groundWidth_));
         for (int y = 0; y < groundHeight_ && !control_.Stopped(); y += band) {
             const std::vector<float> h =
-                Heights(*job_.surface, 0, y, groundWidth_, std::min(band, groundHeight_ - y), f);
+                Heights(*job_.surface, 0, y, groundWidth_, std::min(band, groundHeight_ - y), f, {});
             heights.insert(heights.end(), h.begin(), h.end());
         }
         if (control_.Stopped())
@@ -326,9 +501,18 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
     };
     const int side = RecoveryGrid::kBucket;
     const size_t tiles = grid.TileCount(side);
+    // The samples are sparse (one pixel in stride x stride of a pair), but every block of a
+    // scene holds some: the tile is read whole, its states and values taken at the samples
+    // alone (Byte values as they are).
+    struct Scene {
+        size_t scene;
+        int e;
+        std::vector<unsigned char> visibility, bytes;  // bytes: of a Byte ortho
+        std::vector<float> values;                     // of another
+    };
     struct Worker {
         SceneReader::Scratch scratch;
-        std::vector<SceneTile> scenes;
+        std::vector<Scene> scenes;
         std::vector<Chunk> chunks;
     };
     std::vector<Worker> workers(std::max(1u, threads));
@@ -345,11 +529,24 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
         for (const size_t s : meeting) {
             if (w.scenes.size() <= n)
                 w.scenes.emplace_back();
-            n += reader.Read(s, r, true, false, w.scratch, w.scenes[n]) ? 1 : 0;
+            Scene& scene = w.scenes[n];
+            if (!reader.ReadVisibility(s, r, w.scratch, scene.visibility))
+                continue;
+            scene.scene = s, scene.e = job.scenes[s].dbmPixelError;
+            if (!reader.ReadBytes(s, r, scene.bytes))
+                reader.ReadValues(s, r, scene.values);
+            ++n;
         }
+        const auto clear = [&](const Scene& scene, int i, int j) {
+            return SeenClearly(scene.visibility.data(), r.width + 2 * scene.e, scene.e, i, j);
+        };
+        const auto value = [&](const Scene& scene, int band, size_t p) {
+            const size_t k = r.Size() * band + p;
+            return scene.bytes.empty() ? scene.values[k] : static_cast<float>(scene.bytes[k]);
+        };
         for (size_t k = 0; k < n; ++k)
             for (size_t l = k + 1; l < n; ++l) {
-                const SceneTile &a = w.scenes[k], &b = w.scenes[l];
+                const Scene &a = w.scenes[k], &b = w.scenes[l];
                 const auto found = index.find(a.scene * count + b.scene);
                 if (found == index.end())
                     continue;
@@ -360,18 +557,18 @@ std::vector<OverlapSamples> GatherOverlaps(const RecoveryJob& job, const Recover
                 for (int j = j0; j < r.height; j += stride)
                     for (int i = i0; i < r.width; i += stride) {
                         const size_t p = static_cast<size_t>(j) * r.width + i;
-                        if (a.state[p] != kClear || b.state[p] != kClear)
+                        if (!clear(a, i, j) || !clear(b, i, j))
                             continue;
                         // Pixels clipped in either scene would pull the fit towards the clip.
                         bool clipped = false;
                         for (int band = 0; band < grid.bands && !clipped; ++band)
-                            clipped = range.Clipped(a.values[r.Size() * band + p]) ||
-                                      range.Clipped(b.values[r.Size() * band + p]);
+                            clipped = range.Clipped(value(a, band, p)) ||
+                                      range.Clipped(value(b, band, p));
                         if (clipped)
                             continue;
                         for (int band = 0; band < grid.bands; ++band) {
-                            chunk.a.push_back(a.values[r.Size() * band + p]);
-                            chunk.b.push_back(b.values[r.Size() * band + p]);
+                            chunk.a.push_back(value(a, band, p));
+                            chunk.b.push_back(value(b, band, p));
                         }
                     }
                 if (!chunk.a.empty())

@@ -277,14 +277,17 @@ std::vector<int> Solve(const SeamWindow& window, const SeamParams& params, std::
     for (std::size_t c = 0; c < cells; ++c)
         if (energy.Free(c) && labels[c] >= 0)
             x.free.push_back(c);
-    double total = energy.Total(labels);
-    for (int cycle = 0; cycle < (everyScene ? kMaxCycles : kRefineCycles); ++cycle) {
+    // The total is needed only to stop early: a single cycle reads no cell beyond the free ones
+    // and their neighbours.
+    const int cycles = everyScene ? kMaxCycles : kRefineCycles;
+    double total = cycles > 1 ? energy.Total(labels) : 0;
+    for (int cycle = 0; cycle < cycles; ++cycle) {
         double gain = 0;
         for (int alpha = 0; alpha < scenes; ++alpha)
             if (present[static_cast<std::size_t>(alpha)])
                 gain -= Expand(window, energy, alpha, labels, x);
         // Gains below the float terms' rounding are no gains.
-        if (gain <= 1e-6 * std::max(1.0, std::fabs(total)))
+        if (cycle + 1 == cycles || gain <= 1e-6 * std::max(1.0, std::fabs(total)))
             break;
         total -= gain;
     }
@@ -494,13 +497,25 @@ class RegionChooser {
             fine_, threads, control, "Choosing seamlines", kCoarseShare, 1.0,
             [&](int colour, std::size_t square, const Chessboard::Square& core) {
                 const Chessboard::Square win = fine_.Widened(core, colour);
-                SeamWindow window = Read(win, 1);
-                Hold(window, win, [&](int x, int y) -> int {
+                auto held = [&](int x, int y) -> int {
                     if (colour == 1 && !Inside(core, x, y))
                         return Beside(core, x, y) ? Neighbour(edges, x, y) : 0;
                     const std::size_t c = CoarseCell(x, y);
                     return band_[c] ? 0 : coarse_[c];
+                };
+                // Most cells keep their held label: only the free ones and their neighbours are
+                // read in full. Which cells are held depends only on which scenes see them (a
+                // read cut short by a stop holds no scenes).
+                std::vector<int> fixed;
+                std::vector<std::size_t> scenes;
+                SeamWindow window = Read(win, 1, [&](const SeamWindow& allowed) {
+                    fixed = Labels(allowed, win, held);
+                    scenes = allowed.scenes;
+                    return Needed(allowed, fixed);
                 });
+                window.fixed = !fixed.empty() && scenes == window.scenes
+                                   ? std::move(fixed)
+                                   : Labels(window, win, held);
                 Reach(window, win);
                 // The band starts from the coarse labels and may take only their scenes
                 // (and those that see what they do not).
@@ -569,8 +584,9 @@ class RegionChooser {
                          : e.bottom[static_cast<std::size_t>(x - s.x0)];
     }
 
-    SeamWindow Read(const Chessboard::Square& s, int factor) {
-        SeamWindow window = source_.Read(s.x0, s.y0, s.w, s.h, factor);
+    SeamWindow Read(const Chessboard::Square& s, int factor, const CellsNeeded& needed = {}) {
+        SeamWindow window = needed ? source_.Read(s.x0, s.y0, s.w, s.h, factor, needed)
+                                   : source_.Read(s.x0, s.y0, s.w, s.h, factor);
         if (window.width != s.w || window.height != s.h)
             KESTREL_THROW(DataException, "seam source: asked for " + std::to_string(s.w) + " x " +
                                              std::to_string(s.h) + " cells at (" +
@@ -625,6 +641,36 @@ class RegionChooser {
                     labels[c] = k;
             }
         return labels;
+    }
+
+    // What a single expansion cycle reads of a window whose cells are held to `fixed` (-1:
+    // free): the data costs of the free cells that some scene sees, and the seam terms between
+    // them and their four neighbours.
+    static std::vector<std::uint8_t> Needed(const SeamWindow& window,
+                                            const std::vector<int>& fixed) {
+        static_assert(kRefineCycles == 1, "a further cycle would weigh the energy's total, over "
+                                          "every cell");
+        const int W = window.width, H = window.height;
+        std::vector<std::uint8_t> needed(Cells(window), 0);
+        for (int y = 0; y < H; ++y)
+            for (int x = 0; x < W; ++x) {
+                const std::size_t c = static_cast<std::size_t>(y) * W + x;
+                bool seen = false;
+                for (std::size_t k = 0; k < window.scenes.size() && !seen && fixed[c] < 0; ++k)
+                    seen = Allowed(window.cost[k][c]);
+                if (!seen)
+                    continue;
+                needed[c] = 1;
+                if (x > 0)
+                    needed[c - 1] = 1;
+                if (x + 1 < W)
+                    needed[c + 1] = 1;
+                if (y > 0)
+                    needed[c - W] = 1;
+                if (y + 1 < H)
+                    needed[c + W] = 1;
+            }
+        return needed;
     }
 
     // Fixes the cells of the window (at s in the grid) to the scene held(x, y) names (1 + scene;

@@ -69,6 +69,11 @@ KESTREL_API double SeamEnergy(const SeamWindow& window, const SeamParams& params
 // pixelSize metres.
 KESTREL_API int CoarseFactor(unsigned int pixels, unsigned int lines, double pixelSize);
 
+// Per cell of a window, nonzero where the solver needs the cell in full: its costs, brightness
+// and raised height. Given the window's scenes and, per scene and cell, a cost of 0 where the
+// scene may take the cell and kForbidden where not (no grey, no raised heights).
+using CellsNeeded = std::function<std::vector<std::uint8_t>(const SeamWindow& allowed)>;
+
 // What the region chooser reads: a window of the mosaic grid in which each cell stands for
 // factor x factor pixels (factor 1: full resolution); x0, y0, width and height count such cells
 // (cell (i, j) covers pixels [i factor, (i + 1) factor) x [j factor, (j + 1) factor), clipped
@@ -77,6 +82,15 @@ class SeamSource {
   public:
     virtual ~SeamSource() = default;
     virtual SeamWindow Read(int x0, int y0, int width, int height, int factor) = 0;
+    // The same window, in full only where `needed` asks: the scenes are those Read gives and
+    // each cost is allowed (< kForbidden) exactly where Read's is, but a cell that `needed`
+    // leaves out may hold a cost of 0 for every allowed scene, and grey and raised values of 0.
+    // A source may read more than is asked; by default it reads the whole window.
+    virtual SeamWindow Read(int x0, int y0, int width, int height, int factor,
+                            const CellsNeeded& needed) {
+        (void)needed;
+        return Read(x0, y0, width, height, factor);
+    }
 };
 
 // Receives labels (1 + scene index, 0 where no scene sees the pixel) of a full-resolution
