@@ -329,30 +329,43 @@ TEST_F(OppositeViews, CancelledOrRefusedRunsLeaveNoOutput) {
 
 // A cancel while the seam step asks for the surface's heights (the ground's opening, in slices)
 // ends the run there: after the slice at hand no height is asked for, nothing is published.
+// Cancelled at the seam source's first read of surface heights (the ground's estimate) or at
+// its last (a refinement window's, after it said which cells it needs): the read stops at the
+// slice and the run leaves no output.
 TEST_F(OppositeViews, CancelWhileSeamsReadHeightsStopsAtTheSlice) {
     struct Cancelling : samplecity::GridSurface {
         using GridSurface::GridSurface;
         bool* flag = nullptr;
-        mutable std::size_t cells = 0;
+        std::size_t cancelAt = 0;  // reads of several heights before cancelling; 0: never
+        mutable std::size_t reads = 0, cells = 0;
         void GetHeights(std::size_t n, const double* x, const double* y,
                         double* h) const override {
             GridSurface::GetHeights(n, x, y, h);
-            if (n > 1)  // not a single point's view angle
+            if (n > 1 && ++reads >= cancelAt && cancelAt > 0)  // not a view angle's point
                 cells += n, *flag = true;
         }
     } heights(dir->File("dsm.tif"));
-    bool cancel = false;
-    heights.flag = &cancel;
     RecoveryJob job = Job(1, 1, 1, true);
     job.surface = &heights;
     job.seamlines = true;
-    OcclusionRecovery recovery;
-    recovery.SetCancelFlag(&cancel);
-    EXPECT_FALSE(recovery.Recover(job).completed);
-    EXPECT_GT(heights.cells, 0u);
-    EXPECT_LE(heights.cells, 2u * 4096u);  // a slice on each of two threads at the most
-    for (const char* name : {"mosaic.tif", "source.tif"})
-        EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
+    bool cancel = false;
+    heights.flag = &cancel;
+    ASSERT_TRUE(OcclusionRecovery().Recover(job).completed);
+    const std::size_t all = heights.reads;
+    for (const std::size_t at : {std::size_t{1}, all}) {
+        SCOPED_TRACE(::testing::Message() << "cancelled at read " << at << " of " << all);
+        cancel = false;
+        heights.cancelAt = at, heights.reads = 0, heights.cells = 0;
+        std::filesystem::remove(dir->File("mosaic.tif"));
+        std::filesystem::remove(dir->File("source.tif"));
+        OcclusionRecovery recovery;
+        recovery.SetCancelFlag(&cancel);
+        EXPECT_FALSE(recovery.Recover(job).completed);
+        EXPECT_GT(heights.cells, 0u);
+        EXPECT_LE(heights.cells, 2u * 4096u);  // a slice on each of two threads at the most
+        for (const char* name : {"mosaic.tif", "source.tif"})
+            EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
+    }
 }
 
 // ---------------------------------------------------------------------------------------------

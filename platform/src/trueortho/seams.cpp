@@ -504,13 +504,18 @@ class RegionChooser {
                     return band_[c] ? 0 : coarse_[c];
                 };
                 // Most cells keep their held label: only the free ones and their neighbours are
-                // read in full. Which cells are held depends only on which scenes see them.
+                // read in full. Which cells are held depends only on which scenes see them (a
+                // read cut short by a stop holds no scenes).
                 std::vector<int> fixed;
+                std::vector<std::size_t> scenes;
                 SeamWindow window = Read(win, 1, [&](const SeamWindow& allowed) {
                     fixed = Labels(allowed, win, held);
+                    scenes = allowed.scenes;
                     return Needed(allowed, fixed);
                 });
-                window.fixed = fixed.empty() ? Labels(window, win, held) : std::move(fixed);
+                window.fixed = !fixed.empty() && scenes == window.scenes
+                                   ? std::move(fixed)
+                                   : Labels(window, win, held);
                 Reach(window, win);
                 // The band starts from the coarse labels and may take only their scenes
                 // (and those that see what they do not).
