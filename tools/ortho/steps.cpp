@@ -364,6 +364,9 @@ std::array<long long, 2> CellOffset(const Grid& grid, const Grid& window) {
 
 bool ReadGrid(const std::string& path, Grid& grid) {
     ErrorCapture errors;
+    // The side files (world file, .aux.xml) looked for one by one: listing an output directory
+    // of hundreds of scene files costs more, once per raster checked.
+    CPLConfigOptionSetter byName("GDAL_DISABLE_READDIR_ON_OPEN", "TRUE", true);
     DatasetPtr dataset(
         GDALDataset::Open(path.c_str(), GDAL_OF_RASTER | GDAL_OF_READONLY, nullptr, nullptr));
     if (!dataset)
