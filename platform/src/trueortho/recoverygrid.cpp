@@ -116,14 +116,18 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
     // node of the cell is, or the cell is not flagged).
     std::vector<double> above(tw), below(tw);
     std::vector<unsigned char> unknown(tw);
-    int row = -1;
+    int row = -1, lo = 0, hi = 0;  // the columns of the flagged cells of the cell row
     for (int j = 0; j < th; ++j) {
         int b;
         double fy;
         cell(j, th, b, fy);
         if (b != row) {
             row = b;
-            for (int i = 0; i < tw; ++i) {
+            lo = tw, hi = 0;
+            for (int a = 0; a < cx; ++a)
+                if (flagged(a, b))
+                    lo = std::min(lo, a * kAngleStep), hi = std::min(tw, (a + 1) * kAngleStep);
+            for (int i = lo; i < hi; ++i) {
                 const double fx = fractions[i];
                 const size_t k = static_cast<size_t>(b) * nx + nodes[i];
                 const float q[4] = {lattice[k], lattice[k + 1], lattice[k + nx], lattice[k + nx + 1]};
@@ -134,7 +138,7 @@ void Angles(const RecoveryJob& job, const RecoveryGrid& grid, const RecoveryScen
             }
         }
         float* line = out.data() + static_cast<size_t>(j) * tw;
-        for (int i = 0; i < tw; ++i)
+        for (int i = lo; i < hi; ++i)
             if (!unknown[i])
                 line[i] = static_cast<float>((1 - fy) * above[i] + fy * below[i]);
     }
