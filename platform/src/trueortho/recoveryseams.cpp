@@ -87,6 +87,7 @@ class RecoverySeamSource : public SeamSource {
         // One scene at a time, in chunks of about 256 pixels across: the sums of its pixel costs
         // and brightness per cell go straight into its arrays.
         std::vector<Sums> sums;
+        std::vector<unsigned int> seen;  // per cell, the pixels the scene sees
         for (const size_t s : grid_.ScenesMeeting(at.in)) {
             Sums sum;
             sum.scene = s;
@@ -95,23 +96,26 @@ class RecoverySeamSource : public SeamSource {
                     return window;  // no scene: the run is being abandoned
                 if (!reader_.Read(s, part, whole, whole, scratch, tile))
                     continue;
-                if (sum.seen.empty())
-                    sum.seen.assign(at.cells, 0), sum.cost.assign(at.cells, 0.0f),
+                if (sum.cost.empty())
+                    seen.assign(at.cells, 0), sum.cost.assign(at.cells, 0.0f),
                         sum.grey.assign(at.cells, 0.0f);
-                Add(at, tile, part, part, true, whole, relief, {}, sum);
+                Add(at, tile, part, part, &seen, whole, relief, {}, sum);
                 if (!whole)
                     sum.states.emplace_back(part, tile.state);
             }
-            if (sum.seen.empty())
+            if (sum.cost.empty())
                 continue;
             sum.allowed.resize(at.cells);
             bool any = false;
             for (size_t c = 0; c < at.cells; ++c) {
-                sum.allowed[c] = sum.seen[c] > 0 && 2 * static_cast<size_t>(sum.seen[c]) >= at.total[c];
+                sum.allowed[c] = seen[c] > 0 && 2 * static_cast<size_t>(seen[c]) >= at.total[c];
                 any = any || sum.allowed[c];
             }
-            if (any)
-                sums.push_back(std::move(sum));
+            if (!any)
+                continue;
+            if (whole)
+                Finish(at, seen, {}, sum);
+            sums.push_back(std::move(sum));
         }
         std::vector<std::uint8_t> full;
         if (!whole) {
@@ -133,16 +137,9 @@ class RecoverySeamSource : public SeamSource {
                     return window;
         }
         for (Sums& sum : sums) {
-            for (size_t c = 0; c < at.cells; ++c) {
-                if (!sum.allowed[c]) {
-                    sum.cost[c] = kForbidden, sum.grey[c] = 0;
-                } else if (whole || full[c]) {
-                    sum.cost[c] = sum.cost[c] / sum.seen[c] +
-                                  kUnclearCost * static_cast<float>(at.total[c] - sum.seen[c]) /
-                                      at.total[c];
-                    sum.grey[c] /= sum.seen[c];
-                }
-            }
+            if (!whole)  // at full resolution a scene sees the one pixel of each cell it may take
+                Finish(at, std::vector<unsigned int>(sum.allowed.begin(), sum.allowed.end()),
+                       full, sum);
             window.scenes.push_back(sum.scene);
             window.cost.push_back(std::move(sum.cost));
             window.grey.push_back(std::move(sum.grey));
@@ -181,12 +178,11 @@ class RecoverySeamSource : public SeamSource {
         std::vector<unsigned int> total;  // per cell
     };
 
-    // One scene's pixels seen per cell, whether it may take each cell, the sums of the costs and
-    // brightness of the pixels it sees, and its pixel states over the chunks read (kept only to
-    // read the needed pixels after).
+    // One scene's window: whether it may take each cell, the sums of the costs and brightness of
+    // the pixels it sees (their means once finished), and its pixel states over the chunks read
+    // (kept only to read the needed pixels after).
     struct Sums {
         size_t scene = 0;
-        std::vector<unsigned int> seen;
         std::vector<std::uint8_t> allowed;
         std::vector<float> cost, grey;
         std::vector<std::pair<Rect, std::vector<unsigned char>>> states;
@@ -215,11 +211,11 @@ class RecoverySeamSource : public SeamSource {
     }
 
     // Adds the pixels of `part` that the scene sees (`tile` holds it over `read`, which holds
-    // `part`): their count per cell if `count`, and if `values` the sums of their costs and
-    // brightness in the cells `full` names (empty: all).
+    // `part`): their count per cell into `seen` if given, and if `values` the sums of their
+    // costs and brightness in the cells `full` names (empty: all).
     void Add(const Layout& at, const SceneTile& tile, const Rect& read, const Rect& part,
-             bool count, bool values, const Relief& relief, const std::vector<std::uint8_t>& full,
-             Sums& sum) const {
+             std::vector<unsigned int>* seen, bool values, const Relief& relief,
+             const std::vector<std::uint8_t>& full, Sums& sum) const {
         const int level = job_.scenes[sum.scene].radiometricLevel;
         std::vector<size_t> column(static_cast<size_t>(part.width));  // per pixel, its cell's
         for (int i = 0; i < part.width; ++i)
@@ -233,8 +229,8 @@ class RecoverySeamSource : public SeamSource {
                 if (tile.state[p] == kNotSeen)
                     continue;
                 const size_t c = row + column[i];
-                if (count)
-                    ++sum.seen[c];
+                if (seen != nullptr)
+                    ++(*seen)[c];
                 if (!values || (!full.empty() && !full[c]))
                     continue;
                 sum.cost[c] += PixelCost(tile, p, level, relief.rise[c] <= kExposedRise);
@@ -243,6 +239,22 @@ class RecoverySeamSource : public SeamSource {
                     grey += fit_.gain[sum.scene][b] * tile.values[read.Size() * b + p] +
                             fit_.offset[sum.scene][b];
                 sum.grey[c] += static_cast<float>(grey / grid_.bands);
+            }
+        }
+    }
+
+    // The scene's cells from its sums and the pixels it sees of each (`seen`): kForbidden where
+    // it may not take the cell; else, in the cells `full` names (empty: all), the mean pixel cost
+    // plus kUnclearCost times the share it does not see, and the mean brightness.
+    static void Finish(const Layout& at, const std::vector<unsigned int>& seen,
+                       const std::vector<std::uint8_t>& full, Sums& sum) {
+        for (size_t c = 0; c < at.cells; ++c) {
+            if (!sum.allowed[c]) {
+                sum.cost[c] = kForbidden, sum.grey[c] = 0;
+            } else if (full.empty() || full[c]) {
+                sum.cost[c] = sum.cost[c] / seen[c] +
+                              kUnclearCost * static_cast<float>(at.total[c] - seen[c]) / at.total[c];
+                sum.grey[c] /= seen[c];
             }
         }
     }
@@ -286,7 +298,7 @@ class RecoverySeamSource : public SeamSource {
                             tile.state.begin() + static_cast<std::ptrdiff_t>(to));
             }
             reader_.ReadValues(sum.scene, box, tile.values);
-            Add(at, tile, box, box, false, true, relief, full, sum);
+            Add(at, tile, box, box, nullptr, true, relief, full, sum);
         }
         return true;
     }
