@@ -245,7 +245,8 @@ struct FootprintLayer {
 void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid,
                      const std::string& path);
 
-// A PNG picture of a raster for people to look at, at most 2048 pixels wide.
+// A PNG picture of a raster for people to look at, at most 2048 pixels on the long side: the
+// size of the raster's largest overview that fits, when it has overviews.
 enum class Quicklook { Image, Visibility, SourceIndex };
 // Each quicklook has a world file beside it (NAME.pgw); an image's bands share one stretch.
 void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook kind);
