@@ -1326,13 +1326,15 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     if (!source)
         FailFile(raster, "cannot be opened", errors);
     const int width = source->GetRasterXSize(), height = source->GetRasterYSize();
-    // At most kQuicklookSide pixels on the long side: the size of the raster's largest overview
-    // that fits, when it has one (GDAL then reads that overview alone), else read decimated.
+    // A raster of at most kQuicklookSide / 2 pixels on the long side is drawn whole; a larger
+    // one at the size of its largest overview of at most kQuicklookSide (GDAL then reads that
+    // overview alone: the raster itself is the full-resolution picture), or without one read
+    // decimated to kQuicklookSide.
     constexpr int kQuicklookSide = 2048;
     const double shrink = std::max(1.0, std::max(width, height) / double{kQuicklookSide});
     int outWidth = std::max(1, static_cast<int>(width / shrink));
     int outHeight = std::max(1, static_cast<int>(height / shrink));
-    if (shrink > 1.0 && source->GetRasterCount() > 0) {
+    if (std::max(width, height) > kQuicklookSide / 2 && source->GetRasterCount() > 0) {
         GDALRasterBand* first = source->GetRasterBand(1);
         for (int k = 0; k < first->GetOverviewCount(); ++k) {
             GDALRasterBand* overview = first->GetOverview(k);
