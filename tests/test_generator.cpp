@@ -387,7 +387,7 @@ struct Cancelling {
         auto* self = static_cast<Cancelling*>(data);
         ++self->calls;
         if (fraction > 0)
-            *self->flag = true;
+            testsupport::RaiseCancelFlag(self->flag);
         return fraction == 0 || self->answer;
     }
 };

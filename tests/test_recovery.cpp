@@ -344,12 +344,7 @@ TEST_F(OppositeViews, CancelWhileSeamsReadHeightsStopsAtTheSlice) {
             GridSurface::GetHeights(n, x, y, h);
             if (n > 1 && ++reads >= cancelAt && cancelAt > 0) {  // not a view angle's point
                 cells += n;
-                // The process's cancel flag is a plain bool, read by the run atomically.
-#if defined(__GNUC__) || defined(__clang__)
-                __atomic_store_n(flag, true, __ATOMIC_RELAXED);
-#else
-                *static_cast<volatile bool*>(flag) = true;
-#endif
+                testsupport::RaiseCancelFlag(flag);
             }
         }
     } heights(dir->File("dsm.tif"));
