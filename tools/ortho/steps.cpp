@@ -1326,10 +1326,25 @@ void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook
     if (!source)
         FailFile(raster, "cannot be opened", errors);
     const int width = source->GetRasterXSize(), height = source->GetRasterYSize();
-    // At most 2048 pixels on the long side, read decimated.
-    const double shrink = std::max(1.0, std::max(width, height) / 2048.0);
-    const int outWidth = std::max(1, static_cast<int>(width / shrink));
-    const int outHeight = std::max(1, static_cast<int>(height / shrink));
+    // A raster of at most kQuicklookSide / 2 pixels on the long side is drawn whole; a larger
+    // one at the size of its largest overview of at most kQuicklookSide (GDAL then reads that
+    // overview alone: the raster itself is the full-resolution picture), or without one read
+    // decimated to kQuicklookSide.
+    constexpr int kQuicklookSide = 2048;
+    const double shrink = std::max(1.0, std::max(width, height) / double{kQuicklookSide});
+    int outWidth = std::max(1, static_cast<int>(width / shrink));
+    int outHeight = std::max(1, static_cast<int>(height / shrink));
+    if (std::max(width, height) > kQuicklookSide / 2 && source->GetRasterCount() > 0) {
+        GDALRasterBand* first = source->GetRasterBand(1);
+        for (int k = 0; k < first->GetOverviewCount(); ++k) {
+            GDALRasterBand* overview = first->GetOverview(k);
+            if (overview != nullptr &&
+                std::max(overview->GetXSize(), overview->GetYSize()) <= kQuicklookSide) {
+                outWidth = overview->GetXSize(), outHeight = overview->GetYSize();
+                break;
+            }
+        }
+    }
     const int bands = kind == Quicklook::Image ? std::min(3, source->GetRasterCount()) : 1;
 
     // The picture is drawn in strips of rows (read from the raster at the picture's scale), so

@@ -245,7 +245,9 @@ struct FootprintLayer {
 void MergeFootprints(const std::vector<FootprintLayer>& layers, const Grid& grid,
                      const std::string& path);
 
-// A PNG picture of a raster for people to look at, at most 2048 pixels wide.
+// A PNG picture of a raster for people to look at: up to 1024 pixels on the long side the
+// raster's size; above, the size of its largest overview of at most 2048, or without one the
+// raster's shrunk to 2048.
 enum class Quicklook { Image, Visibility, SourceIndex };
 // Each quicklook has a world file beside it (NAME.pgw); an image's bands share one stretch.
 void WriteQuicklook(const std::string& raster, const std::string& png, Quicklook kind);
