@@ -13,6 +13,7 @@
 #include <gdal_utils.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cmath>
 #include <filesystem>
 #include <memory>
@@ -334,12 +335,19 @@ TEST_F(OppositeViews, CancelWhileSeamsReadHeightsStopsAtTheSlice) {
         using GridSurface::GridSurface;
         bool* flag = nullptr;
         std::size_t cancelAt = 0;  // reads of several heights before cancelling; 0: never
-        mutable std::size_t reads = 0, cells = 0;
+        mutable std::atomic<std::size_t> reads{0}, cells{0};  // asked from the seam threads
         void GetHeights(std::size_t n, const double* x, const double* y,
                         double* h) const override {
             GridSurface::GetHeights(n, x, y, h);
-            if (n > 1 && ++reads >= cancelAt && cancelAt > 0)  // not a view angle's point
-                cells += n, *flag = true;
+            if (n > 1 && ++reads >= cancelAt && cancelAt > 0) {  // not a view angle's point
+                cells += n;
+                // The process's cancel flag is a plain bool, read by the run atomically.
+#if defined(__GNUC__) || defined(__clang__)
+                __atomic_store_n(flag, true, __ATOMIC_RELAXED);
+#else
+                *static_cast<volatile bool*>(flag) = true;
+#endif
+            }
         }
     } heights(dir->File("dsm.tif"));
     RecoveryJob job = Job(1, 1, 1, true);
@@ -348,7 +356,7 @@ TEST_F(OppositeViews, CancelWhileSeamsReadHeightsStopsAtTheSlice) {
     bool cancel = false;
     heights.flag = &cancel;
     ASSERT_TRUE(OcclusionRecovery().Recover(job).completed);
-    const std::size_t all = heights.reads;
+    const std::size_t all = heights.reads.load();
     for (const std::size_t at : {std::size_t{1}, all}) {
         SCOPED_TRACE(::testing::Message() << "cancelled at read " << at << " of " << all);
         cancel = false;
