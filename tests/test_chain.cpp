@@ -54,7 +54,9 @@ struct Chain {
 
 }  // namespace
 
-TEST(FileChain, PreparationFileReadsBackTypedWithDefaultsForEmptyColumns) {
+// The preparation file reads back typed, with the process's defaults for empty columns; the
+// image-set file without the preparation lines, with the default pixel error.
+TEST(FileChain, DerivedFilesReadBackTypedWithDefaultsForEmptyColumns) {
     Chain chain;
     std::vector<unsigned int> dbic{9};
     std::vector<int> dbiw{-1, 8};
@@ -80,10 +82,6 @@ TEST(FileChain, PreparationFileReadsBackTypedWithDefaultsForEmptyColumns) {
         EXPECT_EQ(prep->GetSrcBgd(), lines[i].srcBgd);
         EXPECT_EQ(prep->GetEdgeClip(), lines[i].edgeClip);
     }
-}
-
-TEST(FileChain, ImgSetFileReadsBackWithoutPreparationLines) {
-    Chain chain;
     std::unique_ptr<TOImgSetParser> imgset(
         ParserFactory::CreateImgSetParser(chain.imgset, RadioDifHigh, 5));
     ASSERT_EQ(imgset->GetMfileLines(), 2u);

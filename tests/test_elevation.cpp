@@ -228,7 +228,9 @@ TEST(ElUnits, MultipliesByTheFactorOfTheUpperCasedUnit) {
     EXPECT_EQ(scale, 2.0);
 }
 
-TEST_F(Factories, EmptyDemPathRefusedBeforeAnyFactory) {
+// An empty DEM path is refused before any factory call; a missing one is not found after the
+// tiled test.
+TEST_F(Factories, EmptyOrMissingDemPathIsRefused) {
     DatumType datum = DatumMSL;
     if (const auto e = testsupport::Thrown<kestrel::ParameterException>(
             [&] { delete GetDem("", 1, 0, 1, 0, datum, DatumEllipsoid); })) {
@@ -241,11 +243,8 @@ TEST_F(Factories, EmptyDemPathRefusedBeforeAnyFactory) {
         EXPECT_EQ(e->GetSourceFile(), "utils.cpp");
     }
     EXPECT_TRUE(dems->calls.empty());
-}
 
-TEST_F(Factories, MissingDemPathIsNotFoundAfterTheTiledTest) {
     const std::string path = dir.File("none.tif");
-    DatumType datum = DatumMSL;
     if (const auto e = testsupport::Thrown<kestrel::FileNotFoundException>(
             [&] { delete GetDem(path, 1, 0, 1, 0, datum, DatumEllipsoid); })) {
         EXPECT_EQ(e->GetFileName(), path);

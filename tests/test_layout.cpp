@@ -21,6 +21,7 @@
 #include <silvan/utils.h>
 
 #include "rpcscene.h"
+#include "surface.h"
 #include "samplecity.h"
 #include "program.h"
 
@@ -28,6 +29,7 @@
 using kestrel::ogc::cs::GeocodingInfo;
 using kestrel::ogc::cs::ICRS;
 using kestrel::tin::Polygon;
+using testsupport::FunctionSurface;
 using testsupport::RunCommand;
 using testsupport::TempDir;
 
@@ -294,38 +296,8 @@ TEST(OrthoMetadataTransfer, CopiesMetadataDescriptionsColoursAndSetsNoData) {
 
 namespace {
 
-// Terrain given by a function over a box in UTM 32N, ellipsoidal heights; NaN outside.
-class FunctionTerrain final : public kestrel::dem::IElevationSource {
-  public:
-    FunctionTerrain(double (*height)(double, double), double minX, double minY, double maxX,
-                    double maxY)
-        : height_(height), crs_("EPSG:32632"), box_{minX, minY, maxX, maxY} {}
-    void SetOutputVerticalDatum(kestrel::ogc::cs::DatumType) override {}
-    kestrel::ogc::cs::DatumType GetOutputVerticalDatum() const override {
-        return kestrel::ogc::cs::DatumEllipsoid;
-    }
-    const ICRS* GetCRS() const override { return &crs_; }
-    void GetExtent(double& minX, double& minY, double& maxX, double& maxY) const override {
-        minX = box_[0], minY = box_[1], maxX = box_[2], maxY = box_[3];
-    }
-    void SetInputCRS(const ICRS*) override {}
-    void GetHeights(std::size_t n, const double* x, const double* y,
-                    double* heights) const override {
-        for (std::size_t i = 0; i < n; ++i) {
-            const bool inside =
-                x[i] >= box_[0] && x[i] <= box_[2] && y[i] >= box_[1] && y[i] <= box_[3];
-            heights[i] = inside ? height_(x[i], y[i]) : NAN;
-        }
-    }
-
-  private:
-    double (*height_)(double, double);
-    ICRS crs_;
-    double box_[4];
-};
-
-FunctionTerrain SceneHills() {
-    return FunctionTerrain(&rpcscene::Hills, rpcscene::kDemLeft,
+FunctionSurface SceneHills() {
+    return FunctionSurface(&rpcscene::Hills, rpcscene::kDemLeft,
                            rpcscene::kDemTop - rpcscene::kDemSize,
                            rpcscene::kDemLeft + rpcscene::kDemSize, rpcscene::kDemTop);
 }
@@ -419,7 +391,7 @@ TEST(Layout, PartialTerrainCutsTheSceneAndTooLittleIsRefused) {
     };
     const kestrel::orthoutils::LayoutRequest plain;
     // The scene's centre is near (514900, 5034000).
-    const FunctionTerrain terrain = SceneHills();
+    const FunctionSurface terrain = SceneHills();
     const kestrel::orthoutils::Layout whole =
         kestrel::orthoutils::ComputeLayout(*model, &terrain, plain);
     EXPECT_EQ(whole.uncoveredShare, 0.0);
@@ -432,7 +404,7 @@ TEST(Layout, PartialTerrainCutsTheSceneAndTooLittleIsRefused) {
                     0.0, 1e-6);
     const auto xs = std::minmax_element(whole.borderX.begin(), whole.borderX.end());
     const double west = *xs.first, east = *xs.second;
-    const FunctionTerrain half(&rpcscene::Hills, 511000, 5030000, (west + east) / 2, 5038000);
+    const FunctionSurface half(&rpcscene::Hills, 511000, 5030000, (west + east) / 2, 5038000);
     const kestrel::orthoutils::Layout cut =
         kestrel::orthoutils::ComputeLayout(*model, &half, plain);
     EXPECT_NEAR(cut.uncoveredShare, 0.5, 0.1);
@@ -440,10 +412,10 @@ TEST(Layout, PartialTerrainCutsTheSceneAndTooLittleIsRefused) {
         EXPECT_LE(x, (west + east) / 2 + 1e-6);
     EXPECT_NEAR(cut.geocoding.GetGeoTransform()[0], whole.geocoding.GetGeoTransform()[0], 2.0);
     EXPECT_LT(cut.pixels, whole.pixels * 0.6);
-    const FunctionTerrain sliver(&rpcscene::Hills, 511000, 5030000, west + (east - west) * 0.01,
+    const FunctionSurface sliver(&rpcscene::Hills, 511000, 5030000, west + (east - west) * 0.01,
                                  5038000);
     expectMessage(&sliver, plain, "% of the scene's ground, under the 2 % needed");
-    const FunctionTerrain far(&rpcscene::Hills, 600000, 5030000, 608000, 5038000);
+    const FunctionSurface far(&rpcscene::Hills, 600000, 5030000, 608000, 5038000);
     expectMessage(&far, plain, "miss the DEM entirely");
 
     kestrel::orthoutils::LayoutRequest request;
@@ -467,7 +439,7 @@ TEST(Layout, PlumbCentreRayOfANadirCameraMeetsTheTerrain) {
     pose.centre = {514845, 5033745, 340.225};
     pose.rotation = {6.123233995736766e-17, -1, 0, -1, -6.123233995736766e-17, 0, 0, 0, -1};
     const auto model = kestrel::mathmodel::MakeFrameCameraModel(lens, pose, "nadir");
-    const FunctionTerrain flat([](double, double) { return 250.0; }, 514700, 5033600, 515000,
+    const FunctionSurface flat([](double, double) { return 250.0; }, 514700, 5033600, 515000,
                                5033900);
     const auto layout = kestrel::orthoutils::ComputeLayout(*model, &flat, {});
     const auto xs = std::minmax_element(layout.borderX.begin(), layout.borderX.end());

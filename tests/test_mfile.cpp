@@ -96,7 +96,7 @@ TEST(MFileTable, FieldsAndListsReadAsWritten) {
     EXPECT_EQ(Read(WriteFile(dir.File("e.txt"), ""))->GetLineCount(), 0u);
 }
 
-TEST(MFileTable, MissingOrEmptyFieldsReadAsTypedDefaults) {
+TEST(MFileTable, MissingOrEmptyFieldsReadAsTypedDefaultsOrAreRefusedWithout) {
     TempDir dir;
     auto table = Read(WriteFile(dir.File("m.txt"), "only\na;;\n"));
     table->AddDefaultString("name");
@@ -110,6 +110,17 @@ TEST(MFileTable, MissingOrEmptyFieldsReadAsTypedDefaults) {
     EXPECT_EQ(table->GetString(0, 0), "only");
     table->AddDefaultIntList({});
     EXPECT_TRUE(table->GetIntList(0, 3).empty());
+
+    // No silent 0 or empty text: a value that is missing without a default, or empty with a
+    // text default, is refused like a bad one.
+    auto bare = Read(WriteFile(dir.File("bare.txt"), "a;\n"));
+    EXPECT_THROW(bare->GetString(0, 1), DataException);
+    bare->AddDefaultString("");
+    bare->AddDefaultString("");
+    EXPECT_THROW(bare->GetInt(0, 1), DataException);
+    EXPECT_THROW(bare->GetString(0, 2), DataException);
+    EXPECT_THROW(bare->GetString(1, 0), DataException);
+    EXPECT_THROW(bare->GetString(0, -1), DataException);
 }
 
 // A value that is not of the asked type is refused with the file, line in the file and column.
@@ -143,20 +154,6 @@ TEST(MFileTable, BadValuesNameFileLineAndColumn) {
             EXPECT_TRUE(Contains(e->GetFunction(), "GetInt"));
         }
     }
-}
-
-// No silent 0 or empty text: a value that is missing without a default, or empty with a text
-// default, is refused like a bad one.
-TEST(MFileTable, MissingValuesWithoutUsableDefaultAreRefused) {
-    TempDir dir;
-    auto table = Read(WriteFile(dir.File("m.txt"), "a;\n"));
-    EXPECT_THROW(table->GetString(0, 1), DataException);
-    table->AddDefaultString("");
-    table->AddDefaultString("");
-    EXPECT_THROW(table->GetInt(0, 1), DataException);
-    EXPECT_THROW(table->GetString(0, 2), DataException);
-    EXPECT_THROW(table->GetString(1, 0), DataException);
-    EXPECT_THROW(table->GetString(0, -1), DataException);
 }
 
 TEST(MFileTable, UnreadableFilesGiveNoTableAndTooLargeOnesAreRefused) {

@@ -53,7 +53,7 @@ TEST(ProcOption, EveryFormGivesStrategyNumbersAndDevices) {
     EXPECT_EQ(Show("GPU:count=2;streams=3;threads=5"), "GPU 5 3 2 []");
 }
 
-TEST(ProcOption, UnreadableTextQuotesItListsFormsAndLeavesOutputsAlone) {
+TEST(ProcOption, UnreadableTextIsQuotedWholeAndLeavesOutputsAlone) {
     for (const std::string text :
          {"FPGA", "CPU:", "CPU:-1", "CPU:+4", "CPU:4x", "CPU:4;", "CPU:4;threads=2",
           "CPU:2147483648", "CPU:streams=2", "AUTO:count=1", "CPU:0,1", "GPU:0,,1", "GPU:1,1",
@@ -74,10 +74,7 @@ TEST(ProcOption, UnreadableTextQuotesItListsFormsAndLeavesOutputsAlone) {
         EXPECT_EQ(p.first, 99);
         EXPECT_EQ(p.list, std::vector<int>{99});
     }
-}
-
-// The message shows the whole text, a NUL or other control byte included.
-TEST(ProcOption, MessageShowsControlBytesOfTheText) {
+    // The message shows the whole text, a NUL or other control byte included.
     const std::string message =
         testsupport::ThrownMessage<DataException>([] { Read(std::string("CPU:4\0x\n", 8)); });
     EXPECT_TRUE(testsupport::Contains(message, "\"CPU:4\\x00x\\x0A\"")) << message;

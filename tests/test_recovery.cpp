@@ -317,12 +317,9 @@ TEST_F(OppositeViews, CancelledOrRefusedRunsLeaveNoOutput) {
     RecoveryJob job = Job(1, 1, 1, false);
     job.scenes[1].orthoPath = dir->File("dsm.tif");
     job.scenes[1].visibilityPath = dir->File("dsm.tif");
-    try {
-        OcclusionRecovery().Recover(job);
-        ADD_FAILURE() << "no exception";
-    } catch (const kestrel::DataException& e) {
-        EXPECT_NE(std::string(e.what()).find("dsm.tif"), std::string::npos) << e.what();
-    }
+    const std::string refused = testsupport::ThrownMessage<kestrel::DataException>(
+        [&] { OcclusionRecovery().Recover(job); });
+    EXPECT_TRUE(testsupport::Contains(refused, "dsm.tif")) << refused;
     for (const char* name :
          {"mosaic.tif", "source.tif", "mosaic.tif.partial", "source.tif.partial"})
         EXPECT_FALSE(std::filesystem::exists(dir->File(name))) << name;
@@ -608,14 +605,11 @@ TEST(RecoveryWindows, ScenesOnWindowsGiveTheMosaicOfTheScenesPaddedToTheGrid) {
 
     synthetic::WriteBand(dir.File("shifted.tif"), visibility[1], windows[1], 0.25);
     cropped.scenes[1].orthoPath = dir.File("shifted.tif");
-    try {
-        OcclusionRecovery().Recover(cropped);
-        ADD_FAILURE() << "no exception";
-    } catch (const kestrel::DataException& e) {
-        const std::string what = e.what();
-        EXPECT_NE(what.find("shifted.tif"), std::string::npos) << what;
-        EXPECT_NE(what.find("scene0_window_ortho.tif"), std::string::npos) << what;
-    }
+    const std::string what = testsupport::ThrownMessage<kestrel::DataException>(
+        [&] { OcclusionRecovery().Recover(cropped); });
+    EXPECT_TRUE(testsupport::Contains(what, "shifted.tif") &&
+                testsupport::Contains(what, "scene0_window_ortho.tif"))
+        << what;
 }
 
 // A regions raster names each pixel's scene; where that scene does not see the pixel, and where
@@ -647,14 +641,9 @@ TEST(RecoveryRegions, TheRegionsRasterChoosesWhereItsSceneSees) {
 
     regions[30 * synthetic::kWidth + 7] = 4;
     synthetic::WriteBand(dir.File("regions.tif"), regions);
-    try {
-        OcclusionRecovery().Recover(job);
-        ADD_FAILURE() << "no exception";
-    } catch (const kestrel::DataException& e) {
-        EXPECT_NE(std::string(e.what()).find("regions.tif holds 4 at pixel 7, line 30"),
-                  std::string::npos)
-            << e.what();
-    }
+    const std::string what = testsupport::ThrownMessage<kestrel::DataException>(
+        [&] { OcclusionRecovery().Recover(job); });
+    EXPECT_TRUE(testsupport::Contains(what, "regions.tif holds 4 at pixel 7, line 30")) << what;
 
     // Scene 1 sees every pixel and holds the region left of pixel 40; the mask leaves out the
     // rest: each 16-pixel tile reads scene 1 alone, or nothing where it is all masked out.

@@ -161,16 +161,14 @@ TEST_F(SceneRead, EachMissingRequiredElementOrPointlessFootprintIsReported) {
             e.footprint = "<SceneFootprint></SceneFootprint>";
         const std::string path = Put("s.xml", e.Document());
         TOSceneParser scene;
-        try {
-            ReadInto(scene, path);
-            ADD_FAILURE() << "read without error, case " << missing;
-        } catch (const FileAccessException& err) {
-            EXPECT_EQ(err.GetErrorMessage(),
+        if (const auto err = testsupport::Thrown<FileAccessException>(
+                [&] { ReadInto(scene, path); }, "case " + std::to_string(missing))) {
+            EXPECT_EQ(err->GetErrorMessage(),
                       " Error in parsing " + path + " XML file. Some tags are missing.\n");
-            EXPECT_EQ(err.GetFileName(), "");
-            EXPECT_EQ(static_cast<int>(err.GetType()), 1);
+            EXPECT_EQ(err->GetFileName(), "");
+            EXPECT_EQ(static_cast<int>(err->GetType()), 1);
             testsupport::ExpectThrownFrom(
-                err, "virtual void kestrel::processes::silvan::TOSceneParser::ReadXMLFile()",
+                *err, "virtual void kestrel::processes::silvan::TOSceneParser::ReadXMLFile()",
                 "tosceneparser.cpp");
         }
         // Reading stops at the gap; a footprint without points is kept as an empty polygon.

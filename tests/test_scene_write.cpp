@@ -207,21 +207,18 @@ TEST_F(SceneWrite, DtdIsWrittenExactlyBesideTheXmlFileUnlessPresent) {
     EXPECT_EQ(ReadFile(dtd), "mine\n");
 }
 
-// A scene that cannot be written leaves no DTD behind, and the previous file as it was.
-TEST_F(SceneWrite, FailedWritingLeavesNoDtd) {
+// A scene that cannot be written leaves no DTD behind, and the previous file as it was; a DTD
+// that cannot be created is reported.
+TEST_F(SceneWrite, FailedWritingLeavesNoDtdAndAnUncreatableDtdIsReported) {
     TOSceneParser scene;
     Fill(scene);
     std::filesystem::create_directory(dir.File("s.xml"));  // the XML file cannot be made
     EXPECT_THROW(Write(scene, dir.File("s.xml")), FileAccessException);
     EXPECT_FALSE(std::filesystem::exists(dir.File("TOSceneDesc_Document.dtd")));
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path()), {}), 1);
-}
 
-TEST_F(SceneWrite, DtdThatCannotBeCreatedIsReported) {
     const std::string directory = dir.File("missing") + "/";
     const std::string dtd = directory + "TOSceneDesc_Document.dtd";
-    TOSceneParser scene;
-    Fill(scene);
     if (const auto e =
             testsupport::Thrown<FileAccessException>([&] { Write(scene, directory + "s.xml"); })) {
         EXPECT_EQ(e->GetFileName(), dtd);

@@ -167,7 +167,7 @@ TEST(MaxFlow, CutsAsLittleAsAugmentingPathsOnGrids) {
     }
 }
 
-TEST(SolveSeams, MinimalEnergyAgainstBruteForce) {
+TEST(SolveSeams, MinimalEnergyAgainstBruteForceAndWindowsThatDoNotFitAreRefused) {
     struct Case {
         int width, height, scenes;
         bool fixed;
@@ -201,9 +201,7 @@ TEST(SolveSeams, MinimalEnergyAgainstBruteForce) {
                     energy - tolerance)
                     << "expanding " << alpha;
         }
-}
-
-TEST(SolveSeams, RejectsWindowsWhoseArraysDoNotFit) {
+    // Windows whose arrays do not fit, or whose fixed cells name no scene, are refused.
     SeamWindow w = RandomWindow(1, 4, 4, 2, false);
     w.cost[1].pop_back();
     EXPECT_THROW(SolveSeams(w, SeamParams{}), kestrel::DataException);

@@ -178,7 +178,12 @@ TEST(ProcessBaseBuiltIn, WithoutGraphicsProcessorEveryTextGivesCentralProcessorG
     }
 }
 
+// No generator obtained names the PROC text; an unreadable one is refused before any factory
+// call.
 TEST_F(ProcessBase, NoGeneratorObtainedNamesTheProcText) {
+    process.SetProc("GPU:x");
+    EXPECT_THROW(delete process.CreateTorthoGenerator(), DataException);
+    EXPECT_TRUE(factory->calls.empty());
     factory->nulls = {"CreateCudaGenerator", "CreateCPUGenerator", "CreateGenerator"};
     const std::pair<const char*, std::size_t> cases[] = {{"GPU:1", 2}, {"CPU", 1}, {"", 1}};
     for (const auto& c : cases) {
@@ -210,10 +215,4 @@ TEST_F(ProcessBase, GeneratorOfWrongKindIsReleasedAndRefused) {
         }
         EXPECT_EQ(liveGenerators, 0);
     }
-}
-
-TEST_F(ProcessBase, UnreadableProcTextIsRefusedBeforeAnyFactoryCall) {
-    process.SetProc("GPU:x");
-    EXPECT_THROW(delete process.CreateTorthoGenerator(), DataException);
-    EXPECT_TRUE(factory->calls.empty());
 }
