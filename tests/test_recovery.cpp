@@ -517,11 +517,13 @@ TEST(RecoveryChoice, PixelErrorNeighbourhoodMatchesTheRuleAtEveryPixel) {
 
 // Many scenes on many threads under a small limit of open files, and a thread count far beyond
 // the work: the threads share each scene's rasters, more scenes than stay open at once (closed
-// and opened again as tiles need them), and threads are capped by the tiles.
+// and opened again as tiles need them), and threads are capped by the tiles. The mosaic, a COG
+// compressed on the run's threads, is the same file on one thread.
 TEST(RecoveryChoice, ThreadsShareEachScenesFilesAndAreCappedByTheWork) {
     TempDir dir;
     std::vector<std::vector<unsigned char>> visibility;
-    const RecoveryJob job = synthetic::MakeScenes(dir, 70, 0.01, 7, visibility);
+    RecoveryJob job = synthetic::MakeScenes(dir, 70, 0.01, 7, visibility);
+    job.format = "COG";
     const auto expected = synthetic::ExpectedSource(job, visibility);
 #if !defined(_WIN32)
     rlimit saved{};
@@ -530,13 +532,19 @@ TEST(RecoveryChoice, ThreadsShareEachScenesFilesAndAreCappedByTheWork) {
     limited.rlim_cur = std::min<rlim_t>(saved.rlim_cur, 1024);
     ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &limited), 0);
 #endif
-    for (const unsigned int threads : {16u, 4000000000u}) {
+    std::string oneThread;
+    for (const unsigned int threads : {1u, 16u, 4000000000u}) {
         SCOPED_TRACE(threads);
         GeneratorSettings settings;
         settings.threadCount = threads;
         std::filesystem::remove(job.sourcePath);
+        std::filesystem::remove(job.mosaicPath);
         EXPECT_TRUE(OcclusionRecovery(settings).Recover(job).completed);
         EXPECT_EQ(ReadBand(job.sourcePath), expected);
+        const std::string mosaic = testsupport::ReadFile(job.mosaicPath);
+        if (threads == 1)
+            oneThread = mosaic;
+        EXPECT_TRUE(mosaic == oneThread);
     }
 #if !defined(_WIN32)
     setrlimit(RLIMIT_NOFILE, &saved);

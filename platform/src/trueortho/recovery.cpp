@@ -597,12 +597,16 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
 
     // 3. The composition, tile by tile.
     const bool cog = job.format == "COG";
-    auto mosaic = OutputWriter(job.mosaicPath, job.format, job.mosaicOptions, grid, grid.bands,
-                               grid.type, grid.hasNoData ? grid.noData : 0.0);
+    // A COG's tiles are compressed on the run's threads (the same bytes as on one), unless the
+    // job's options say otherwise (later options win).
+    const std::string threaded = cog ? FormatString("NUM_THREADS=%u ", threads) : std::string();
+    auto mosaic = OutputWriter(job.mosaicPath, job.format, threaded + job.mosaicOptions, grid,
+                               grid.bands, grid.type, grid.hasNoData ? grid.noData : 0.0);
     if (cog)
         mosaic->SetNoDataAsMask();
-    auto source = OutputWriter(job.sourcePath, job.format, cog ? "OVERVIEW_RESAMPLING=NEAREST" : "",
-                               grid, 1, job.scenes.size() < 255 ? GDT_Byte : GDT_UInt16, 0.0);
+    auto source = OutputWriter(job.sourcePath, job.format,
+                               cog ? threaded + "OVERVIEW_RESAMPLING=NEAREST" : "", grid, 1,
+                               job.scenes.size() < 255 ? GDT_Byte : GDT_UInt16, 0.0);
     const trueortho::BlendMode blend = job.blend == RecoveryJob::Blend::Multiband
                                            ? trueortho::BlendMode::Multiband
                                            : trueortho::BlendMode::Feather;
