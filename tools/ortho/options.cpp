@@ -317,7 +317,7 @@ Mosaic (only the mosaic is made again when these change):
                       over the whole mosaic that keep off raised objects and colour edges;
                       pixel, each pixel from the scene that sees it best (clear view, lower
                       radiometric level, line of sight nearer the vertical), with no seams to
-                      solve: some half of the mosaic step's time, seams wherever the choice
+                      solve: under half of the mosaic step's time, seams wherever the choice
                       changes
   --blend-width N     blend the two scenes across each seam over N mosaic pixels (default 16;
                       0: hard seams; at most 4096)
