@@ -44,7 +44,6 @@ struct Composition {
     datasources::BasicWriter *mosaic = nullptr, *source = nullptr;
     // Every scene and the mosaic are Byte: hard seams go from byte to byte (HardSeamBytes).
     bool bytes = false;
-    std::vector<int> channels;  // 1 to the grid's band count
     unsigned char noDataByte = 0;  // the no-data value as the mosaic's Byte band holds it
 };
 
@@ -213,15 +212,11 @@ void HardSeamBytes(const Composition& c, Worker& w, const Rect& t, const Rect& r
             continue;  // its region lies in the border only
         const size_t s = scenes[u];
         const Rect read{r.x + box.x, r.y + box.y, box.width, box.height};
-        bytes.resize(read.Size() * bands);
-        c.grid.orthos[s]->Read(c.channels.data(), bands, read, GDT_Byte, bytes.data());
+        c.reader.ReadBytes(s, read, bytes);
         for (int b = 0; b < bands; ++b) {
-            const double gain = c.fit.gain[s][b], offset = c.fit.offset[s][b];
-            const bool balanced = !(gain == 1 && offset == 0);
-            for (int v = 0; v < 256; ++v)
-                values[v] = c.range.Besides(
-                    c.range(balanced ? c.range(gain * v + offset) : static_cast<float>(v)),
-                    c.grid.noData);
+            c.range.BalancedBytes(c.fit.gain[s][b], c.fit.offset[s][b], values);
+            for (float& v : values)
+                v = c.range.Besides(c.range(v), c.grid.noData);
             ToBytes(values, table, 256);
             for (int j = 0; j < read.height; ++j) {
                 const int* label =
@@ -409,13 +404,7 @@ void Compose(const Composition& c, Worker& w, const Rect& t, const RunControl& c
     }
     Rect any{};  // the boxes' bounding box
     for (const Rect& box : w.boxes)
-        if (!box.Empty())
-            any = any.Empty() ? box
-                              : Rect{std::min(any.x, box.x), std::min(any.y, box.y),
-                                     std::max(any.x + any.width, box.x + box.width) -
-                                         std::min(any.x, box.x),
-                                     std::max(any.y + any.height, box.y + box.height) -
-                                         std::min(any.y, box.y)};
+        any = any.Union(box);
     w.clear.assign(size, 0);
     for (size_t k = 0; k < n; ++k)
         if (w.slot[k] >= 0)
@@ -613,9 +602,6 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
     bool bytes = grid.type == GDT_Byte;
     for (const auto& ortho : grid.orthos)
         bytes = bytes && ortho->type == GDT_Byte;
-    std::vector<int> channels(grid.bands);
-    for (int b = 0; b < grid.bands; ++b)
-        channels[b] = b + 1;
     const float noData = static_cast<float>(grid.noData);
     unsigned char noDataByte = 0;
     ToBytes(&noData, &noDataByte, 1);
@@ -631,7 +617,6 @@ TorthoRecoveryResult OcclusionRecovery::Recover(const RecoveryJob& job) {
                                   mosaic.get(),
                                   source.get(),
                                   bytes,
-                                  channels,
                                   noDataByte};
     control.SetSpan(0.6, 0.4);
     std::vector<TorthoRecoveryResult> counts(threads);

@@ -163,6 +163,16 @@ Rect Rect::Intersect(const Rect& o) const {
     return {x0, y0, std::max(0, x1 - x0), std::max(0, y1 - y0)};
 }
 
+Rect Rect::Union(const Rect& o) const {
+    if (o.Empty())
+        return *this;
+    if (Empty())
+        return o;
+    const int x0 = std::min(x, o.x), y0 = std::min(y, o.y);
+    return {x0, y0, std::max(x + width, o.x + o.width) - x0,
+            std::max(y + height, o.y + o.height) - y0};
+}
+
 void SharedRaster::Read(const int* bands, int count, const Rect& r, GDALDataType bufferType,
                         void* buffer) {
     if (r.Intersect(window).Empty())
@@ -502,15 +512,12 @@ void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const Rect& part,
                             part.width, static_cast<float>(grid_.noData));
     if (on.Empty())
         return;
-    scratch.bytes.resize(on.Size() * grid_.bands);
-    grid_.orthos[s]->Read(bands_.data(), grid_.bands, on, GDT_Byte, scratch.bytes.data());
+    ReadBytes(s, on, scratch.bytes);
     float table[256], plain[256];
     for (int value = 0; value < 256; ++value)
         plain[value] = static_cast<float>(value);
     for (int b = 0; b < grid_.bands; ++b) {
-        const bool balanced = !(gain[b] == 1 && offset[b] == 0);
-        for (int value = 0; value < 256 && balanced; ++value)
-            table[value] = range(gain[b] * value + offset[b]);
+        range.BalancedBytes(gain[b], offset[b], table);
         for (int j = 0; j < on.height; ++j) {
             const size_t first = static_cast<size_t>(on.y - r.y + j) * r.width + (on.x - r.x);
             const unsigned char* in =
@@ -518,7 +525,7 @@ void SceneReader::ReadBalanced(std::size_t s, const Rect& r, const Rect& part,
             const unsigned char* seen = state.data() + first;
             float* out = values.data() + size * b + first;
             for (int i = 0; i < on.width; ++i)
-                out[i] = balanced && seen[i] != kNotSeen ? table[in[i]] : plain[in[i]];
+                out[i] = seen[i] != kNotSeen ? table[in[i]] : plain[in[i]];
         }
     }
 }

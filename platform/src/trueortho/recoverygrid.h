@@ -32,6 +32,8 @@ struct Rect {
     std::size_t Size() const { return static_cast<std::size_t>(width) * height; }
     bool Empty() const { return width <= 0 || height <= 0; }
     Rect Intersect(const Rect& o) const;
+    // The bounding box of both (an empty one adds nothing).
+    Rect Union(const Rect& o) const;
     Rect Grown(int border) const {
         return {x - border, y - border, width + 2 * border, height + 2 * border};
     }
@@ -149,6 +151,13 @@ class ValueRange {
     // A value that is not `noData`, the nearest one inside the range when it is.
     float Besides(float v, double noData) const {
         return v != static_cast<float>(noData) ? v : Beside(noData);
+    }
+    // The 256 values of a Byte band balanced (value * gain + offset, as the range holds it), or
+    // the values themselves when gain is 1 and offset 0.
+    void BalancedBytes(double gain, double offset, float table[256]) const {
+        const bool balanced = !(gain == 1 && offset == 0);
+        for (int v = 0; v < 256; ++v)
+            table[v] = balanced ? (*this)(gain * v + offset) : static_cast<float>(v);
     }
     // True for a value at either end of an integer type's range: a clipped (saturated) value
     // says nothing of the scene's exposure.
