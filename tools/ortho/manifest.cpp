@@ -95,6 +95,11 @@ std::string CreationOptions(const Options& o, bool mosaic) {
     return text;
 }
 
+// A recorded value as a reason shows it: "(none)" for an option not given.
+std::string Shown(const std::string& value) {
+    return value.empty() ? "(none)" : value;
+}
+
 }  // namespace
 
 const std::vector<PixelOption>& PixelOptions() {
@@ -277,15 +282,6 @@ bool Manifest::Read(const std::string& path) {
     }
     return header;
 }
-
-namespace {
-
-// A recorded value as a reason shows it: "(none)" for an option not given.
-std::string Shown(const std::string& value) {
-    return value.empty() ? "(none)" : value;
-}
-
-}  // namespace
 
 std::vector<std::string> Manifest::ChangesSince(const Manifest& earlier) const {
     std::vector<std::string> changes;
